@@ -1,0 +1,68 @@
+#pragma once
+
+#include <cstdint>
+#include <functional>
+#include <memory>
+#include <optional>
+#include <span>
+
+#include "GWError.h"
+#include "GWValue.h"
+
+class GWRemoteFileHandle;
+class GWStreamDecoder;
+
+// Decompressor algorithm numbers.
+enum GWDecompressorAlgorithm : int {
+    GWDecompressorAlgorithmCopy = 0,
+    GWDecompressorAlgorithmDeflate = 1,  // raw or zlib-wrapped
+    GWDecompressorAlgorithmBzip2 = 5,
+};
+
+// A streaming decoder: feed it pieces of a compressed stream, take the bytes
+// it gives back, and call again with empty input while it asks to run again.
+class GWDecompressor {
+public:
+    static std::shared_ptr<GWDecompressor> initForStreamingWithAlgorithm(int algorithm,
+                                                                         GWErrorPtr* error);
+    ~GWDecompressor();
+
+    // One step. Returns none with an error for a damaged stream. Sets
+    // `shouldRunAgain` while it holds more output; the caller then repeats
+    // the call with empty input and the same `isFinal`.
+    std::optional<GWData> decompressedDataFromStreamWithInputData(
+        std::span<const std::uint8_t> input, bool isFinal, bool* shouldRunAgain,
+        GWErrorPtr* error);
+
+    // True when the bytes begin a zlib (algorithm 1) or bzip2 (5) stream.
+    static bool isDataCompressed(std::span<const std::uint8_t> data, int* algorithm = nullptr);
+    // Decodes a whole buffer that isDataCompressed recognised. Output beyond
+    // `maxLength` bytes fails, so a hostile stream cannot exhaust memory.
+    static std::optional<GWData> decompressedDataFromData(std::span<const std::uint8_t> data,
+                                                          GWErrorPtr* error,
+                                                          std::uint64_t maxLength = UINT64_MAX);
+
+    // (decoded piece, stored bytes read so far, decoded bytes so far, done,
+    // digest of the stored bytes, digest of the decoded bytes, error) -> go on?
+    // The digests come with the call that has `done` set.
+    using StreamHandler = std::function<bool(
+        std::span<const std::uint8_t> piece, std::uint64_t storedBytesRead,
+        std::uint64_t decodedBytes, bool done, const std::optional<GWData>& storedDigest,
+        const std::optional<GWData>& decodedDigest, const GWErrorPtr& error)>;
+
+    // Reads [offset, offset + length) through the handle, decodes it and
+    // digests both sides in one pass. Returns after the handler's last call.
+    static void decompressRemoteFileHandle(const std::shared_ptr<GWRemoteFileHandle>& handle,
+                                           std::uint64_t offset, std::uint64_t length,
+                                           int algorithm, int compressedChecksumAlgorithm,
+                                           int decompressedChecksumAlgorithm,
+                                           const StreamHandler& handler);
+
+    explicit GWDecompressor(std::unique_ptr<GWStreamDecoder> engine);
+
+private:
+    std::unique_ptr<GWStreamDecoder> engine_;
+    GWData pending_;  // input the engine has not consumed yet
+    bool finished_ = false;
+    GWErrorPtr failure_;
+};

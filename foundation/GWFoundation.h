@@ -1,0 +1,10 @@
+#pragma once
+
+// The support layer every archive subsystem builds on.
+
+#include "GWByteReader.h"
+#include "GWDate.h"
+#include "GWError.h"
+#include "GWLog.h"
+#include "GWURL.h"
+#include "GWValue.h"

@@ -1,0 +1,34 @@
+#pragma once
+
+#include <cstddef>
+#include <cstdint>
+#include <memory>
+#include <span>
+#include <string>
+
+// One decoding engine behind GWDecompressor. The decompressor owns the
+// buffering and the run-again protocol; an engine only turns input into output.
+class GWStreamDecoder {
+public:
+    struct Step {
+        std::size_t consumed = 0;  // input bytes used
+        std::size_t produced = 0;  // output bytes written
+        bool finished = false;     // the stream ended and all its output was written
+        bool failed = false;       // damaged input; `error` says how
+        std::string error;
+    };
+
+    virtual ~GWStreamDecoder() = default;
+
+    // Decodes as much of `input` as fits into `output`. It must make progress
+    // when it has input (or output it holds back) and room to write. With
+    // `isFinal` no more input follows, so an engine that cannot end its stream
+    // with what it has may fail. Input it did not consume is offered again.
+    virtual Step decode(std::span<const std::uint8_t> input, std::span<std::uint8_t> output,
+                        bool isFinal) = 0;
+};
+
+std::unique_ptr<GWStreamDecoder> GWMakeCopyDecoder();
+// Raw deflate, or the zlib-wrapped form when the stream begins with a zlib header.
+std::unique_ptr<GWStreamDecoder> GWMakeInflateDecoder();
+std::unique_ptr<GWStreamDecoder> GWMakeBzip2Decoder();

@@ -1,0 +1,6 @@
+#pragma once
+
+// Umbrella header: everything a caller of the library needs.
+
+#include "GWArchiveConstants.h"
+#include "foundation/GWFoundation.h"
