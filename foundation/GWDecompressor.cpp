@@ -1,0 +1,222 @@
+#include "GWDecompressor.h"
+
+#include <algorithm>
+
+#include "GWChecksum.h"
+#include "GWRemoteFileHandle.h"
+#include "decoders/GWStreamDecoder.h"
+
+namespace {
+
+// Output handed back per step; a caller asked to run again gets the rest in
+// further pieces of this size.
+constexpr std::size_t kOutputPieceSize = 256 * 1024;
+
+GWErrorPtr damagedStreamError(const std::string& reason) {
+    return GWGenerateError(kGWCocoaErrorDomain, GWFileReadCorruptFileError, std::nullopt, nullptr,
+                           {}, "%s", reason.c_str());
+}
+
+}  // namespace
+
+GWDecompressor::GWDecompressor(std::unique_ptr<GWStreamDecoder> engine)
+    : engine_(std::move(engine)) {}
+
+GWDecompressor::~GWDecompressor() = default;
+
+std::shared_ptr<GWDecompressor> GWDecompressor::initForStreamingWithAlgorithm(int algorithm,
+                                                                              GWErrorPtr* error) {
+    std::unique_ptr<GWStreamDecoder> engine;
+    switch (algorithm) {
+        case GWDecompressorAlgorithmCopy: engine = GWMakeCopyDecoder(); break;
+        case GWDecompressorAlgorithmDeflate: engine = GWMakeInflateDecoder(); break;
+        case GWDecompressorAlgorithmBzip2: engine = GWMakeBzip2Decoder(); break;
+        default:
+            GWFail(error, GWGenerateError(kGWPOSIXErrorDomain, EINVAL, std::nullopt, nullptr, {},
+                                          "Unknown decompressor algorithm %d", algorithm));
+            return nullptr;
+    }
+    return std::make_shared<GWDecompressor>(std::move(engine));
+}
+
+std::optional<GWData> GWDecompressor::decompressedDataFromStreamWithInputData(
+    std::span<const std::uint8_t> input, bool isFinal, bool* shouldRunAgain, GWErrorPtr* error) {
+    if (shouldRunAgain) {
+        *shouldRunAgain = false;
+    }
+    if (failure_) {
+        GWFail(error, failure_);
+        return std::nullopt;
+    }
+    if (finished_) {
+        return GWData();
+    }
+    // Input left over from an earlier step comes first; copy only then.
+    std::span<const std::uint8_t> in = input;
+    if (!pending_.empty()) {
+        pending_.insert(pending_.end(), input.begin(), input.end());
+        in = pending_;
+    }
+    GWData output(kOutputPieceSize);
+    std::size_t produced = 0;
+    bool full = false;
+    for (;;) {
+        const auto step = engine_->decode(in, std::span(output).subspan(produced), isFinal);
+        in = in.subspan(step.consumed);
+        produced += step.produced;
+        if (step.failed) {
+            failure_ = damagedStreamError(step.error);
+            pending_.clear();
+            GWFail(error, failure_);
+            return std::nullopt;
+        }
+        if (step.finished) {
+            finished_ = true;
+            break;
+        }
+        if (produced == output.size()) {
+            full = true;
+            break;
+        }
+        if (step.consumed == 0 && step.produced == 0) {
+            if (isFinal) {
+                failure_ = damagedStreamError("the compressed stream ends early");
+                pending_.clear();
+                GWFail(error, failure_);
+                return std::nullopt;
+            }
+            break;  // the engine waits for more input
+        }
+    }
+    GWData leftover(in.begin(), in.end());
+    pending_.swap(leftover);
+    if (finished_) {
+        pending_.clear();
+    }
+    output.resize(produced);
+    if (shouldRunAgain) {
+        *shouldRunAgain = full && !finished_;
+    }
+    return output;
+}
+
+bool GWDecompressor::isDataCompressed(std::span<const std::uint8_t> data, int* algorithm) {
+    int found = -1;
+    if (data.size() >= 2 && (data[0] & 0x0F) == 8 && (data[0] >> 4) <= 7 &&
+        ((unsigned(data[0]) << 8) | data[1]) % 31 == 0) {
+        found = GWDecompressorAlgorithmDeflate;
+    } else if (data.size() >= 4 && data[0] == 'B' && data[1] == 'Z' && data[2] == 'h' &&
+               data[3] >= '1' && data[3] <= '9') {
+        found = GWDecompressorAlgorithmBzip2;
+    }
+    if (found < 0) {
+        return false;
+    }
+    if (algorithm) {
+        *algorithm = found;
+    }
+    return true;
+}
+
+std::optional<GWData> GWDecompressor::decompressedDataFromData(std::span<const std::uint8_t> data,
+                                                               GWErrorPtr* error,
+                                                               std::uint64_t maxLength) {
+    int algorithm = 0;
+    if (!isDataCompressed(data, &algorithm)) {
+        GWFail(error, damagedStreamError("The data is not a recognised compressed stream"));
+        return std::nullopt;
+    }
+    auto decompressor = initForStreamingWithAlgorithm(algorithm, error);
+    GWData result;
+    std::span<const std::uint8_t> input = data;
+    bool again = true;
+    while (again) {
+        auto piece = decompressor->decompressedDataFromStreamWithInputData(input, true, &again,
+                                                                          error);
+        if (!piece) {
+            return std::nullopt;
+        }
+        if (piece->size() > maxLength - result.size()) {
+            GWFail(error,
+                   GWGenerateError(kGWCocoaErrorDomain, GWFileReadCorruptFileError, std::nullopt,
+                                   nullptr, {}, "The data decompresses to more than %llu bytes",
+                                   (unsigned long long)maxLength));
+            return std::nullopt;
+        }
+        result.insert(result.end(), piece->begin(), piece->end());
+        input = {};
+    }
+    return result;
+}
+
+void GWDecompressor::decompressRemoteFileHandle(const std::shared_ptr<GWRemoteFileHandle>& handle,
+                                                std::uint64_t offset, std::uint64_t length,
+                                                int algorithm, int compressedChecksumAlgorithm,
+                                                int decompressedChecksumAlgorithm,
+                                                const StreamHandler& handler) {
+    GWErrorPtr error;
+    auto decompressor = initForStreamingWithAlgorithm(algorithm, &error);
+    if (!decompressor) {
+        handler({}, 0, 0, true, std::nullopt, std::nullopt, error);
+        return;
+    }
+    auto storedDigest = GWChecksum::checksumWithAlgorithm(compressedChecksumAlgorithm);
+    auto decodedDigest = GWChecksum::checksumWithAlgorithm(decompressedChecksumAlgorithm);
+    std::uint64_t storedBytes = 0, decodedBytes = 0;
+
+    // Hands one decoded piece on; on the last one, with both digests.
+    auto deliver = [&](std::span<const std::uint8_t> piece, bool done) {
+        decodedBytes += piece.size();
+        if (decodedDigest) {
+            decodedDigest->update(piece);
+        }
+        std::optional<GWData> stored, decoded;
+        if (done) {
+            if (storedDigest) {
+                stored = storedDigest->finish();
+            }
+            if (decodedDigest) {
+                decoded = decodedDigest->finish();
+            }
+        }
+        return handler(piece, storedBytes, decodedBytes, done, stored, decoded, nullptr);
+    };
+    // An empty range is an empty stream whatever its nominal compression.
+    if (length == 0) {
+        deliver({}, true);
+        return;
+    }
+
+    handle->readDataAtOffset(
+        offset, length, UINT64_MAX,
+        [&](GWRemoteFileHandle&, std::span<const std::uint8_t> chunk, bool isLast,
+            const GWErrorPtr& readError) {
+            if (readError) {
+                handler({}, storedBytes, decodedBytes, true, std::nullopt, std::nullopt,
+                        readError);
+                return false;
+            }
+            storedBytes += chunk.size();
+            if (storedDigest) {
+                storedDigest->update(chunk);
+            }
+            bool again = false;
+            std::span<const std::uint8_t> input = chunk;
+            do {
+                GWErrorPtr decodeError;
+                auto piece = decompressor->decompressedDataFromStreamWithInputData(
+                    input, isLast, &again, &decodeError);
+                if (!piece) {
+                    handler({}, storedBytes, decodedBytes, true, std::nullopt, std::nullopt,
+                            decodeError);
+                    return false;
+                }
+                input = {};
+                const bool done = isLast && !again;
+                if ((!piece->empty() || done) && !deliver(*piece, done)) {
+                    return false;
+                }
+            } while (again);
+            return true;
+        });
+}

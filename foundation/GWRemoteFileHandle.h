@@ -1,0 +1,61 @@
+#pragma once
+
+#include <cstdint>
+#include <functional>
+#include <memory>
+#include <optional>
+#include <span>
+
+#include "GWError.h"
+#include "GWURL.h"
+#include "GWValue.h"
+
+class GWFileHandleBackend;
+
+// Position-based access to a file. Reads are positioned reads, so one handle
+// never disturbs another open on the same file. Used by one operation at a time.
+class GWRemoteFileHandle {
+public:
+    static std::shared_ptr<GWRemoteFileHandle> initForReadingFromURL(const GWURL& url,
+                                                                     GWErrorPtr* error);
+    // Creates (or empties) the file. With no URL the handle accepts and
+    // discards whatever is written.
+    static std::shared_ptr<GWRemoteFileHandle> initForWritingToURL(const std::optional<GWURL>& url,
+                                                                   GWErrorPtr* error);
+
+    explicit GWRemoteFileHandle(std::unique_ptr<GWFileHandleBackend> backend);
+    ~GWRemoteFileHandle();
+    GWRemoteFileHandle(const GWRemoteFileHandle&) = delete;
+    GWRemoteFileHandle& operator=(const GWRemoteFileHandle&) = delete;
+
+    // Up to `length` bytes from the current position, which advances. Fewer
+    // at the end of the file, and empty data at the end.
+    std::optional<GWData> readDataOfLength(std::uint64_t length, GWErrorPtr* error);
+    bool seekToFileOffset(std::uint64_t offset, GWErrorPtr* error);
+    std::uint64_t offsetInFile() const { return position_; }
+    std::uint64_t fileSize() const;
+    bool isSeekable() const;
+
+    // (this handle, piece, is last piece, error) -> go on?
+    using ReadHandler = std::function<bool(GWRemoteFileHandle& handle,
+                                           std::span<const std::uint8_t> piece, bool isLast,
+                                           const GWErrorPtr& error)>;
+    // Reads [offset, offset + length) in pieces of at most `maxBufferSize`
+    // bytes (UINT64_MAX: the handle's own, large size). A file that ends
+    // before the range does is an error, never a short final piece.
+    void readDataAtOffset(std::uint64_t offset, std::uint64_t length, std::uint64_t maxBufferSize,
+                          const ReadHandler& handler);
+
+    bool writeData(std::span<const std::uint8_t> bytes, GWErrorPtr* error);
+    bool closeFileAndReturnError(GWErrorPtr* error);
+
+    const std::optional<GWURL>& URL() const { return url_; }
+
+    // The piece size used when the caller sets no limit.
+    static constexpr std::size_t kDefaultPieceSize = 512 * 1024;
+
+private:
+    std::unique_ptr<GWFileHandleBackend> backend_;
+    std::optional<GWURL> url_;
+    std::uint64_t position_ = 0;
+};

@@ -1,0 +1,80 @@
+#include <zlib.h>
+
+#include <climits>
+
+#include "GWStreamDecoder.h"
+
+namespace {
+
+// True when the first two bytes form a zlib header (deflate method, a window
+// of at most 32 KiB, no preset dictionary, valid check bits). A raw deflate
+// stream can begin like this only with a stored block whose padding bits are
+// set, which no encoder writes.
+bool looksLikeZlibHeader(std::uint8_t cmf, std::uint8_t flg) {
+    return (cmf & 0x0F) == 8 && (cmf >> 4) <= 7 && (flg & 0x20) == 0 &&
+           ((unsigned(cmf) << 8) | flg) % 31 == 0;
+}
+
+class GWInflateDecoder final : public GWStreamDecoder {
+public:
+    ~GWInflateDecoder() override {
+        if (initialised_) {
+            inflateEnd(&stream_);
+        }
+    }
+
+    Step decode(std::span<const std::uint8_t> input, std::span<std::uint8_t> output,
+                bool isFinal) override {
+        Step step;
+        if (!initialised_) {
+            // The header decides between the two wrappings; wait for two bytes.
+            if (input.size() < 2 && !isFinal) {
+                return step;
+            }
+            const bool zlib = input.size() >= 2 && looksLikeZlibHeader(input[0], input[1]);
+            if (inflateInit2(&stream_, zlib ? MAX_WBITS : -MAX_WBITS) != Z_OK) {
+                step.failed = true;
+                step.error = "could not set up the deflate decoder";
+                return step;
+            }
+            initialised_ = true;
+        }
+        // zlib counts in 32 bits; larger spans are simply offered in parts.
+        stream_.next_in = const_cast<Bytef*>(input.data());
+        stream_.avail_in = uInt(std::min<std::size_t>(input.size(), UINT_MAX));
+        stream_.next_out = output.data();
+        stream_.avail_out = uInt(std::min<std::size_t>(output.size(), UINT_MAX));
+        const int status = inflate(&stream_, Z_NO_FLUSH);
+        step.consumed = std::min<std::size_t>(input.size(), UINT_MAX) - stream_.avail_in;
+        step.produced = std::min<std::size_t>(output.size(), UINT_MAX) - stream_.avail_out;
+        switch (status) {
+            case Z_STREAM_END:
+                step.finished = true;
+                break;
+            case Z_OK:
+            case Z_BUF_ERROR:  // no progress possible: more input or more room needed
+                // Room left and nothing more to read: the stream was cut short.
+                if (isFinal && step.consumed == input.size() && stream_.avail_out > 0) {
+                    step.failed = true;
+                    step.error = "the deflate stream ends early";
+                }
+                break;
+            default:
+                step.failed = true;
+                step.error = std::string("damaged deflate stream: ") +
+                             (stream_.msg ? stream_.msg : zError(status));
+                break;
+        }
+        return step;
+    }
+
+private:
+    z_stream stream_{};
+    bool initialised_ = false;
+};
+
+}  // namespace
+
+std::unique_ptr<GWStreamDecoder> GWMakeInflateDecoder() {
+    return std::make_unique<GWInflateDecoder>();
+}
