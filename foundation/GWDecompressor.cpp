@@ -57,11 +57,16 @@ std::optional<GWData> GWDecompressor::decompressedDataFromStreamWithInputData(
         pending_.insert(pending_.end(), input.begin(), input.end());
         in = pending_;
     }
-    GWData output(kOutputPieceSize);
+    // Decode into a buffer kept across steps and copy out only what came, so
+    // small input pieces do not pay for a large allocation each.
+    if (scratch_.empty()) {
+        scratch_.resize(kOutputPieceSize);
+    }
+    std::span<std::uint8_t> output = scratch_;
     std::size_t produced = 0;
     bool full = false;
     for (;;) {
-        const auto step = engine_->decode(in, std::span(output).subspan(produced), isFinal);
+        const auto step = engine_->decode(in, output.subspan(produced), isFinal);
         in = in.subspan(step.consumed);
         produced += step.produced;
         if (step.failed) {
@@ -88,16 +93,16 @@ std::optional<GWData> GWDecompressor::decompressedDataFromStreamWithInputData(
             break;  // the engine waits for more input
         }
     }
-    GWData leftover(in.begin(), in.end());
-    pending_.swap(leftover);
     if (finished_) {
         pending_.clear();
+    } else if (in.data() != pending_.data() || in.size() != pending_.size()) {
+        GWData leftover(in.begin(), in.end());
+        pending_.swap(leftover);
     }
-    output.resize(produced);
     if (shouldRunAgain) {
         *shouldRunAgain = full && !finished_;
     }
-    return output;
+    return GWData(output.begin(), output.begin() + produced);
 }
 
 bool GWDecompressor::isDataCompressed(std::span<const std::uint8_t> data, int* algorithm) {

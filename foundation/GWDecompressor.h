@@ -63,6 +63,7 @@ public:
 private:
     std::unique_ptr<GWStreamDecoder> engine_;
     GWData pending_;  // input the engine has not consumed yet
+    GWData scratch_;  // output of one step before it is handed back
     bool finished_ = false;
     GWErrorPtr failure_;
 };

@@ -1,6 +1,7 @@
 #include "GWRemoteFileHandle.h"
 
 #include <algorithm>
+#include <cerrno>
 
 #include "GWFileHandleBackend.h"
 
@@ -68,6 +69,10 @@ bool GWRemoteFileHandle::isSeekable() const {
 
 std::optional<GWData> GWRemoteFileHandle::readDataOfLength(std::uint64_t length,
                                                            GWErrorPtr* error) {
+    if (closed_) {
+        GWFail(error, GWPOSIXError(EBADF, url_));
+        return std::nullopt;
+    }
     // The length is a wish, not a promise: never allocate past the file's end.
     const std::uint64_t size = backend_->size();
     const std::uint64_t available = position_ < size ? size - position_ : 0;
@@ -89,6 +94,10 @@ bool GWRemoteFileHandle::seekToFileOffset(std::uint64_t offset, GWErrorPtr*) {
 void GWRemoteFileHandle::readDataAtOffset(std::uint64_t offset, std::uint64_t length,
                                           std::uint64_t maxBufferSize,
                                           const ReadHandler& handler) {
+    if (closed_) {
+        handler(*this, {}, true, GWPOSIXError(EBADF, url_));
+        return;
+    }
     const std::uint64_t pieceLimit = maxBufferSize == UINT64_MAX || maxBufferSize == 0
                                          ? kDefaultPieceSize
                                          : std::min<std::uint64_t>(maxBufferSize, 64 << 20);
@@ -129,6 +138,9 @@ void GWRemoteFileHandle::readDataAtOffset(std::uint64_t offset, std::uint64_t le
 }
 
 bool GWRemoteFileHandle::writeData(std::span<const std::uint8_t> bytes, GWErrorPtr* error) {
+    if (closed_) {
+        return GWFail(error, GWPOSIXError(EBADF, url_));
+    }
     if (!backend_->writeAt(position_, bytes, error)) {
         return false;
     }
@@ -137,5 +149,6 @@ bool GWRemoteFileHandle::writeData(std::span<const std::uint8_t> bytes, GWErrorP
 }
 
 bool GWRemoteFileHandle::closeFileAndReturnError(GWErrorPtr* error) {
+    closed_ = true;
     return backend_->close(error);
 }

@@ -58,4 +58,5 @@ private:
     std::unique_ptr<GWFileHandleBackend> backend_;
     std::optional<GWURL> url_;
     std::uint64_t position_ = 0;
+    bool closed_ = false;
 };

@@ -1,0 +1,104 @@
+#include <gtest/gtest.h>
+
+#include "foundation/GWChecksum.h"
+#include "support/TestSupport.h"
+
+using gwtest::bytesOf;
+using gwtest::hex;
+
+namespace {
+
+std::string digest(const std::string& text, int algorithm) {
+    return hex(GWChecksum::checksumForData(bytesOf(text), algorithm));
+}
+
+}  // namespace
+
+TEST(GWChecksum, CRC32IsLaidOutLeastSignificantByteFirst) {
+    // The CRC-32 of "1234" is 0x9BE3E0A3.
+    EXPECT_EQ(digest("1234", GWChecksumAlgorithmCRC32), "a3e0e39b");
+    EXPECT_EQ(digest("", GWChecksumAlgorithmCRC32), "00000000");
+}
+
+TEST(GWChecksum, MD2MatchesThePublishedVectors) {
+    EXPECT_EQ(digest("", GWChecksumAlgorithmMD2), "8350e5a3e24c153df2275c9f80692773");
+    EXPECT_EQ(digest("a", GWChecksumAlgorithmMD2), "32ec01ec4a6dac72c0ab96fb34c0b5d1");
+    EXPECT_EQ(digest("abc", GWChecksumAlgorithmMD2), "da853b0d3f88d99b30283a69e6ded6bb");
+    EXPECT_EQ(digest("message digest", GWChecksumAlgorithmMD2),
+              "ab4f496bfb2a530b219ff33031fe06b0");
+    EXPECT_EQ(digest("abcdefghijklmnopqrstuvwxyz", GWChecksumAlgorithmMD2),
+              "4e8ddff3650292ab5a4108c3aa47940b");
+    EXPECT_EQ(digest("ABCDEFGHIJKLMNOPQRSTUVWXYZabcdefghijklmnopqrstuvwxyz0123456789",
+                     GWChecksumAlgorithmMD2),
+              "da33def2a42df13975352846c30338cd");
+    EXPECT_EQ(digest("1234567890123456789012345678901234567890123456789012345678901234567890123"
+                     "4567890",
+                     GWChecksumAlgorithmMD2),
+              "d5976f79d83d3a0dc9806c3c66f3efd8");
+}
+
+TEST(GWChecksum, MD5AndTheSHAFamilyMatchThePublishedVectors) {
+    EXPECT_EQ(digest("abc", GWChecksumAlgorithmMD5), "900150983cd24fb0d6963f7d28e17f72");
+    EXPECT_EQ(digest("abc", GWChecksumAlgorithmSHA1), "a9993e364706816aba3e25717850c26c9cd0d89d");
+    EXPECT_EQ(digest("abc", GWChecksumAlgorithmSHA224),
+              "23097d223405d8228642a477bda255b32aadbce4bda0b3f7e36c9da7");
+    EXPECT_EQ(digest("abc", GWChecksumAlgorithmSHA256),
+              "ba7816bf8f01cfea414140de5dae2223b00361a396177a9cb410ff61f20015ad");
+    EXPECT_EQ(digest("abc", GWChecksumAlgorithmSHA384),
+              "cb00753f45a35e8bb5a03d699ac65007272c32ab0eded1631a8b605a43ff5bed8086072ba1e7cc2358"
+              "baeca134c825a7");
+    EXPECT_EQ(digest("abc", GWChecksumAlgorithmSHA512),
+              "ddaf35a193617abacc417349ae20413112e6fa4e89a97ea20a9eeee64b55d39a2192992a274fc1a83"
+              "6ba3c23a3feebbd454d4423643ce80e2a9ac94fa54ca49f");
+}
+
+TEST(GWChecksum, AlgorithmsWithoutADigestGiveNothing) {
+    EXPECT_TRUE(GWChecksum::checksumForData(bytesOf("abc"), GWChecksumAlgorithmNone).empty());
+    EXPECT_TRUE(GWChecksum::checksumForData(bytesOf("abc"), GWChecksumAlgorithmUnknown).empty());
+    EXPECT_TRUE(GWChecksum::checksumForData(bytesOf("abc"), 2).empty());
+    EXPECT_EQ(GWChecksum::checksumWithAlgorithm(GWChecksumAlgorithmNone), nullptr);
+}
+
+TEST(GWChecksum, StreamingInPiecesEqualsOneShot) {
+    const GWData data = gwtest::randomBytes(100000, 7);
+    for (int algorithm : {1, 3, 4, 5, 6, 7, 8, 9}) {
+        auto checksum = GWChecksum::checksumWithAlgorithm(algorithm);
+        ASSERT_TRUE(checksum);
+        for (std::size_t at = 0; at < data.size(); at += 997) {
+            checksum->update(std::span(data).subspan(at, std::min<std::size_t>(997, data.size() - at)));
+        }
+        const GWData streamed = checksum->finish();
+        EXPECT_EQ(streamed, GWChecksum::checksumForData(data, algorithm)) << algorithm;
+        EXPECT_EQ(streamed.size(), GWChecksum::digestLength(algorithm));
+    }
+}
+
+TEST(GWChecksum, FileDigestsAgreeWithOpenSSL) {
+    if (!gwtest::toolAvailable("openssl")) {
+        GTEST_SKIP() << "openssl is not installed";
+    }
+    gwtest::TemporaryDirectory directory;
+    const std::string path = directory.file("big.bin");
+    gwtest::writeFile(path, gwtest::randomBytes(5 * 1024 * 1024 + 17, 42));
+    const std::pair<int, const char*> algorithms[] = {
+        {GWChecksumAlgorithmMD5, "md5"},       {GWChecksumAlgorithmSHA1, "sha1"},
+        {GWChecksumAlgorithmSHA224, "sha224"}, {GWChecksumAlgorithmSHA256, "sha256"},
+        {GWChecksumAlgorithmSHA384, "sha384"}, {GWChecksumAlgorithmSHA512, "sha512"}};
+    for (const auto& [algorithm, name] : algorithms) {
+        const auto result = gwtest::runCommand(std::string("openssl dgst -r -") + name + " " +
+                                               gwtest::shellQuote(path));
+        ASSERT_EQ(result.status, 0);
+        GWErrorPtr error;
+        auto ours = GWChecksum::checksumAtURL(GWURL::fileURLWithPath(path), algorithm, &error);
+        ASSERT_TRUE(ours) << error->localizedDescription();
+        EXPECT_EQ(hex(*ours), result.output.substr(0, result.output.find(' '))) << name;
+    }
+}
+
+TEST(GWChecksum, AMissingFileIsAPOSIXError) {
+    GWErrorPtr error;
+    EXPECT_FALSE(GWChecksum::checksumAtURL(GWURL::fileURLWithPath("/nonexistent/x"),
+                                           GWChecksumAlgorithmMD5, &error));
+    ASSERT_TRUE(error);
+    EXPECT_TRUE(error->is(kGWPOSIXErrorDomain, ENOENT));
+}

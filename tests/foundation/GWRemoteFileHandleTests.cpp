@@ -1,0 +1,147 @@
+#include <gtest/gtest.h>
+
+#include "foundation/GWRemoteFileHandle.h"
+#include "support/TestSupport.h"
+
+namespace {
+
+struct Piece {
+    GWData bytes;
+    bool isLast;
+    GWErrorPtr error;
+};
+
+std::vector<Piece> readRange(GWRemoteFileHandle& handle, std::uint64_t offset,
+                             std::uint64_t length, std::uint64_t maxBuffer) {
+    std::vector<Piece> pieces;
+    handle.readDataAtOffset(offset, length, maxBuffer,
+                            [&](GWRemoteFileHandle&, std::span<const std::uint8_t> piece,
+                                bool isLast, const GWErrorPtr& error) {
+                                pieces.push_back({GWData(piece.begin(), piece.end()), isLast,
+                                                  error});
+                                return true;
+                            });
+    return pieces;
+}
+
+class GWRemoteFileHandleTest : public ::testing::Test {
+protected:
+    void SetUp() override {
+        contents_ = gwtest::randomBytes(1500000, 3);
+        gwtest::writeFile(directory_.file("data"), contents_);
+        GWErrorPtr error;
+        handle_ = GWRemoteFileHandle::initForReadingFromURL(directory_.url("data"), &error);
+        ASSERT_TRUE(handle_);
+    }
+
+    gwtest::TemporaryDirectory directory_;
+    GWData contents_;
+    std::shared_ptr<GWRemoteFileHandle> handle_;
+};
+
+}  // namespace
+
+TEST_F(GWRemoteFileHandleTest, ReadingPastTheEndGivesShortThenEmptyData) {
+    ASSERT_TRUE(handle_->seekToFileOffset(contents_.size() - 10, nullptr));
+    auto tail = handle_->readDataOfLength(100, nullptr);
+    ASSERT_TRUE(tail);
+    EXPECT_EQ(*tail, GWData(contents_.end() - 10, contents_.end()));
+    EXPECT_EQ(handle_->offsetInFile(), contents_.size());
+    auto empty = handle_->readDataOfLength(100, nullptr);
+    ASSERT_TRUE(empty);
+    EXPECT_TRUE(empty->empty());
+    // A huge request is bounded by the file, not allocated as asked.
+    ASSERT_TRUE(handle_->seekToFileOffset(0, nullptr));
+    EXPECT_EQ(handle_->readDataOfLength(UINT64_MAX, nullptr)->size(), contents_.size());
+}
+
+TEST_F(GWRemoteFileHandleTest, RangesArriveInLargePiecesWithTheLastMarked) {
+    const auto pieces = readRange(*handle_, 7, contents_.size() - 7, UINT64_MAX);
+    GWData joined;
+    for (std::size_t i = 0; i < pieces.size(); ++i) {
+        EXPECT_FALSE(pieces[i].error);
+        EXPECT_EQ(pieces[i].isLast, i + 1 == pieces.size());
+        if (i + 1 < pieces.size()) {
+            EXPECT_GE(pieces[i].bytes.size(), 256u * 1024);
+        }
+        joined.insert(joined.end(), pieces[i].bytes.begin(), pieces[i].bytes.end());
+    }
+    EXPECT_EQ(joined, GWData(contents_.begin() + 7, contents_.end()));
+}
+
+TEST_F(GWRemoteFileHandleTest, PieceSizeHonoursTheCallersLimit) {
+    const auto pieces = readRange(*handle_, 0, 1000, 300);
+    ASSERT_EQ(pieces.size(), 4u);
+    EXPECT_EQ(pieces[3].bytes.size(), 100u);
+    EXPECT_TRUE(pieces[3].isLast);
+}
+
+TEST_F(GWRemoteFileHandleTest, AnEmptyRangeIsOneEmptyLastPiece) {
+    const auto pieces = readRange(*handle_, 5, 0, UINT64_MAX);
+    ASSERT_EQ(pieces.size(), 1u);
+    EXPECT_TRUE(pieces[0].bytes.empty());
+    EXPECT_TRUE(pieces[0].isLast);
+    EXPECT_FALSE(pieces[0].error);
+}
+
+TEST_F(GWRemoteFileHandleTest, ARangeRunningPastTheEndIsAnErrorNotAShortPiece) {
+    const auto pieces = readRange(*handle_, contents_.size() - 100, 1000, UINT64_MAX);
+    ASSERT_FALSE(pieces.empty());
+    ASSERT_TRUE(pieces.back().error);
+    EXPECT_TRUE(pieces.back().error->is(kGWCocoaErrorDomain, GWFileReadCorruptFileError));
+    const auto overflow = readRange(*handle_, UINT64_MAX - 5, 100, UINT64_MAX);
+    ASSERT_EQ(overflow.size(), 1u);
+    EXPECT_TRUE(overflow[0].error);
+}
+
+TEST_F(GWRemoteFileHandleTest, AHandlerThatAnswersFalseStopsTheReading) {
+    int calls = 0;
+    handle_->readDataAtOffset(0, contents_.size(), 1000,
+                              [&](GWRemoteFileHandle&, std::span<const std::uint8_t>, bool,
+                                  const GWErrorPtr&) { return ++calls < 3; });
+    EXPECT_EQ(calls, 3);
+}
+
+TEST(GWRemoteFileHandle, OpeningFailuresSayWhy) {
+    gwtest::TemporaryDirectory directory;
+    GWErrorPtr error;
+    EXPECT_FALSE(GWRemoteFileHandle::initForReadingFromURL(directory.url("missing"), &error));
+    EXPECT_TRUE(error->is(kGWPOSIXErrorDomain, ENOENT));
+    EXPECT_EQ(error->URL(), directory.url("missing"));
+    EXPECT_FALSE(GWRemoteFileHandle::initForReadingFromURL(
+        GWURL::fileURLWithPath(directory.path()), &error));
+    EXPECT_TRUE(error->is(kGWPOSIXErrorDomain, EISDIR));
+    EXPECT_FALSE(GWRemoteFileHandle::initForReadingFromURL(
+        *GWURL::URLWithString("ftp://example.invalid/a.zip"), &error));
+    EXPECT_TRUE(error->is(kGWCocoaErrorDomain, GWFileReadUnsupportedSchemeError));
+    EXPECT_FALSE(GWRemoteFileHandle::initForWritingToURL(directory.url("no/such/dir/x"), &error));
+    EXPECT_TRUE(error->is(kGWPOSIXErrorDomain, ENOENT));
+}
+
+TEST(GWRemoteFileHandle, WritesLandAtThePositionAndAHandleWithoutURLDiscards) {
+    gwtest::TemporaryDirectory directory;
+    auto writer = GWRemoteFileHandle::initForWritingToURL(directory.url("out"), nullptr);
+    ASSERT_TRUE(writer);
+    ASSERT_TRUE(writer->writeData(gwtest::bytesOf("hello world"), nullptr));
+    ASSERT_TRUE(writer->seekToFileOffset(6, nullptr));
+    ASSERT_TRUE(writer->writeData(gwtest::bytesOf("there"), nullptr));
+    EXPECT_TRUE(writer->closeFileAndReturnError(nullptr));
+    EXPECT_EQ(gwtest::readFile(directory.file("out")), gwtest::bytesOf("hello there"));
+
+    auto sink = GWRemoteFileHandle::initForWritingToURL(std::nullopt, nullptr);
+    ASSERT_TRUE(sink);
+    EXPECT_TRUE(sink->writeData(gwtest::randomBytes(1000, 1), nullptr));
+    EXPECT_EQ(sink->offsetInFile(), 1000u);
+    EXPECT_TRUE(sink->closeFileAndReturnError(nullptr));
+}
+
+TEST(GWRemoteFileHandle, UseAfterCloseIsAnErrorNotACrash) {
+    gwtest::TemporaryDirectory directory;
+    gwtest::writeFile(directory.file("f"), gwtest::bytesOf("abc"));
+    auto handle = GWRemoteFileHandle::initForReadingFromURL(directory.url("f"), nullptr);
+    ASSERT_TRUE(handle->closeFileAndReturnError(nullptr));
+    GWErrorPtr error;
+    EXPECT_FALSE(handle->readDataOfLength(3, &error));
+    EXPECT_TRUE(error->is(kGWPOSIXErrorDomain, EBADF));
+    EXPECT_FALSE(handle->writeData(gwtest::bytesOf("x"), &error));
+}
