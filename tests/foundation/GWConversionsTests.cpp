@@ -1,0 +1,92 @@
+#include <gtest/gtest.h>
+
+#include <set>
+
+#include "foundation/GWConversions.h"
+#include "foundation/GWPropertyListSerialization.h"
+#include "foundation/GWStringEncoding.h"
+#include "support/TestSupport.h"
+
+TEST(GWConversions, FourCharCodesPutTheFirstCharacterHigh) {
+    EXPECT_EQ(GWFourCharCode("TEXT"), 0x54455854u);
+    EXPECT_EQ(GWStringWithFourCharCode(0x54455854u), "TEXT");
+    // Classic Mac codes use Mac OS Roman: 0xA9 is the copyright sign there.
+    EXPECT_EQ(GWFourCharCode("\xC2\xA9" "abc"), 0xA9616263u);
+    EXPECT_EQ(GWStringWithFourCharCode(0xA9616263u), "\xC2\xA9" "abc");
+    EXPECT_EQ(GWFourCharCode(""), 0u);
+    EXPECT_EQ(GWFourCharCode("TOOLONG"), 0u);
+    EXPECT_EQ(GWFourCharCode("ab"), 0u);
+}
+
+TEST(GWConversions, LittleEndianIntegersOfOneToEightBytes) {
+    EXPECT_EQ(GWNumberWithLittleEndianIntegerData(GWData{0x34, 0x12}), 0x1234u);
+    EXPECT_EQ(GWNumberWithLittleEndianIntegerData(GWData{1, 2, 3, 4, 5, 6, 7, 0x88}),
+              0x8807060504030201ull);
+    EXPECT_EQ(GWNumberWithLittleEndianIntegerData(GWData{}), std::nullopt);
+    EXPECT_EQ(GWNumberWithLittleEndianIntegerData(GWData(9, 1)), std::nullopt);
+}
+
+TEST(GWConversions, UniqueIDsAreDistinctUUIDs) {
+    std::set<std::string> seen;
+    for (int i = 0; i < 1000; ++i) {
+        const std::string id = GWUniqueID();
+        EXPECT_EQ(id.size(), 36u);
+        EXPECT_EQ(id[14], '4');
+        seen.insert(id);
+    }
+    EXPECT_EQ(seen.size(), 1000u);
+}
+
+TEST(GWBase64, DecodesStandardTextWithSpacesAndLineBreaks) {
+    auto decode = [](const char* text) {
+        return GWPropertyListSerialization::dataWithBase64String(text, nullptr);
+    };
+    EXPECT_EQ(decode("aGVsbG8gd29ybGQ="), gwtest::bytesOf("hello world"));
+    EXPECT_EQ(decode("aGVs\nbG8g\r\nd29y bGQ="), gwtest::bytesOf("hello world"));
+    EXPECT_EQ(decode("QUJD"), gwtest::bytesOf("ABC"));
+    EXPECT_EQ(decode("QQ=="), gwtest::bytesOf("A"));
+    EXPECT_EQ(decode("QQ"), gwtest::bytesOf("A"));
+    EXPECT_EQ(decode(""), GWData());
+    EXPECT_EQ(decode("+/+/"), (GWData{0xFB, 0xFF, 0xBF}));
+}
+
+TEST(GWBase64, RefusesAnythingElse) {
+    for (const char* text : {"aGVsbG8*", "QQ=A", "Q", "QUJD=", "Q===", "QQ=", "aGVs-bG8"}) {
+        GWErrorPtr error;
+        EXPECT_FALSE(GWPropertyListSerialization::dataWithBase64String(text, &error)) << text;
+        ASSERT_TRUE(error) << text;
+        EXPECT_TRUE(error->is(kGWCocoaErrorDomain, GWFileReadCorruptFileError));
+    }
+}
+
+TEST(GWStringEncoding, UTF8MustBeWellFormed) {
+    EXPECT_EQ(GWStringFromBytes(std::string_view("caf\xC3\xA9"), GWStringEncoding::UTF8),
+              "caf\xC3\xA9");
+    for (const char* bad : {"\xC3", "\xC0\xAF", "\xED\xA0\x80", "\xF4\x90\x80\x80", "\xFF",
+                            "a\x80"}) {
+        EXPECT_FALSE(GWStringFromBytes(std::string_view(bad), GWStringEncoding::UTF8)) << bad;
+    }
+}
+
+TEST(GWStringEncoding, LegacyCodePagesDecodeToUTF8) {
+    EXPECT_EQ(GWStringFromBytes(std::string_view("caf\x8E"), GWStringEncoding::MacOSRoman),
+              "caf\xC3\xA9");
+    EXPECT_EQ(GWStringFromBytes(std::string_view("caf\xE9"), GWStringEncoding::WindowsCP1252),
+              "caf\xC3\xA9");
+    EXPECT_EQ(GWStringFromBytes(std::string_view("\x80"), GWStringEncoding::WindowsCP1252),
+              "\xE2\x82\xAC");
+    EXPECT_EQ(GWStringFromBytes(std::string_view("\xC4\xE5"), GWStringEncoding::WindowsCP1251),
+              "\xD0\x94\xD0\xB5");
+    EXPECT_EQ(GWStringFromBytes(std::string_view("\x82\xA0"), GWStringEncoding::ShiftJIS),
+              "\xE3\x81\x82");
+    EXPECT_EQ(GWStringFromBytes(std::string_view("\xE9"), GWStringEncoding::ISOLatin1),
+              "\xC3\xA9");
+    // Bytes that mean nothing in the code page are refused, not guessed.
+    EXPECT_FALSE(GWStringFromBytes(std::string_view("\x81"), GWStringEncoding::WindowsCP1252));
+    EXPECT_FALSE(GWStringFromBytes(std::string_view("\x82"), GWStringEncoding::ShiftJIS));
+}
+
+TEST(GWStringEncoding, EncodingBackRefusesCharactersWithoutAPlace) {
+    EXPECT_EQ(GWBytesFromString("caf\xC3\xA9", GWStringEncoding::MacOSRoman), "caf\x8E");
+    EXPECT_FALSE(GWBytesFromString("\xE3\x81\x82", GWStringEncoding::MacOSRoman));
+}

@@ -1,0 +1,153 @@
+#include <gtest/gtest.h>
+
+#include <cstdlib>
+
+#include "GWArchiveSupport/GWArchiveConstants.h"
+#include "foundation/GWFoundation.h"
+
+TEST(GWURL, FileURLsKeepTheirPathAndParts) {
+    const GWURL url = GWURL::fileURLWithPath("/tmp/some dir/archive.tar.xar");
+    EXPECT_TRUE(url.isFileURL());
+    EXPECT_EQ(url.path(), "/tmp/some dir/archive.tar.xar");
+    EXPECT_EQ(url.absoluteString(), "file:///tmp/some%20dir/archive.tar.xar");
+    EXPECT_EQ(url.lastPathComponent(), "archive.tar.xar");
+    EXPECT_EQ(url.pathExtension(), "xar");
+    EXPECT_EQ(url.URLByDeletingLastPathComponent().path(), "/tmp/some dir");
+    EXPECT_EQ(url.URLByDeletingLastPathComponent().URLByAppendingPathComponent("x").path(),
+              "/tmp/some dir/x");
+    EXPECT_EQ(GWURL::fileURLWithPath("/").URLByAppendingPathComponent("a").path(), "/a");
+    EXPECT_EQ(GWURL::fileURLWithPath("/a/").path(), "/a");
+    EXPECT_TRUE(GWURL::fileURLWithPath("/a/").hasDirectoryPath());
+    EXPECT_EQ(GWURL::fileURLWithPath(".hidden").pathExtension(), "");
+}
+
+TEST(GWURL, RelativePathsResolveAgainstTheCurrentDirectory) {
+    const GWURL url = GWURL::fileURLWithPath("relative.zip");
+    EXPECT_EQ(url.path().front(), '/');
+    EXPECT_EQ(url.lastPathComponent(), "relative.zip");
+}
+
+TEST(GWURL, ParsingStrings) {
+    auto file = GWURL::URLWithString("file:///tmp/caf%C3%A9.zip");
+    ASSERT_TRUE(file);
+    EXPECT_EQ(file->path(), "/tmp/caf\xC3\xA9.zip");
+    EXPECT_EQ(*file, GWURL::fileURLWithPath("/tmp/caf\xC3\xA9.zip"));
+    EXPECT_EQ(GWURL::URLWithString(file->absoluteString()), file);
+
+    auto web = GWURL::URLWithString("HTTPS://example.com/dir/a.xar?x=1");
+    ASSERT_TRUE(web);
+    EXPECT_EQ(web->scheme(), "https");
+    EXPECT_EQ(web->host(), "example.com");
+    EXPECT_EQ(web->path(), "/dir/a.xar");
+    EXPECT_EQ(web->absoluteString(), "https://example.com/dir/a.xar?x=1");
+
+    auto relative = GWURL::URLWithString("dir/a.zip");
+    ASSERT_TRUE(relative);
+    EXPECT_TRUE(relative->scheme().empty());
+    EXPECT_FALSE(relative->isFileURL());
+
+    EXPECT_FALSE(GWURL::URLWithString(""));
+    EXPECT_FALSE(GWURL::URLWithString("file:///bad%zzescape"));
+    EXPECT_FALSE(GWURL::URLWithString("file://otherhost/x"));
+    EXPECT_FALSE(GWURL::URLWithString("file:relative"));
+    EXPECT_FALSE(GWURL::URLWithString("has space"));
+}
+
+TEST(GWDate, GregorianFieldsInAZoneAndRollingOver) {
+    const GWTimeZone utc = GWTimeZone::UTC();
+    EXPECT_EQ(GWDate::gregorianDateWithYear(1970, 1, 1, 0, 0, 0, utc).timeIntervalSince1970(), 0);
+    EXPECT_EQ(GWDate::gregorianDateWithYear(2001, 1, 1, 0, 0, 0, utc).timeIntervalSince1970(),
+              978307200);
+    EXPECT_EQ(GWDate::gregorianDateWithYear(1904, 1, 1, 0, 0, 0, utc).timeIntervalSince1970(),
+              -2082844800);
+    // A DOS time can say second 31 or month 0; both roll into the next field.
+    EXPECT_EQ(GWDate::gregorianDateWithYear(2000, 1, 1, 0, 0, 61, utc).timeIntervalSince1970(),
+              GWDate::gregorianDateWithYear(2000, 1, 1, 0, 1, 1, utc).timeIntervalSince1970());
+    EXPECT_EQ(GWDate::gregorianDateWithYear(2000, 0, 1, 0, 0, 0, utc).timeIntervalSince1970(),
+              GWDate::gregorianDateWithYear(1999, 12, 1, 0, 0, 0, utc).timeIntervalSince1970());
+    EXPECT_EQ(GWDate::gregorianDateWithYear(2000, 1, 1, 2, 0, 0, GWTimeZone{7200})
+                  .timeIntervalSince1970(),
+              946684800);
+}
+
+TEST(GWDate, NoZoneMeansTheCurrentOne) {
+    const char* saved = std::getenv("TZ");
+    const std::string previous = saved ? saved : "";
+    setenv("TZ", "America/New_York", 1);
+    tzset();
+    // Winter is five hours behind UTC there, summer four.
+    EXPECT_EQ(GWDate::gregorianDateWithYear(2020, 1, 15, 12, 0, 0).timeIntervalSince1970(),
+              GWDate::gregorianDateWithYear(2020, 1, 15, 17, 0, 0, GWTimeZone::UTC())
+                  .timeIntervalSince1970());
+    EXPECT_EQ(GWDate::gregorianDateWithYear(2020, 7, 15, 12, 0, 0).timeIntervalSince1970(),
+              GWDate::gregorianDateWithYear(2020, 7, 15, 16, 0, 0, GWTimeZone::UTC())
+                  .timeIntervalSince1970());
+    if (saved) {
+        setenv("TZ", previous.c_str(), 1);
+    } else {
+        unsetenv("TZ");
+    }
+    tzset();
+}
+
+TEST(GWDate, ISO8601AndNTFSTicks) {
+    auto date = GWDate::dateWithISO8601String("2021-03-04T05:06:07");
+    ASSERT_TRUE(date);
+    EXPECT_EQ(date->timeIntervalSince1970(), 1614834367);
+    EXPECT_EQ(date->ISO8601String(), "2021-03-04T05:06:07Z");
+    for (const char* bad : {"2021-03-04T05:06:07.5", "2021-13-04T05:06:07", "2021-03-04 05:06:07",
+                            "", "2021-03-04T05:06"}) {
+        EXPECT_FALSE(GWDate::dateWithISO8601String(bad)) << bad;
+    }
+    EXPECT_EQ(GWDate::dateWithNTFSTicks(116444736000000000ull).timeIntervalSince1970(), 0);
+    EXPECT_DOUBLE_EQ(GWDate::dateWithNTFSTicks(116444736000000001ull).timeIntervalSince1970(),
+                     1e-7);
+}
+
+TEST(GWError, GeneratedErrorsCarryEverything) {
+    auto underlying = GWPOSIXError(ENOENT);
+    EXPECT_EQ(underlying->localizedDescription(), "No such file or directory");
+    const GWURL url = GWURL::fileURLWithPath("/tmp/a.zip");
+    auto error = GWGenerateError(kGWZipArchiveErrorDomain, 1, url, underlying,
+                                 {{kGWZipArchiveUnknownEntityErrorKey, GWValue(9)}},
+                                 "method %d is not supported", 9);
+    EXPECT_EQ(error->domain(), "GWZipArchiveErrorDomain");
+    EXPECT_EQ(error->code(), 1);
+    EXPECT_EQ(error->URL(), url);
+    EXPECT_EQ(error->underlyingError(), underlying);
+    EXPECT_EQ(error->detailString(kGWZipArchiveUnknownEntityErrorKey), "9");
+    EXPECT_EQ(error->localizedDescription(), "method 9 is not supported");
+    EXPECT_NE(GWCocoaError(GWFileReadCorruptFileError, url)->localizedDescription().find(
+                  "/tmp/a.zip"),
+              std::string::npos);
+}
+
+TEST(GWLog, LinesGoToTheSinkThatIsSet) {
+    std::vector<std::string> lines;
+    auto previous = GWSetLogSink([&](const std::string& line) { lines.push_back(line); });
+    GWLog("unknown extra info signature: 0x%x", 0x1234);
+    GWSetLogSink(previous);
+    ASSERT_EQ(lines.size(), 1u);
+    EXPECT_EQ(lines[0], "unknown extra info signature: 0x1234");
+}
+
+TEST(GWByteReader, ReadsAreCheckedAndFailureIsSticky) {
+    const GWData bytes{0x01, 0x02, 0x03, 0x04, 0x05, 0x06};
+    GWByteReader reader(bytes);
+    EXPECT_EQ(reader.u16le(), 0x0201);
+    EXPECT_EQ(reader.u16be(), 0x0304);
+    EXPECT_TRUE(reader.ok());
+    EXPECT_EQ(reader.u32le(), 0u);
+    EXPECT_FALSE(reader.ok());
+    EXPECT_EQ(reader.u8(), 0);  // still failed, even though a byte remains
+    EXPECT_EQ(reader.failureDescription(),
+              "unexpected end of data at offset 0x6 while reading [0x4, 0x8)");
+
+    GWByteReader whole(bytes);
+    EXPECT_FALSE(whole.slice(4, 3).ok());
+    EXPECT_FALSE(whole.slice(SIZE_MAX, 2).ok());
+    GWByteReader part = whole.slice(2, 3);
+    EXPECT_EQ(part.uintBE(3), 0x030405u);
+    EXPECT_TRUE(part.ok());
+    EXPECT_FALSE(whole.seek(7));
+}
