@@ -116,8 +116,8 @@ std::optional<GWData> GWChecksum::checksumAtURL(const GWURL& url, int algorithm,
     auto checksum = checksumWithAlgorithm(algorithm);
     GWErrorPtr readError;
     handle->readDataAtOffset(0, handle->fileSize(), UINT64_MAX,
-                             [&](GWRemoteFileHandle&, std::span<const std::uint8_t> piece,
-                                 bool, const GWErrorPtr& pieceError) {
+                             [&](GWRemoteFileHandle&, std::span<const std::uint8_t> piece, bool,
+                                 const GWErrorPtr& pieceError) {
                                  if (pieceError) {
                                      readError = pieceError;
                                      return false;

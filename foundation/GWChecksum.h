@@ -40,8 +40,7 @@ public:
     // The digest of a buffer; empty for algorithms without a digest.
     static GWData checksumForData(std::span<const std::uint8_t> bytes, int algorithm);
     // The digest of a file's whole contents, read in large pieces.
-    static std::optional<GWData> checksumAtURL(const GWURL& url, int algorithm,
-                                               GWErrorPtr* error);
+    static std::optional<GWData> checksumAtURL(const GWURL& url, int algorithm, GWErrorPtr* error);
 };
 
 // MD2, which OpenSSL builds omit.

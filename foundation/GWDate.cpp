@@ -40,11 +40,11 @@ GWDate GWDate::dateWithNTFSTicks(std::uint64_t ticks) {
     return GWDate(whole + double(ticks % 10000000) / 1e7);
 }
 
-GWDate GWDate::gregorianDateWithYear(int year, int month, int day, int hour, int minute,
-                                     int second, const std::optional<GWTimeZone>& timeZone) {
+GWDate GWDate::gregorianDateWithYear(int year, int month, int day, int hour, int minute, int second,
+                                     const std::optional<GWTimeZone>& timeZone) {
     if (timeZone) {
-        return GWDate(double(utcSeconds(year, month, day, hour, minute, second) -
-                             timeZone->secondsFromGMT));
+        return GWDate(
+            double(utcSeconds(year, month, day, hour, minute, second) - timeZone->secondsFromGMT));
     }
     // The local zone's offset depends on the date itself (daylight saving,
     // historic offsets), which mktime knows.
@@ -84,12 +84,10 @@ std::optional<GWDate> GWDate::dateWithISO8601String(std::string_view text) {
     };
     const int month = number(5, 2), day = number(8, 2);
     const int hour = number(11, 2), minute = number(14, 2), second = number(17, 2);
-    if (month < 1 || month > 12 || day < 1 || day > 31 || hour > 23 || minute > 59 ||
-        second > 59) {
+    if (month < 1 || month > 12 || day < 1 || day > 31 || hour > 23 || minute > 59 || second > 59) {
         return std::nullopt;
     }
-    return gregorianDateWithYear(number(0, 4), month, day, hour, minute, second,
-                                 GWTimeZone::UTC());
+    return gregorianDateWithYear(number(0, 4), month, day, hour, minute, second, GWTimeZone::UTC());
 }
 
 std::string GWDate::ISO8601String() const {
@@ -98,8 +96,7 @@ std::string GWDate::ISO8601String() const {
     gmtime_r(&t, &fields);
     char text[64];
     std::snprintf(text, sizeof text, "%04d-%02d-%02dT%02d:%02d:%02dZ", fields.tm_year + 1900,
-                  fields.tm_mon + 1, fields.tm_mday, fields.tm_hour, fields.tm_min,
-                  fields.tm_sec);
+                  fields.tm_mon + 1, fields.tm_mday, fields.tm_hour, fields.tm_min, fields.tm_sec);
     return text;
 }
 

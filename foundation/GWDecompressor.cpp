@@ -136,8 +136,8 @@ std::optional<GWData> GWDecompressor::decompressedDataFromData(std::span<const s
     std::span<const std::uint8_t> input = data;
     bool again = true;
     while (again) {
-        auto piece = decompressor->decompressedDataFromStreamWithInputData(input, true, &again,
-                                                                          error);
+        auto piece =
+            decompressor->decompressedDataFromStreamWithInputData(input, true, &again, error);
         if (!piece) {
             return std::nullopt;
         }
@@ -197,8 +197,7 @@ void GWDecompressor::decompressRemoteFileHandle(const std::shared_ptr<GWRemoteFi
         [&](GWRemoteFileHandle&, std::span<const std::uint8_t> chunk, bool isLast,
             const GWErrorPtr& readError) {
             if (readError) {
-                handler({}, storedBytes, decodedBytes, true, std::nullopt, std::nullopt,
-                        readError);
+                handler({}, storedBytes, decodedBytes, true, std::nullopt, std::nullopt, readError);
                 return false;
             }
             storedBytes += chunk.size();

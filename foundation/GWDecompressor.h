@@ -31,8 +31,7 @@ public:
     // `shouldRunAgain` while it holds more output; the caller then repeats
     // the call with empty input and the same `isFinal`.
     std::optional<GWData> decompressedDataFromStreamWithInputData(
-        std::span<const std::uint8_t> input, bool isFinal, bool* shouldRunAgain,
-        GWErrorPtr* error);
+        std::span<const std::uint8_t> input, bool isFinal, bool* shouldRunAgain, GWErrorPtr* error);
 
     // True when the bytes begin a zlib (algorithm 1) or bzip2 (5) stream.
     static bool isDataCompressed(std::span<const std::uint8_t> data, int* algorithm = nullptr);

@@ -24,8 +24,8 @@ public:
                 GWErrorPtr* error) override {
         got = 0;
         while (got < into.size()) {
-            const ssize_t n = ::pread(fd_, into.data() + got, into.size() - got,
-                                      off_t(offset + got));
+            const ssize_t n =
+                ::pread(fd_, into.data() + got, into.size() - got, off_t(offset + got));
             if (n < 0) {
                 if (errno == EINTR) {
                     continue;
@@ -44,8 +44,8 @@ public:
                  GWErrorPtr* error) override {
         std::size_t done = 0;
         while (done < bytes.size()) {
-            const ssize_t n = ::pwrite(fd_, bytes.data() + done, bytes.size() - done,
-                                       off_t(offset + done));
+            const ssize_t n =
+                ::pwrite(fd_, bytes.data() + done, bytes.size() - done, off_t(offset + done));
             if (n < 0) {
                 if (errno == EINTR) {
                     continue;

@@ -92,8 +92,7 @@ bool GWRemoteFileHandle::seekToFileOffset(std::uint64_t offset, GWErrorPtr*) {
 }
 
 void GWRemoteFileHandle::readDataAtOffset(std::uint64_t offset, std::uint64_t length,
-                                          std::uint64_t maxBufferSize,
-                                          const ReadHandler& handler) {
+                                          std::uint64_t maxBufferSize, const ReadHandler& handler) {
     if (closed_) {
         handler(*this, {}, true, GWPOSIXError(EBADF, url_));
         return;
@@ -103,8 +102,8 @@ void GWRemoteFileHandle::readDataAtOffset(std::uint64_t offset, std::uint64_t le
                                          : std::min<std::uint64_t>(maxBufferSize, 64 << 20);
     if (length > UINT64_MAX - offset) {
         handler(*this, {}, true,
-                GWGenerateError(kGWCocoaErrorDomain, GWFileReadCorruptFileError, url_, nullptr,
-                                {}, "The range at offset %llu of length %llu lies past any file",
+                GWGenerateError(kGWCocoaErrorDomain, GWFileReadCorruptFileError, url_, nullptr, {},
+                                "The range at offset %llu of length %llu lies past any file",
                                 (unsigned long long)offset, (unsigned long long)length));
         return;
     }
@@ -119,14 +118,13 @@ void GWRemoteFileHandle::readDataAtOffset(std::uint64_t offset, std::uint64_t le
             return;
         }
         if (got < want) {
-            handler(*this, {}, true,
-                    GWGenerateError(kGWCocoaErrorDomain, GWFileReadCorruptFileError, url_,
-                                    nullptr, {},
-                                    "Unexpected end of file at offset %llu while reading "
-                                    "[%llu, %llu)",
-                                    (unsigned long long)(offset + done + got),
-                                    (unsigned long long)offset,
-                                    (unsigned long long)(offset + length)));
+            handler(
+                *this, {}, true,
+                GWGenerateError(kGWCocoaErrorDomain, GWFileReadCorruptFileError, url_, nullptr, {},
+                                "Unexpected end of file at offset %llu while reading "
+                                "[%llu, %llu)",
+                                (unsigned long long)(offset + done + got),
+                                (unsigned long long)offset, (unsigned long long)(offset + length)));
             return;
         }
         done += got;

@@ -37,9 +37,9 @@ public:
     bool isSeekable() const;
 
     // (this handle, piece, is last piece, error) -> go on?
-    using ReadHandler = std::function<bool(GWRemoteFileHandle& handle,
-                                           std::span<const std::uint8_t> piece, bool isLast,
-                                           const GWErrorPtr& error)>;
+    using ReadHandler =
+        std::function<bool(GWRemoteFileHandle& handle, std::span<const std::uint8_t> piece,
+                           bool isLast, const GWErrorPtr& error)>;
     // Reads [offset, offset + length) in pieces of at most `maxBufferSize`
     // bytes (UINT64_MAX: the handle's own, large size). A file that ends
     // before the range does is an error, never a short final piece.

@@ -11,16 +11,16 @@ bool isSchemeCharacter(char c, bool first) {
     if (std::isalpha(static_cast<unsigned char>(c))) {
         return true;
     }
-    return !first && (std::isdigit(static_cast<unsigned char>(c)) || c == '+' || c == '-' ||
-                      c == '.');
+    return !first &&
+           (std::isdigit(static_cast<unsigned char>(c)) || c == '+' || c == '-' || c == '.');
 }
 
 std::string percentEncodePath(const std::string& path) {
     static const char kHex[] = "0123456789ABCDEF";
     std::string out;
     for (unsigned char c : path) {
-        if (std::isalnum(c) || std::string_view("/-._~!$&'()*+,;=:@").find(c) !=
-                                   std::string_view::npos) {
+        if (std::isalnum(c) ||
+            std::string_view("/-._~!$&'()*+,;=:@").find(c) != std::string_view::npos) {
             out += char(c);
         } else {
             out += '%';

@@ -25,8 +25,7 @@ struct GWValue {
     GWValue() : storage(false) {}
     GWValue(bool v) : storage(v) {}
     template <typename T>
-        requires(std::is_integral_v<T> && !std::is_same_v<T, bool>)
-    GWValue(T v) {
+    requires(std::is_integral_v<T> && !std::is_same_v<T, bool>) GWValue(T v) {
         if constexpr (std::is_signed_v<T>) {
             storage = std::int64_t(v);
         } else {

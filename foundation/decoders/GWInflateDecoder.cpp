@@ -48,9 +48,7 @@ public:
         step.consumed = std::min<std::size_t>(input.size(), UINT_MAX) - stream_.avail_in;
         step.produced = std::min<std::size_t>(output.size(), UINT_MAX) - stream_.avail_out;
         switch (status) {
-            case Z_STREAM_END:
-                step.finished = true;
-                break;
+            case Z_STREAM_END: step.finished = true; break;
             case Z_OK:
             case Z_BUF_ERROR:  // no progress possible: more input or more room needed
                 // Room left and nothing more to read: the stream was cut short.

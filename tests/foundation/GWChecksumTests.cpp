@@ -24,8 +24,7 @@ TEST(GWChecksum, MD2MatchesThePublishedVectors) {
     EXPECT_EQ(digest("", GWChecksumAlgorithmMD2), "8350e5a3e24c153df2275c9f80692773");
     EXPECT_EQ(digest("a", GWChecksumAlgorithmMD2), "32ec01ec4a6dac72c0ab96fb34c0b5d1");
     EXPECT_EQ(digest("abc", GWChecksumAlgorithmMD2), "da853b0d3f88d99b30283a69e6ded6bb");
-    EXPECT_EQ(digest("message digest", GWChecksumAlgorithmMD2),
-              "ab4f496bfb2a530b219ff33031fe06b0");
+    EXPECT_EQ(digest("message digest", GWChecksumAlgorithmMD2), "ab4f496bfb2a530b219ff33031fe06b0");
     EXPECT_EQ(digest("abcdefghijklmnopqrstuvwxyz", GWChecksumAlgorithmMD2),
               "4e8ddff3650292ab5a4108c3aa47940b");
     EXPECT_EQ(digest("ABCDEFGHIJKLMNOPQRSTUVWXYZabcdefghijklmnopqrstuvwxyz0123456789",
@@ -65,7 +64,8 @@ TEST(GWChecksum, StreamingInPiecesEqualsOneShot) {
         auto checksum = GWChecksum::checksumWithAlgorithm(algorithm);
         ASSERT_TRUE(checksum);
         for (std::size_t at = 0; at < data.size(); at += 997) {
-            checksum->update(std::span(data).subspan(at, std::min<std::size_t>(997, data.size() - at)));
+            checksum->update(
+                std::span(data).subspan(at, std::min<std::size_t>(997, data.size() - at)));
         }
         const GWData streamed = checksum->finish();
         EXPECT_EQ(streamed, GWChecksum::checksumForData(data, algorithm)) << algorithm;

@@ -11,8 +11,12 @@ TEST(GWConversions, FourCharCodesPutTheFirstCharacterHigh) {
     EXPECT_EQ(GWFourCharCode("TEXT"), 0x54455854u);
     EXPECT_EQ(GWStringWithFourCharCode(0x54455854u), "TEXT");
     // Classic Mac codes use Mac OS Roman: 0xA9 is the copyright sign there.
-    EXPECT_EQ(GWFourCharCode("\xC2\xA9" "abc"), 0xA9616263u);
-    EXPECT_EQ(GWStringWithFourCharCode(0xA9616263u), "\xC2\xA9" "abc");
+    EXPECT_EQ(GWFourCharCode("\xC2\xA9"
+                             "abc"),
+              0xA9616263u);
+    EXPECT_EQ(GWStringWithFourCharCode(0xA9616263u),
+              "\xC2\xA9"
+              "abc");
     EXPECT_EQ(GWFourCharCode(""), 0u);
     EXPECT_EQ(GWFourCharCode("TOOLONG"), 0u);
     EXPECT_EQ(GWFourCharCode("ab"), 0u);
@@ -62,8 +66,8 @@ TEST(GWBase64, RefusesAnythingElse) {
 TEST(GWStringEncoding, UTF8MustBeWellFormed) {
     EXPECT_EQ(GWStringFromBytes(std::string_view("caf\xC3\xA9"), GWStringEncoding::UTF8),
               "caf\xC3\xA9");
-    for (const char* bad : {"\xC3", "\xC0\xAF", "\xED\xA0\x80", "\xF4\x90\x80\x80", "\xFF",
-                            "a\x80"}) {
+    for (const char* bad :
+         {"\xC3", "\xC0\xAF", "\xED\xA0\x80", "\xF4\x90\x80\x80", "\xFF", "a\x80"}) {
         EXPECT_FALSE(GWStringFromBytes(std::string_view(bad), GWStringEncoding::UTF8)) << bad;
     }
 }
@@ -79,8 +83,7 @@ TEST(GWStringEncoding, LegacyCodePagesDecodeToUTF8) {
               "\xD0\x94\xD0\xB5");
     EXPECT_EQ(GWStringFromBytes(std::string_view("\x82\xA0"), GWStringEncoding::ShiftJIS),
               "\xE3\x81\x82");
-    EXPECT_EQ(GWStringFromBytes(std::string_view("\xE9"), GWStringEncoding::ISOLatin1),
-              "\xC3\xA9");
+    EXPECT_EQ(GWStringFromBytes(std::string_view("\xE9"), GWStringEncoding::ISOLatin1), "\xC3\xA9");
     // Bytes that mean nothing in the code page are refused, not guessed.
     EXPECT_FALSE(GWStringFromBytes(std::string_view("\x81"), GWStringEncoding::WindowsCP1252));
     EXPECT_FALSE(GWStringFromBytes(std::string_view("\x82"), GWStringEncoding::ShiftJIS));

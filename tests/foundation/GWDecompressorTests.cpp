@@ -52,7 +52,7 @@ std::optional<GWData> decodeInPieces(int algorithm, const GWData& stream, std::s
         bool again = false;
         do {
             auto piece = decompressor->decompressedDataFromStreamWithInputData(input, isFinal,
-                                                                              &again, error);
+                                                                               &again, error);
             if (!piece) {
                 return false;
             }
@@ -62,8 +62,7 @@ std::optional<GWData> decodeInPieces(int algorithm, const GWData& stream, std::s
         return true;
     };
     for (std::size_t at = 0; at < stream.size(); at += pieceSize) {
-        if (!step(std::span(stream).subspan(at, std::min(pieceSize, stream.size() - at)),
-                  false)) {
+        if (!step(std::span(stream).subspan(at, std::min(pieceSize, stream.size() - at)), false)) {
             return std::nullopt;
         }
     }
@@ -122,8 +121,8 @@ TEST(GWDecompressor, BufferedOutputAsksToRunAgainUntilDelivered) {
     GWData output = *first;
     int calls = 0;
     while (again) {
-        auto more = decompressor->decompressedDataFromStreamWithInputData({}, false, &again,
-                                                                         nullptr);
+        auto more =
+            decompressor->decompressedDataFromStreamWithInputData({}, false, &again, nullptr);
         ASSERT_TRUE(more);
         output.insert(output.end(), more->begin(), more->end());
         ++calls;
@@ -163,8 +162,8 @@ TEST(GWDecompressor, DamagedAndTruncatedStreamsAreErrors) {
         EXPECT_GT(failures, 0) << codec.name;
     }
     GWErrorPtr error;
-    EXPECT_FALSE(decodeInPieces(GWDecompressorAlgorithmDeflate, gwtest::randomBytes(5000, 11),
-                                100, &error));
+    EXPECT_FALSE(
+        decodeInPieces(GWDecompressorAlgorithmDeflate, gwtest::randomBytes(5000, 11), 100, &error));
 }
 
 TEST(GWDecompressor, AfterAnErrorEveryStepFails) {
@@ -195,8 +194,8 @@ TEST(GWDecompressor, RecognisesAndDecodesWholeBuffers) {
     EXPECT_FALSE(GWDecompressor::isDataCompressed(gwtest::bytesOf("<?xml version"), nullptr));
     EXPECT_FALSE(GWDecompressor::isDataCompressed({}, nullptr));
 
-    auto decoded = GWDecompressor::decompressedDataFromData(deflateBytes(input, Wrapping::Zlib),
-                                                            nullptr);
+    auto decoded =
+        GWDecompressor::decompressedDataFromData(deflateBytes(input, Wrapping::Zlib), nullptr);
     ASSERT_TRUE(decoded);
     EXPECT_TRUE(*decoded == input);
     GWErrorPtr error;
@@ -260,8 +259,7 @@ TEST(GWDecompressor, FileRangeStreamsStopOnRefusalAndReportErrorsOnce) {
     for (int algorithm : {GWDecompressorAlgorithmCopy, GWDecompressorAlgorithmDeflate}) {
         std::vector<GWErrorPtr> errors;
         GWDecompressor::decompressRemoteFileHandle(
-            handle, algorithm == 0 ? 2999000 : 0, algorithm == 0 ? 5000 : 3000000, algorithm, 1,
-            1,
+            handle, algorithm == 0 ? 2999000 : 0, algorithm == 0 ? 5000 : 3000000, algorithm, 1, 1,
             [&](auto, auto, auto, bool done, const auto& stored, const auto&,
                 const GWErrorPtr& error) {
                 if (error) {

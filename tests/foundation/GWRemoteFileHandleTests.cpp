@@ -11,16 +11,16 @@ struct Piece {
     GWErrorPtr error;
 };
 
-std::vector<Piece> readRange(GWRemoteFileHandle& handle, std::uint64_t offset,
-                             std::uint64_t length, std::uint64_t maxBuffer) {
+std::vector<Piece> readRange(GWRemoteFileHandle& handle, std::uint64_t offset, std::uint64_t length,
+                             std::uint64_t maxBuffer) {
     std::vector<Piece> pieces;
-    handle.readDataAtOffset(offset, length, maxBuffer,
-                            [&](GWRemoteFileHandle&, std::span<const std::uint8_t> piece,
-                                bool isLast, const GWErrorPtr& error) {
-                                pieces.push_back({GWData(piece.begin(), piece.end()), isLast,
-                                                  error});
-                                return true;
-                            });
+    handle.readDataAtOffset(
+        offset, length, maxBuffer,
+        [&](GWRemoteFileHandle&, std::span<const std::uint8_t> piece, bool isLast,
+            const GWErrorPtr& error) {
+            pieces.push_back({GWData(piece.begin(), piece.end()), isLast, error});
+            return true;
+        });
     return pieces;
 }
 
@@ -108,8 +108,8 @@ TEST(GWRemoteFileHandle, OpeningFailuresSayWhy) {
     EXPECT_FALSE(GWRemoteFileHandle::initForReadingFromURL(directory.url("missing"), &error));
     EXPECT_TRUE(error->is(kGWPOSIXErrorDomain, ENOENT));
     EXPECT_EQ(error->URL(), directory.url("missing"));
-    EXPECT_FALSE(GWRemoteFileHandle::initForReadingFromURL(
-        GWURL::fileURLWithPath(directory.path()), &error));
+    EXPECT_FALSE(GWRemoteFileHandle::initForReadingFromURL(GWURL::fileURLWithPath(directory.path()),
+                                                           &error));
     EXPECT_TRUE(error->is(kGWPOSIXErrorDomain, EISDIR));
     EXPECT_FALSE(GWRemoteFileHandle::initForReadingFromURL(
         *GWURL::URLWithString("ftp://example.invalid/a.zip"), &error));

@@ -117,9 +117,9 @@ TEST(GWError, GeneratedErrorsCarryEverything) {
     EXPECT_EQ(error->underlyingError(), underlying);
     EXPECT_EQ(error->detailString(kGWZipArchiveUnknownEntityErrorKey), "9");
     EXPECT_EQ(error->localizedDescription(), "method 9 is not supported");
-    EXPECT_NE(GWCocoaError(GWFileReadCorruptFileError, url)->localizedDescription().find(
-                  "/tmp/a.zip"),
-              std::string::npos);
+    EXPECT_NE(
+        GWCocoaError(GWFileReadCorruptFileError, url)->localizedDescription().find("/tmp/a.zip"),
+        std::string::npos);
 }
 
 TEST(GWLog, LinesGoToTheSinkThatIsSet) {

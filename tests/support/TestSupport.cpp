@@ -87,8 +87,9 @@ GWData randomBytes(std::size_t count, std::uint32_t seed) {
 }
 
 GWData textBytes(std::size_t count, std::uint32_t seed) {
-    static const char* const kWords[] = {"archive", "resource", "fork", "finder", "the", "of",
-                                         "metadata", "central", "directory", "a", "heap", "toc"};
+    static const char* const kWords[] = {"archive",   "resource", "fork",     "finder",
+                                         "the",       "of",       "metadata", "central",
+                                         "directory", "a",        "heap",     "toc"};
     std::mt19937 generator(seed);
     GWData bytes;
     bytes.reserve(count);
