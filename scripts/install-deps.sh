@@ -5,11 +5,11 @@
 set -euo pipefail
 
 packages=(
-  build-essential cmake pkg-config python3
+  build-essential cmake pkg-config python3 clang-format
   zlib1g-dev libbz2-dev libssl-dev openssl
   libpugixml-dev libacl1-dev libplist-dev libcurl4-openssl-dev libisal-dev
   libgtest-dev libgmock-dev libbenchmark-dev
-  unzip zip libarchive-tools 7zip unar
+  unzip zip libarchive-tools 7zip unar macutils
 )
 
 missing=()
