@@ -4,7 +4,10 @@
 
 #include "GWByteReader.h"
 #include "GWDate.h"
+#include "GWDispatch.h"
 #include "GWError.h"
 #include "GWLog.h"
+#include "GWOperation.h"
+#include "GWOperationQueue.h"
 #include "GWURL.h"
 #include "GWValue.h"

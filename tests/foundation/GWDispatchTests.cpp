@@ -1,0 +1,160 @@
+#include <gtest/gtest.h>
+
+#include <atomic>
+#include <chrono>
+#include <thread>
+#include <vector>
+
+#include "foundation/GWFoundation.h"
+
+namespace {
+
+using namespace std::chrono_literals;
+
+// Bounds waits that must succeed, so that a fault fails instead of hanging.
+constexpr auto kEventually = 10s;
+// How long to watch for something that must not happen.
+constexpr auto kMeanwhile = 20ms;
+
+}  // namespace
+
+TEST(GWSemaphore, CountsSignalsAndTimesOutWithoutOne) {
+    GWSemaphore semaphore(2);
+    EXPECT_TRUE(semaphore.wait(0ms));
+    EXPECT_TRUE(semaphore.wait(0ms));
+    EXPECT_FALSE(semaphore.wait(kMeanwhile));
+    semaphore.signal();
+    semaphore.signal();
+    semaphore.wait();
+    EXPECT_TRUE(semaphore.wait(0ms));
+    EXPECT_FALSE(semaphore.wait(0ms));
+}
+
+TEST(GWSemaphore, NegativeStartNeedsExtraSignals) {
+    GWSemaphore semaphore(-1);
+    semaphore.signal();
+    EXPECT_FALSE(semaphore.wait(0ms));
+    semaphore.signal();
+    EXPECT_TRUE(semaphore.wait(0ms));
+}
+
+TEST(GWSemaphore, WakesAWaiterOnAnotherThread) {
+    GWSemaphore semaphore;
+    std::atomic<bool> woke{false};
+    std::thread waiter([&] { woke = semaphore.wait(kEventually); });
+    semaphore.signal();
+    waiter.join();
+    EXPECT_TRUE(woke);
+}
+
+TEST(GWGroup, WaitsUntilEveryEnterIsMatched) {
+    GWGroup group;
+    EXPECT_TRUE(group.wait(0ms));
+    group.enter();
+    group.enter();
+    EXPECT_FALSE(group.wait(kMeanwhile));
+    group.leave();
+    EXPECT_FALSE(group.wait(0ms));
+    std::thread leaver([&] { group.leave(); });
+    group.wait();
+    leaver.join();
+    EXPECT_TRUE(group.wait(0ms));
+}
+
+TEST(GWGroup, UnbalancedLeaveIsIgnored) {
+    GWGroup group;
+    group.leave();
+    group.enter();
+    EXPECT_FALSE(group.wait(0ms));
+    group.leave();
+    EXPECT_TRUE(group.wait(0ms));
+}
+
+TEST(GWGroup, NotifyRunsOnTheQueueOnceTheGroupEmpties) {
+    GWGroup group;
+    auto queue = GWDispatchQueue::serialQueue("group notify");
+    std::atomic<bool> notified{false};
+    GWSemaphore done;
+    group.enter();
+    group.enter();
+    group.notify(queue, [&] {
+        notified = true;
+        done.signal();
+    });
+    group.leave();
+    // Anything dispatched by the first leave would run before this.
+    queue->sync([] {});
+    EXPECT_FALSE(notified);
+    group.leave();
+    ASSERT_TRUE(done.wait(kEventually));
+    EXPECT_TRUE(notified);
+
+    // On an empty group it goes out at once; no queue means the global one.
+    group.notify(nullptr, [&] { done.signal(); });
+    EXPECT_TRUE(done.wait(kEventually));
+}
+
+TEST(GWDispatchQueue, SerialQueueRunsBlocksOneAtATimeInOrder) {
+    auto queue = GWDispatchQueue::serialQueue("GWXARArchive setxattr queue");
+    EXPECT_EQ(queue->label(), "GWXARArchive setxattr queue");
+    EXPECT_TRUE(queue->isSerial());
+    std::vector<int> order;
+    std::atomic<int> inside{0};
+    std::atomic<bool> overlapped{false};
+    for (int i = 0; i < 200; ++i) {
+        queue->async([&, i] {
+            if (++inside != 1) {
+                overlapped = true;
+            }
+            order.push_back(i);
+            --inside;
+        });
+    }
+    int lastSeen = -1;
+    queue->sync([&] { lastSeen = order.empty() ? -1 : order.back(); });
+    EXPECT_EQ(lastSeen, 199);
+    EXPECT_FALSE(overlapped);
+    std::vector<int> expected(200);
+    for (int i = 0; i < 200; ++i) {
+        expected[i] = i;
+    }
+    EXPECT_EQ(order, expected);
+}
+
+TEST(GWDispatchQueue, DroppedSerialQueueStillRunsItsBlocks) {
+    GWSemaphore ran;
+    {
+        auto queue = GWDispatchQueue::serialQueue("short-lived");
+        queue->async([&] { ran.signal(); });
+    }
+    EXPECT_TRUE(ran.wait(kEventually));
+}
+
+TEST(GWDispatchQueue, GlobalQueueIsSharedAndConcurrent) {
+    auto global = GWDispatchQueue::globalQueue();
+    EXPECT_EQ(global, GWDispatchQueue::globalQueue());
+    EXPECT_FALSE(global->isSerial());
+    // Each block waits for the other: a serial queue would time out.
+    GWSemaphore first, second;
+    std::atomic<int> met{0};
+    GWGroup group;
+    group.enter();
+    group.enter();
+    global->async([&] {
+        first.signal();
+        met += second.wait(kEventually) ? 1 : 0;
+        group.leave();
+    });
+    global->async([&] {
+        second.signal();
+        met += first.wait(kEventually) ? 1 : 0;
+        group.leave();
+    });
+    group.wait();
+    EXPECT_EQ(met, 2);
+
+    const auto caller = std::this_thread::get_id();
+    std::thread::id ranOn;
+    global->sync([&] { ranOn = std::this_thread::get_id(); });
+    EXPECT_EQ(ranOn, caller);
+}

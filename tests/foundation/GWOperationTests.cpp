@@ -1,0 +1,490 @@
+#include <gtest/gtest.h>
+
+#include <algorithm>
+#include <atomic>
+#include <chrono>
+#include <memory>
+#include <mutex>
+#include <thread>
+#include <vector>
+
+#include "foundation/GWFoundation.h"
+
+namespace {
+
+using namespace std::chrono_literals;
+
+// Bounds waits that must succeed, so that a fault fails instead of hanging.
+constexpr auto kEventually = 10s;
+// How long to watch for something that must not happen.
+constexpr auto kMeanwhile = 30ms;
+
+class Recorder {
+public:
+    void add(int value) {
+        std::lock_guard<std::mutex> lock(mutex_);
+        values_.push_back(value);
+    }
+    std::vector<int> values() const {
+        std::lock_guard<std::mutex> lock(mutex_);
+        return values_;
+    }
+
+private:
+    mutable std::mutex mutex_;
+    std::vector<int> values_;
+};
+
+class CountingOperation : public GWOperation {
+public:
+    void main() override {
+        executingInsideMain = isExecuting();
+        ++mainCalls;
+    }
+    std::atomic<int> mainCalls{0};
+    std::atomic<bool> executingInsideMain{false};
+};
+
+// Stays executing after start() returns until the test finishes it.
+class ManualOperation : public GWOperation {
+public:
+    bool isAsynchronous() const override { return true; }
+    void main() override { started.signal(); }
+    void complete() { finish(); }
+    GWSemaphore started;
+};
+
+GWBlockOperationPtr recordingOperation(Recorder& recorder, int value) {
+    return GWBlockOperation::blockOperationWithBlock([&recorder, value] { recorder.add(value); });
+}
+
+}  // namespace
+
+TEST(GWOperation, StartRunsMainOnceAndFinishes) {
+    auto operation = std::make_shared<CountingOperation>();
+    EXPECT_TRUE(operation->isReady());
+    operation->start();
+    operation->start();
+    EXPECT_EQ(operation->mainCalls, 1);
+    EXPECT_TRUE(operation->executingInsideMain);
+    EXPECT_FALSE(operation->isExecuting());
+    EXPECT_TRUE(operation->isFinished());
+}
+
+TEST(GWOperation, CancelledBeforeStartSkipsMainYetFinishesAndCompletesOnce) {
+    auto operation = std::make_shared<CountingOperation>();
+    std::atomic<int> completions{0};
+    std::atomic<bool> finishedInsideCompletion{false};
+    operation->setCompletionBlock([&, raw = operation.get()] {
+        finishedInsideCompletion = raw->isFinished();
+        ++completions;
+    });
+    operation->cancel();
+    operation->start();
+    operation->start();
+    operation->waitUntilFinished();
+    EXPECT_EQ(operation->mainCalls, 0);
+    EXPECT_TRUE(operation->isCancelled());
+    EXPECT_TRUE(operation->isFinished());
+    EXPECT_EQ(completions, 1);
+    EXPECT_TRUE(finishedInsideCompletion);
+}
+
+TEST(GWOperation, CompletionBlockRunsOnceEvenWhenFinishIsRaced) {
+    auto operation = std::make_shared<ManualOperation>();
+    std::atomic<int> completions{0};
+    operation->setCompletionBlock([&] { ++completions; });
+    operation->start();
+    EXPECT_TRUE(operation->isExecuting());
+    std::vector<std::thread> finishers;
+    for (int i = 0; i < 4; ++i) {
+        finishers.emplace_back([operation] { operation->complete(); });
+    }
+    for (auto& finisher : finishers) {
+        finisher.join();
+    }
+    EXPECT_TRUE(operation->isFinished());
+    EXPECT_EQ(completions, 1);
+    EXPECT_FALSE(operation->completionBlock());
+}
+
+TEST(GWOperation, WaitUntilFinishedReturnsOnlyAfterTheCompletionBlock) {
+    auto operation = GWBlockOperation::blockOperationWithBlock([] {});
+    GWSemaphore completionEntered, releaseCompletion, waiterReturned;
+    std::atomic<bool> completed{false};
+    operation->setCompletionBlock([&] {
+        completionEntered.signal();
+        releaseCompletion.wait();
+        completed = true;
+    });
+    std::atomic<bool> completedWhenWaitReturned{false};
+    std::thread waiter([&] {
+        operation->waitUntilFinished();
+        completedWhenWaitReturned = completed.load();
+        waiterReturned.signal();
+    });
+    GWOperationQueue queue;
+    queue.addOperation(operation);
+    ASSERT_TRUE(completionEntered.wait(kEventually));
+    EXPECT_TRUE(operation->isFinished());
+    EXPECT_FALSE(waiterReturned.wait(kMeanwhile));
+    releaseCompletion.signal();
+    waiter.join();
+    EXPECT_TRUE(completedWhenWaitReturned);
+}
+
+TEST(GWOperation, DependentsStartOnlyAfterTheCompletionBlockReturned) {
+    GWOperationQueue first, second;
+    auto dependency = GWBlockOperation::blockOperationWithBlock([] {});
+    GWSemaphore completionEntered, releaseCompletion, dependentStarted;
+    std::atomic<bool> completed{false};
+    dependency->setCompletionBlock([&] {
+        completionEntered.signal();
+        releaseCompletion.wait();
+        completed = true;
+    });
+    std::atomic<bool> completedWhenDependentRan{false};
+    auto dependent = GWBlockOperation::blockOperationWithBlock([&] {
+        completedWhenDependentRan = completed.load();
+        dependentStarted.signal();
+    });
+    dependent->addDependency(dependency);
+    second.addOperation(dependent);
+    first.addOperation(dependency);
+    ASSERT_TRUE(completionEntered.wait(kEventually));
+    EXPECT_FALSE(dependentStarted.wait(kMeanwhile));
+    releaseCompletion.signal();
+    ASSERT_TRUE(dependentStarted.wait(kEventually));
+    EXPECT_TRUE(completedWhenDependentRan);
+}
+
+TEST(GWOperation, DependenciesOrderExecutionAcrossQueues) {
+    GWOperationQueue first, second;
+    Recorder recorder;
+    auto a = recordingOperation(recorder, 1);
+    auto b = recordingOperation(recorder, 2);
+    auto c = recordingOperation(recorder, 3);
+    auto d = recordingOperation(recorder, 4);
+    b->addDependency(a);
+    c->addDependency(b);
+    d->addDependency(c);
+    d->addDependency(a);
+    // Added last-first, so only the dependencies can produce the order.
+    first.addOperation(d);
+    second.addOperation(c);
+    first.addOperation(b);
+    second.addOperation(a);
+    d->waitUntilFinished();
+    EXPECT_EQ(recorder.values(), (std::vector<int>{1, 2, 3, 4}));
+    EXPECT_EQ(d->dependencies().size(), 2u);
+}
+
+TEST(GWOperation, ADependencyStartedByHandReleasesQueuedDependents) {
+    GWOperationQueue queue;
+    auto byHand = std::make_shared<CountingOperation>();
+    GWSemaphore dependentRan;
+    auto dependent = GWBlockOperation::blockOperationWithBlock([&] { dependentRan.signal(); });
+    dependent->addDependency(byHand);
+    EXPECT_FALSE(dependent->isReady());
+    queue.addOperation(dependent);
+    EXPECT_FALSE(dependentRan.wait(kMeanwhile));
+    byHand->start();
+    EXPECT_TRUE(dependentRan.wait(kEventually));
+    dependent->waitUntilFinished();
+}
+
+TEST(GWOperation, DependingOnAFinishedOperationIsReadyAtOnce) {
+    auto done = std::make_shared<CountingOperation>();
+    done->start();
+    auto dependent = std::make_shared<CountingOperation>();
+    dependent->addDependency(done);
+    dependent->addDependency(done);
+    dependent->addDependency(dependent);
+    dependent->addDependency(nullptr);
+    EXPECT_TRUE(dependent->isReady());
+    EXPECT_EQ(dependent->dependencies().size(), 1u);
+}
+
+TEST(GWOperation, RemovingTheLastUnfinishedDependencyLetsItRun) {
+    GWOperationQueue queue;
+    auto never = std::make_shared<CountingOperation>();
+    auto dependent = std::make_shared<CountingOperation>();
+    dependent->addDependency(never);
+    queue.addOperation(dependent);
+    dependent->removeDependency(never);
+    dependent->waitUntilFinished();
+    EXPECT_EQ(dependent->mainCalls, 1);
+    EXPECT_TRUE(dependent->dependencies().empty());
+}
+
+TEST(GWOperation, CancellingMakesAnOperationWithUnfinishedDependenciesFinish) {
+    GWOperationQueue queue;
+    auto never = std::make_shared<CountingOperation>();
+    auto dependent = std::make_shared<CountingOperation>();
+    std::atomic<int> completions{0};
+    dependent->setCompletionBlock([&] { ++completions; });
+    dependent->addDependency(never);
+    queue.addOperation(dependent);
+    dependent->cancel();
+    dependent->waitUntilFinished();
+    EXPECT_EQ(dependent->mainCalls, 0);
+    EXPECT_EQ(completions, 1);
+    EXPECT_FALSE(never->isFinished());
+    queue.waitUntilAllOperationsAreFinished();
+}
+
+TEST(GWBlockOperation, RunsItsBlocksInOrderAndIgnoresLateOnes) {
+    Recorder recorder;
+    auto operation = recordingOperation(recorder, 1);
+    operation->addExecutionBlock([&] { recorder.add(2); });
+    operation->addExecutionBlock(nullptr);
+    EXPECT_EQ(operation->executionBlocks().size(), 2u);
+    operation->start();
+    operation->addExecutionBlock([&] { recorder.add(3); });
+    EXPECT_EQ(recorder.values(), (std::vector<int>{1, 2}));
+}
+
+TEST(GWOperationQueue, NeverRunsMoreThanItsWidthAndReachesIt) {
+    constexpr int kWidth = 3;
+    constexpr int kOperations = 24;
+    GWOperationQueue queue;
+    queue.setMaxConcurrentOperationCount(kWidth);
+    EXPECT_EQ(queue.maxConcurrentOperationCount(), kWidth);
+    std::atomic<int> running{0}, peak{0}, started{0};
+    GWSemaphore widthReached, gate;
+    for (int i = 0; i < kOperations; ++i) {
+        queue.addOperationWithBlock([&] {
+            const int now = ++running;
+            int seen = peak.load();
+            while (now > seen && !peak.compare_exchange_weak(seen, now)) {
+            }
+            if (++started == kWidth) {
+                widthReached.signal();
+            }
+            gate.wait();
+            --running;
+        });
+    }
+    ASSERT_TRUE(widthReached.wait(kEventually));
+    EXPECT_EQ(running, kWidth);
+    EXPECT_EQ(queue.operationCount(), std::size_t(kOperations));
+    for (int i = 0; i < kOperations; ++i) {
+        gate.signal();
+    }
+    queue.waitUntilAllOperationsAreFinished();
+    EXPECT_EQ(peak, kWidth);
+    EXPECT_EQ(started, kOperations);
+    EXPECT_EQ(queue.operationCount(), 0u);
+}
+
+TEST(GWOperationQueue, AsynchronousOperationHoldsItsSlotUntilItFinishes) {
+    GWOperationQueue queue;
+    queue.setMaxConcurrentOperationCount(1);
+    auto manual = std::make_shared<ManualOperation>();
+    GWSemaphore nextRan;
+    auto next = GWBlockOperation::blockOperationWithBlock([&] { nextRan.signal(); });
+    queue.addOperation(manual);
+    queue.addOperation(next);
+    ASSERT_TRUE(manual->started.wait(kEventually));
+    EXPECT_FALSE(nextRan.wait(kMeanwhile));
+    EXPECT_TRUE(manual->isExecuting());
+    EXPECT_FALSE(manual->isFinished());
+    manual->complete();
+    EXPECT_TRUE(nextRan.wait(kEventually));
+    EXPECT_TRUE(manual->isFinished());
+}
+
+TEST(GWOperationQueue, StartsReadyOperationsInTheOrderAdded) {
+    GWOperationQueue queue;
+    queue.setMaxConcurrentOperationCount(1);
+    queue.setSuspended(true);
+    EXPECT_TRUE(queue.isSuspended());
+    Recorder recorder;
+    std::vector<GWOperationPtr> operations;
+    for (int i = 0; i < 6; ++i) {
+        operations.push_back(recordingOperation(recorder, i));
+    }
+    // Waits for the fourth one, so it is passed over until then.
+    auto late = recordingOperation(recorder, 100);
+    late->addDependency(operations[3]);
+    operations.insert(operations.begin() + 1, late);
+    queue.addOperations(operations, false);
+    EXPECT_EQ(queue.operations(), operations);
+    queue.setSuspended(false);
+    queue.waitUntilAllOperationsAreFinished();
+    EXPECT_EQ(recorder.values(), (std::vector<int>{0, 1, 2, 3, 100, 4, 5}));
+}
+
+TEST(GWOperationQueue, WaitsForEveryOperationAndItsCompletionBlock) {
+    GWOperationQueue queue;
+    std::atomic<int> completions{0};
+    std::vector<GWOperationPtr> operations;
+    for (int i = 0; i < 40; ++i) {
+        auto operation = GWBlockOperation::blockOperationWithBlock([] {});
+        operation->setCompletionBlock([&] { ++completions; });
+        operations.push_back(operation);
+    }
+    queue.addOperations(operations, true);
+    EXPECT_EQ(completions, 40);
+    queue.addOperationWithBlock([] {});
+    queue.waitUntilAllOperationsAreFinished();
+    EXPECT_EQ(queue.operationCount(), 0u);
+}
+
+TEST(GWOperationQueue, CancelAllOperationsFinishesPendingOnesWithoutRunningThem) {
+    GWOperationQueue queue;
+    queue.setSuspended(true);
+    std::vector<std::shared_ptr<CountingOperation>> operations;
+    std::atomic<int> completions{0};
+    for (int i = 0; i < 10; ++i) {
+        auto operation = std::make_shared<CountingOperation>();
+        operation->setCompletionBlock([&] { ++completions; });
+        operations.push_back(operation);
+        queue.addOperation(operation);
+    }
+    queue.cancelAllOperations();
+    queue.setSuspended(false);
+    queue.waitUntilAllOperationsAreFinished();
+    for (const auto& operation : operations) {
+        EXPECT_EQ(operation->mainCalls, 0);
+        EXPECT_TRUE(operation->isFinished());
+    }
+    EXPECT_EQ(completions, 10);
+}
+
+TEST(GWOperationQueue, RefusesOperationsItCannotRun) {
+    GWOperationQueue queue, other;
+    queue.setSuspended(true);
+    auto operation = std::make_shared<CountingOperation>();
+    EXPECT_TRUE(queue.addOperation(operation));
+    EXPECT_FALSE(queue.addOperation(operation));
+    EXPECT_FALSE(other.addOperation(operation));
+    EXPECT_FALSE(queue.addOperation(nullptr));
+    auto finished = std::make_shared<CountingOperation>();
+    finished->start();
+    EXPECT_FALSE(queue.addOperation(finished));
+    auto executing = std::make_shared<ManualOperation>();
+    executing->start();
+    EXPECT_FALSE(queue.addOperation(executing));
+    executing->complete();
+    EXPECT_EQ(queue.operationCount(), 1u);
+    queue.setSuspended(false);
+    queue.waitUntilAllOperationsAreFinished();
+    other.waitUntilAllOperationsAreFinished();
+    EXPECT_EQ(operation->mainCalls, 1);
+    EXPECT_EQ(finished->mainCalls, 1);
+}
+
+// The shape of a batch extraction: a directory, its children, and a final
+// operation that reports the first error the completion blocks recorded.
+TEST(GWOperationQueue, BatchReportsTheFirstErrorAndCancelsTheRest) {
+    constexpr int kChildren = 300;
+    constexpr int kFailing = 40;
+    GWOperationQueue queue;
+    // One at a time, so exactly the operations after the failing one are skipped.
+    queue.setMaxConcurrentOperationCount(1);
+    std::mutex slotMutex;
+    int firstError = 0;
+    std::vector<std::shared_ptr<CountingOperation>> batch;
+    batch.push_back(std::make_shared<CountingOperation>());
+    for (int i = 1; i <= kChildren; ++i) {
+        batch.push_back(std::make_shared<CountingOperation>());
+        batch.back()->addDependency(batch.front());
+    }
+    std::atomic<bool> everyOneFinishedFirst{true};
+    int reported = -1;
+    auto final = GWBlockOperation::blockOperationWithBlock([&] {
+        for (const auto& operation : batch) {
+            if (!operation->isFinished()) {
+                everyOneFinishedFirst = false;
+            }
+        }
+        std::lock_guard<std::mutex> lock(slotMutex);
+        reported = firstError;
+    });
+    for (int i = 0; i <= kChildren; ++i) {
+        std::weak_ptr<CountingOperation> weak = batch[i];
+        batch[i]->setCompletionBlock([&, weak, i] {
+            const auto operation = weak.lock();
+            std::lock_guard<std::mutex> lock(slotMutex);
+            if (operation->isCancelled() && firstError == 0) {
+                firstError = -1;
+            }
+            if (i == kFailing && firstError == 0) {
+                firstError = kFailing;
+            }
+            if (firstError != 0) {
+                for (const auto& member : batch) {
+                    member->cancel();
+                }
+            }
+        });
+        final->addDependency(batch[i]);
+        queue.addOperation(batch[i]);
+    }
+    queue.addOperation(final);
+    final->waitUntilFinished();
+    EXPECT_TRUE(everyOneFinishedFirst);
+    EXPECT_EQ(reported, kFailing);
+    for (int i = 0; i <= kChildren; ++i) {
+        EXPECT_EQ(batch[i]->mainCalls, i <= kFailing ? 1 : 0) << i;
+        EXPECT_TRUE(batch[i]->isFinished());
+    }
+    queue.waitUntilAllOperationsAreFinished();
+}
+
+TEST(GWOperationQueue, DroppedQueueStillRunsWhatItHolds) {
+    auto queue = std::make_shared<GWOperationQueue>();
+    queue->setMaxConcurrentOperationCount(1);
+    GWSemaphore gate;
+    auto blocked = GWBlockOperation::blockOperationWithBlock([&] { gate.wait(); });
+    auto waiting = std::make_shared<CountingOperation>();
+    waiting->addDependency(blocked);
+    queue->addOperation(waiting);
+    queue->addOperation(blocked);
+    queue.reset();
+    gate.signal();
+    waiting->waitUntilFinished();
+    EXPECT_EQ(waiting->mainCalls, 1);
+}
+
+TEST(GWOperationQueue, LastReferenceMayBeDroppedByItsOwnOperation) {
+    auto queue = std::make_shared<GWOperationQueue>();
+    std::weak_ptr<GWOperationQueue> watch = queue;
+    auto operation = GWBlockOperation::blockOperationWithBlock([queue] {});
+    auto second = GWBlockOperation::blockOperationWithBlock([] {});
+    second->setCompletionBlock([queue] {});
+    queue->addOperation(operation);
+    queue->addOperation(second);
+    queue.reset();
+    operation->waitUntilFinished();
+    second->waitUntilFinished();
+    EXPECT_TRUE(watch.expired());
+}
+
+TEST(GWOperationQueue, DefaultWidthRunsBlockingWorkSideBySide) {
+    GWOperationQueue queue;
+    EXPECT_EQ(queue.maxConcurrentOperationCount(),
+              kGWOperationQueueDefaultMaxConcurrentOperationCount);
+    queue.setName("batch");
+    EXPECT_EQ(queue.name(), "batch");
+    // Each waits for all the others: only a queue at least this wide completes.
+    const int count = int(std::max(1u, std::thread::hardware_concurrency())) * 2;
+    std::atomic<int> arrived{0};
+    GWSemaphore allArrived;
+    std::atomic<int> timedOut{0};
+    for (int i = 0; i < count; ++i) {
+        queue.addOperationWithBlock([&] {
+            if (++arrived == count) {
+                for (int j = 0; j < count; ++j) {
+                    allArrived.signal();
+                }
+            }
+            if (!allArrived.wait(kEventually)) {
+                ++timedOut;
+            }
+        });
+    }
+    queue.waitUntilAllOperationsAreFinished();
+    EXPECT_EQ(timedOut, 0);
+}
