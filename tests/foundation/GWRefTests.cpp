@@ -1,0 +1,115 @@
+#include <gtest/gtest.h>
+
+#include "foundation/GWBinaryPropertyList.h"
+#include "foundation/GWRef.h"
+
+namespace {
+
+GWURL urlFrom(const char* text) {
+    auto url = GWURL::URLWithString(text);
+    EXPECT_TRUE(url) << text;
+    return url.value_or(GWURL());
+}
+
+// Stands in for a GWRef in an archive, with whatever "URL" value a damaged or
+// foreign archive might hold.
+class FakeRef : public GWCoding {
+public:
+    explicit FakeRef(std::optional<GWValue> url) : url_(std::move(url)) {}
+    std::string className() const override { return "GWRef"; }
+    void encodeWithCoder(GWCoder& coder) const override { coder.encodeValue(url_, "URL"); }
+
+private:
+    std::optional<GWValue> url_;
+};
+
+class RecordingCoder : public GWCoder {
+public:
+    int writes = 0;
+
+protected:
+    void writeValue(const std::string&, const GWValue&) override { ++writes; }
+    void writeObject(const std::string&, const GWCoding&) override { ++writes; }
+    void writeObjects(const std::string&, std::span<const GWCoding* const>) override { ++writes; }
+};
+
+}  // namespace
+
+TEST(GWRef, RefusesLocationsThatCannotBeReferenced) {
+    EXPECT_FALSE(GWRef::initWithURL(GWURL()));
+    for (const char* text :
+         {"relative/archive.zip", "ftp://example.com/archive.zip", "mailto:someone@example.com",
+          "http:/no-host/archive.zip", "https:archive.zip"}) {
+        EXPECT_FALSE(GWRef::initWithURL(urlFrom(text))) << text;
+    }
+}
+
+TEST(GWRef, AcceptsFileAndWebLocationsAndGivesThemBack) {
+    for (const GWURL& url :
+         {GWURL::fileURLWithPath("/nonexistent/folder/archive.zip"),
+          GWURL::fileURLWithPath("/tmp/dir", true), urlFrom("http://example.com/a.zip"),
+          urlFrom("HTTPS://example.com/a%20b.zip?x=1#part")}) {
+        auto ref = GWRef::initWithURL(url);
+        ASSERT_TRUE(ref) << url.absoluteString();
+        EXPECT_EQ(ref->URL(), url);
+        EXPECT_EQ(ref->className(), "GWRef");
+    }
+}
+
+TEST(GWRef, CopiesAreEqualValuesInNewObjects) {
+    auto ref = GWRef::initWithURL(GWURL::fileURLWithPath("/data/archive.xar"));
+    ASSERT_TRUE(ref);
+    auto copy = ref->copy();
+    ASSERT_TRUE(copy);
+    EXPECT_NE(copy.get(), ref.get());
+    EXPECT_EQ(*copy, *ref);
+    EXPECT_EQ(copy->URL(), ref->URL());
+}
+
+TEST(GWRef, RoundTripsThroughAKeyedArchive) {
+    for (const GWURL& url : {GWURL::fileURLWithPath("/data/a b/\xC3\xA9t\xC3\xA9 100%.zip"),
+                             GWURL::fileURLWithPath("/data/folder/", true),
+                             urlFrom("https://example.com/x/archive.zip?token=a%2Fb&v=2")}) {
+        auto ref = GWRef::initWithURL(url);
+        ASSERT_TRUE(ref);
+        GWErrorPtr error;
+        GWData archive = GWKeyedArchiver::archivedDataWithRootObject(ref, &error);
+        ASSERT_FALSE(archive.empty());
+
+        auto plist = GWBinaryPropertyList::valueWithData(archive);
+        ASSERT_TRUE(plist);
+        const GWDictionary& stored =
+            *plist->dictionary()->at("$top").dictionary()->at("root").dictionary();
+        EXPECT_EQ(stored.at("$class"), GWValue("GWRef"));
+        EXPECT_EQ(stored.at("URL"), GWValue(url.absoluteString()));
+
+        auto back = GWKeyedUnarchiver::unarchiveObjectWithData<GWRef>(archive, &error);
+        ASSERT_TRUE(back) << error->localizedDescription();
+        EXPECT_EQ(back->URL(), url) << url.absoluteString();
+    }
+}
+
+TEST(GWRef, AStoredURLThatIsMissingOrRefusedDecodesToNone) {
+    GWCodingRegistry::registerClass<GWRef>();
+    for (const auto& stored :
+         {std::optional<GWValue>(), std::optional<GWValue>(GWValue("not a url")),
+          std::optional<GWValue>(GWValue("ftp://example.com/a.zip")),
+          std::optional<GWValue>(GWValue("relative/path")), std::optional<GWValue>(GWValue(42))}) {
+        GWData archive = GWKeyedArchiver::archivedDataWithRootObject(FakeRef(stored));
+        ASSERT_FALSE(archive.empty());
+        GWErrorPtr error;
+        EXPECT_FALSE(GWKeyedUnarchiver::unarchiveObjectWithData<GWRef>(archive, &error));
+        ASSERT_TRUE(error);
+        EXPECT_TRUE(error->is(kGWCocoaErrorDomain, GWFileReadCorruptFileError));
+    }
+}
+
+TEST(GWRef, ANonKeyedCoderGetsNothingAndGivesNothing) {
+    auto ref = GWRef::initWithURL(GWURL::fileURLWithPath("/data/archive.zip"));
+    ASSERT_TRUE(ref);
+    RecordingCoder recorder;
+    ref->encodeWithCoder(recorder);
+    EXPECT_EQ(recorder.writes, 0);
+    GWNonKeyedCoder coder;
+    EXPECT_FALSE(GWRef::initWithCoder(coder));
+}
