@@ -1,0 +1,307 @@
+#include <gtest/gtest.h>
+#include <sys/stat.h>
+
+#include <functional>
+
+#include "applefile/GWAppleFileDecoder.h"
+#include "foundation/GWConversions.h"
+#include "foundation/GWFileInfo.h"
+#include "foundation/GWLog.h"
+#include "foundation/GWMetadataStore.h"
+#include "support/MacBinaryBuilder.h"
+#include "support/MetadataTestSupport.h"
+#include "support/TestSupport.h"
+
+namespace {
+
+using gwtest::bytesOf;
+using gwtest::MacBinaryFile;
+
+GWDate macDate(std::uint32_t seconds) {
+    return GWDate::gregorianDateWithYear(1904, 1, 1, 0, 0, 0).dateByAddingTimeInterval(seconds);
+}
+
+MacBinaryFile sampleFile(int version) {
+    MacBinaryFile file;
+    file.version = version;
+    file.type = "APPL";
+    file.creator = "GWAT";
+    file.finderFlags = 0x2104;
+    file.extendedFinderFlags = 0x40;
+    file.verticalPosition = 40;
+    file.horizontalPosition = 60;
+    file.creationDate = 3000000000u;
+    file.modificationDate = 3100000000u;
+    file.dataFork = gwtest::textBytes(5000, std::uint32_t(version));
+    file.resourceFork = gwtest::randomBytes(20000, std::uint32_t(version));
+    return file;
+}
+
+class GWMacBinaryTest : public ::testing::Test {
+protected:
+    bool decode(const GWData& encoded, GWErrorPtr* error = nullptr) {
+        gwtest::writeFile(directory_.file("source.bin"), encoded);
+        return GWAppleFileDecoder::sharedInstance()->decodeMacBinaryFileAtURL(
+            directory_.url("source.bin"), directory_.url("decoded"), error);
+    }
+
+    GWData resourceFork() {
+        return GWMetadataStore(directory_.file("decoded"))
+            .attribute(kGWResourceForkAttributeName, nullptr)
+            .value_or(GWData());
+    }
+
+    std::optional<GWData> comment() {
+        return GWMetadataStore(directory_.file("decoded"))
+            .attribute(kGWCommentAttributeName, nullptr);
+    }
+
+    std::shared_ptr<GWFileInfo> info() {
+        return GWFileInfo::initWithURL(directory_.url("decoded"), nullptr);
+    }
+
+    gwtest::TemporaryDirectory directory_;
+};
+
+}  // namespace
+
+TEST_F(GWMacBinaryTest, FilesWrittenByMacstreamDecode) {
+    if (!gwtest::toolAvailable("macstream")) {
+        GTEST_SKIP() << "macstream (macutils) is not installed";
+    }
+    // macstream joins an info header with .data and .rsrc files and pads the
+    // forks itself. It copies the header as given, so version I is what it
+    // writes on its own; a sealed header makes version II.
+    for (const int version : {1, 2}) {
+        SCOPED_TRACE(version);
+        MacBinaryFile file = sampleFile(version);
+        gwtest::writeFile(directory_.file("Sample.info"), gwtest::macBinaryHeader(file));
+        gwtest::writeFile(directory_.file("Sample.data"), file.dataFork);
+        gwtest::writeFile(directory_.file("Sample.rsrc"), file.resourceFork);
+        const auto made = gwtest::runCommand("cd " + gwtest::shellQuote(directory_.path()) +
+                                             " && macstream Sample.info > source.bin");
+        ASSERT_EQ(made.status, 0);
+        ASSERT_EQ(gwtest::readFile(directory_.file("source.bin")).size(), 128u + 5120 + 20096);
+
+        GWErrorPtr error;
+        ASSERT_TRUE(GWAppleFileDecoder::sharedInstance()->decodeMacBinaryFileAtURL(
+            directory_.url("source.bin"), directory_.url("decoded"), &error))
+            << error->localizedDescription();
+        EXPECT_EQ(gwtest::readFile(directory_.file("decoded")), file.dataFork);
+        EXPECT_EQ(resourceFork(), file.resourceFork);
+        const auto decoded = info();
+        ASSERT_TRUE(decoded);
+        EXPECT_EQ(decoded->typeCode(), GWFourCharCode("APPL"));
+        EXPECT_EQ(decoded->creatorCode(), GWFourCharCode("GWAT"));
+        // Version I has no low Finder-flags byte.
+        EXPECT_EQ(decoded->finderFlags(), version == 1 ? 0x2100 : 0x2104);
+        EXPECT_EQ(decoded->location(), (60u << 16) | 40u);
+        EXPECT_EQ(decoded->modificationDate(), macDate(3100000000u));
+    }
+}
+
+TEST_F(GWMacBinaryTest, CheckValuesOf0x8000AndAboveNeverMatchSoTheHeaderReadsAsVersionI) {
+    // The check value is compared as a signed number, so a header whose CRC is
+    // 0x8000 or more never matches and is read as version I.
+    MacBinaryFile file = sampleFile(2);
+    file.comment = "Caf\x8E notes";  // Mac OS Roman
+    ASSERT_TRUE(decode(gwtest::buildMacBinary(file)));
+    EXPECT_EQ(comment(), bytesOf("Caf\xC3\xA9 notes"));
+    EXPECT_EQ(info()->finderFlags(), 0x2104);
+    EXPECT_EQ(info()->extendedFinderFlags(), 0);
+
+    // Read as version I, neither the comment, the low flags byte nor the
+    // version bytes count.
+    file.seal = gwtest::MacBinarySeal::fromx8000;
+    file.writerVersion = 200;
+    const GWData encoded = gwtest::buildMacBinary(file);
+    ASSERT_GE((encoded[124] << 8) | encoded[125], 0x8000);
+    ASSERT_TRUE(decode(encoded));
+    EXPECT_FALSE(comment());
+    EXPECT_EQ(info()->finderFlags(), 0x2100);
+    EXPECT_EQ(resourceFork(), file.resourceFork);
+}
+
+TEST_F(GWMacBinaryTest, TheSignatureMakesVersionIIIWhateverTheCheckValue) {
+    MacBinaryFile file = sampleFile(3);
+    file.comment = "three";
+    GWData encoded = gwtest::buildMacBinary(file);
+    encoded[gwtest::macbinary::kCRC] ^= 0x5A;
+    encoded[gwtest::macbinary::kZeroByte82] = 1;
+    ASSERT_TRUE(decode(encoded));
+    EXPECT_EQ(info()->extendedFinderFlags(), 0x40);
+    EXPECT_EQ(info()->finderFlags(), 0x2104);
+    EXPECT_EQ(comment(), bytesOf("three"));
+    EXPECT_EQ(gwtest::readFile(directory_.file("decoded")), file.dataFork);
+}
+
+TEST_F(GWMacBinaryTest, AForkEndingOnABlockBoundaryIsFollowedByAFullBlockSkip) {
+    MacBinaryFile file = sampleFile(2);
+    file.dataFork = gwtest::randomBytes(256, 4);
+    file.resourceFork = gwtest::randomBytes(300, 5);
+    ASSERT_TRUE(decode(gwtest::buildMacBinary(file)));
+    EXPECT_EQ(gwtest::readFile(directory_.file("decoded")), file.dataFork);
+    EXPECT_EQ(resourceFork(), file.resourceFork);
+
+    // A file padded the standard way is therefore read a block late.
+    GWErrorPtr error;
+    EXPECT_FALSE(decode(gwtest::buildMacBinary(file, gwtest::MacBinaryPadding::standard), &error));
+    EXPECT_TRUE(error->is(kGWCocoaErrorDomain, GWFileReadUnknownError));
+}
+
+TEST_F(GWMacBinaryTest, TheSecondaryHeaderIsSkippedByItsExactLength) {
+    MacBinaryFile file = sampleFile(2);
+    file.secondaryHeader = bytesOf("12345");
+    ASSERT_TRUE(decode(gwtest::buildMacBinary(file)));
+    EXPECT_EQ(gwtest::readFile(directory_.file("decoded")), file.dataFork);
+    EXPECT_EQ(resourceFork(), file.resourceFork);
+}
+
+TEST_F(GWMacBinaryTest, AHeaderAloneGivesAnEmptyFileWithItsFinderInformationAndDates) {
+    MacBinaryFile file = sampleFile(2);
+    file.dataFork.clear();
+    file.resourceFork.clear();
+    const GWData encoded = gwtest::buildMacBinary(file);
+    ASSERT_EQ(encoded.size(), 128u);
+    ASSERT_TRUE(decode(encoded));
+    EXPECT_TRUE(gwtest::readFile(directory_.file("decoded")).empty());
+    EXPECT_EQ(info()->typeCode(), GWFourCharCode("APPL"));
+    EXPECT_EQ(info()->modificationDate(), macDate(3100000000u));
+    EXPECT_FALSE(GWMetadataStore(directory_.file("decoded"))
+                     .attribute(kGWResourceForkAttributeName, nullptr));
+}
+
+TEST_F(GWMacBinaryTest, ALargeResourceForkIsKeptInTheSideFile) {
+    MacBinaryFile file = sampleFile(2);
+    file.resourceFork = gwtest::randomBytes((1 << 20) + 77, 9);
+    GWErrorPtr error;
+    ASSERT_TRUE(decode(gwtest::buildMacBinary(file), &error)) << error->localizedDescription();
+    EXPECT_EQ(resourceFork(), file.resourceFork);
+    EXPECT_TRUE(gwtest::fileExists(directory_.file("._decoded")));
+    EXPECT_FALSE(gwtest::rawAttribute(directory_.file("decoded"), "user.com.apple.ResourceFork"));
+}
+
+TEST_F(GWMacBinaryTest, AnExistingDestinationIsReplacedWithItsMetadata) {
+    const std::string destination = directory_.file("decoded");
+    gwtest::writeFile(destination, bytesOf("old contents"));
+    {
+        gwtest::ScopedAttributeLimit refuseEverything(0);
+        ASSERT_TRUE(
+            GWMetadataStore(destination).setAttribute("com.example.old", bytesOf("x"), nullptr));
+    }
+    ASSERT_TRUE(decode(gwtest::buildMacBinary(sampleFile(2))));
+    EXPECT_EQ(gwtest::readFile(destination), sampleFile(2).dataFork);
+    EXPECT_FALSE(GWMetadataStore(destination).attribute("com.example.old", nullptr));
+}
+
+TEST_F(GWMacBinaryTest, ADirectoryDestinationFailsBeforeAnythingIsWritten) {
+    gwtest::writeFile(directory_.file("source.bin"), gwtest::buildMacBinary(sampleFile(2)));
+    ASSERT_EQ(::mkdir(directory_.file("folder").c_str(), 0755), 0);
+    GWErrorPtr error;
+    EXPECT_FALSE(GWAppleFileDecoder::sharedInstance()->decodeMacBinaryFileAtURL(
+        directory_.url("source.bin"), directory_.url("folder"), &error));
+    ASSERT_TRUE(error);
+    EXPECT_TRUE(error->is(kGWCocoaErrorDomain, GWFileIsDirectoryError));
+    EXPECT_EQ(error->URL(), directory_.url("folder"));
+    EXPECT_EQ(gwtest::runCommand("ls -A " + directory_.file("folder")).output, "");
+}
+
+TEST_F(GWMacBinaryTest, LocationsAreCheckedBeforeTheSource) {
+    const auto& decoder = GWAppleFileDecoder::sharedInstance();
+    EXPECT_EQ(decoder, GWAppleFileDecoder::sharedInstance());
+    const GWURL remote = *GWURL::URLWithString("https://example.com/x.bin");
+    GWErrorPtr error;
+    EXPECT_FALSE(decoder->decodeMacBinaryFileAtURL(remote, std::nullopt, &error));
+    EXPECT_TRUE(error->is(kGWPOSIXErrorDomain, EINVAL));
+    EXPECT_FALSE(decoder->decodeMacBinaryFileAtURL(remote, remote, &error));
+    EXPECT_TRUE(error->is(kGWCocoaErrorDomain, GWFileWriteUnsupportedSchemeError));
+    EXPECT_EQ(error->URL(), remote);
+    EXPECT_FALSE(decoder->decodeMacBinaryFileAtURL(remote, directory_.url("out"), &error));
+    EXPECT_TRUE(error->is(kGWCocoaErrorDomain, GWFileReadUnsupportedSchemeError));
+    EXPECT_FALSE(decoder->decodeMacBinaryFileAtURL(directory_.url("missing"), directory_.url("out"),
+                                                   &error));
+    EXPECT_TRUE(error->is(kGWPOSIXErrorDomain, ENOENT));
+    EXPECT_EQ(error->URL(), directory_.url("missing"));
+}
+
+// Malformed files: each mutation of a sound version II file, with the error it must give.
+namespace {
+
+enum class Where { nowhere, source };
+
+struct MalformedCase {
+    const char* name;
+    std::function<void(GWData&)> mutate;
+    long code;
+    Where where;
+};
+
+void sealed(GWData& bytes, std::size_t at, std::uint8_t value) {
+    bytes[at] = value;
+    gwtest::resealMacBinaryHeader(bytes);
+}
+
+void forkLengths(GWData& bytes, std::uint32_t data, std::uint32_t resource) {
+    for (int i = 0; i < 4; ++i) {
+        bytes[83 + i] = std::uint8_t(data >> (24 - 8 * i));
+        bytes[87 + i] = std::uint8_t(resource >> (24 - 8 * i));
+    }
+    gwtest::resealMacBinaryHeader(bytes);
+}
+
+class GWMacBinaryMalformedTest : public GWMacBinaryTest,
+                                 public ::testing::WithParamInterface<MalformedCase> {};
+
+const MalformedCase kMalformedCases[] = {
+    {"ShorterThanAHeader", [](GWData& b) { b.resize(127); }, 259, Where::source},
+    {"EmptySource", [](GWData& b) { b.clear(); }, 259, Where::source},
+    {"OldVersionByteSet", [](GWData& b) { b[0] = 1; }, 259, Where::source},
+    {"Byte74Set", [](GWData& b) { sealed(b, gwtest::macbinary::kZeroByte74, 1); }, 259,
+     Where::source},
+    {"NeitherSealedNorVersionI", [](GWData& b) { b[gwtest::macbinary::kZeroByte82] = 1; }, 259,
+     Where::source},
+    {"EmptyName", [](GWData& b) { sealed(b, gwtest::macbinary::kNameLength, 0); }, 259,
+     Where::source},
+    {"NameOf32Bytes", [](GWData& b) { sealed(b, gwtest::macbinary::kNameLength, 32); }, 259,
+     Where::source},
+    {"WriterTooNew", [](GWData& b) { sealed(b, gwtest::macbinary::kWriterVersion, 131); }, 259,
+     Where::nowhere},
+    {"ReaderTooNew", [](GWData& b) { sealed(b, gwtest::macbinary::kReaderVersion, 130); }, 259,
+     Where::nowhere},
+    {"DataForkCutShort", [](GWData& b) { b.resize(128 + 4000); }, 256, Where::nowhere},
+    {"ResourceForkCutShort", [](GWData& b) { b.resize(128 + 5120 + 19999); }, 256, Where::nowhere},
+    {"AbsurdDataForkLength", [](GWData& b) { forkLengths(b, 0xFFFFFFF0u, 0); }, 256,
+     Where::nowhere},
+    {"AbsurdResourceForkLength", [](GWData& b) { forkLengths(b, 5000, 0xFFFFFFFFu); }, 256,
+     Where::nowhere},
+};
+
+}  // namespace
+
+TEST_P(GWMacBinaryMalformedTest, FailsWithTheDocumentedError) {
+    GWData encoded = gwtest::buildMacBinary(sampleFile(2));
+    GetParam().mutate(encoded);
+    std::vector<std::string> logged;
+    auto previous = GWSetLogSink([&](const std::string& line) { logged.push_back(line); });
+    GWErrorPtr error;
+    const bool decoded = decode(encoded, &error);
+    GWSetLogSink(previous);
+    ASSERT_FALSE(decoded);
+    ASSERT_TRUE(error);
+    EXPECT_TRUE(error->is(kGWCocoaErrorDomain, GetParam().code))
+        << error->domain() << " " << error->code();
+    if (GetParam().where == Where::source) {
+        EXPECT_EQ(error->URL(), directory_.url("source.bin"));
+    } else {
+        EXPECT_FALSE(error->URL());
+    }
+    const bool versionError = std::string(GetParam().name).ends_with("TooNew");
+    EXPECT_EQ(logged.size(), versionError ? 1u : 0u);
+    if (versionError) {
+        EXPECT_EQ(logged[0], std::string("Error: unsupported MacBinary version ") +
+                                 (GetParam().name[0] == 'W' ? "131" : "130"));
+    }
+}
+
+INSTANTIATE_TEST_SUITE_P(Headers, GWMacBinaryMalformedTest, ::testing::ValuesIn(kMalformedCases),
+                         [](const auto& info) { return std::string(info.param.name); });
