@@ -39,6 +39,17 @@ std::shared_ptr<GWDecompressor> GWDecompressor::initForStreamingWithAlgorithm(in
     return std::make_shared<GWDecompressor>(std::move(engine));
 }
 
+std::shared_ptr<GWDecompressor> GWDecompressor::initForUnshrinkStreamingWithUncompressedSize(
+    std::uint64_t size, GWErrorPtr* /*error*/) {
+    return std::make_shared<GWDecompressor>(GWMakeUnshrinkDecoder(size));
+}
+
+std::shared_ptr<GWDecompressor> GWDecompressor::initForExplodeStreamingWithUncompressedSize(
+    std::uint64_t size, bool useLargeDictionary, bool useLiteralTree, GWErrorPtr* /*error*/) {
+    return std::make_shared<GWDecompressor>(
+        GWMakeExplodeDecoder(size, useLargeDictionary, useLiteralTree));
+}
+
 std::optional<GWData> GWDecompressor::decompressedDataFromStreamWithInputData(
     std::span<const std::uint8_t> input, bool isFinal, bool* shouldRunAgain, GWErrorPtr* error) {
     if (shouldRunAgain) {

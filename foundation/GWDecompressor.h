@@ -25,6 +25,12 @@ class GWDecompressor {
 public:
     static std::shared_ptr<GWDecompressor> initForStreamingWithAlgorithm(int algorithm,
                                                                          GWErrorPtr* error);
+    // ZIP methods 1 and 6, which need the size the entry expands to; the
+    // explode flags are bits 1 and 2 of the entry's general-purpose flags.
+    static std::shared_ptr<GWDecompressor> initForUnshrinkStreamingWithUncompressedSize(
+        std::uint64_t size, GWErrorPtr* error);
+    static std::shared_ptr<GWDecompressor> initForExplodeStreamingWithUncompressedSize(
+        std::uint64_t size, bool useLargeDictionary, bool useLiteralTree, GWErrorPtr* error);
     ~GWDecompressor();
 
     // One step. Returns none with an error for a damaged stream. Sets

@@ -32,3 +32,9 @@ std::unique_ptr<GWStreamDecoder> GWMakeCopyDecoder();
 // Raw deflate, or the zlib-wrapped form when the stream begins with a zlib header.
 std::unique_ptr<GWStreamDecoder> GWMakeInflateDecoder();
 std::unique_ptr<GWStreamDecoder> GWMakeBzip2Decoder();
+// ZIP method 1 (shrink) and method 6 (implode). Neither stream marks its end,
+// so both stop after `uncompressedSize` bytes.
+std::unique_ptr<GWStreamDecoder> GWMakeUnshrinkDecoder(std::uint64_t uncompressedSize);
+std::unique_ptr<GWStreamDecoder> GWMakeExplodeDecoder(std::uint64_t uncompressedSize,
+                                                      bool useLargeDictionary,
+                                                      bool useLiteralTree);
