@@ -1,0 +1,555 @@
+#include <gtest/gtest.h>
+#include <zlib.h>
+
+#include <filesystem>
+#include <random>
+
+#include "foundation/GWByteReader.h"
+#include "foundation/GWDecompressor.h"
+#include "foundation/decoders/GWStreamDecoder.h"
+#include "support/MinimalZip.h"
+#include "support/TestSupport.h"
+#include "support/ZipLegacyEncoders.h"
+
+namespace {
+
+constexpr std::uint16_t kShrunk = 1;
+constexpr std::uint16_t kImploded = 6;
+
+using gwtest::ImplodeSettings;
+
+const ImplodeSettings kImplodeSettings[] = {
+    {false, false}, {false, true}, {true, false}, {true, true}};
+
+std::string describe(const ImplodeSettings& settings) {
+    return std::string(settings.largeDictionary ? "8 KiB" : "4 KiB") +
+           (settings.literalTree ? ", three trees" : ", two trees");
+}
+
+std::shared_ptr<GWDecompressor> makeDecompressor(std::uint16_t method, std::uint16_t flags,
+                                                 std::uint64_t size) {
+    if (method == kShrunk) {
+        return GWDecompressor::initForUnshrinkStreamingWithUncompressedSize(size, nullptr);
+    }
+    return GWDecompressor::initForExplodeStreamingWithUncompressedSize(size, flags & 2, flags & 4,
+                                                                       nullptr);
+}
+
+// Feeds `stored` in pieces of `pieceSize` (0: whole), calling again with empty
+// input while asked to, and ends with an empty final piece.
+std::optional<GWData> decodeInPieces(std::uint16_t method, std::uint16_t flags,
+                                     std::span<const std::uint8_t> stored, std::uint64_t size,
+                                     std::size_t pieceSize, GWErrorPtr* error = nullptr) {
+    auto decompressor = makeDecompressor(method, flags, size);
+    if (pieceSize == 0) {
+        pieceSize = std::max<std::size_t>(stored.size(), 1);
+    }
+    GWData output;
+    auto step = [&](std::span<const std::uint8_t> input, bool isFinal) {
+        bool again = false;
+        do {
+            auto piece = decompressor->decompressedDataFromStreamWithInputData(input, isFinal,
+                                                                               &again, error);
+            if (!piece) {
+                return false;
+            }
+            output.insert(output.end(), piece->begin(), piece->end());
+            input = {};
+        } while (again);
+        return true;
+    };
+    for (std::size_t at = 0; at < stored.size(); at += pieceSize) {
+        if (!step(stored.subspan(at, std::min(pieceSize, stored.size() - at)), false)) {
+            return std::nullopt;
+        }
+    }
+    if (!step({}, true)) {
+        return std::nullopt;
+    }
+    return output;
+}
+
+// Shrink codes, least significant bit first, starting at nine bits and
+// following the 256, 1 announcements.
+GWData shrinkCodes(std::initializer_list<unsigned> codes) {
+    GWData bytes;
+    std::uint64_t buffer = 0;
+    unsigned count = 0, size = 9;
+    bool afterControl = false;
+    for (unsigned code : codes) {
+        buffer |= std::uint64_t(code) << count;
+        for (count += size; count >= 8; count -= 8, buffer >>= 8) {
+            bytes.push_back(std::uint8_t(buffer));
+        }
+        if (afterControl && code == 1) {
+            size = std::min(size + 1, 13u);
+        }
+        afterControl = !afterControl && code == 256;
+    }
+    if (count > 0) {
+        bytes.push_back(std::uint8_t(buffer));
+    }
+    return bytes;
+}
+
+// Records with counters, short runs of zeros and long ones, and text: matches
+// of every length at every distance.
+GWData binaryBytes(std::size_t count, std::uint32_t seed) {
+    std::mt19937 generator(seed);
+    GWData bytes;
+    std::uint32_t counter = 0;
+    while (bytes.size() < count) {
+        switch (generator() % 4) {
+            case 0:
+                for (int i = 0; i < 4; ++i) {
+                    bytes.push_back(std::uint8_t(counter >> (8 * i)));
+                }
+                counter += generator() % 3;
+                break;
+            case 1: bytes.insert(bytes.end(), generator() % 700, 0); break;
+            case 2: {
+                const GWData words = gwtest::textBytes(generator() % 60, generator());
+                bytes.insert(bytes.end(), words.begin(), words.end());
+                break;
+            }
+            default: bytes.push_back(std::uint8_t(generator()));
+        }
+    }
+    bytes.resize(count);
+    return bytes;
+}
+
+std::vector<GWData> sampleInputs() {
+    return {GWData{},
+            GWData{'x'},
+            GWData(1500, 'a'),
+            gwtest::textBytes(300000, 1),
+            binaryBytes(200000, 2),
+            gwtest::randomBytes(100000, 3)};
+}
+
+// The members of a ZIP archive with what decoding them takes.
+struct ArchiveMember {
+    std::string name;
+    std::uint16_t method = 0;
+    std::uint16_t flags = 0;
+    std::uint32_t crc = 0;
+    std::uint32_t uncompressedSize = 0;
+    std::span<const std::uint8_t> stored;
+};
+
+// Just enough of ZIP to reach the members of the sample archives: the end
+// record, the central directory and each local header's lengths.
+std::vector<ArchiveMember> readMembers(const GWData& archive, std::string& failure) {
+    GWByteReader reader(archive);
+    std::size_t end = archive.size() >= 22 ? archive.size() - 22 : 0;
+    while (end > 0 && !(reader.seek(end) && reader.u32le() == 0x06054B50)) {
+        --end;
+    }
+    reader.seek(end + 10);
+    const unsigned count = reader.u16le();
+    reader.skip(4);
+    const std::uint32_t directory = reader.u32le();
+    reader.seek(directory);
+    std::vector<ArchiveMember> members;
+    for (unsigned i = 0; i < count && reader.ok(); ++i) {
+        ArchiveMember member;
+        const bool signature = reader.u32le() == 0x02014B50;
+        reader.skip(4);
+        member.flags = reader.u16le();
+        member.method = reader.u16le();
+        reader.skip(4);
+        member.crc = reader.u32le();
+        const std::uint32_t compressedSize = reader.u32le();
+        member.uncompressedSize = reader.u32le();
+        const unsigned nameLength = reader.u16le(), extraLength = reader.u16le(),
+                       commentLength = reader.u16le();
+        reader.skip(8);
+        const std::uint32_t localOffset = reader.u32le();
+        member.name = reader.string(nameLength);
+        reader.skip(extraLength + commentLength);
+
+        GWByteReader local = GWByteReader(archive).slice(localOffset, archive.size() - localOffset);
+        const bool localSignature = local.u32le() == 0x04034B50;
+        local.seek(26);
+        const unsigned localNameLength = local.u16le(), localExtraLength = local.u16le();
+        local.skip(localNameLength + localExtraLength);
+        member.stored = local.bytes(compressedSize);
+        if (!signature || !localSignature || !local.ok()) {
+            failure = "damaged member " + member.name + " " + local.failureDescription();
+            return {};
+        }
+        members.push_back(member);
+    }
+    failure = reader.failureDescription();
+    return members;
+}
+
+std::string sampleFolder() {
+    return GW_SHARED_TESTDATA_DIR "/pkzip";
+}
+
+}  // namespace
+
+TEST(GWUnshrinkDecoder, RoundTripsInPiecesOfAnySize) {
+    for (const GWData& input : sampleInputs()) {
+        for (unsigned clearingCodeSize : {9u, 13u}) {
+            gwtest::ShrinkStats stats;
+            const GWData stored = gwtest::shrinkBytes(input, {clearingCodeSize}, &stats);
+            if (clearingCodeSize == 9 && input.size() > 20000) {
+                EXPECT_GT(stats.partialClears, 0);
+            }
+            for (std::size_t pieceSize : {1, 13, 0}) {
+                if (pieceSize == 1 && stored.size() > 100000) {
+                    continue;
+                }
+                GWErrorPtr error;
+                auto output = decodeInPieces(kShrunk, 0, stored, input.size(), pieceSize, &error);
+                ASSERT_TRUE(output) << error->localizedDescription();
+                EXPECT_TRUE(*output == input)
+                    << input.size() << " bytes in pieces of " << pieceSize;
+            }
+        }
+    }
+}
+
+TEST(GWUnshrinkDecoder, FullTablesClearAndCodesReachThirteenBits) {
+    const GWData input = gwtest::randomBytes(400000, 21);
+    gwtest::ShrinkStats stats;
+    const GWData stored = gwtest::shrinkBytes(input, {}, &stats);
+    EXPECT_EQ(stats.largestCodeSize, 13u);
+    EXPECT_GT(stats.partialClears, 3);
+    auto output = decodeInPieces(kShrunk, 0, stored, input.size(), 4096);
+    ASSERT_TRUE(output);
+    EXPECT_TRUE(*output == input);
+}
+
+TEST(GWUnshrinkDecoder, SeveralMebibytesWithRunAgain) {
+    const GWData input = gwtest::textBytes(3 * 1024 * 1024, 22);
+    const GWData stored = gwtest::shrinkBytes(input);
+    for (std::size_t pieceSize : {13, 0}) {
+        auto output = decodeInPieces(kShrunk, 0, stored, input.size(), pieceSize);
+        ASSERT_TRUE(output);
+        EXPECT_TRUE(*output == input) << "pieces of " << pieceSize;
+    }
+}
+
+// A code may run through the slot that its own arrival completes: after a
+// partial clear freed the previous code, the entry built on it went to a lower
+// slot, and the freed slot is the next to be filled. Codes: "a", "b", "c",
+// "bc", clear (frees 257 to 259), "x" (257 becomes 258 + "x"), then 257 runs
+// through 258, which this very code defines as "x" + "x". unzip and 7zz agree.
+TEST(GWUnshrinkDecoder, CodesMayBuildOnTheSlotTheyComplete) {
+    const GWData stored = shrinkCodes({'a', 'b', 'c', 258, 256, 2, 'x', 257});
+    auto output = decodeInPieces(kShrunk, 0, stored, 9, 1);
+    ASSERT_TRUE(output);
+    EXPECT_EQ(std::string(output->begin(), output->end()), "abcbcxxxx");
+}
+
+TEST(GWUnshrinkDecoder, DamagedCodesAreNamedInTheError) {
+    const struct {
+        GWData stream;
+        const char* message;
+    } cases[] = {
+        {shrinkCodes({'A', 300}), "shrink code 300 refers to a free slot"},
+        {shrinkCodes({257}), "the shrunk stream begins with code 257"},
+        {shrinkCodes({'A', 256, 3}), "unknown shrink control code 256, 3"},
+        {shrinkCodes({'A', 'B'}), "the shrunk stream ends early"},
+        // The clear frees 257 and 258; 257 is the next slot, 258 is not.
+        {shrinkCodes({'a', 'b', 'c', 256, 2, 258}), "shrink code 258 refers to a free slot"},
+        // The clear frees 257 to 260; 257 is then built on the freed 259.
+        {shrinkCodes({'a', 'b', 'c', 'd', 259, 256, 2, 'x', 257}),
+         "shrink code 257 is built on a free slot"},
+        // Sizes 9 to 13 are four steps; a fifth is one too many.
+        {shrinkCodes({'A', 256, 1, 256, 1, 256, 1, 256, 1, 256, 1}), "beyond 13 bits"},
+    };
+    for (const auto& c : cases) {
+        GWErrorPtr error;
+        EXPECT_FALSE(decodeInPieces(kShrunk, 0, c.stream, 10, 0, &error)) << c.message;
+        ASSERT_TRUE(error);
+        EXPECT_TRUE(error->is(kGWCocoaErrorDomain, GWFileReadCorruptFileError));
+        EXPECT_NE(error->localizedDescription().find(c.message), std::string::npos)
+            << error->localizedDescription();
+    }
+}
+
+TEST(GWExplodeDecoder, RoundTripsInEveryDictionaryAndTreeSetting) {
+    for (const ImplodeSettings& settings : kImplodeSettings) {
+        for (const GWData& input : sampleInputs()) {
+            const GWData stored = gwtest::implodeBytes(input, settings);
+            for (std::size_t pieceSize : {1, 13, 0}) {
+                if (pieceSize == 1 && stored.size() > 100000) {
+                    continue;
+                }
+                GWErrorPtr error;
+                auto output = decodeInPieces(kImploded, settings.flags(), stored, input.size(),
+                                             pieceSize, &error);
+                ASSERT_TRUE(output) << describe(settings) << ": " << error->localizedDescription();
+                EXPECT_TRUE(*output == input) << describe(settings) << ", " << input.size()
+                                              << " bytes in pieces of " << pieceSize;
+            }
+        }
+    }
+}
+
+TEST(GWExplodeDecoder, EncoderReachesEveryLengthAndDistancePath) {
+    const GWData input = binaryBytes(200000, 2);
+    for (const ImplodeSettings& settings : kImplodeSettings) {
+        std::size_t matches = 0, longest = 0, farthest = 0;
+        for (const auto& token : gwtest::implodeTokens(input, settings)) {
+            matches += token.length > 0;
+            longest = std::max(longest, token.length);
+            farthest = std::max(farthest, token.distance);
+        }
+        EXPECT_GT(matches, 1000u) << describe(settings);
+        EXPECT_EQ(longest, settings.longestMatch()) << describe(settings);
+        EXPECT_GT(farthest, settings.dictionarySize() * 3 / 4) << describe(settings);
+    }
+}
+
+TEST(GWExplodeDecoder, SeveralMebibytesWithRunAgain) {
+    const GWData input = gwtest::textBytes(3 * 1024 * 1024, 23);
+    const ImplodeSettings settings{true, true};
+    const GWData stored = gwtest::implodeBytes(input, settings);
+    for (std::size_t pieceSize : {13, 0}) {
+        auto output = decodeInPieces(kImploded, settings.flags(), stored, input.size(), pieceSize);
+        ASSERT_TRUE(output);
+        EXPECT_TRUE(*output == input) << "pieces of " << pieceSize;
+    }
+}
+
+TEST(GWExplodeDecoder, MatchesBeforeTheFirstByteReadZeros) {
+    const ImplodeSettings settings{false, false};
+    const GWData stored =
+        gwtest::implodeTokenStream({{0, 5, 4000}, {'a', 0, 0}, {0, 3, 1}, {0, 2, 10}}, settings);
+    auto output = decodeInPieces(kImploded, settings.flags(), stored, 11, 0);
+    ASSERT_TRUE(output);
+    EXPECT_EQ(gwtest::hex(*output), "0000000000616161610000");
+}
+
+TEST(GWExplodeDecoder, InvalidTablesAreRefused) {
+    // Two-tree streams: lengths first, then distances. 0xF5 is a run of 16
+    // six-bit codes, so four of them make a complete table of 64.
+    const GWData complete = {0x03, 0xF5, 0xF5, 0xF5, 0xF5};
+    const struct {
+        GWData stream;
+        const char* message;
+    } cases[] = {
+        {{0x03, 0xF0, 0xF0, 0xF0, 0xF0}, "invalid Shannon-Fano tree for length codes"},
+        {{0x04, 0xF5, 0xF5, 0xF5, 0xF5, 0x05}, "invalid Shannon-Fano tree for length codes"},
+        {{0x02, 0xF5, 0xF5, 0xF5}, "invalid Shannon-Fano tree for length codes"},
+        {{0x03, 0xF5, 0xF5, 0xF5, 0xF5, 0x03, 0xF5, 0xF5, 0xF5, 0xE5, 0x00},
+         "invalid Shannon-Fano tree for distance codes"},
+        {{0x03, 0xF5, 0xF5, 0xF5}, "the imploded stream ends inside its code tables"},
+        // Seven-bit lengths leave half the codes unused; all-ones is one of them.
+        {{0x03, 0xF6, 0xF6, 0xF6, 0xF6, 0x03, 0xF6, 0xF6, 0xF6, 0xF6, 0xFE, 0xFF, 0xFF},
+         "invalid Shannon-Fano code"},
+        {{0x03, 0xF5, 0xF5, 0xF5, 0xF5, 0x03, 0xF5, 0xF5, 0xF5, 0xF5, 0x01},
+         "the imploded stream ends early"},
+    };
+    for (const auto& c : cases) {
+        GWErrorPtr error;
+        EXPECT_FALSE(decodeInPieces(kImploded, 0, c.stream, 100, 1, &error)) << c.message;
+        ASSERT_TRUE(error);
+        EXPECT_TRUE(error->is(kGWCocoaErrorDomain, GWFileReadCorruptFileError));
+        EXPECT_NE(error->localizedDescription().find(c.message), std::string::npos)
+            << error->localizedDescription();
+    }
+    // With the literal tree the first table has 256 entries.
+    GWErrorPtr error;
+    EXPECT_FALSE(decodeInPieces(kImploded, 4, complete, 100, 0, &error));
+    ASSERT_TRUE(error);
+    EXPECT_NE(error->localizedDescription().find("for literal codes"), std::string::npos);
+}
+
+TEST(GWLegacyDecoders, OutputStopsAtTheExpectedSize) {
+    const GWData input = gwtest::textBytes(50000, 31);
+    const GWData shrunk = gwtest::shrinkBytes(input);
+    const ImplodeSettings settings{true, false};
+    const GWData imploded = gwtest::implodeBytes(input, settings);
+    for (const auto& [method, flags, stored] :
+         {std::tuple(kShrunk, std::uint16_t(0), shrunk),
+          std::tuple(kImploded, settings.flags(), imploded)}) {
+        for (std::uint64_t size : {std::uint64_t(0), std::uint64_t(1), std::uint64_t(49999)}) {
+            auto output = decodeInPieces(method, flags, stored, size, 13);
+            ASSERT_TRUE(output) << method << " " << size;
+            EXPECT_TRUE(GWData(input.begin(), input.begin() + std::ptrdiff_t(size)) == *output);
+        }
+        GWErrorPtr error;
+        EXPECT_FALSE(decodeInPieces(method, flags, stored, input.size() + 1, 13, &error));
+        ASSERT_TRUE(error);
+        EXPECT_NE(error->localizedDescription().find("ends early"), std::string::npos);
+        // Nothing at all is a valid stream of nothing.
+        auto empty = decodeInPieces(method, flags, {}, 0, 0);
+        ASSERT_TRUE(empty);
+        EXPECT_TRUE(empty->empty());
+    }
+}
+
+// The engines themselves, given an output span of a few bytes per call: a
+// match or string longer than the span must be held back, not lost.
+TEST(GWLegacyDecoders, EnginesHoldBackOutputForSmallSpans) {
+    const GWData input = binaryBytes(60000, 41);
+    const ImplodeSettings settings{true, true};
+    const GWData streams[] = {gwtest::shrinkBytes(input), gwtest::implodeBytes(input, settings)};
+    for (int which = 0; which < 2; ++which) {
+        for (std::size_t span : {1, 7}) {
+            auto engine = which == 0 ? GWMakeUnshrinkDecoder(input.size())
+                                     : GWMakeExplodeDecoder(input.size(), true, true);
+            std::span<const std::uint8_t> pending = streams[which];
+            GWData output;
+            std::uint8_t room[7];
+            bool finished = false;
+            for (std::size_t calls = 0; !finished && calls < 10 * input.size(); ++calls) {
+                const auto step = engine->decode(pending, std::span(room, span), true);
+                ASSERT_FALSE(step.failed) << step.error;
+                ASSERT_TRUE(step.consumed > 0 || step.produced > 0 || step.finished);
+                pending = pending.subspan(step.consumed);
+                output.insert(output.end(), room, room + step.produced);
+                finished = step.finished;
+            }
+            EXPECT_TRUE(finished);
+            EXPECT_TRUE(output == input) << which << " span " << span;
+        }
+    }
+}
+
+TEST(GWLegacyDecoders, DamagedStreamsEndInAnErrorOrAShortResult) {
+    const GWData input = binaryBytes(30000, 51);
+    struct Subject {
+        std::uint16_t method, flags;
+        GWData stored;
+    };
+    std::vector<Subject> subjects = {{kShrunk, 0, gwtest::shrinkBytes(input, {9})}};
+    for (const ImplodeSettings& settings : kImplodeSettings) {
+        subjects.push_back({kImploded, settings.flags(), gwtest::implodeBytes(input, settings)});
+    }
+    std::mt19937 generator(20240601);
+    for (const Subject& subject : subjects) {
+        const std::span<const std::uint8_t> stored = subject.stored;
+        for (std::size_t cut = 0; cut < stored.size(); cut += stored.size() / 97 + 1) {
+            GWErrorPtr error;
+            EXPECT_FALSE(decodeInPieces(subject.method, subject.flags, stored.first(cut),
+                                        input.size(), 13, &error))
+                << subject.method << " cut at " << cut;
+        }
+        int refused = 0;
+        for (int flip = 0; flip < 300; ++flip) {
+            GWData damaged = subject.stored;
+            damaged[generator() % damaged.size()] ^= std::uint8_t(1u << (generator() % 8));
+            auto output = decodeInPieces(subject.method, subject.flags, damaged, input.size(),
+                                         1 + generator() % 4000);
+            refused += !output;
+            if (output) {
+                EXPECT_EQ(output->size(), input.size());
+            }
+        }
+        EXPECT_GT(refused, 0) << subject.method << " " << subject.flags;
+        for (int noise = 0; noise < 50; ++noise) {
+            const GWData garbage = gwtest::randomBytes(1 + generator() % 3000, generator());
+            auto output = decodeInPieces(subject.method, subject.flags, garbage, 100000, 512);
+            EXPECT_TRUE(!output || output->size() == 100000);
+        }
+    }
+}
+
+TEST(GWLegacyDecoders, PeerToolsAcceptEncoderOutput) {
+    const bool haveUnzip = gwtest::toolAvailable("unzip");
+    const bool have7zz = gwtest::toolAvailable("7zz");
+    if (!haveUnzip && !have7zz) {
+        GTEST_SKIP() << "neither unzip nor 7zz is installed";
+    }
+    const GWData text = gwtest::textBytes(120000, 61);
+    const GWData binary = binaryBytes(120000, 62);
+    const GWData random = gwtest::randomBytes(90000, 63);
+    gwtest::ShrinkStats stats;
+    std::vector<gwtest::MinimalZipEntry> entries = {
+        gwtest::minimalZipEntry("shrunk-text", kShrunk, 0, gwtest::shrinkBytes(text, {9}, &stats),
+                                text),
+        gwtest::minimalZipEntry("shrunk-random", kShrunk, 0, gwtest::shrinkBytes(random), random),
+        gwtest::minimalZipEntry("shrunk-byte", kShrunk, 0, gwtest::shrinkBytes({'q'}), {'q'}),
+        // The stream of CodesMayBuildOnTheSlotTheyComplete.
+        gwtest::minimalZipEntry("shrunk-by-hand", kShrunk, 0,
+                                shrinkCodes({'a', 'b', 'c', 258, 256, 2, 'x', 257}),
+                                gwtest::bytesOf("abcbcxxxx")),
+    };
+    ASSERT_GT(stats.partialClears, 0);
+    for (const ImplodeSettings& settings : kImplodeSettings) {
+        const std::string suffix = std::string(settings.largeDictionary ? "-8k" : "-4k") +
+                                   (settings.literalTree ? "-3" : "-2");
+        entries.push_back(gwtest::minimalZipEntry("imploded-text" + suffix, kImploded,
+                                                  settings.flags(),
+                                                  gwtest::implodeBytes(text, settings), text));
+        entries.push_back(gwtest::minimalZipEntry("imploded-binary" + suffix, kImploded,
+                                                  settings.flags(),
+                                                  gwtest::implodeBytes(binary, settings), binary));
+    }
+    gwtest::TemporaryDirectory directory;
+    const std::string path = directory.file("legacy.zip");
+    gwtest::writeMinimalZip(path, entries);
+
+    if (haveUnzip) {
+        const auto result = gwtest::runCommand("unzip -t " + gwtest::shellQuote(path) + " 2>&1");
+        EXPECT_EQ(result.status, 0) << result.output;
+        EXPECT_NE(result.output.find("No errors detected"), std::string::npos) << result.output;
+    }
+    if (have7zz) {
+        const auto result = gwtest::runCommand("7zz t " + gwtest::shellQuote(path) + " 2>&1");
+        EXPECT_EQ(result.status, 0) << result.output;
+        EXPECT_NE(result.output.find("Everything is Ok"), std::string::npos) << result.output;
+    }
+}
+
+TEST(GWLegacyDecoders, PKZIPArchivesDecodeLikeUnzip) {
+    if (!std::filesystem::is_directory(sampleFolder())) {
+        GTEST_SKIP() << sampleFolder() << " is absent";
+    }
+    if (!gwtest::toolAvailable("unzip")) {
+        GTEST_SKIP() << "unzip is not installed";
+    }
+    int decoded[7] = {};
+    for (const char* name : {"PKZ110.ZIP", "PKZ110EI.ZIP", "PKZ110ES.ZIP", "PKZ80B1.ZIP"}) {
+        const std::string path = sampleFolder() + "/" + name;
+        const GWData archive = gwtest::readFile(path);
+        std::string failure;
+        const auto members = readMembers(archive, failure);
+        ASSERT_FALSE(members.empty()) << name << ": " << failure;
+        for (const ArchiveMember& member : members) {
+            if (member.method != kShrunk && member.method != kImploded) {
+                continue;
+            }
+            GWErrorPtr error;
+            auto output = decodeInPieces(member.method, member.flags, member.stored,
+                                         member.uncompressedSize, 997, &error);
+            ASSERT_TRUE(output) << name << " " << member.name << ": "
+                                << error->localizedDescription();
+            const auto extracted = gwtest::runCommand("unzip -p " + gwtest::shellQuote(path) + " " +
+                                                      gwtest::shellQuote(member.name));
+            ASSERT_EQ(extracted.status, 0) << name << " " << member.name;
+            EXPECT_EQ(output->size(), extracted.output.size()) << name << " " << member.name;
+            EXPECT_TRUE(*output == gwtest::bytesOf(extracted.output)) << name << " " << member.name;
+            EXPECT_EQ(crc32(0, output->data(), uInt(output->size())), member.crc)
+                << name << " " << member.name;
+            ++decoded[member.method];
+        }
+    }
+    // Eight shrunk members in PKZ110ES, one each in PKZ110 and PKZ80B1; seven
+    // imploded members in PKZ110 and in PKZ110EI.
+    EXPECT_EQ(decoded[kShrunk], 10);
+    EXPECT_EQ(decoded[kImploded], 14);
+}
+
+TEST(GWLegacyDecoders, PKZIP080ArchiveUsesReduce) {
+    const std::string path = sampleFolder() + "/PKZ80B1.ZIP";
+    if (!std::filesystem::exists(path)) {
+        GTEST_SKIP() << path << " is absent";
+    }
+    std::string failure;
+    const auto members = readMembers(gwtest::readFile(path), failure);
+    ASSERT_FALSE(members.empty()) << failure;
+    int reduced = 0;
+    for (const ArchiveMember& member : members) {
+        reduced += member.method >= 2 && member.method <= 5;
+    }
+    EXPECT_EQ(reduced, 7);
+}
