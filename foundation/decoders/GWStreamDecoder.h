@@ -36,5 +36,4 @@ std::unique_ptr<GWStreamDecoder> GWMakeBzip2Decoder();
 // so both stop after `uncompressedSize` bytes.
 std::unique_ptr<GWStreamDecoder> GWMakeUnshrinkDecoder(std::uint64_t uncompressedSize);
 std::unique_ptr<GWStreamDecoder> GWMakeExplodeDecoder(std::uint64_t uncompressedSize,
-                                                      bool useLargeDictionary,
-                                                      bool useLiteralTree);
+                                                      bool useLargeDictionary, bool useLiteralTree);
