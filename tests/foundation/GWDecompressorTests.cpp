@@ -5,6 +5,7 @@
 #include "foundation/GWChecksum.h"
 #include "foundation/GWDecompressor.h"
 #include "foundation/GWRemoteFileHandle.h"
+#include "support/DecoderTestSupport.h"
 #include "support/TestSupport.h"
 
 namespace {
@@ -36,40 +37,13 @@ GWData bzip2Bytes(const GWData& input) {
     return output;
 }
 
-// Feeds `stream` in pieces of `pieceSize` (0: whole), following the run-again
-// protocol, and ends with an empty final piece.
 std::optional<GWData> decodeInPieces(int algorithm, const GWData& stream, std::size_t pieceSize,
                                      GWErrorPtr* error) {
     auto decompressor = GWDecompressor::initForStreamingWithAlgorithm(algorithm, error);
     if (!decompressor) {
         return std::nullopt;
     }
-    if (pieceSize == 0) {
-        pieceSize = std::max<std::size_t>(stream.size(), 1);
-    }
-    GWData output;
-    auto step = [&](std::span<const std::uint8_t> input, bool isFinal) {
-        bool again = false;
-        do {
-            auto piece = decompressor->decompressedDataFromStreamWithInputData(input, isFinal,
-                                                                               &again, error);
-            if (!piece) {
-                return false;
-            }
-            output.insert(output.end(), piece->begin(), piece->end());
-            input = {};
-        } while (again);
-        return true;
-    };
-    for (std::size_t at = 0; at < stream.size(); at += pieceSize) {
-        if (!step(std::span(stream).subspan(at, std::min(pieceSize, stream.size() - at)), false)) {
-            return std::nullopt;
-        }
-    }
-    if (!step({}, true)) {
-        return std::nullopt;
-    }
-    return output;
+    return gwtest::decodeInPieces(*decompressor, stream, pieceSize, error);
 }
 
 struct Codec {

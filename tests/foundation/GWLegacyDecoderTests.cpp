@@ -7,6 +7,7 @@
 #include "foundation/GWByteReader.h"
 #include "foundation/GWDecompressor.h"
 #include "foundation/decoders/GWStreamDecoder.h"
+#include "support/DecoderTestSupport.h"
 #include "support/MinimalZip.h"
 #include "support/TestSupport.h"
 #include "support/ZipLegacyEncoders.h"
@@ -35,38 +36,11 @@ std::shared_ptr<GWDecompressor> makeDecompressor(std::uint16_t method, std::uint
                                                                        nullptr);
 }
 
-// Feeds `stored` in pieces of `pieceSize` (0: whole), calling again with empty
-// input while asked to, and ends with an empty final piece.
 std::optional<GWData> decodeInPieces(std::uint16_t method, std::uint16_t flags,
                                      std::span<const std::uint8_t> stored, std::uint64_t size,
                                      std::size_t pieceSize, GWErrorPtr* error = nullptr) {
     auto decompressor = makeDecompressor(method, flags, size);
-    if (pieceSize == 0) {
-        pieceSize = std::max<std::size_t>(stored.size(), 1);
-    }
-    GWData output;
-    auto step = [&](std::span<const std::uint8_t> input, bool isFinal) {
-        bool again = false;
-        do {
-            auto piece = decompressor->decompressedDataFromStreamWithInputData(input, isFinal,
-                                                                               &again, error);
-            if (!piece) {
-                return false;
-            }
-            output.insert(output.end(), piece->begin(), piece->end());
-            input = {};
-        } while (again);
-        return true;
-    };
-    for (std::size_t at = 0; at < stored.size(); at += pieceSize) {
-        if (!step(stored.subspan(at, std::min(pieceSize, stored.size() - at)), false)) {
-            return std::nullopt;
-        }
-    }
-    if (!step({}, true)) {
-        return std::nullopt;
-    }
-    return output;
+    return gwtest::decodeInPieces(*decompressor, stored, pieceSize, error);
 }
 
 // Shrink codes, least significant bit first, starting at nine bits and
