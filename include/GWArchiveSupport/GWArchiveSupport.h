@@ -3,4 +3,5 @@
 // Umbrella header: everything a caller of the library needs.
 
 #include "GWArchiveConstants.h"
+#include "GWZipFile.h"
 #include "foundation/GWFoundation.h"

@@ -1,0 +1,336 @@
+#include "GWZipFile.h"
+
+#include <algorithm>
+#include <atomic>
+
+#include "GWZipNames.h"
+#include "foundation/GWConversions.h"
+
+namespace {
+
+// Bumped by every rename of any entry, so that name indexes notice renames of
+// children even when the child does not know the directory holding it.
+std::atomic<std::uint64_t> gRenameEpoch{1};
+
+const GWValue* infoValue(const GWDictionary& info, const char* key) {
+    return GWDictionaryValue(info, key);
+}
+
+std::optional<std::string> stringInfo(const GWDictionary& info, const char* key) {
+    const GWValue* value = infoValue(info, key);
+    if (value && value->string()) {
+        return *value->string();
+    }
+    return std::nullopt;
+}
+
+std::optional<GWDate> dateInfo(const GWDictionary& info, const char* key) {
+    const GWValue* value = infoValue(info, key);
+    if (value && value->date()) {
+        return *value->date();
+    }
+    return std::nullopt;
+}
+
+// The number's bits; 0 when absent or not a number.
+std::uint64_t numberInfo(const GWDictionary& info, const char* key) {
+    const GWValue* value = infoValue(info, key);
+    return value && value->isNumber() ? value->unsignedValue() : 0;
+}
+
+bool boolInfo(const GWDictionary& info, const char* key) {
+    const GWValue* value = infoValue(info, key);
+    return value && value->boolValue();
+}
+
+std::optional<GWDate> preferredDate(const GWDictionary& info, const char* utcKey,
+                                    const char* localKey) {
+    if (auto date = dateInfo(info, utcKey)) {
+        return date;
+    }
+    return dateInfo(info, localKey);
+}
+
+}  // namespace
+
+GWZipFilePtr GWZipFile::initWithName(
+    std::string name, const GWZipFilePtr& parent, std::uint64_t compressedSize,
+    std::uint64_t uncompressedSize, std::optional<GWData> checksum, std::uint64_t checksumAlgorithm,
+    std::uint32_t owner, std::uint32_t groupOwner, std::uint16_t permissionsMode,
+    std::optional<GWDate> modificationDate, std::optional<std::string> symlinkDestination,
+    std::uint64_t localHeaderOffset, std::uint16_t generalPurposeFlags,
+    std::uint16_t compressionMethod, GWDictionary extraInfo) {
+    auto file = std::make_shared<GWZipFile>();
+    file->name_ = std::move(name);
+    file->parent_ = parent;
+    file->compressedSize_ = compressedSize;
+    file->uncompressedSize_ = uncompressedSize;
+    file->checksum_ = std::move(checksum);
+    file->checksumAlgorithm_ = checksumAlgorithm;
+    file->owner_ = owner;
+    file->groupOwner_ = groupOwner;
+    file->permissionsMode_ = permissionsMode;
+    file->modificationDate_ = modificationDate;
+    file->symlinkDestination_ = std::move(symlinkDestination);
+    file->localHeaderOffset_ = localHeaderOffset;
+    file->generalPurposeFlags_ = generalPurposeFlags;
+    file->compressionMethod_ = compressionMethod;
+    file->extraInfo_ = std::move(extraInfo);
+    return file;
+}
+
+GWZipFile::~GWZipFile() {
+    // A path of thousands of components is a chain of thousands of nodes;
+    // releasing it recursively could exhaust a worker thread's stack.
+    std::vector<GWZipFilePtr> pending;
+    auto detach = [&pending](GWZipFile& node) {
+        if (node.children_ && node.children_.use_count() == 1) {
+            for (auto& child : *node.children_) {
+                pending.push_back(std::move(child));
+            }
+        }
+        node.children_.reset();
+        pending.push_back(std::move(node.resourceFork_));
+        pending.push_back(std::move(node.appleDoubleFile_));
+    };
+    detach(*this);
+    while (!pending.empty()) {
+        GWZipFilePtr node = std::move(pending.back());
+        pending.pop_back();
+        if (node && node.use_count() == 1) {
+            detach(*node);
+        }
+    }
+}
+
+void GWZipFile::setName(std::string name) {
+    if (name != name_) {
+        name_ = std::move(name);
+        gRenameEpoch.fetch_add(1, std::memory_order_relaxed);
+    }
+}
+
+void GWZipFile::setExtraInfo(GWDictionary extraInfo) {
+    if (auto filename = filenameFromExtraInfo(extraInfo)) {
+        setName(std::move(*filename));
+    }
+    extraInfo_ = std::move(extraInfo);
+}
+
+std::optional<std::string> GWZipFile::filenameFromExtraInfo(const GWDictionary& extraInfo) const {
+    if (boolInfo(extraInfo, kGWZipDontChangeFilenameKey)) {
+        return std::nullopt;
+    }
+    std::optional<std::string> candidate;
+    if (auto filename = stringInfo(extraInfo, kGWZipFilenameKey)) {
+        candidate = GWZipFilenameFromMacName(*filename);
+    } else if (auto posixPath = stringInfo(extraInfo, kGWZipPOSIXPathKey)) {
+        candidate = GWZipLastPOSIXPathComponent(*posixPath);
+    } else if (auto hfsPath = stringInfo(extraInfo, kGWZipHFSPathKey)) {
+        candidate = GWZipLastHFSPathComponent(*hfsPath);
+    }
+    // A name that is not one path component would move the entry elsewhere
+    // on extraction; the archive's own name is kept instead.
+    if (candidate && !GWZipIsSafeFilename(*candidate)) {
+        return std::nullopt;
+    }
+    return candidate;
+}
+
+// --- Children ------------------------------------------------------------------
+
+void GWZipFile::setChildren(std::optional<GWZipFileArray> children) {
+    children_ = children ? std::make_shared<GWZipFileArray>(std::move(*children)) : nullptr;
+    ++childrenGeneration_;
+}
+
+void GWZipFile::addChild(const GWZipFilePtr& child) {
+    if (!children_) {
+        children_ = std::make_shared<GWZipFileArray>(1, child);
+        ++childrenGeneration_;
+        return;
+    }
+    if (children_.use_count() > 1) {
+        // A caller holds a snapshot: it must not see the append.
+        auto copy = std::make_shared<GWZipFileArray>();
+        copy->reserve(children_->size() + 1);
+        *copy = *children_;
+        copy->push_back(child);
+        children_ = std::move(copy);
+        ++childrenGeneration_;
+        return;
+    }
+    children_->push_back(child);
+    std::lock_guard lock(indexMutex_);
+    if (index_.valid && index_.childrenGeneration == childrenGeneration_ && child) {
+        index_.first.emplace(child->name_, children_->size() - 1);
+    }
+}
+
+void GWZipFile::removeChild(const GWZipFilePtr& child) {
+    if (!children_) {
+        return;
+    }
+    auto remaining = std::make_shared<GWZipFileArray>();
+    remaining->reserve(children_->size());
+    for (const auto& existing : *children_) {
+        if (existing != child) {
+            remaining->push_back(existing);
+        }
+    }
+    children_ = std::move(remaining);
+    ++childrenGeneration_;
+}
+
+std::optional<std::size_t> GWZipFile::indexOfChildNamed(std::string_view name) const {
+    if (!children_) {
+        return std::nullopt;
+    }
+    std::lock_guard lock(indexMutex_);
+    const std::uint64_t epoch = gRenameEpoch.load(std::memory_order_relaxed);
+    if (!index_.valid || index_.childrenGeneration != childrenGeneration_ ||
+        index_.renameEpoch != epoch) {
+        index_.first.clear();
+        index_.first.reserve(children_->size());
+        for (std::size_t i = 0; i < children_->size(); ++i) {
+            if (const auto& child = (*children_)[i]) {
+                index_.first.emplace(child->name_, i);
+            }
+        }
+        index_.childrenGeneration = childrenGeneration_;
+        index_.renameEpoch = epoch;
+        index_.valid = true;
+    }
+    auto found = index_.first.find(std::string(name));
+    if (found == index_.first.end()) {
+        return std::nullopt;
+    }
+    return found->second;
+}
+
+GWZipFilePtr GWZipFile::childNamed(std::string_view name) const {
+    auto position = indexOfChildNamed(name);
+    return position ? (*children_)[*position] : nullptr;
+}
+
+// --- Derived properties ----------------------------------------------------------
+
+std::string GWZipFile::path() const {
+    std::vector<const std::string*> names{&name_};
+    std::vector<GWZipFilePtr> ancestors;  // keeps each ancestor alive while its name is used
+    for (auto ancestor = parent(); ancestor; ancestor = ancestor->parent()) {
+        names.push_back(&ancestor->name_);
+        ancestors.push_back(ancestor);
+    }
+    std::string path;
+    for (auto it = names.rbegin(); it != names.rend(); ++it) {
+        if (!path.empty() && path.back() != '/' && !(*it)->empty()) {
+            path += '/';
+        }
+        path += **it;
+    }
+    return path;
+}
+
+std::uint64_t GWZipFile::uncompressedSize() const {
+    std::uint64_t total = uncompressedSize_;
+    std::vector<const GWZipFile*> pending{resourceFork_.get(), appleDoubleFile_.get()};
+    while (!pending.empty()) {
+        const GWZipFile* companion = pending.back();
+        pending.pop_back();
+        if (companion) {
+            total += companion->uncompressedSize_;
+            pending.push_back(companion->resourceFork_.get());
+            pending.push_back(companion->appleDoubleFile_.get());
+        }
+    }
+    return total;
+}
+
+std::optional<std::string> GWZipFile::type() const {
+    return isDirectory() ? std::optional<std::string>("fold")
+                         : stringInfo(extraInfo_, kGWZipTypeCodeKey);
+}
+
+std::optional<std::string> GWZipFile::creator() const {
+    return isDirectory() ? std::optional<std::string>("MACS")
+                         : stringInfo(extraInfo_, kGWZipCreatorCodeKey);
+}
+
+std::uint32_t GWZipFile::typeCode() const {
+    auto code = type();
+    return code ? GWFourCharCode(*code) : 0;
+}
+
+std::uint32_t GWZipFile::creatorCode() const {
+    auto code = creator();
+    return code ? GWFourCharCode(*code) : 0;
+}
+
+std::int16_t GWZipFile::iconLocationV() const {
+    return std::int16_t(numberInfo(extraInfo_, kGWZipVerticalIconLocationKey));
+}
+
+std::int16_t GWZipFile::iconLocationH() const {
+    return std::int16_t(numberInfo(extraInfo_, kGWZipHorizontalIconLocationKey));
+}
+
+std::optional<GWDate> GWZipFile::creationDate() const {
+    return preferredDate(extraInfo_, kGWZipUTCCreationDateKey, kGWZipCreationDateKey);
+}
+
+std::optional<GWDate> GWZipFile::modificationDate() const {
+    if (auto date =
+            preferredDate(extraInfo_, kGWZipUTCModificationDateKey, kGWZipModificationDateKey)) {
+        return date;
+    }
+    return modificationDate_;
+}
+
+std::optional<GWDate> GWZipFile::backupDate() const {
+    return preferredDate(extraInfo_, kGWZipUTCBackupDateKey, kGWZipBackupDateKey);
+}
+
+std::optional<GWDate> GWZipFile::accessDate() const {
+    return preferredDate(extraInfo_, kGWZipUTCAccessDateKey, kGWZipAccessDateKey);
+}
+
+std::uint16_t GWZipFile::finderFlags() const {
+    return std::uint16_t(numberInfo(extraInfo_, kGWZipFinderFlagsKey));
+}
+
+std::uint16_t GWZipFile::extendedFinderFlags() const {
+    return std::uint16_t(numberInfo(extraInfo_, kGWZipExtendedFinderFlagsKey));
+}
+
+std::uint8_t GWZipFile::versionNumber() const {
+    return std::uint8_t(numberInfo(extraInfo_, kGWZipVersionNumberKey));
+}
+
+std::uint8_t GWZipFile::accessRights() const {
+    return std::uint8_t(numberInfo(extraInfo_, kGWZipAccessRightsKey));
+}
+
+std::uint16_t GWZipFile::putAwayFolderID() const {
+    return std::uint16_t(numberInfo(extraInfo_, kGWZipPutAwayFolderKey));
+}
+
+std::optional<std::string> GWZipFile::comment() const {
+    return stringInfo(extraInfo_, kGWZipCommentKey);
+}
+
+bool GWZipFile::isMacBinaryEncoded() const {
+    return !isDirectory() && boolInfo(extraInfo_, kGWZipIsMacBinaryEncodedKey);
+}
+
+bool GWZipFile::moreInfoAvailableInLocalHeader() const {
+    return boolInfo(extraInfo_, kGWZipMoreInfoAvailableInLocalHeaderKey);
+}
+
+std::optional<GWData> GWZipFile::uncompressedChecksum() const {
+    return isMacBinaryEncoded() ? std::nullopt : checksum_;
+}
+
+std::uint64_t GWZipFile::uncompressedChecksumAlgorithm() const {
+    return isMacBinaryEncoded() ? 0 : checksumAlgorithm_;
+}

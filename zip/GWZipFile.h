@@ -1,0 +1,227 @@
+#pragma once
+
+#include <cstdint>
+#include <memory>
+#include <mutex>
+#include <optional>
+#include <string>
+#include <string_view>
+#include <unordered_map>
+#include <vector>
+
+#include "GWZipExtraInfoKeys.h"
+#include "foundation/GWCoder.h"
+#include "foundation/GWDate.h"
+#include "foundation/GWValue.h"
+
+class GWZipFile;
+using GWZipFilePtr = std::shared_ptr<GWZipFile>;
+using GWZipFileArray = std::vector<GWZipFilePtr>;
+// A directory's contents as callers see them: an immutable snapshot that later
+// changes to the directory never touch.
+using GWZipFileArrayPtr = std::shared_ptr<const GWZipFileArray>;
+
+// One node of a ZIP archive's tree: a file, a directory or a symbolic link,
+// with its place in the archive, its POSIX attributes and the "extra info"
+// its extra fields carried. A node owns its children and its Mac companions
+// (resource-fork and AppleDouble entries); the parent link is weak, so a tree
+// is owned from its roots. Create nodes with initWithName.
+class GWZipFile : public GWCoding {
+public:
+    static constexpr const char* kClassName = "GWZipFile";
+
+    // The designated initialiser. `checksum` and `checksumAlgorithm` become
+    // the private checksum fields; `extraInfo` is stored without the renaming
+    // that setExtraInfo does.
+    static GWZipFilePtr initWithName(
+        std::string name, const GWZipFilePtr& parent, std::uint64_t compressedSize,
+        std::uint64_t uncompressedSize, std::optional<GWData> checksum,
+        std::uint64_t checksumAlgorithm, std::uint32_t owner, std::uint32_t groupOwner,
+        std::uint16_t permissionsMode, std::optional<GWDate> modificationDate,
+        std::optional<std::string> symlinkDestination, std::uint64_t localHeaderOffset,
+        std::uint16_t generalPurposeFlags, std::uint16_t compressionMethod, GWDictionary extraInfo);
+
+    GWZipFile() = default;
+    GWZipFile(const GWZipFile&) = delete;
+    GWZipFile& operator=(const GWZipFile&) = delete;
+    // Tears deep trees down without recursion.
+    ~GWZipFile() override;
+
+    // --- Stored properties ----------------------------------------------------
+
+    // POSIX mode bits including the file-type bits.
+    std::uint16_t permissionsMode() const { return permissionsMode_; }
+    std::uint16_t generalPurposeFlags() const { return generalPurposeFlags_; }
+    void setGeneralPurposeFlags(std::uint16_t flags) { generalPurposeFlags_ = flags; }
+    std::uint16_t compressionMethod() const { return compressionMethod_; }
+    void setCompressionMethod(std::uint16_t method) { compressionMethod_ = method; }
+    std::uint32_t owner() const { return owner_; }
+    std::uint32_t groupOwner() const { return groupOwner_; }
+    // The date of the central directory record (see modificationDate()).
+    const std::optional<GWDate>& storedModificationDate() const { return modificationDate_; }
+    // This entry's own size, without its companions (see uncompressedSize()).
+    std::uint64_t storedUncompressedSize() const { return uncompressedSize_; }
+    void setUncompressedSize(std::uint64_t size) { uncompressedSize_ = size; }
+    // The last path component.
+    const std::string& name() const { return name_; }
+    void setName(std::string name);
+    std::uint64_t compressedSize() const { return compressedSize_; }
+    void setCompressedSize(std::uint64_t size) { compressedSize_ = size; }
+    const std::optional<std::string>& symlinkDestination() const { return symlinkDestination_; }
+    void setSymlinkDestination(std::optional<std::string> destination) {
+        symlinkDestination_ = std::move(destination);
+    }
+    const GWZipFilePtr& resourceFork() const { return resourceFork_; }
+    void setResourceFork(GWZipFilePtr file) { resourceFork_ = std::move(file); }
+    const GWZipFilePtr& appleDoubleFile() const { return appleDoubleFile_; }
+    void setAppleDoubleFile(GWZipFilePtr file) { appleDoubleFile_ = std::move(file); }
+    // The containing directory; none for a root entry.
+    GWZipFilePtr parent() const { return parent_.lock(); }
+    void setParent(const GWZipFilePtr& parent) { parent_ = parent; }
+    // Relative to the start of the ZIP data, which may follow a prefix.
+    std::uint64_t localHeaderOffset() const { return localHeaderOffset_; }
+    void setLocalHeaderOffset(std::uint64_t offset) { localHeaderOffset_ = offset; }
+    const std::optional<GWData>& privateUncompressedChecksum() const { return checksum_; }
+    void setPrivateUncompressedChecksum(std::optional<GWData> checksum) {
+        checksum_ = std::move(checksum);
+    }
+    // A GWChecksum algorithm number.
+    std::uint64_t privateUncompressedChecksumAlgorithm() const { return checksumAlgorithm_; }
+    void setPrivateUncompressedChecksumAlgorithm(std::uint64_t algorithm) {
+        checksumAlgorithm_ = algorithm;
+    }
+    const GWDictionary& extraInfo() const { return extraInfo_; }
+    // Renames the entry when the dictionary names it (filenameFromExtraInfo),
+    // then stores it.
+    void setExtraInfo(GWDictionary extraInfo);
+
+    // --- Children -------------------------------------------------------------
+
+    // Null for a leaf. The snapshot stays as it is when the directory changes.
+    GWZipFileArrayPtr children() const { return children_; }
+    // Replaces the children whole; std::nullopt makes the entry a leaf. Does
+    // not touch the children's parent links.
+    void setChildren(std::optional<GWZipFileArray> children);
+    // The first child of that exact name (the order of `children` decides).
+    GWZipFilePtr childNamed(std::string_view name) const;
+    // Appends; the child's parent link is the caller's to set.
+    void addChild(const GWZipFilePtr& child);
+    // Removes every occurrence of that very object.
+    void removeChild(const GWZipFilePtr& child);
+
+    // --- Derived properties ---------------------------------------------------
+
+    // The parent's path with the name appended.
+    std::string path() const;
+    // The stored size plus the sizes of the companions, which count theirs.
+    std::uint64_t uncompressedSize() const;
+    bool isDirectory() const { return (permissionsMode_ & 0xF000) == 0x4000; }
+    bool isSymbolicLink() const { return (permissionsMode_ & 0xF000) == 0xA000; }
+    // "fold" / "MACS" for a directory, else the extra info's codes.
+    std::optional<std::string> type() const;
+    std::optional<std::string> creator() const;
+    std::uint32_t typeCode() const;
+    std::uint32_t creatorCode() const;
+    std::int16_t iconLocationV() const;
+    std::int16_t iconLocationH() const;
+    // A UTC-sourced date wins over a local-time one.
+    std::optional<GWDate> creationDate() const;
+    std::optional<GWDate> modificationDate() const;
+    std::optional<GWDate> backupDate() const;
+    std::optional<GWDate> accessDate() const;
+    std::uint16_t finderFlags() const;
+    std::uint16_t extendedFinderFlags() const;
+    std::uint8_t versionNumber() const;
+    std::uint8_t accessRights() const;
+    // Deliberately narrowed to 16 bits.
+    std::uint16_t putAwayFolderID() const;
+    std::optional<std::string> comment() const;
+    bool isMacBinaryEncoded() const;
+    bool moreInfoAvailableInLocalHeader() const;
+    // The stored CRC of a MacBinary entry covers the MacBinary stream, not the
+    // data fork extraction produces, so such an entry reports no checksum.
+    std::optional<GWData> uncompressedChecksum() const;
+    std::uint64_t uncompressedChecksumAlgorithm() const;
+    void setUncompressedChecksum(std::optional<GWData> checksum) {
+        checksum_ = std::move(checksum);
+    }
+    void setUncompressedChecksumAlgorithm(std::uint64_t algorithm) {
+        checksumAlgorithm_ = algorithm;
+    }
+
+    // The name the dictionary gives an entry of this kind, or none.
+    std::optional<std::string> filenameFromExtraInfo(const GWDictionary& extraInfo) const;
+
+    // --- Tree lookup and building ---------------------------------------------
+
+    // Components without empty ones and "."; ".." drops the last kept one.
+    static std::vector<std::string> standardizedComponentsForPath(std::string_view path);
+    static GWZipFilePtr fileNamed(std::string_view name, const GWZipFileArray& files);
+    // Finds the node at the path; with `create`, missing directories on the
+    // way (the last component included) are made as implicit directories and
+    // added to their parent or to `rootFiles`.
+    static GWZipFilePtr fileWithPath(std::string_view path, GWZipFileArray& rootFiles, bool create);
+    static GWZipFilePtr fileWithPathComponents(const std::vector<std::string>& components,
+                                               GWZipFileArray& rootFiles, bool create);
+    // The first component is looked up in `files` and made in `parent` (or
+    // appended to `files` without one); the rest below.
+    static GWZipFilePtr fileWithPathComponents(const std::vector<std::string>& components,
+                                               const GWZipFilePtr& parent, GWZipFileArray& files,
+                                               bool create);
+
+    // --- Persistence and copying ----------------------------------------------
+
+    std::string className() const override { return kClassName; }
+    // Writes nothing to a non-keyed coder; never writes the parent.
+    void encodeWithCoder(GWCoder& coder) const override;
+    // None from a non-keyed coder. The children's parent links point at the
+    // new node; the node itself has none.
+    static GWZipFilePtr initWithCoder(GWCoder& coder);
+    // A deep copy (children and companions too) with the children's parent
+    // links rebuilt; the copy itself is detached.
+    GWZipFilePtr copy() const;
+
+protected:
+    // The plain new instance copy() fills; a subclass answers its own class.
+    virtual GWZipFilePtr newInstance() const;
+
+private:
+    // Copies the stored fields, not children or companions.
+    void copyFieldsTo(GWZipFile& target) const;
+    static GWZipFilePtr makeImplicitDirectory(const std::string& name, const GWZipFilePtr& parent);
+    // Position of the first child of that name, through the name index.
+    std::optional<std::size_t> indexOfChildNamed(std::string_view name) const;
+
+    std::uint16_t permissionsMode_ = 0;
+    std::uint16_t generalPurposeFlags_ = 0;
+    std::uint16_t compressionMethod_ = 0;
+    std::uint32_t owner_ = 0;
+    std::uint32_t groupOwner_ = 0;
+    std::optional<GWDate> modificationDate_;
+    std::uint64_t uncompressedSize_ = 0;
+    std::string name_;
+    // Copy-on-write: appended to in place while no snapshot is out.
+    std::shared_ptr<GWZipFileArray> children_;
+    std::uint64_t compressedSize_ = 0;
+    std::optional<std::string> symlinkDestination_;
+    GWZipFilePtr resourceFork_;
+    GWZipFilePtr appleDoubleFile_;
+    std::weak_ptr<GWZipFile> parent_;
+    std::uint64_t localHeaderOffset_ = 0;
+    std::optional<GWData> checksum_;
+    std::uint64_t checksumAlgorithm_ = 0;
+    GWDictionary extraInfo_;
+
+    // Name -> position of its first occurrence in children_, rebuilt when the
+    // children are replaced or any entry anywhere is renamed. Lookups may run
+    // on several threads over a finished tree, hence the lock.
+    struct NameIndex {
+        std::unordered_map<std::string, std::size_t> first;
+        std::uint64_t childrenGeneration = 0;
+        std::uint64_t renameEpoch = 0;
+        bool valid = false;
+    };
+    mutable std::mutex indexMutex_;
+    mutable NameIndex index_;
+    std::uint64_t childrenGeneration_ = 0;
+};

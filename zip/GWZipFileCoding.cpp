@@ -1,0 +1,140 @@
+// Keyed persistence and deep copying of ZIP entries.
+
+#include "GWZipFile.h"
+
+namespace {
+
+const char* const kNameKey = "Name";
+const char* const kChildrenKey = "Children";
+const char* const kCompressedSizeKey = "CompressedSize";
+const char* const kUncompressedSizeKey = "UncompressedSize";
+const char* const kUncompressedChecksumKey = "UncompressedChecksum";
+const char* const kUncompressedChecksumAlgorithmKey = "UncompressedChecksumAlgorithm";
+const char* const kOwnerKey = "Owner";
+const char* const kGroupOwnerKey = "GroupOwner";
+const char* const kPermissionsModeKey = "PermissionsMode";
+const char* const kModificationDateKey = "ModificationDate";
+const char* const kSymlinkDestinationKey = "SymlinkDestination";
+const char* const kResourceForkKey = "ResourceFork";
+const char* const kAppleDoubleFileKey = "AppleDoubleFile";
+const char* const kLocalHeaderOffsetKey = "LocalHeaderOffset";
+const char* const kGeneralPurposeFlagsKey = "GeneralPurposeFlags";
+const char* const kCompressionMethodKey = "CompressionMethod";
+const char* const kExtraInfoKey = "ExtraInfo";
+
+}  // namespace
+
+void GWZipFile::encodeWithCoder(GWCoder& coder) const {
+    if (!coder.allowsKeyedCoding()) {
+        return;
+    }
+    coder.encodeValue(GWValue(name_), kNameKey);
+    if (children_) {
+        coder.encodeArrayOfObjects(*children_, kChildrenKey);
+    }
+    coder.encodeUInt64(compressedSize_, kCompressedSizeKey);
+    coder.encodeUInt64(uncompressedSize_, kUncompressedSizeKey);
+    coder.encodeValue(checksum_, kUncompressedChecksumKey);
+    coder.encodeInteger(std::int64_t(checksumAlgorithm_), kUncompressedChecksumAlgorithmKey);
+    coder.encodeInt32(std::int32_t(owner_), kOwnerKey);
+    coder.encodeInt32(std::int32_t(groupOwner_), kGroupOwnerKey);
+    coder.encodeInteger(permissionsMode_, kPermissionsModeKey);
+    coder.encodeValue(modificationDate_, kModificationDateKey);
+    coder.encodeValue(symlinkDestination_, kSymlinkDestinationKey);
+    coder.encodeObject(resourceFork_, kResourceForkKey);
+    coder.encodeObject(appleDoubleFile_, kAppleDoubleFileKey);
+    coder.encodeUInt64(localHeaderOffset_, kLocalHeaderOffsetKey);
+    coder.encodeInt32(generalPurposeFlags_, kGeneralPurposeFlagsKey);
+    coder.encodeInt32(compressionMethod_, kCompressionMethodKey);
+    coder.encodeValue(GWValue(extraInfo_), kExtraInfoKey);
+}
+
+GWZipFilePtr GWZipFile::initWithCoder(GWCoder& coder) {
+    if (!coder.allowsKeyedCoding()) {
+        return nullptr;
+    }
+    auto children = coder.decodeArrayOfObjectsOfClass<GWZipFile>(kChildrenKey);
+    auto file = initWithName(
+        coder.decodeString(kNameKey).value_or(std::string()), nullptr,
+        coder.decodeUInt64(kCompressedSizeKey), coder.decodeUInt64(kUncompressedSizeKey),
+        coder.decodeData(kUncompressedChecksumKey),
+        std::uint64_t(coder.decodeInteger(kUncompressedChecksumAlgorithmKey)),
+        std::uint32_t(coder.decodeInt32(kOwnerKey)),
+        std::uint32_t(coder.decodeInt32(kGroupOwnerKey)),
+        std::uint16_t(coder.decodeInteger(kPermissionsModeKey)),
+        coder.decodeDate(kModificationDateKey), coder.decodeString(kSymlinkDestinationKey),
+        coder.decodeUInt64(kLocalHeaderOffsetKey),
+        std::uint16_t(coder.decodeInt32(kGeneralPurposeFlagsKey)),
+        std::uint16_t(coder.decodeInt32(kCompressionMethodKey)),
+        coder.decodeDictionary(kExtraInfoKey).value_or(GWDictionary()));
+    file->setChildren(std::move(children));
+    file->resourceFork_ = coder.decodeObjectOfClass<GWZipFile>(kResourceForkKey);
+    file->appleDoubleFile_ = coder.decodeObjectOfClass<GWZipFile>(kAppleDoubleFileKey);
+    if (file->children_) {
+        for (const auto& child : *file->children_) {
+            child->parent_ = file;
+        }
+    }
+    return file;
+}
+
+GWZipFilePtr GWZipFile::newInstance() const {
+    return std::make_shared<GWZipFile>();
+}
+
+void GWZipFile::copyFieldsTo(GWZipFile& target) const {
+    target.permissionsMode_ = permissionsMode_;
+    target.generalPurposeFlags_ = generalPurposeFlags_;
+    target.compressionMethod_ = compressionMethod_;
+    target.owner_ = owner_;
+    target.groupOwner_ = groupOwner_;
+    target.modificationDate_ = modificationDate_;
+    target.uncompressedSize_ = uncompressedSize_;
+    target.name_ = name_;
+    target.compressedSize_ = compressedSize_;
+    target.symlinkDestination_ = symlinkDestination_;
+    target.localHeaderOffset_ = localHeaderOffset_;
+    target.checksum_ = checksum_;
+    target.checksumAlgorithm_ = checksumAlgorithm_;
+    target.extraInfo_ = extraInfo_;
+}
+
+GWZipFilePtr GWZipFile::copy() const {
+    auto shallowCopy = [](const GWZipFile& source) {
+        GWZipFilePtr target = source.newInstance();
+        source.copyFieldsTo(*target);
+        return target;
+    };
+    GWZipFilePtr root = shallowCopy(*this);
+    // A work list instead of recursion: trees may be very deep.
+    std::vector<std::pair<const GWZipFile*, GWZipFilePtr>> pending{{this, root}};
+    while (!pending.empty()) {
+        auto [source, target] = std::move(pending.back());
+        pending.pop_back();
+        if (source->resourceFork_) {
+            target->resourceFork_ = shallowCopy(*source->resourceFork_);
+            pending.emplace_back(source->resourceFork_.get(), target->resourceFork_);
+        }
+        if (source->appleDoubleFile_) {
+            target->appleDoubleFile_ = shallowCopy(*source->appleDoubleFile_);
+            pending.emplace_back(source->appleDoubleFile_.get(), target->appleDoubleFile_);
+        }
+        if (!source->children_) {
+            continue;
+        }
+        auto children = std::make_shared<GWZipFileArray>();
+        children->reserve(source->children_->size());
+        for (const auto& child : *source->children_) {
+            GWZipFilePtr childCopy;
+            if (child) {
+                childCopy = shallowCopy(*child);
+                childCopy->parent_ = target;
+                pending.emplace_back(child.get(), childCopy);
+            }
+            children->push_back(std::move(childCopy));
+        }
+        target->children_ = std::move(children);
+        ++target->childrenGeneration_;
+    }
+    return root;
+}
