@@ -1,0 +1,319 @@
+#include "ZipBuilder.h"
+
+#include <bzlib.h>
+#include <zlib.h>
+
+#include <stdexcept>
+
+#include "TestSupport.h"
+
+namespace gwtest {
+
+namespace {
+
+constexpr std::uint32_t kEscaped32 = 0xFFFFFFFF;
+
+void put16(GWData& out, std::uint64_t value) {
+    out.push_back(std::uint8_t(value));
+    out.push_back(std::uint8_t(value >> 8));
+}
+
+void put32(GWData& out, std::uint64_t value) {
+    put16(out, value & 0xFFFF);
+    put16(out, (value >> 16) & 0xFFFF);
+}
+
+void put64(GWData& out, std::uint64_t value) {
+    put32(out, value & 0xFFFFFFFF);
+    put32(out, value >> 32);
+}
+
+void append(GWData& out, const GWData& bytes) {
+    out.insert(out.end(), bytes.begin(), bytes.end());
+}
+
+GWData rawDeflate(const GWData& input) {
+    z_stream stream{};
+    if (deflateInit2(&stream, 6, Z_DEFLATED, -15, 8, Z_DEFAULT_STRATEGY) != Z_OK) {
+        throw std::runtime_error("deflateInit2 failed");
+    }
+    GWData output(deflateBound(&stream, uLong(input.size())) + 16);
+    stream.next_in = const_cast<Bytef*>(input.data());
+    stream.avail_in = uInt(input.size());
+    stream.next_out = output.data();
+    stream.avail_out = uInt(output.size());
+    const int status = deflate(&stream, Z_FINISH);
+    output.resize(stream.total_out);
+    deflateEnd(&stream);
+    if (status != Z_STREAM_END) {
+        throw std::runtime_error("deflate did not finish");
+    }
+    return output;
+}
+
+GWData bzip2Compress(const GWData& input) {
+    unsigned int length = unsigned(input.size() + input.size() / 100 + 600);
+    GWData output(length);
+    if (BZ2_bzBuffToBuffCompress(reinterpret_cast<char*>(output.data()), &length,
+                                 const_cast<char*>(reinterpret_cast<const char*>(input.data())),
+                                 unsigned(input.size()), 9, 0, 0) != BZ_OK) {
+        throw std::runtime_error("bzip2 compression failed");
+    }
+    output.resize(length);
+    return output;
+}
+
+// The Zip64 block for the fields a header escaped, in their standard order.
+GWData zip64Block(const std::vector<std::uint64_t>& values) {
+    GWData block;
+    put16(block, 0x0001);
+    put16(block, values.size() * 8);
+    for (std::uint64_t value : values) {
+        put64(block, value);
+    }
+    return block;
+}
+
+}  // namespace
+
+std::uint16_t zipDOSTime(int hour, int minute, int second) {
+    return std::uint16_t(hour << 11 | minute << 5 | second / 2);
+}
+
+std::uint16_t zipDOSDate(int year, int month, int day) {
+    return std::uint16_t((year - 1980) << 9 | month << 5 | day);
+}
+
+GWData zipCompress(const GWData& content, std::uint16_t method) {
+    switch (method) {
+        case 8: return rawDeflate(content);
+        case 12: return bzip2Compress(content);
+        default: return content;
+    }
+}
+
+GWData ZipEntry::storedBytes() const {
+    return stored ? *stored : zipCompress(content, method);
+}
+
+std::uint32_t ZipEntry::effectiveCRC32() const {
+    return crc32 ? *crc32 : std::uint32_t(::crc32(0, content.data(), uInt(content.size())));
+}
+
+ZipEntry& ZipBuilder::add(ZipEntry entry) {
+    entries_.push_back(std::move(entry));
+    return entries_.back();
+}
+
+ZipEntry& ZipBuilder::addFile(const std::string& name, GWData content, std::uint16_t method) {
+    ZipEntry entry;
+    entry.name = bytesOf(name);
+    entry.content = std::move(content);
+    entry.method = method;
+    return add(std::move(entry));
+}
+
+ZipEntry& ZipBuilder::addDirectory(const std::string& name) {
+    ZipEntry entry;
+    entry.name = bytesOf(name);
+    entry.externalAttributes = (040755u << 16) | 0x10;
+    return add(std::move(entry));
+}
+
+ZipEntry& ZipBuilder::addSymlink(const std::string& name, const std::string& target) {
+    ZipEntry entry;
+    entry.name = bytesOf(name);
+    entry.content = bytesOf(target);
+    entry.externalAttributes = 0120777u << 16;
+    return add(std::move(entry));
+}
+
+GWData ZipBuilder::bytes() const {
+    GWData out = prefix;
+    const std::uint64_t base = offsetsIncludePrefix ? 0 : prefix.size();
+    GWData directory;
+    offsets_.clear();
+    for (const ZipEntry& entry : entries_) {
+        const GWData stored = entry.storedBytes();
+        const std::uint32_t crc = entry.effectiveCRC32();
+        const std::uint64_t compressed = entry.compressedSize.value_or(stored.size());
+        const std::uint64_t uncompressed = entry.uncompressedSize.value_or(entry.content.size());
+        const std::uint16_t flags = entry.flags | (entry.dataDescriptor ? 0x0008 : 0);
+        const std::uint64_t offset = out.size() - base;
+        offsets_.push_back(out.size());
+
+        if (!entry.omitLocalHeader) {
+            const GWData& localName = entry.localName ? *entry.localName : entry.name;
+            GWData localExtra = entry.localExtra;
+            const std::uint64_t localCompressed = entry.localCompressedSize.value_or(compressed);
+            const std::uint64_t localUncompressed =
+                entry.localUncompressedSize.value_or(uncompressed);
+            if (entry.zip64Sizes) {
+                append(localExtra, zip64Block({localUncompressed, localCompressed}));
+            }
+            put32(out, 0x04034B50);
+            put16(out, entry.versionNeeded);
+            put16(out, flags);
+            put16(out, entry.method);
+            put16(out, entry.dosTime);
+            put16(out, entry.dosDate);
+            if (entry.dataDescriptor) {
+                put32(out, entry.localCRC32.value_or(0));
+                put32(out, entry.localCompressedSize.value_or(0));
+                put32(out, entry.localUncompressedSize.value_or(0));
+            } else {
+                put32(out, entry.localCRC32.value_or(crc));
+                put32(out, entry.zip64Sizes ? kEscaped32 : localCompressed);
+                put32(out, entry.zip64Sizes ? kEscaped32 : localUncompressed);
+            }
+            put16(out, localName.size());
+            put16(out, localExtra.size());
+            append(out, localName);
+            append(out, localExtra);
+            append(out, stored);
+            if (entry.dataDescriptor) {
+                if (entry.dataDescriptorSignature) {
+                    put32(out, 0x08074B50);
+                }
+                put32(out, crc);
+                if (entry.zip64Sizes) {
+                    put64(out, compressed);
+                    put64(out, uncompressed);
+                } else {
+                    put32(out, compressed);
+                    put32(out, uncompressed);
+                }
+            }
+        }
+
+        GWData centralExtra = entry.centralExtra;
+        std::vector<std::uint64_t> escaped;
+        if (entry.zip64Sizes) {
+            escaped = {uncompressed, compressed};
+        }
+        const std::uint64_t recordedOffset = entry.centralLocalHeaderOffset.value_or(offset);
+        if (entry.zip64Offset) {
+            escaped.push_back(recordedOffset);
+        }
+        if (!escaped.empty()) {
+            append(centralExtra, zip64Block(escaped));
+        }
+        put32(directory, 0x02014B50);
+        put16(directory, std::uint16_t(entry.host) << 8 | entry.madeByVersion);
+        put16(directory, entry.versionNeeded);
+        put16(directory, flags);
+        put16(directory, entry.method);
+        put16(directory, entry.dosTime);
+        put16(directory, entry.dosDate);
+        put32(directory, crc);
+        put32(directory, entry.zip64Sizes ? kEscaped32 : compressed);
+        put32(directory, entry.zip64Sizes ? kEscaped32 : uncompressed);
+        put16(directory, entry.name.size());
+        put16(directory, centralExtra.size());
+        put16(directory, entry.comment.size());
+        put16(directory, entry.diskNumberStart);
+        put16(directory, entry.internalAttributes);
+        put32(directory, entry.externalAttributes);
+        put32(directory, entry.zip64Offset ? kEscaped32 : recordedOffset);
+        append(directory, entry.name);
+        append(directory, centralExtra);
+        append(directory, entry.comment);
+    }
+
+    const std::uint64_t directoryOffset = out.size() - base;
+    append(out, directory);
+    const std::uint64_t count = entries_.size();
+    if (zip64EndRecord) {
+        const std::uint64_t recordOffset = out.size() - base;
+        put32(out, 0x06064B50);
+        put64(out, 44);  // size of the rest of the record
+        put16(out, kZipHostUnix << 8 | 45);
+        put16(out, 45);
+        put32(out, 0);
+        put32(out, 0);
+        put64(out, count);
+        put64(out, count);
+        put64(out, directory.size());
+        put64(out, directoryOffset);
+        put32(out, 0x07064B50);
+        put32(out, 0);
+        put64(out, recordOffset + (offsetsIncludePrefix ? 0 : prefix.size()));
+        put32(out, 1);
+    }
+    put32(out, 0x06054B50);
+    put16(out, 0);
+    put16(out, 0);
+    const std::uint16_t shortCount = zip64EndRecord ? 0xFFFF : std::uint16_t(count);
+    put16(out, endRecordEntryCount.value_or(shortCount));
+    put16(out, endRecordEntryCount.value_or(shortCount));
+    put32(out,
+          endRecordCentralDirectorySize.value_or(zip64EndRecord ? kEscaped32 : directory.size()));
+    put32(out,
+          endRecordCentralDirectoryOffset.value_or(zip64EndRecord ? kEscaped32 : directoryOffset));
+    put16(out, archiveComment.size());
+    append(out, archiveComment);
+    return out;
+}
+
+void ZipBuilder::write(const std::string& path) const {
+    writeFile(path, bytes());
+}
+
+std::vector<ZipRecord> readZipRecords(const GWData& archive) {
+    auto u16 = [&](std::size_t at) -> std::uint32_t {
+        return at + 2 <= archive.size() ? archive[at] | archive[at + 1] << 8 : 0;
+    };
+    auto u32 = [&](std::size_t at) -> std::uint32_t { return u16(at) | u16(at + 2) << 16; };
+    auto slice = [&](std::size_t at, std::size_t length) {
+        return at + length <= archive.size()
+                   ? GWData(archive.begin() + at, archive.begin() + at + length)
+                   : GWData();
+    };
+    if (archive.size() < 22) {
+        return {};
+    }
+    std::size_t end = archive.size() - 22;
+    while (u32(end) != 0x06054B50) {
+        if (end == 0) {
+            return {};
+        }
+        --end;
+    }
+    // Offsets count from the archive's start, which a prefix moves.
+    const std::size_t directorySize = u32(end + 12), directoryOffset = u32(end + 16);
+    if (directorySize + directoryOffset > end) {
+        return {};
+    }
+    const std::size_t shift = end - directorySize - directoryOffset;
+    std::vector<ZipRecord> records;
+    std::size_t at = directoryOffset + shift;
+    for (std::uint32_t i = 0, count = u16(end + 10); i < count; ++i) {
+        if (u32(at) != 0x02014B50 || at + 46 > archive.size()) {
+            return {};
+        }
+        ZipRecord record;
+        record.versionMadeBy = std::uint16_t(u16(at + 4));
+        record.flags = std::uint16_t(u16(at + 8));
+        record.method = std::uint16_t(u16(at + 10));
+        record.crc32 = u32(at + 16);
+        record.compressedSize = u32(at + 20);
+        record.uncompressedSize = u32(at + 24);
+        const std::size_t nameLength = u16(at + 28), extraLength = u16(at + 30);
+        const std::size_t commentLength = u16(at + 32);
+        record.externalAttributes = u32(at + 38);
+        record.localHeaderOffset = u32(at + 42);
+        const GWData name = slice(at + 46, nameLength);
+        record.name.assign(name.begin(), name.end());
+        record.centralExtra = slice(at + 46 + nameLength, extraLength);
+        const std::size_t local = record.localHeaderOffset + shift;
+        record.localHeader = slice(local, 30);
+        if (u32(local) == 0x04034B50) {
+            record.localExtra = slice(local + 30 + u16(local + 26), u16(local + 28));
+        }
+        records.push_back(std::move(record));
+        at += 46 + nameLength + extraLength + commentLength;
+    }
+    return records;
+}
+
+}  // namespace gwtest
