@@ -4,4 +4,5 @@
 
 #include "GWArchiveConstants.h"
 #include "GWZipFile.h"
+#include "GWZipWorkOperation.h"
 #include "foundation/GWFoundation.h"

@@ -1,0 +1,5 @@
+#pragma once
+
+// The ZIP record parsing shared by loading and extraction.
+
+#include "zip/GWZipWorkOperation.h"
