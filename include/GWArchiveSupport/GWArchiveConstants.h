@@ -18,3 +18,25 @@ enum GWZipArchiveErrorCode : long {
     GWZipArchiveUnknownExtraFieldError = 2,
     GWZipArchiveUnknownExtraFieldVersionError = 3,
 };
+
+// Codes of kGWXARArchiveErrorDomain. 0, 8, 9 and 18 are never raised.
+enum GWXARArchiveErrorCode : long {
+    GWXARArchiveSkippedEntryError = -1,  // internal: an entry that is dropped, never reported
+    GWXARArchiveNotXARFileError = 1,
+    GWXARArchiveUnsupportedVersionError = 2,
+    GWXARArchiveFileNotInArchiveError = 3,
+    GWXARArchiveNoSuchExtendedAttributeError = 4,
+    GWXARArchiveInvalidTOCChecksumError = 5,
+    GWXARArchiveInvalidSignatureError = 6,
+    GWXARArchiveUntrustedCertificateError = 7,
+    GWXARArchiveUnknownFlagError = 10,
+    GWXARArchiveUnsupportedFileTypeError = 11,
+    GWXARArchiveUnknownChecksumError = 12,
+    GWXARArchiveUnsupportedCompressionError = 13,
+    GWXARArchiveUnknownSignatureStyleError = 14,
+    GWXARArchiveHardLinkTargetNotFoundError = 15,
+    GWXARArchiveMissingElementError = 16,
+    GWXARArchiveMissingAttributeError = 17,
+    GWXARArchiveMissingCertificateError = 19,
+    GWXARArchiveMalformedValueError = 20,
+};
