@@ -3,6 +3,8 @@
 // Umbrella header: everything a caller of the library needs.
 
 #include "GWArchiveConstants.h"
+#include "GWXARDataReference.h"
+#include "GWXARFile.h"
 #include "GWZipFile.h"
 #include "GWZipWorkOperation.h"
 #include "foundation/GWFoundation.h"

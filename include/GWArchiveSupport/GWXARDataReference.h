@@ -1,0 +1,5 @@
+#pragma once
+
+// A stored stream of a XAR entry: its data fork or an extended attribute.
+
+#include "xar/GWXARDataReference.h"

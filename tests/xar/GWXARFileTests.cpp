@@ -1,0 +1,407 @@
+#include <gtest/gtest.h>
+
+#include "foundation/GWCoder.h"
+#include "foundation/GWFormat.h"
+#include "xar/GWXARFile.h"
+
+namespace {
+
+GWXARFilePtr entry(const std::string& name, std::uint16_t mode = 0100644) {
+    auto file = GWXARFile::initWithArchive(nullptr);
+    file->setName(name);
+    file->setPermissionsMode(mode);
+    return file;
+}
+
+std::string pointer(const void* p) {
+    return GWFormat("%p", p);
+}
+
+// `text` with every "\n" followed by `indent`.
+std::string indentLines(const std::string& text, const std::string& indent) {
+    std::string out;
+    for (char c : text) {
+        out += c;
+        if (c == '\n') {
+            out += indent;
+        }
+    }
+    return out;
+}
+
+// A description with the object addresses blanked: equal exactly when every
+// described field is equal.
+std::string fields(const GWXARFile& file) {
+    std::string text = file.description();
+    for (const std::string prefix :
+         {"<GWXARFile ", "<GWXARDataReference ", "parent=", "hardlinkDestination="}) {
+        for (std::size_t at = text.find(prefix); at != std::string::npos;
+             at = text.find(prefix, at + 1)) {
+            const std::size_t start = at + prefix.size();
+            const std::size_t end = text.find_first_of(" \n", start);
+            text.replace(start, end - start, "@");
+        }
+    }
+    return text;
+}
+
+// GWXARArchive is not defined at this level; an aliasing pointer gives a
+// stand-in whose identity entries can hold without ever using it.
+std::shared_ptr<GWXARArchive> standInArchive() {
+    auto owner = std::make_shared<int>(0);
+    return std::shared_ptr<GWXARArchive>(owner, reinterpret_cast<GWXARArchive*>(owner.get()));
+}
+
+GWACL aclFromText(const std::string& text) {
+    auto acl = GWACL::fromText(text, nullptr);
+    EXPECT_TRUE(acl) << text;
+    return acl ? std::move(*acl) : GWACL::adopt(acl_init(0));
+}
+
+const char* const kMacACL =
+    "!#acl 1\ngroup:ABCDEFAB-CDEF-ABCD-EFAB-CDEF0000000C:everyone:12:deny:write,chown\n";
+
+GWXARDataReferencePtr sampleReference() {
+    auto reference = GWXARDataReference::init();
+    reference->setOffset(0x1c);
+    reference->setCompressedSize(11);
+    reference->setUncompressedSize(3);
+    reference->setCompressedChecksum(GWData{0xab, 0xcd, 0xef, 0x01, 0x23});
+    reference->setCompressedChecksumType(GWXARChecksumTypeSHA1);
+    reference->setUncompressedChecksumType(2);
+    reference->setCompressionType(GWXARCompressionTypeGZip);
+    return reference;
+}
+
+// A directory holding a file with every field set and a resolved hard link to it.
+struct SampleTree {
+    GWXARFilePtr directory = entry("dir", 0040755), file = entry("file", 0104755),
+                 link = entry("link");
+
+    SampleTree() {
+        directory->setItemID("1");
+        file->setItemID("2");
+        file->setOwnerID(4000000000u);
+        file->setGroupOwnerID(20);
+        file->setOwnerName("owner");
+        file->setGroupOwnerName("group");
+        file->setCreationDate(GWDate(1262401445.25));
+        file->setModificationDate(GWDate(1262401446));
+        file->setAccessDate(GWDate(1262401447));
+        file->setAttributeModificationDate(GWDate(1262401448));
+        file->setPosixFlags(0x40004);
+        GWACL access = aclFromText("u::rw-,u:4000000:r--,g::r--,m::r--,o::---");
+        GWACL defaults = aclFromText("u::rwx,g::r-x,o::---");
+        GWACL extended = aclFromText(kMacACL);
+        file->setAccessACL(&access);
+        file->setDefaultACL(&defaults);
+        file->setExtendedACL(&extended);
+        file->setInode(0xFFFFFFFFFFFFFFF0ull);
+        file->setDeviceNumber(-2);
+        file->setDeviceMajorNumber(8);
+        file->setDeviceMinorNumber(255);
+        file->setDataFork(sampleReference());
+        auto attribute = sampleReference();
+        attribute->setName("com.apple.FinderInfo");
+        attribute->setUncompressedChecksum(GWData{});
+        file->addExtendedAttribute(attribute);
+        link->setItemID("3");
+        link->setHardlinkDestinationID("stale");
+        link->setHardlinkDestination(file);
+        directory->setChildren({link, file});
+        directory->setArchive(standInArchive());
+    }
+};
+
+// Records the keys an object writes, in order.
+class RecordingCoder : public GWCoder {
+public:
+    explicit RecordingCoder(bool keyed) : keyed_(keyed) {}
+    bool allowsKeyedCoding() const override { return keyed_; }
+    std::vector<std::string> keys;
+    GWDictionary values;
+
+protected:
+    void writeValue(const std::string& key, const GWValue& value) override {
+        keys.push_back(key);
+        values[key] = value;
+    }
+    void writeObject(const std::string& key, const GWCoding&) override { keys.push_back(key); }
+    void writeObjects(const std::string& key, std::span<const GWCoding* const>) override {
+        keys.push_back(key);
+    }
+
+private:
+    bool keyed_;
+};
+
+TEST(GWXARFileType, FollowsTheModeAndTheResolvedHardLink) {
+    const std::pair<std::uint16_t, GWXARFileType> cases[] = {
+        {0100644, GWXARFileTypeRegular},      {0040755, GWXARFileTypeDirectory},
+        {0120777, GWXARFileTypeSymbolicLink}, {0020644, GWXARFileTypeCharacterSpecial},
+        {0060644, GWXARFileTypeBlockSpecial}, {0010644, GWXARFileTypeFIFO},
+        {0140755, GWXARFileTypeSocket},       {0160000, GWXARFileTypeWhiteout},
+        {0000644, GWXARFileTypeUnknown},      {0030644, GWXARFileTypeUnknown},
+    };
+    for (const auto& [mode, type] : cases) {
+        EXPECT_EQ(entry("x", mode)->type(), type) << std::oct << mode;
+    }
+    auto link = entry("link");
+    {
+        auto target = entry("target");
+        link->setHardlinkDestination(target);
+        EXPECT_EQ(link->type(), GWXARFileTypeHardLink);
+    }
+    // The link is weak: with the target gone the entry is a plain file again.
+    EXPECT_EQ(link->type(), GWXARFileTypeRegular);
+}
+
+TEST(GWXARFileTree, PathsAndHardLinkPaths) {
+    auto x = entry("x", 0040755), y = entry("y");
+    x->setChildren({y});
+    auto a = entry("a", 0040755), b = entry("b", 0040755), c = entry("c", 0040755);
+    auto deep = entry("deep"), shallow = entry("shallow"), top = entry("top");
+    a->setChildren({b, shallow});
+    b->setChildren({c});
+    c->setChildren({deep});
+    EXPECT_EQ(deep->path(), "a/b/c/deep");
+    EXPECT_EQ(deep->hardlinkPath(), std::nullopt);
+    for (const auto& link : {deep, shallow, top}) {
+        link->setHardlinkDestination(y);
+    }
+    EXPECT_EQ(deep->hardlinkPath(), "../../../x/y");
+    EXPECT_EQ(shallow->hardlinkPath(), "../x/y");
+    EXPECT_EQ(top->hardlinkPath(), "x/y");
+}
+
+TEST(GWXARFileTree, ChildrenSortCaseInsensitivelyWithNumbersByValue) {
+    auto directory = entry("d", 0040755);
+    auto b = entry("b"), A = entry("A"), file10 = entry("file10"), file2 = entry("file2");
+    directory->setChildren({b, A, file10, file2});
+    EXPECT_EQ(directory->children(), (GWXARFileArray{A, b, file2, file10}));
+    EXPECT_EQ(file2->parent(), directory);
+
+    // Equal names keep their order; long digit runs compare by value.
+    auto same1 = entry("Same"), same2 = entry("same"), zero = entry("file02");
+    auto huge = entry("v100000000000000000000000"), big = entry("v99999999999999999999999");
+    directory->setChildren({huge, same1, same2, file2, zero, big});
+    EXPECT_EQ(directory->children(), (GWXARFileArray{file2, zero, same1, same2, big, huge}));
+}
+
+TEST(GWXARFileTree, ArchiveComesFromTheNearestAncestorThatHasOne) {
+    auto archive = standInArchive(), other = standInArchive();
+    auto top = GWXARFile::initWithArchive(archive);
+    auto middle = entry("m", 0040755), leaf = entry("l");
+    top->setChildren({middle});
+    middle->setChildren({leaf});
+    EXPECT_EQ(leaf->archive(), archive);
+    middle->setArchive(other);
+    EXPECT_EQ(leaf->archive(), other);
+    EXPECT_EQ(entry("alone")->archive(), nullptr);
+}
+
+TEST(GWXARFileACL, SlotsOwnTheirCopies) {
+    auto file = entry("f");
+    const std::string text = "user::rw-\ngroup::r--\nother::r--\n";
+    {
+        GWACL acl = aclFromText(text);
+        file->setAccessACL(&acl);
+        EXPECT_NE(file->accessACL()->handle(), acl.handle());
+    }
+    EXPECT_EQ(file->accessACL()->text(), text);
+    // Storing a slot's own ACL into it again must not free it first.
+    file->setAccessACL(file->accessACL());
+    EXPECT_EQ(file->accessACL()->text(), text);
+    file->setAccessACL(nullptr);
+    EXPECT_EQ(file->accessACL(), nullptr);
+}
+
+TEST(GWXARFileACL, TextIsPOSIXOrMacExtendedOrAnError) {
+    EXPECT_FALSE(aclFromText("user::rwx,group::r-x,other::r--").isMacExtended());
+    EXPECT_TRUE(
+        aclFromText("!#acl 1 defer_inherit\n"
+                    "user:FFFFEEEE-DDDD-CCCC-BBBB-AAAA000001F5:me:501:allow:read,file_inherit\n"
+                    "group:ABCDEFAB-CDEF-ABCD-EFAB-CDEF0000000C::-2:deny\n")
+            .isMacExtended());
+    for (const char* bad : {"user::rwz", "!#acl\n", "!#acl 1\nuser:x:y:1:allow:read\n",
+                            "!#acl 1\nuser:FFFFEEEE-DDDD-CCCC-BBBB-AAAA000001F5:me:501:maybe\n"}) {
+        GWErrorPtr error;
+        EXPECT_FALSE(GWACL::fromText(bad, &error)) << bad;
+        EXPECT_TRUE(error && error->is(kGWPOSIXErrorDomain, EINVAL)) << bad;
+    }
+}
+
+TEST(GWXARFileACL, PersistentFormRoundTripsAndRefusesDamage) {
+    for (const char* text : {"u::rw-,u:1000:r--,g::r--,g:50:rw-,m::rw-,o::---", kMacACL}) {
+        auto bytes = GWXARFile::dataFromACL(aclFromText(text), nullptr);
+        ASSERT_TRUE(bytes);
+        auto back = GWXARFile::aclFromData(*bytes, nullptr);
+        ASSERT_TRUE(back);
+        EXPECT_EQ(back->text(), aclFromText(text).text());
+    }
+    const GWData good = *GWXARFile::dataFromACL(aclFromText("u::rw-,g::r--,o::---"), nullptr);
+    std::vector<GWData> damaged = {
+        GWData(good.begin(), good.end() - 1), good, good, good, GWData{1, 2, 3}, GWData{}};
+    damaged[1].push_back(0);
+    damaged[2][0] ^= 0x40;  // the size word no longer matches
+    damaged[3][4] = 1;      // nor does its upper half
+    const std::string brokenMac = "!#acl 1\nuser:nonsense\n";
+    damaged.emplace_back(brokenMac.begin(), brokenMac.end());
+    for (const auto& sample : damaged) {
+        GWErrorPtr error;
+        EXPECT_FALSE(GWXARFile::aclFromData(sample, &error));
+        EXPECT_TRUE(error && error->is(kGWPOSIXErrorDomain, EINVAL));
+    }
+}
+
+TEST(GWXARFileText, TypeNames) {
+    EXPECT_EQ(GWXARDataReference::stringFromChecksumType(0), "None");
+    EXPECT_EQ(GWXARDataReference::stringFromChecksumType(1), "Unknown");
+    EXPECT_EQ(GWXARDataReference::stringFromChecksumType(2), "Unknown");
+    EXPECT_EQ(GWXARDataReference::stringFromChecksumType(3), "MD2");
+    EXPECT_EQ(GWXARDataReference::stringFromChecksumType(9), "SHA512");
+    EXPECT_EQ(GWXARDataReference::stringFromCompressionType(3), "LZMA");
+    EXPECT_EQ(GWXARDataReference::stringFromCompressionType(4), "Unknown");
+    EXPECT_EQ(GWXARFile::stringFromFileType(GWXARFileTypeCharacterSpecial), "character special");
+}
+
+TEST(GWXARFileText, DescriptionOfALeafWithItsDataFork) {
+    auto file = entry("f");
+    file->setOwnerID(501);
+    file->setGroupOwnerID(20);
+    file->setOwnerName("me");
+    file->setModificationDate(GWDate::dateWithISO8601String("2010-01-02T03:04:05"));
+    file->setPosixFlags(0x20000);
+    file->setInode(7);
+    file->setDeviceNumber(-1);
+    file->setDeviceMinorNumber(3);
+    GWACL access = aclFromText("u::rw-,g::r--,o::---");
+    file->setAccessACL(&access);
+    auto reference = sampleReference();
+    file->setDataFork(reference);
+    EXPECT_EQ(
+        file->description(),
+        "<GWXARFile " + pointer(file.get()) +
+            "\n\tname=f\n\tparent=0x0 (null)\n\ttype=regular\n\tmode=100644\n\townerID=501\n\t"
+            "groupOwnerID=20\n\townerName=me\n\tgroupOwnerName=(null)\n\tcreationDate=(null)\n\t"
+            "modificationDate=2010-01-02T03:04:05Z\n\taccessDate=(null)\n\t"
+            "statusChangeDate=(null)\n\tposixFlags=131072\n\tdefaultACL='(null)'\n\t"
+            "accessACL='user::rw-\n\tgroup::r--\n\tother::---\n\t'\n\textendedACL='(null)'\n\t"
+            "inode=7\n\tdeviceNumber=4294967295\n\tsymlinkDestination='(null)'\n\t"
+            "hardlinkDestination=0x0 (null)\n\tdeviceMajorNumber=0\n\tdeviceMinorNumber=3\n\t"
+            "dataFork=<GWXARDataReference " +
+            pointer(reference.get()) +
+            "\n\t\tname=(null)\n\t\toffset=0x1c\n\t\tcompressedSize=11 bytes\n\t\t"
+            "uncompressedSize=3 bytes\n\t\tcompressedChecksum=<abcdef01 23> (SHA1)\n\t\t"
+            "uncompressedChecksum=(null) (Unknown)\n\t\tcompressionType=GZip\n\t>\n>");
+}
+
+TEST(GWXARFileText, DescriptionNestsAttributesAndChildren) {
+    auto directory = entry("d", 0040755);
+    auto a = entry("a"), b = entry("b");
+    directory->setChildren({b, a});
+    auto attribute = GWXARDataReference::init();
+    directory->addExtendedAttribute(attribute);
+    directory->addExtendedAttribute(attribute);
+    auto target = entry("t");
+    a->setHardlinkDestination(target);
+
+    auto twice = [](const std::string& text) { return indentLines(text, "\t\t"); };
+    const std::string tail =
+        "dataFork=(null)\n\textendedAttributes={\n\t\t" + twice(attribute->description()) +
+        ",\n\t\t" + twice(attribute->description()) + "\n\t}\n\tchildren={\n\t\t" +
+        twice(a->description()) + ",\n\t\t" + twice(b->description()) + "\n\t}\n>";
+    EXPECT_TRUE(directory->description().ends_with(tail)) << directory->description();
+    EXPECT_NE(
+        a->description().find("\n\tparent=" + pointer(directory.get()) + " d\n\ttype=hard link\n"),
+        std::string::npos);
+    EXPECT_NE(a->description().find("\n\thardlinkDestination=" + pointer(target.get()) + " t\n"),
+              std::string::npos);
+}
+
+TEST(GWXARFileCoding, WritesItsKeysInOrderAndNothingWithoutKeys) {
+    SampleTree tree;
+    RecordingCoder link(true);
+    tree.link->encodeWithCoder(link);
+    EXPECT_EQ(link.keys, (std::vector<std::string>{
+                             "Name", "PermissionsMode", "OwnerID", "GroupOwnerID", "POSIXFlags",
+                             "Inode", "DeviceNumber", "ItemID", "HardlinkDestinationID",
+                             "HardlinkPath", "DeviceMajorNumber", "DeviceMinorNumber"}));
+    // The resolved target's identifier, not the one the entry recorded.
+    EXPECT_EQ(*link.values["HardlinkDestinationID"].string(), "2");
+    EXPECT_EQ(*link.values["HardlinkPath"].string(), "../dir/file");
+
+    RecordingCoder file(true);
+    tree.file->encodeWithCoder(file);
+    EXPECT_EQ(file.keys, (std::vector<std::string>{"Name",
+                                                   "PermissionsMode",
+                                                   "OwnerID",
+                                                   "GroupOwnerID",
+                                                   "OwnerName",
+                                                   "GroupOwnerName",
+                                                   "CreationDate",
+                                                   "ModificationDate",
+                                                   "AccessDate",
+                                                   "AttributeModificationDate",
+                                                   "POSIXFlags",
+                                                   "DefaultACL",
+                                                   "AccessACL",
+                                                   "ExtendedACL",
+                                                   "Inode",
+                                                   "DeviceNumber",
+                                                   "ItemID",
+                                                   "DeviceMajorNumber",
+                                                   "DeviceMinorNumber",
+                                                   "DataFork",
+                                                   "ExtendedAttributes"}));
+
+    RecordingCoder plain(false);
+    tree.directory->encodeWithCoder(plain);
+    tree.file->dataFork()->encodeWithCoder(plain);
+    EXPECT_TRUE(plain.keys.empty());
+    GWNonKeyedCoder nonKeyed;
+    EXPECT_EQ(GWXARFile::initWithCoder(nonKeyed), nullptr);
+    EXPECT_EQ(GWXARDataReference::initWithCoder(nonKeyed), nullptr);
+}
+
+TEST(GWXARFileCoding, KeyedRoundTripKeepsValuesButNotTheWeakLinks) {
+    SampleTree tree;
+    GWErrorPtr error;
+    auto decoded = GWKeyedUnarchiver::unarchiveObjectWithData<GWXARFile>(
+        GWKeyedArchiver::archivedDataWithRootObject(*tree.directory, &error), &error);
+    ASSERT_TRUE(decoded) << (error ? error->localizedDescription() : "");
+
+    // The link comes back unresolved, which shows in its type and description.
+    tree.link->setHardlinkDestination(nullptr);
+    EXPECT_EQ(fields(*decoded), fields(*tree.directory));
+    EXPECT_EQ(decoded->archive(), nullptr);
+    auto file = decoded->children()[0];
+    auto link = decoded->children()[1];
+    EXPECT_EQ(file->parent(), decoded);
+    EXPECT_EQ(file->itemID(), "2");
+    EXPECT_EQ(link->hardlinkDestinationID(), "2");
+    EXPECT_EQ(file->extendedACL()->macExtendedText(), kMacACL);
+    EXPECT_EQ(file->extendedAttributes()[0]->uncompressedChecksum(), GWData{});
+}
+
+TEST(GWXARFileCopy, IsDeepAndLeavesTheChildrensParentAtTheSource) {
+    SampleTree tree;
+    auto copy = tree.directory->copy();
+    ASSERT_EQ(copy->children().size(), 2u);
+    auto file = copy->children()[0];
+    auto link = copy->children()[1];
+    // Intended: the copied children still name the source as their parent.
+    EXPECT_EQ(file->parent(), tree.directory);
+    EXPECT_EQ(fields(*file), fields(*tree.file));
+    EXPECT_EQ(copy->archive(), nullptr);
+    EXPECT_EQ(link->hardlinkDestination(), nullptr);
+    EXPECT_EQ(link->hardlinkDestinationID(), "stale");
+    EXPECT_EQ(link->itemID(), "3");
+    // Owned parts are the copy's own.
+    EXPECT_NE(file->accessACL()->handle(), tree.file->accessACL()->handle());
+    EXPECT_NE(file->extendedAttributes()[0], tree.file->extendedAttributes()[0]);
+    tree.file->dataFork()->setOffset(1);
+    EXPECT_EQ(file->dataFork()->offset(), 0x1cu);
+}
+
+}  // namespace
