@@ -1,0 +1,205 @@
+#include <gtest/gtest.h>
+
+#include <random>
+
+#include "GWArchiveSupport/GWArchiveConstants.h"
+#include "XarTestSupport.h"
+#include "support/TestSupport.h"
+#include "support/XarBuilder.h"
+
+namespace {
+
+struct HostileTOC {
+    const char* name;
+    std::string fileElements;
+    const char* domain;  // null: the parse fails without an error object
+    long code;
+    std::string entity;
+};
+
+std::string nested(std::size_t depth, const std::string& innermost = "") {
+    std::string xml;
+    for (std::size_t i = 0; i < depth; ++i) {
+        xml += "<file id=\"" + std::to_string(i + 1) + "\"><name>d</name><type>directory</type>";
+    }
+    xml += innermost;
+    for (std::size_t i = 0; i < depth; ++i) {
+        xml += "</file>";
+    }
+    return xml;
+}
+
+std::string withData(const std::string& dataBody) {
+    return "<file id=\"1\"><name>f</name><data>" + dataBody + "</data></file>";
+}
+
+std::string withProperty(const std::string& property) {
+    return "<file id=\"1\"><name>f</name>" + property + "</file>";
+}
+
+class GWXARTOCHostile : public testing::TestWithParam<HostileTOC> {};
+
+TEST_P(GWXARTOCHostile, FailsWithTheDocumentedError) {
+    const HostileTOC& sample = GetParam();
+    auto parsed = gwtest::parseEntries(sample.fileElements, 28);
+    EXPECT_FALSE(parsed.files);
+    if (!sample.domain) {
+        EXPECT_EQ(parsed.error, nullptr);
+        return;
+    }
+    ASSERT_TRUE(parsed.error);
+    EXPECT_EQ(parsed.error->domain(), sample.domain);
+    EXPECT_EQ(parsed.error->code(), sample.code) << parsed.error->localizedDescription();
+    EXPECT_EQ(parsed.error->detailString(kGWXARArchiveUnknownEntityErrorKey), sample.entity);
+}
+
+const char* const kXAR = "GWXARArchiveErrorDomain";
+
+INSTANTIATE_TEST_SUITE_P(
+    GWXARSamples, GWXARTOCHostile,
+    testing::Values(
+        HostileTOC{"TooDeep", nested(GWXARLoadOperation::kMaxFileNestingDepth + 1),
+                   "NSCocoaErrorDomain", GWFileReadCorruptFileError, ""},
+        HostileTOC{"FarTooDeep", nested(20000), "NSCocoaErrorDomain", GWFileReadCorruptFileError,
+                   ""},
+        HostileTOC{"LengthPast64Bits", withData("<length>18446744073709551616</length>"), kXAR,
+                   GWXARArchiveMalformedValueError, "18446744073709551616"},
+        HostileTOC{"LengthNotANumber", withData("<length>twelve</length>"), kXAR,
+                   GWXARArchiveMalformedValueError, "twelve"},
+        HostileTOC{"SizeNegative", withData("<size>-1</size>"), kXAR,
+                   GWXARArchiveMalformedValueError, "-1"},
+        HostileTOC{"OffsetPastTheEndOfTheAddressSpace",
+                   withData("<offset>18446744073709551600</offset>"), kXAR,
+                   GWXARArchiveMalformedValueError, "18446744073709551600"},
+        HostileTOC{"OddHex", withData("<archived-checksum style=\"sha1\">ABC</archived-checksum>"),
+                   kXAR, GWXARArchiveMalformedValueError, "ABC"},
+        HostileTOC{"HexWithNonDigits",
+                   withData("<extracted-checksum style=\"sha1\">0x12</extracted-checksum>"), kXAR,
+                   GWXARArchiveMalformedValueError, "0x12"},
+        HostileTOC{"ChecksumWithoutStyle", withData("<archived-checksum>00</archived-checksum>"),
+                   kXAR, GWXARArchiveMissingAttributeError, "style"},
+        HostileTOC{"UnknownChecksum",
+                   withData("<archived-checksum style=\"crc32\">00</archived-checksum>"), kXAR,
+                   GWXARArchiveUnknownChecksumError, "crc32"},
+        HostileTOC{"EncodingWithoutStyle", withData("<encoding/>"), kXAR,
+                   GWXARArchiveMissingAttributeError, "style"},
+        HostileTOC{"UnknownEncoding", withData("<encoding style=\"application/x-xz\"/>"), kXAR,
+                   GWXARArchiveUnsupportedCompressionError, "application/x-xz"},
+        HostileTOC{"UnknownType", withProperty("<type>portal</type>"), kXAR,
+                   GWXARArchiveMalformedValueError, "portal"},
+        HostileTOC{"HardLinkWithoutLink", withProperty("<type>hardlink</type>"), kXAR,
+                   GWXARArchiveMissingAttributeError, "link"},
+        HostileTOC{"HardLinkToNothing", withProperty("<type link=\"42\">hardlink</type>"), kXAR,
+                   GWXARArchiveHardLinkTargetNotFoundError, "42"},
+        HostileTOC{"UnknownFlag", withProperty("<flags><Sparkly/></flags>"), kXAR,
+                   GWXARArchiveUnknownFlagError, "Sparkly"},
+        HostileTOC{"DeviceWithoutMajor", withProperty("<device><minor>1</minor></device>"), kXAR,
+                   GWXARArchiveMissingElementError, "major"},
+        HostileTOC{"DeviceMajorTooLarge",
+                   withProperty("<device><major>18446744073709551615</major><minor>0</minor>"
+                                "</device>"),
+                   kXAR, GWXARArchiveMalformedValueError, "9223372036854775807"},
+        HostileTOC{"DeviceMinorTooLarge",
+                   withProperty("<device><major>0</major><minor>256</minor></device>"), kXAR,
+                   GWXARArchiveMalformedValueError, "256"},
+        HostileTOC{"CreationWithoutTime", withProperty("<FinderCreateTime></FinderCreateTime>"),
+                   kXAR, GWXARArchiveMissingElementError, "time"},
+        HostileTOC{"DeepFailureSurfaces", nested(10, withProperty("<type>portal</type>")), kXAR,
+                   GWXARArchiveMalformedValueError, "portal"},
+        HostileTOC{"ACLThatIsNeither", withProperty("<acl><access>rwxrwxrwx</access></acl>"),
+                   "NSPOSIXErrorDomain", EINVAL, "rwxrwxrwx"},
+        HostileTOC{"ACLWithANul",
+                   withProperty("<acl><access enctype=\"base64\">"
+                                "dTo6cnctLGc6OnItLSxvOjotLS0AanVuaw==</access></acl>"),
+                   "NSPOSIXErrorDomain", EINVAL, std::string("u::rw-,g::r--,o::---\0junk", 25)},
+        HostileTOC{"BrokenBase64", withProperty("<user enctype=\"base64\">====</user>"),
+                   "NSCocoaErrorDomain", GWFileReadCorruptFileError, ""},
+        HostileTOC{"EmptyID", "<file id=\"\"><name>f</name></file>", nullptr, 0, ""},
+        HostileTOC{"BadDate", withProperty("<atime>yesterday</atime>"), nullptr, 0, ""},
+        HostileTOC{"BadDateDeepDown", nested(3, withProperty("<ctime>2010-13-01T00:00:00</ctime>")),
+                   nullptr, 0, ""}),
+    [](const testing::TestParamInfo<HostileTOC>& info) { return std::string(info.param.name); });
+
+TEST(GWXARTOCHostileLimits, NestingUpToTheLimitIsAccepted) {
+    auto parsed = gwtest::parseEntries(nested(GWXARLoadOperation::kMaxFileNestingDepth));
+    ASSERT_TRUE(parsed.files) << (parsed.error ? parsed.error->localizedDescription() : "");
+    std::size_t depth = 0;
+    for (auto level = *parsed.files; !level.empty(); level = level[0]->children()) {
+        ++depth;
+    }
+    EXPECT_EQ(depth, GWXARLoadOperation::kMaxFileNestingDepth);
+}
+
+TEST(GWXARTOCHostileLimits, ManyDroppedEntriesStayCheap) {
+    // Each "." below the top hands its children to an entry under construction;
+    // a quadratic hand-over would make this crawl.
+    std::string inner;
+    for (int i = 0; i < 20000; ++i) {
+        inner += "<file id=\"d" + std::to_string(i) + "\"><name>.</name><file id=\"c" +
+                 std::to_string(i) + "\"><name>c</name></file></file>";
+    }
+    auto parsed = gwtest::parseEntries(
+        "<file id=\"top\"><name>top</name><type>directory</type>" + inner +
+        "</file><file id=\"l\"><name>l</name><type link=\"c19999\">hardlink</type></file>");
+    ASSERT_TRUE(parsed.files);
+    EXPECT_TRUE(gwtest::entryAtPath(*parsed.files, "top")->children().empty());
+}
+
+// Random damage to a real-looking table of contents: whatever the parser
+// makes of it, it must return normally (the sanitizer build checks the rest).
+TEST(GWXARTOCHostileLimits, MutatedTablesOfContentsNeverCrash) {
+    gwtest::XarBuilder builder;
+    const std::string data =
+        builder.dataElement("data", gwtest::bytesOf("hello"), gwtest::XarEncoding::gzip);
+    const std::string ea = builder.dataElement(
+        "ea", gwtest::bytesOf("v"), gwtest::XarEncoding::none, "md5", "<name>user.x</name>");
+    const std::string body =
+        "<file id=\"1\"><name>dir</name><type>directory</type><mode>0755</mode>"
+        "<file id=\"2\"><name>f</name><type link=\"original\">hardlink</type><uid>501</uid>"
+        "<mtime>2010-01-02T03:04:05Z</mtime><flags><UserNoDump/></flags>" +
+        data + ea +
+        "</file><file id=\"3\"><name>h</name><type link=\"2\">hardlink</type></file>"
+        "<file id=\"4\"><name>c</name><type>block special</type><device><major>8</major>"
+        "<minor>1</minor></device><acl><access>u::rw-,g::r--,o::---</access></acl></file>"
+        "</file>";
+    builder.setFiles(body);
+    const std::string document = builder.tocDocument();
+
+    std::mt19937 random(1234);
+    std::size_t parsedCount = 0;
+    for (int round = 0; round < 3000; ++round) {
+        std::string mutated = document;
+        const int edits = 1 + int(random() % 4);
+        for (int e = 0; e < edits; ++e) {
+            const std::size_t at = random() % mutated.size();
+            switch (random() % 3) {
+                case 0: mutated[at] = char(random() % 256); break;
+                case 1: mutated.erase(at, 1 + random() % 8); break;
+                default:
+                    mutated.insert(at, std::string(1 + random() % 4, "<>/\"0Z-9"[random() % 8]));
+            }
+            if (mutated.empty()) {
+                mutated = "x";
+            }
+        }
+        pugi::xml_document xml;
+        if (!xml.load_buffer(mutated.data(), mutated.size(),
+                             GWXARLoadOperation::kTOCParseOptions)) {
+            continue;
+        }
+        gwtest::LogCapture quiet;
+        auto operation = GWXARLoadOperation::initWithArchive(nullptr, false);
+        GWErrorPtr error;
+        auto files = operation->filesFromTOCElement(xml.child("xar").child("toc"), &error);
+        if (files) {
+            for (const auto& file : *files) {
+                (void)file->description();
+                (void)file->hardlinkPath();
+            }
+        }
+        ++parsedCount;
+    }
+    EXPECT_GT(parsedCount, 100u);
+}
+
+}  // namespace
