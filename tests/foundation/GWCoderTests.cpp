@@ -2,6 +2,7 @@
 
 #include "foundation/GWBinaryPropertyList.h"
 #include "foundation/GWCoder.h"
+#include "support/CoderTestSupport.h"
 #include "support/TestSupport.h"
 
 namespace {
@@ -218,16 +219,7 @@ GWDictionary storedRoot(const GWData& archive) {
     return *top.dictionary()->at("root").dictionary();
 }
 
-// A non-keyed coder that notices any attempt to write.
-class RecordingCoder : public GWCoder {
-public:
-    int writes = 0;
-
-protected:
-    void writeValue(const std::string&, const GWValue&) override { ++writes; }
-    void writeObject(const std::string&, const GWCoding&) override { ++writes; }
-    void writeObjects(const std::string&, std::span<const GWCoding* const>) override { ++writes; }
-};
+using RecordingCoder = gwtest::WriteCountingCoder;
 
 }  // namespace
 

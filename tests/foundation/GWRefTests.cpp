@@ -1,5 +1,7 @@
 #include <gtest/gtest.h>
 
+#include "support/CoderTestSupport.h"
+
 #include "foundation/GWBinaryPropertyList.h"
 #include "foundation/GWRef.h"
 
@@ -23,15 +25,7 @@ private:
     std::optional<GWValue> url_;
 };
 
-class RecordingCoder : public GWCoder {
-public:
-    int writes = 0;
-
-protected:
-    void writeValue(const std::string&, const GWValue&) override { ++writes; }
-    void writeObject(const std::string&, const GWCoding&) override { ++writes; }
-    void writeObjects(const std::string&, std::span<const GWCoding* const>) override { ++writes; }
-};
+using RecordingCoder = gwtest::WriteCountingCoder;
 
 }  // namespace
 
