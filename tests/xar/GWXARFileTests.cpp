@@ -2,6 +2,7 @@
 
 #include "foundation/GWCoder.h"
 #include "foundation/GWFormat.h"
+#include "support/CoderTestSupport.h"
 #include "xar/GWXARFile.h"
 
 namespace {
@@ -114,26 +115,7 @@ struct SampleTree {
 };
 
 // Records the keys an object writes, in order.
-class RecordingCoder : public GWCoder {
-public:
-    explicit RecordingCoder(bool keyed) : keyed_(keyed) {}
-    bool allowsKeyedCoding() const override { return keyed_; }
-    std::vector<std::string> keys;
-    GWDictionary values;
-
-protected:
-    void writeValue(const std::string& key, const GWValue& value) override {
-        keys.push_back(key);
-        values[key] = value;
-    }
-    void writeObject(const std::string& key, const GWCoding&) override { keys.push_back(key); }
-    void writeObjects(const std::string& key, std::span<const GWCoding* const>) override {
-        keys.push_back(key);
-    }
-
-private:
-    bool keyed_;
-};
+using gwtest::RecordingCoder;
 
 TEST(GWXARFileType, FollowsTheModeAndTheResolvedHardLink) {
     const std::pair<std::uint16_t, GWXARFileType> cases[] = {
