@@ -3,6 +3,7 @@
 #include <sstream>
 
 #include "GWArchiveSupport/GWArchiveConstants.h"
+#include "GWXARArchive.h"
 
 namespace {
 
@@ -45,6 +46,9 @@ GWXARLoadOperationPtr GWXARLoadOperation::initWithArchive(
     auto operation = std::make_shared<GWXARLoadOperation>();
     operation->archive_ = archive;
     operation->failOnInvalidSignature_ = failOnInvalidSignature;
+    if (archive && archive->ref()) {
+        operation->archiveURL_ = archive->URL();
+    }
     return operation;
 }
 

@@ -1,6 +1,7 @@
 #pragma once
 
 #include <cstdint>
+#include <map>
 #include <memory>
 #include <optional>
 #include <string>
@@ -21,10 +22,13 @@ class GWXARArchive;
 class GWXARLoadOperation;
 using GWXARLoadOperationPtr = std::shared_ptr<GWXARLoadOperation>;
 
-// Loads a XAR archive's table of contents into entries. This part holds the
-// entry parser: the table of contents' "file" elements become GWXARFile trees
-// with their data forks and extended attributes, and the value parsers
-// (text, numbers, hex, checksums, dates) serve the rest of the load.
+// Documents embedded in a table of contents ("subdoc" elements), by name.
+using GWXARSubdocuments = std::map<std::string, std::shared_ptr<pugi::xml_document>>;
+
+// Loads a XAR archive: reads the header, inflates and checks the table of
+// contents, and turns its "file" elements into GWXARFile trees with their
+// data forks and extended attributes. Runs once, synchronously through
+// start() or on a queue; the archive copies the results out afterwards.
 //
 // Every fallible call returns none or false and fills `error`. A few failures
 // leave no error object on purpose (an empty "id", a date that does not
@@ -55,6 +59,59 @@ public:
     // Where the heap begins: every offset in the table of contents counts from here.
     std::uint64_t heapStart() const { return heapStart_; }
     void setHeapStart(std::uint64_t heapStart) { heapStart_ = heapStart; }
+
+    // --- Opening (GWXARLoadOperationHeader.cpp) --------------------------------
+
+    // Largest table of contents accepted, stored or inflated, whatever the
+    // header claims: real ones are a few megabytes even for huge archives.
+    static constexpr std::uint64_t kMaxTOCLength = 256ull * 1024 * 1024;
+
+    // Opens the archive's file, loads it, and leaves either files() or error() set.
+    void main() override;
+    // The top-level entries, with the validity flags and subdocuments set.
+    std::optional<GWXARFileArray> readArchiveContents(bool failOnInvalidSignature,
+                                                      GWErrorPtr* error);
+    // Reads the header at the handle's position (the file's start). Each
+    // output only when asked for; the checksum algorithm is a GWChecksum
+    // number, -1 for header numbers that name none.
+    bool getHeaderLength(std::uint64_t* headerLength, std::uint64_t* compressedTOCLength,
+                         std::uint64_t* uncompressedTOCLength, int* checksumAlgorithm,
+                         GWErrorPtr* error);
+    // Reads the table of contents right after the header, inflates it and
+    // parses it; `checksum` (when given) receives the digest of the stored bytes.
+    std::shared_ptr<pugi::xml_document> readTOC(std::uint64_t compressedLength,
+                                                std::uint64_t decompressedLength,
+                                                int checksumAlgorithm, GWData* checksum,
+                                                GWErrorPtr* error);
+    // XAR header checksum number -> GWChecksum number: 0 none, 1 SHA-1, 2 MD5, else -1.
+    static int checksumTypeFromXARTypeNumber(std::uint32_t number);
+
+    // --- Table of contents (GWXARLoadOperationTOC.cpp) ------------------------
+
+    // Checks the checksum, splits off subdocuments, checks signatures and
+    // builds the entries. With `failOnInvalidSignature` a bad checksum or
+    // signature ends the parse; without, they are only recorded.
+    std::optional<GWXARFileArray> parseTOC(pugi::xml_document& document, int checksumAlgorithm,
+                                           bool failOnInvalidSignature, GWErrorPtr* error);
+    // True when the one "checksum" element names the header's algorithm and
+    // its bytes in the heap equal the computed checksum (none is needed for
+    // algorithm 0). Every failure is code 5 with the TOC element.
+    bool verifyTOCChecksum(int algorithm, const pugi::xml_node& toc, GWErrorPtr* error);
+    // Moves each "subdoc" child of the root into a document of its own. Never fails.
+    bool extractSubdocumentsFromRoot(pugi::xml_node root, GWErrorPtr* error);
+
+    // Results, read once the operation finished.
+    const std::optional<GWXARFileArray>& files() const { return files_; }
+    const GWXARSubdocuments& subdocuments() const { return subdocuments_; }
+    bool checksumIsValid() const { return checksumIsValid_; }
+    const GWErrorPtr& checksumError() const { return checksumError_; }
+    // Never set: an archive learns that its checksum failed from checksumIsValid alone.
+    GWErrorPtr checksumValidationError() const { return nullptr; }
+    bool signatureIsValid() const { return signatureIsValid_; }
+    const GWErrorPtr& signatureError() const { return signatureError_; }
+    const GWErrorPtr& error() const { return error_; }
+    // The digest of the stored table of contents, computed by readTOC.
+    const GWData& computedTOCChecksum() const { return computedTOCChecksum_; }
 
     // --- Entries (GWXARTOCEntryParser.cpp) ------------------------------------
 
@@ -132,6 +189,15 @@ private:
     std::optional<GWURL> archiveURL_;
     std::shared_ptr<GWRemoteFileHandle> fileHandle_;
     std::uint64_t heapStart_ = 0;
+
+    std::optional<GWXARFileArray> files_;
+    GWXARSubdocuments subdocuments_;
+    GWData computedTOCChecksum_;
+    bool checksumIsValid_ = false;
+    GWErrorPtr checksumError_;
+    bool signatureIsValid_ = false;
+    GWErrorPtr signatureError_;
+    GWErrorPtr error_;
 
     // Item id -> entry, for hard links; dropped entries stay here and may be targets.
     std::unordered_map<std::string, GWXARFilePtr> identifiers_;

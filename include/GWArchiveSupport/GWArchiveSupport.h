@@ -3,6 +3,7 @@
 // Umbrella header: everything a caller of the library needs.
 
 #include "GWArchiveConstants.h"
+#include "GWXARArchive.h"
 #include "GWXARDataReference.h"
 #include "GWXARFile.h"
 #include "GWZipFile.h"
