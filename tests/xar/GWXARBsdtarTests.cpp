@@ -17,6 +17,7 @@
 #include "foundation/GWDecompressor.h"
 #include "support/TestSupport.h"
 #include "support/XarBuilder.h"
+#include "xar/GWXARArchive.h"
 
 namespace {
 
@@ -236,6 +237,69 @@ TEST_P(GWXARBsdtar, EntriesMatchTheFileSystemAndTheListing) {
         ++checked;
     }
     EXPECT_EQ(checked, fixture.hasDevice ? 10 : 9);
+}
+
+// Opened as a whole: the checksum bsdtar wrote holds, and the tree is the
+// parser's, with the archive reachable from every entry.
+TEST_P(GWXARBsdtar, OpensThroughTheArchiveWithAValidChecksum) {
+    Fixture fixture;
+    const std::string path = fixture.archive(GetParam().first);
+    const GWURL url = GWURL::fileURLWithPath(path);
+    EXPECT_TRUE(GWXARArchive::isXARArchiveAtURL(url));
+    GWErrorPtr error;
+    auto archive = GWXARArchive::initWithURL(url, true, &error);
+    ASSERT_TRUE(archive) << (error ? error->localizedDescription() : "no error object");
+    EXPECT_TRUE(archive->checksumIsValid());
+    EXPECT_FALSE(archive->signatureIsValid());
+    EXPECT_FALSE(archive->signatureValidationError());
+    EXPECT_TRUE(archive->subdocuments().empty());
+
+    const GWData bytes = gwtest::readFile(path);
+    auto toc = gwtest::readXarTOC(bytes);
+    ASSERT_TRUE(toc);
+    auto operation = GWXARLoadOperation::initWithArchive(nullptr, false);
+    operation->setHeapStart(toc->heapStart);
+    auto parsed = operation->filesFromTOCElement(toc->toc(), &error);
+    ASSERT_TRUE(parsed);
+    EXPECT_EQ(gwtest::namesOf(archive->files()), gwtest::namesOf(*parsed));
+    for (const std::string member : {"f", "d", "d/file10", "d/file2", "d/A", "s", "h", "p", "x"}) {
+        SCOPED_TRACE(member);
+        auto entry = archive->fileWithPath(member);
+        auto expected = entryAtPath(*parsed, member);
+        ASSERT_TRUE(entry && expected);
+        EXPECT_EQ(entry->path(), member);
+        EXPECT_EQ(entry->permissionsMode(), expected->permissionsMode());
+        EXPECT_EQ(entry->inode(), expected->inode());
+        EXPECT_EQ(entry->archive(), archive);
+        EXPECT_EQ(bool(entry->dataFork()), bool(expected->dataFork()));
+        if (entry->dataFork()) {
+            EXPECT_EQ(entry->dataFork()->offset(), expected->dataFork()->offset());
+        }
+    }
+    EXPECT_EQ(archive->fileWithPath("h")->hardlinkDestination(), archive->fileWithPath("f"));
+    // The stored table of contents' digest, as the checksum element locates it.
+    const pugi::xml_node checksum = toc->toc().child("checksum");
+    const std::size_t offset =
+        std::size_t(toc->heapStart) + std::size_t(std::stoull(checksum.child_value("offset")));
+    const std::size_t size = std::size_t(std::stoull(checksum.child_value("size")));
+    ASSERT_LE(offset + size, bytes.size());
+    EXPECT_EQ(archive->tocChecksum(), GWData(bytes.begin() + std::ptrdiff_t(offset),
+                                             bytes.begin() + std::ptrdiff_t(offset + size)));
+
+    // One flipped byte of the stored digest: opens unchecked, refuses checked.
+    GWData flipped = bytes;
+    flipped[offset + size / 2] ^= 0x80;
+    const std::string flippedPath = fixture.directory.file("flipped.xar");
+    gwtest::writeFile(flippedPath, flipped);
+    auto lenient = GWXARArchive::initWithURL(GWURL::fileURLWithPath(flippedPath), false, &error);
+    ASSERT_TRUE(lenient);
+    EXPECT_FALSE(lenient->checksumIsValid());
+    EXPECT_FALSE(lenient->signatureIsValid());
+    EXPECT_EQ(gwtest::namesOf(lenient->files()), gwtest::namesOf(*parsed));
+    error = nullptr;
+    EXPECT_FALSE(GWXARArchive::initWithURL(GWURL::fileURLWithPath(flippedPath), true, &error));
+    ASSERT_TRUE(error);
+    EXPECT_TRUE(error->is("GWXARArchiveErrorDomain", 5));
 }
 
 INSTANTIATE_TEST_SUITE_P(GWXARCompressions, GWXARBsdtar,
