@@ -86,7 +86,7 @@ std::optional<GWXARFileArray> GWXARLoadOperation::readArchiveContents(bool failO
                          error)) {
         return std::nullopt;
     }
-    // Bounded by kMaxTOCLength below, so this cannot wrap.
+    // Wraps only for absurd lengths, which readTOC refuses before the heap is used.
     heapStart_ = headerLength + compressedLength;
 
     GWData checksum;
