@@ -1,0 +1,194 @@
+#include "GWZipLoadOperation.h"
+
+#include <algorithm>
+#include <cstdarg>
+#include <vector>
+
+#include "GWZipNames.h"
+#include "foundation/GWFormat.h"
+#include "foundation/GWLog.h"
+
+GWZipLoadOperationPtr GWZipLoadOperation::initWithURL(const GWURL& url) {
+    return GWZipLoadOperationPtr(new GWZipLoadOperation(url));
+}
+
+std::optional<GWZipFileArray> GWZipLoadOperation::files() const {
+    std::lock_guard lock(resultMutex_);
+    return files_;
+}
+
+void GWZipLoadOperation::setFiles(std::optional<GWZipFileArray> files) {
+    std::lock_guard lock(resultMutex_);
+    files_ = std::move(files);
+}
+
+GWErrorPtr GWZipLoadOperation::error() const {
+    std::lock_guard lock(resultMutex_);
+    return error_;
+}
+
+void GWZipLoadOperation::setError(GWErrorPtr error) {
+    std::lock_guard lock(resultMutex_);
+    error_ = std::move(error);
+}
+
+GWErrorPtr GWZipLoadOperation::corruptError(const char* format, ...) const {
+    va_list arguments;
+    va_start(arguments, format);
+    std::string description = GWFormatV(format, arguments);
+    va_end(arguments);
+    return GWGenerateError(kGWCocoaErrorDomain, GWFileReadCorruptFileError, url_, nullptr, {}, "%s",
+                           description.c_str());
+}
+
+GWErrorPtr GWZipLoadOperation::cancelledError() const {
+    return GWGenerateError(kGWCocoaErrorDomain, GWUserCancelledError, url_, nullptr, {},
+                           "Loading the archive was cancelled");
+}
+
+void GWZipLoadOperation::main() {
+    GWErrorPtr error;
+    auto file = GWRemoteFileHandle::initForReadingFromURL(url_, &error);
+    if (!file) {
+        setError(error);
+        return;
+    }
+    // Only proves the file is readable; the bytes are not examined.
+    if (!file->readDataOfLength(4, &error)) {
+        setError(error);
+        return;
+    }
+    static constexpr std::uint8_t kLocalHeaderSignature[] = {'P', 'K', 3, 4};
+    std::uint64_t found = kNotFound;
+    auto cancelled = [this] { return isCancelled(); };
+    if (!searchForData(kLocalHeaderSignature, *file, 0, UINT64_MAX, &found, cancelled, &error)) {
+        setError(error);
+        file->closeFileAndReturnError(nullptr);
+        return;
+    }
+    if (found == kNotFound) {
+        // An archive without a single local header (an empty one too) is
+        // refused on purpose.
+        setError(corruptError("No local file header found in %s", url_.path().c_str()));
+        file->closeFileAndReturnError(nullptr);
+        return;
+    }
+    setStartOffset(found);
+    auto roots = loadFilesFromZipArchiveAtHandle(*file, &error);
+    if (!roots) {
+        setError(error);
+    } else {
+        setFiles(std::move(roots));
+        if (isCancelled()) {
+            setError(cancelledError());
+        }
+    }
+    file->closeFileAndReturnError(nullptr);
+}
+
+bool GWZipLoadOperation::chooseStartOffset(const GWZipEndOfCentralDirectoryRecord& end,
+                                           std::uint64_t endOffset, GWRemoteFileHandle& file,
+                                           GWErrorPtr* error) {
+    static constexpr std::uint8_t kCentralSignature[] = {'P', 'K', 1, 2};
+    auto directoryAt = [&](std::uint64_t start) -> std::optional<bool> {
+        if (end.centralDirectoryOffset > endOffset ||
+            start > endOffset - end.centralDirectoryOffset) {
+            return false;
+        }
+        if (!file.seekToFileOffset(start + end.centralDirectoryOffset, error)) {
+            return std::nullopt;
+        }
+        auto bytes = file.readDataOfLength(4, error);
+        if (!bytes) {
+            return std::nullopt;
+        }
+        return bytes->size() == 4 && std::equal(bytes->begin(), bytes->end(), kCentralSignature);
+    };
+    // Offsets are normally relative to the first local header, which is
+    // right for a stub prepended as is. A stub prepended by a tool that
+    // adjusted the offsets (zip -A) makes them absolute instead; the end
+    // record's position minus the directory's size tells which.
+    std::vector<std::uint64_t> candidates{startOffset_};
+    if (end.centralDirectorySize <= endOffset &&
+        end.centralDirectoryOffset <= endOffset - end.centralDirectorySize) {
+        candidates.push_back(endOffset - end.centralDirectorySize - end.centralDirectoryOffset);
+    }
+    candidates.push_back(0);
+    for (std::uint64_t candidate : candidates) {
+        auto found = directoryAt(candidate);
+        if (!found) {
+            return false;
+        }
+        if (*found) {
+            setStartOffset(candidate);
+            return true;
+        }
+    }
+    // None fits: the walk reports the damage where the first guess leads.
+    return true;
+}
+
+std::optional<GWZipFileArray> GWZipLoadOperation::loadFilesFromZipArchiveAtHandle(
+    GWRemoteFileHandle& file, GWErrorPtr* error) {
+    GWZipEndOfCentralDirectoryRecord end;
+    auto endOffset = getEnd(&end, file, error);
+    if (!endOffset) {
+        return std::nullopt;
+    }
+    if (!chooseStartOffset(end, *endOffset, file, error)) {
+        return std::nullopt;
+    }
+    // The directory is taken to run up to the end record; its size field is
+    // not trusted.
+    const std::uint64_t start = startOffset_;
+    if (end.centralDirectoryOffset > *endOffset ||
+        start > *endOffset - end.centralDirectoryOffset) {
+        GWFail(error, corruptError("The central directory at offset %llu (+%llu) lies past the end "
+                                   "record at offset %llu",
+                                   (unsigned long long)end.centralDirectoryOffset,
+                                   (unsigned long long)start, (unsigned long long)*endOffset));
+        return std::nullopt;
+    }
+    const std::uint64_t directoryOffset = start + end.centralDirectoryOffset;
+    if (!file.seekToFileOffset(directoryOffset, error)) {
+        return std::nullopt;
+    }
+    auto directory = file.readDataOfLength(*endOffset - directoryOffset, error);
+    if (!directory) {
+        return std::nullopt;
+    }
+
+    GWZipTreeBuilder tree;
+    GWZipReadWindow window(file);
+    std::size_t pointer = 0;
+    for (std::uint64_t entry = 0; entry < end.totalEntries; ++entry) {
+        if (isCancelled()) {
+            GWFail(error, cancelledError());
+            return std::nullopt;
+        }
+        GWZipCentralDirectoryRecord record;
+        std::optional<std::string> filename;
+        std::optional<GWData> extraFieldData;
+        std::optional<std::string> comment;
+        GWErrorPtr recordError;
+        if (!readCentralDirRecord(&record, *directory, &pointer, &filename, &extraFieldData,
+                                  &comment, &recordError)) {
+            GWLog("Couldn't read central directory record!");
+            GWFail(error, recordError);
+            return std::nullopt;
+        }
+        std::string name = filename.value_or(std::string());
+        if (GWZipLastPOSIXPathComponent(name) == "..") {
+            continue;
+        }
+        if (!addItemFromCentralDirectoryRecord(record, window, std::move(name), extraFieldData,
+                                               comment, tree, error)) {
+            return std::nullopt;
+        }
+    }
+    GWZipFileArray roots = tree.finish();
+    if (!setUpMetadataItemsForFiles(roots, error)) {
+        return std::nullopt;
+    }
+    return roots;
+}
