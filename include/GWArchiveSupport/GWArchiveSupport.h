@@ -6,6 +6,8 @@
 #include "GWXARArchive.h"
 #include "GWXARDataReference.h"
 #include "GWXARFile.h"
+#include "GWZipArchive.h"
 #include "GWZipFile.h"
+#include "GWZipLoadOperation.h"
 #include "GWZipWorkOperation.h"
 #include "foundation/GWFoundation.h"

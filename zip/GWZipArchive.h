@@ -1,0 +1,108 @@
+#pragma once
+
+#include <cstdint>
+#include <functional>
+#include <memory>
+#include <mutex>
+#include <string>
+#include <unordered_map>
+#include <vector>
+
+#include "GWZipFile.h"
+#include "GWZipLoadOperation.h"
+#include "foundation/GWCoder.h"
+#include "foundation/GWError.h"
+#include "foundation/GWOperationQueue.h"
+#include "foundation/GWRef.h"
+#include "foundation/GWURL.h"
+
+class GWZipArchive;
+using GWZipArchivePtr = std::shared_ptr<GWZipArchive>;
+
+// One ZIP file: opened synchronously or asynchronously by a
+// GWZipLoadOperation, it holds the tree of entries, answers path lookups and
+// can be archived and copied.
+class GWZipArchive : public GWCoding, public std::enable_shared_from_this<GWZipArchive> {
+public:
+    static constexpr const char* kClassName = "GWZipArchive";
+
+    // Called with the error, or with none once `files` is set.
+    using CompletionHandler = std::function<void(const GWErrorPtr& error)>;
+
+    // --- Recognising archives -----------------------------------------------------
+
+    static bool isZipArchiveAtURL(const GWURL& url);
+    static bool isSelfExtractingZipArchiveAtURL(const GWURL& url);
+
+    // --- Opening ------------------------------------------------------------------
+
+    // The common first step: an archive that has loaded nothing yet, and the
+    // operation that would load it. None, with GWFileReadUnsupportedSchemeError,
+    // for a URL that cannot be referenced.
+    static GWZipArchivePtr initWithURL(const GWURL& url, GWZipLoadOperationPtr* loadOperation,
+                                       GWErrorPtr* error);
+    // Loads on the calling thread; none with the load's error, or
+    // GWUserCancelledError when the load was cancelled.
+    static GWZipArchivePtr initWithURL(const GWURL& url, GWErrorPtr* error);
+    // Returns at once with an archive whose `files` stay empty until the
+    // handler runs. The load runs on `loadingQueue` (a new queue when none is
+    // given), the operation is handed back for cancelling, and the handler
+    // always runs on the loading queue.
+    static GWZipArchivePtr initWithURL(const GWURL& url, const GWOperationQueuePtr& loadingQueue,
+                                       GWZipLoadOperationPtr* loadOperation,
+                                       CompletionHandler completionHandler);
+
+    GWZipArchive(const GWZipArchive&) = delete;
+    GWZipArchive& operator=(const GWZipArchive&) = delete;
+
+    // --- Properties -----------------------------------------------------------------
+
+    const GWRefPtr& ref() const { return ref_; }
+    GWURL URL() const;
+    // The roots; empty until loading has succeeded. Safe to read while the
+    // loading queue sets them.
+    GWZipFileArray files() const;
+    void setFiles(GWZipFileArray files);
+    // Where the ZIP data begins in the file; every offset is relative to it.
+    std::uint64_t startOffset() const { return startOffset_; }
+    void setStartOffset(std::uint64_t offset) { startOffset_ = offset; }
+    // Never set by loading, so 0; neither archived nor copied.
+    std::uint64_t compressedSize() const { return compressedSize_; }
+    void setCompressedSize(std::uint64_t size) { compressedSize_ = size; }
+
+    // --- Lookup ---------------------------------------------------------------------
+
+    // The nodes the paths name, in the order of the paths; paths that name
+    // nothing are left out. Components are matched one after another from the
+    // roots; one that matches nothing is passed over ("x/a/b" finds "a/b"
+    // when there is no root "x"). A leading "/" is a component of its own;
+    // "." and ".." are names like any other.
+    GWZipFileArray filesWithPaths(const std::vector<std::string>& paths) const;
+    GWZipFilePtr fileWithPath(const std::string& path) const;
+
+    // --- Persistence and copying ----------------------------------------------------
+
+    std::string className() const override { return kClassName; }
+    // Writes nothing to a non-keyed coder.
+    void encodeWithCoder(GWCoder& coder) const override;
+    static GWZipArchivePtr initWithCoder(GWCoder& coder);
+    // A copy of `ref`, the same `startOffset` and deep copies of the roots.
+    GWZipArchivePtr copy() const;
+
+private:
+    GWZipArchive() = default;
+    static GWZipArchivePtr make();
+
+    GWZipFilePtr fileWithPathComponents(const std::vector<std::string>& components) const;
+
+    GWRefPtr ref_;
+    std::uint64_t startOffset_ = 0;
+    std::uint64_t compressedSize_ = 0;
+
+    // `files` is set from the loading queue while callers read it.
+    mutable std::mutex filesMutex_;
+    GWZipFileArray files_;
+    // Name -> first root of that name, built on the first lookup.
+    mutable std::unordered_map<std::string, std::size_t> rootIndex_;
+    mutable bool rootIndexValid_ = false;
+};
