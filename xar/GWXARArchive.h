@@ -5,11 +5,13 @@
 #include <memory>
 #include <mutex>
 #include <optional>
+#include <span>
 #include <string>
 #include <unordered_map>
 #include <vector>
 
 #include "GWXARFile.h"
+#include "GWXARHeapStream.h"
 #include "GWXARLoadOperation.h"
 #include "foundation/GWCoder.h"
 #include "foundation/GWError.h"
@@ -137,6 +139,30 @@ public:
     // A deep copy with a fresh operation queue, whose entries point at the
     // copy and resolve hard links within the copied tree.
     GWXARArchivePtr copy() const;
+
+    // --- Extraction (GWXARArchiveExtraction.cpp) ------------------------------
+    //
+    // Stored streams reach a data handler piece by piece, decoded and checked
+    // against their stored digests; the handler runs on the reading thread,
+    // whatever `queue` says.
+
+    // The item's data fork; a symbolic link yields its link text, and a hard
+    // link the data of the item it ends at.
+    void extractDataForkOfFile(const GWXARFilePtr& file, const GWOperationQueuePtr& queue,
+                               const GWXARDataHandler& handler);
+    // The first extended attribute called `name`; code 4 when there is none.
+    void extractExtendedAttribute(const std::string& name, const GWXARFilePtr& file,
+                                  const GWOperationQueuePtr& queue,
+                                  const GWXARDataHandler& handler);
+    // One stored stream of `file`. A missing reference stands for the data
+    // fork of the item the file resolves to; none at all is an empty stream.
+    void extractDataReference(const GWXARDataReferencePtr& reference, const GWXARFilePtr& file,
+                              const GWOperationQueuePtr& queue, const GWXARDataHandler& handler);
+    // The single place a data handler is called: a refusal cancels the
+    // archive and earns one last call with the user-cancelled error.
+    void invokeDataHandler(const GWXARDataHandler& handler, const GWOperationQueuePtr& queue,
+                           std::optional<std::span<const std::uint8_t>> data, bool isDone,
+                           bool checksumFailed, const GWErrorPtr& error);
 
 private:
     // Copies a finished load's results in.

@@ -1,0 +1,284 @@
+// Streaming stored data out of a XAR heap to a data handler: the pieces, the
+// single last call, the checksum verdict, refusals and unreadable streams.
+
+#include <gtest/gtest.h>
+
+#include <cerrno>
+
+#include "GWArchiveSupport/GWArchiveConstants.h"
+#include "XarExtractTestSupport.h"
+#include "foundation/GWChecksum.h"
+
+namespace {
+
+using gwtest::StreamCalls;
+using gwtest::XarBuilder;
+using gwtest::XarEncoding;
+using gwtest::xarFileElement;
+
+// More than one decoder piece, so that the stream really comes in parts.
+const GWData kLargeContent = gwtest::randomBytes(3 * 1024 * 1024 + 17, 7);
+
+class DataStream : public ::testing::TestWithParam<XarEncoding> {
+protected:
+    GWXARArchivePtr open(XarBuilder& xar, const std::string& body) {
+        xar.setFiles(body);
+        return gwtest::openBuiltXar(xar, directory);
+    }
+
+    gwtest::TemporaryDirectory directory;
+};
+
+TEST_P(DataStream, PiecesJoinToTheContentAndOnlyTheLastIsDone) {
+    XarBuilder xar;
+    const std::string data = xar.dataElement("data", kLargeContent, GetParam());
+    auto archive = open(xar, xarFileElement(1, "big", "file", "0644", data));
+    ASSERT_TRUE(archive);
+
+    StreamCalls calls;
+    archive->extractDataForkOfFile(archive->fileWithPath("big"), nullptr,
+                                   gwtest::recordingHandler(calls));
+    ASSERT_GE(calls.calls.size(), 2u);
+    for (std::size_t i = 0; i + 1 < calls.calls.size(); ++i) {
+        EXPECT_FALSE(calls.calls[i].isDone) << i;
+        EXPECT_FALSE(calls.calls[i].error) << i;
+    }
+    EXPECT_TRUE(calls.last().isDone);
+    EXPECT_FALSE(calls.last().checksumFailed);
+    EXPECT_FALSE(calls.last().error);
+    EXPECT_EQ(calls.bytes(), kLargeContent);
+}
+
+TEST_P(DataStream, ExtendedAttributeIsFoundByName) {
+    XarBuilder xar;
+    std::string inner = xar.dataElement("ea", gwtest::bytesOf("first"), GetParam(), "sha1",
+                                        "<name>user.one</name>");
+    inner += xar.dataElement("ea", gwtest::bytesOf("second"), GetParam(), "md5",
+                             "<name>user.two</name>");
+    auto archive = open(xar, xarFileElement(1, "f", "file", "0644", inner));
+    ASSERT_TRUE(archive);
+
+    StreamCalls calls;
+    archive->extractExtendedAttribute("user.two", archive->fileWithPath("f"), nullptr,
+                                      gwtest::recordingHandler(calls));
+    ASSERT_FALSE(calls.calls.empty());
+    EXPECT_EQ(calls.bytes(), gwtest::bytesOf("second"));
+    EXPECT_TRUE(calls.last().isDone);
+    EXPECT_FALSE(calls.last().checksumFailed);
+}
+
+INSTANTIATE_TEST_SUITE_P(Encodings, DataStream,
+                         ::testing::Values(XarEncoding::none, XarEncoding::gzip,
+                                           XarEncoding::bzip2));
+
+class DataStreamContract : public ::testing::Test {
+protected:
+    // One regular file "f" holding `content`, plus whatever `more` adds.
+    GWXARArchivePtr openWithFile(const GWData& content, const std::string& more = "",
+                                 const std::string& data = "") {
+        const std::string element =
+            data.empty() ? xar.dataElement("data", content, XarEncoding::gzip) : data;
+        xar.setFiles(xarFileElement(1, "f", "file", "0644", element) + more);
+        return gwtest::openBuiltXar(xar, directory);
+    }
+
+    StreamCalls dataFork(const GWXARArchivePtr& archive, const std::string& path,
+                         int refuseAt = -1) {
+        StreamCalls calls;
+        archive->extractDataForkOfFile(archive->fileWithPath(path), nullptr,
+                                       gwtest::recordingHandler(calls, refuseAt));
+        return calls;
+    }
+
+    gwtest::TemporaryDirectory directory;
+    XarBuilder xar;
+};
+
+TEST_F(DataStreamContract, MismatchedDigestDeliversAllDataThenTheVerdict) {
+    const GWData content = gwtest::textBytes(100000, 3);
+    std::string element = xar.dataElement("data", content, XarEncoding::gzip);
+    // Replace the decoded bytes' digest by one of other bytes.
+    const std::string good = gwtest::hex(GWChecksum::checksumForData(content, 5));
+    const std::string bad = gwtest::hex(GWChecksum::checksumForData(gwtest::bytesOf("x"), 5));
+    element.replace(element.find(good), good.size(), bad);
+    auto archive = openWithFile(content, "", element);
+    ASSERT_TRUE(archive);
+
+    const auto calls = dataFork(archive, "f");
+    ASSERT_FALSE(calls.calls.empty());
+    EXPECT_EQ(calls.bytes(), content);
+    EXPECT_TRUE(calls.last().isDone);
+    EXPECT_TRUE(calls.last().checksumFailed);
+    EXPECT_FALSE(calls.last().error);
+    for (std::size_t i = 0; i + 1 < calls.calls.size(); ++i) {
+        EXPECT_FALSE(calls.calls[i].checksumFailed) << "verdict before the end, call " << i;
+    }
+}
+
+TEST_F(DataStreamContract, MissingDigestCountsAsMismatch) {
+    const GWData content = gwtest::bytesOf("no digests stored");
+    auto archive =
+        openWithFile(content, "", xar.dataElement("data", content, XarEncoding::none, ""));
+    ASSERT_TRUE(archive);
+    const auto calls = dataFork(archive, "f");
+    EXPECT_EQ(calls.bytes(), content);
+    EXPECT_TRUE(calls.last().checksumFailed);
+}
+
+TEST_F(DataStreamContract, RefusingHandlerGetsExactlyOneCancelledCall) {
+    auto archive = openWithFile(kLargeContent);
+    ASSERT_TRUE(archive);
+    const auto calls = dataFork(archive, "f", 0);
+    ASSERT_EQ(calls.calls.size(), 2u);
+    const auto& last = calls.calls[1];
+    EXPECT_FALSE(last.data);
+    EXPECT_TRUE(last.isDone);
+    ASSERT_TRUE(last.error);
+    EXPECT_TRUE(last.error->is(kGWCocoaErrorDomain, GWUserCancelledError));
+    EXPECT_TRUE(archive->isCancelled());
+
+    // The next extraction starts afresh.
+    const auto again = dataFork(archive, "f");
+    EXPECT_EQ(again.bytes(), kLargeContent);
+    EXPECT_FALSE(archive->isCancelled());
+}
+
+TEST_F(DataStreamContract, LZMAIsRefusedWithCode13) {
+    const GWData content = gwtest::bytesOf("pretend this is xz");
+    std::string element = xar.dataElement("data", content, XarEncoding::none);
+    const std::string style = "application/octet-stream";
+    element.replace(element.find(style), style.size(), "application/x-lzma");
+    auto archive = openWithFile(content, "", element);
+    ASSERT_TRUE(archive);
+    const auto calls = dataFork(archive, "f");
+    ASSERT_EQ(calls.calls.size(), 1u);
+    ASSERT_TRUE(calls.last().error);
+    EXPECT_TRUE(calls.last().error->is(kGWXARArchiveErrorDomain, 13));
+    EXPECT_EQ(calls.last().error->detailString(kGWXARArchiveUnknownEntityErrorKey), "LZMA");
+    EXPECT_EQ(calls.last().error->URL(), archive->URL());
+    EXPECT_TRUE(calls.last().isDone);
+}
+
+TEST_F(DataStreamContract, UnknownCompressionNumberIsNamedInDecimal) {
+    auto archive = openWithFile(gwtest::bytesOf("x"));
+    ASSERT_TRUE(archive);
+    archive->fileWithPath("f")->dataFork()->setCompressionType(7);
+    const auto calls = dataFork(archive, "f");
+    ASSERT_EQ(calls.calls.size(), 1u);
+    ASSERT_TRUE(calls.last().error);
+    EXPECT_TRUE(calls.last().error->is(kGWXARArchiveErrorDomain, 13));
+    EXPECT_EQ(calls.last().error->detailString(kGWXARArchiveUnknownEntityErrorKey), "7");
+}
+
+TEST_F(DataStreamContract, DamagedStreamReportsTheDecoderErrorOnce) {
+    auto archive = openWithFile(gwtest::textBytes(5000, 9));
+    ASSERT_TRUE(archive);
+    // Point the stream at the table-of-contents digest: not a zlib stream.
+    auto fork = archive->fileWithPath("f")->dataFork();
+    fork->setOffset(fork->offset() - xar.digestLength());
+    const auto calls = dataFork(archive, "f");
+    ASSERT_FALSE(calls.calls.empty());
+    EXPECT_TRUE(calls.last().isDone);
+    EXPECT_TRUE(calls.last().error);
+    EXPECT_TRUE(archive->isCancelled());
+    for (std::size_t i = 0; i + 1 < calls.calls.size(); ++i) {
+        EXPECT_FALSE(calls.calls[i].error);
+    }
+}
+
+TEST_F(DataStreamContract, StreamPastTheEndOfTheFileFails) {
+    auto archive = openWithFile(gwtest::textBytes(5000, 9));
+    ASSERT_TRUE(archive);
+    archive->fileWithPath("f")->dataFork()->setCompressedSize(1u << 30);
+    const auto calls = dataFork(archive, "f");
+    ASSERT_FALSE(calls.calls.empty());
+    EXPECT_TRUE(calls.last().isDone);
+    EXPECT_TRUE(calls.last().error);
+}
+
+TEST_F(DataStreamContract, ItemKindsResolveBeforeReading) {
+    const GWData content = gwtest::bytesOf("target bytes");
+    const std::string more =
+        xarFileElement(2, "d", "directory", "0755") +
+        xarFileElement(3, "s", "symlink", "0777", "<link type=\"file\">f</link>") +
+        xarFileElement(4, "empty-link", "symlink", "0777") +
+        "<file id=\"5\"><name>h1</name><type link=\"1\">hardlink</type><mode>0644</mode></file>" +
+        "<file id=\"6\"><name>h2</name><type link=\"5\">hardlink</type><mode>0644</mode></file>" +
+        xarFileElement(7, "p", "fifo", "0644") + xarFileElement(8, "empty", "file", "0644");
+    auto archive = openWithFile(content, more);
+    ASSERT_TRUE(archive);
+
+    auto directoryCalls = dataFork(archive, "d");
+    ASSERT_EQ(directoryCalls.calls.size(), 1u);
+    EXPECT_TRUE(directoryCalls.last().error->is(kGWPOSIXErrorDomain, EISDIR));
+    EXPECT_TRUE(directoryCalls.last().isDone);
+
+    auto linkCalls = dataFork(archive, "s");
+    ASSERT_EQ(linkCalls.calls.size(), 1u);
+    EXPECT_EQ(linkCalls.bytes(), gwtest::bytesOf("f"));
+    EXPECT_TRUE(linkCalls.last().isDone);
+    EXPECT_FALSE(linkCalls.last().error);
+
+    auto emptyLinkCalls = dataFork(archive, "empty-link");
+    ASSERT_EQ(emptyLinkCalls.calls.size(), 1u);
+    ASSERT_TRUE(emptyLinkCalls.last().data);
+    EXPECT_TRUE(emptyLinkCalls.last().data->empty());
+    EXPECT_FALSE(emptyLinkCalls.last().error);
+
+    // An attribute of a link is its link text too; that is how items resolve.
+    StreamCalls attributeOfLink;
+    auto link = archive->fileWithPath("s");
+    auto reference = GWXARDataReference::init();
+    archive->extractDataReference(reference, link, nullptr,
+                                  gwtest::recordingHandler(attributeOfLink));
+    EXPECT_EQ(attributeOfLink.bytes(), gwtest::bytesOf("f"));
+
+    auto chainCalls = dataFork(archive, "h2");
+    EXPECT_EQ(chainCalls.bytes(), content);
+    EXPECT_TRUE(chainCalls.last().isDone);
+    EXPECT_FALSE(chainCalls.last().error);
+
+    auto fifoCalls = dataFork(archive, "p");
+    ASSERT_EQ(fifoCalls.calls.size(), 1u);
+    EXPECT_TRUE(fifoCalls.last().error->is(kGWPOSIXErrorDomain, EINVAL));
+
+    // Writers leave the data element out of empty files.
+    auto emptyCalls = dataFork(archive, "empty");
+    ASSERT_EQ(emptyCalls.calls.size(), 1u);
+    EXPECT_TRUE(emptyCalls.last().isDone);
+    EXPECT_FALSE(emptyCalls.last().error);
+    EXPECT_TRUE(emptyCalls.bytes().empty());
+}
+
+TEST_F(DataStreamContract, EntriesOfAnotherArchiveAndMissingAttributesAreRefused) {
+    auto archive = openWithFile(gwtest::bytesOf("x"));
+    ASSERT_TRUE(archive);
+    auto other = gwtest::openBuiltXar(xar, directory, "other.xar");
+    ASSERT_TRUE(other);
+
+    StreamCalls foreign;
+    archive->extractDataForkOfFile(other->fileWithPath("f"), nullptr,
+                                   gwtest::recordingHandler(foreign));
+    ASSERT_EQ(foreign.calls.size(), 1u);
+    EXPECT_TRUE(foreign.last().error->is(kGWXARArchiveErrorDomain, 3));
+    EXPECT_TRUE(foreign.last().isDone);
+
+    StreamCalls missing;
+    archive->extractExtendedAttribute("user.none", archive->fileWithPath("f"), nullptr,
+                                      gwtest::recordingHandler(missing));
+    ASSERT_EQ(missing.calls.size(), 1u);
+    EXPECT_TRUE(missing.last().error->is(kGWXARArchiveErrorDomain, 4));
+    EXPECT_EQ(missing.last().error->URL(), archive->URL());
+}
+
+TEST_F(DataStreamContract, UnreadableArchiveFileReportsTheOpenError) {
+    auto archive = openWithFile(gwtest::bytesOf("x"));
+    ASSERT_TRUE(archive);
+    ASSERT_EQ(unlink(archive->URL().path().c_str()), 0);
+    const auto calls = dataFork(archive, "f");
+    ASSERT_EQ(calls.calls.size(), 1u);
+    EXPECT_TRUE(calls.last().isDone);
+    EXPECT_TRUE(calls.last().error);
+}
+
+}  // namespace

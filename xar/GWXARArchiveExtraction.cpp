@@ -1,0 +1,100 @@
+// The archive's read path for stored streams.
+
+#include "GWArchiveSupport/GWArchiveConstants.h"
+#include "GWXARArchive.h"
+
+namespace {
+
+// Longer chains of hard links only come from a damaged or hostile tree.
+constexpr std::size_t kMaxHardLinkChain = 256;
+
+GWErrorPtr notInArchiveError(const GWURL& url) {
+    return GWGenerateError(kGWXARArchiveErrorDomain, GWXARArchiveFileNotInArchiveError, url,
+                           nullptr, {}, "The item does not belong to the archive %s.",
+                           url.path().c_str());
+}
+
+}  // namespace
+
+void GWXARArchive::invokeDataHandler(const GWXARDataHandler& handler, const GWOperationQueuePtr&,
+                                     std::optional<std::span<const std::uint8_t>> data, bool isDone,
+                                     bool checksumFailed, const GWErrorPtr& error) {
+    const auto self = shared_from_this();
+    GWXARHeapStream::invokeDataHandler(
+        handler,
+        {URL(), [self] { return self->isCancelled(); },
+         [self](bool cancelled) { self->setIsCancelled(cancelled); }, nullptr},
+        data, isDone, checksumFailed, error);
+}
+
+void GWXARArchive::extractDataForkOfFile(const GWXARFilePtr& file, const GWOperationQueuePtr& queue,
+                                         const GWXARDataHandler& handler) {
+    extractDataReference(file ? file->dataFork() : nullptr, file, queue, handler);
+}
+
+void GWXARArchive::extractExtendedAttribute(const std::string& name, const GWXARFilePtr& file,
+                                            const GWOperationQueuePtr& queue,
+                                            const GWXARDataHandler& handler) {
+    if (file) {
+        for (const auto& attribute : file->extendedAttributes()) {
+            if (attribute && attribute->name() == name) {
+                extractDataReference(attribute, file, queue, handler);
+                return;
+            }
+        }
+    }
+    invokeDataHandler(
+        handler, queue, std::nullopt, true, false,
+        GWGenerateError(kGWXARArchiveErrorDomain, GWXARArchiveNoSuchExtendedAttributeError, URL(),
+                        nullptr, {{kGWXARArchiveUnknownEntityErrorKey, GWValue(name)}},
+                        "The item has no extended attribute \"%s\".", name.c_str()));
+}
+
+void GWXARArchive::extractDataReference(const GWXARDataReferencePtr& reference,
+                                        const GWXARFilePtr& file, const GWOperationQueuePtr& queue,
+                                        const GWXARDataHandler& handler) {
+    const auto self = shared_from_this();
+    const GWURL url = URL();
+    if (!file || file->archive() != self) {
+        invokeDataHandler(handler, queue, std::nullopt, true, false, notInArchiveError(url));
+        return;
+    }
+    // Follow hard links to the item that holds the data. Each step is a
+    // weak link to another entry; a cycle is a corrupt tree, not a hang.
+    GWXARFilePtr item = file;
+    for (std::size_t hops = 0;; ++hops) {
+        const auto type = item->type();
+        if (type == GWXARFileTypeRegular) {
+            break;
+        }
+        if (type == GWXARFileTypeDirectory) {
+            invokeDataHandler(handler, queue, std::nullopt, true, false, GWPOSIXError(EISDIR, url));
+            return;
+        }
+        if (type == GWXARFileTypeSymbolicLink) {
+            const std::string text = item->symlinkDestination().value_or("");
+            invokeDataHandler(
+                handler, queue,
+                std::span(reinterpret_cast<const std::uint8_t*>(text.data()), text.size()), true,
+                false, nullptr);
+            return;
+        }
+        if (type != GWXARFileTypeHardLink || hops >= kMaxHardLinkChain) {
+            invokeDataHandler(handler, queue, std::nullopt, true, false, GWPOSIXError(EINVAL, url));
+            return;
+        }
+        item = item->hardlinkDestination();
+    }
+    const GWXARDataReferencePtr stream = reference ? reference : item->dataFork();
+    if (!stream) {
+        // Writers leave the data out of empty files.
+        invokeDataHandler(handler, queue, std::span<const std::uint8_t>(), true, false, nullptr);
+        return;
+    }
+    GWXARHeapStream::streamDataReference(
+        *stream,
+        {url, [self] { return self->isCancelled(); },
+         [self](bool cancelled) { self->setIsCancelled(cancelled); },
+         [self, item] { return item->archive() == self; }},
+        handler);
+}
