@@ -20,6 +20,7 @@
 #include "foundation/GWURL.h"
 
 class GWXARArchive;
+class GWXARExtractOperation;
 using GWXARArchivePtr = std::shared_ptr<GWXARArchive>;
 
 // A XAR archive: its entry tree, subdocuments and the verdicts on its table
@@ -144,7 +145,11 @@ public:
     //
     // Stored streams reach a data handler piece by piece, decoded and checked
     // against their stored digests; the handler runs on the reading thread,
-    // whatever `queue` says.
+    // whatever `queue` says. Items are extracted to disk by a
+    // GWXARExtractOperation.
+
+    using ExtractionCompletionHandler =
+        std::function<void(bool checksumIsInvalid, const GWErrorPtr& error)>;
 
     // The item's data fork; a symbolic link yields its link text, and a hard
     // link the data of the item it ends at.
@@ -163,6 +168,17 @@ public:
     void invokeDataHandler(const GWXARDataHandler& handler, const GWOperationQueuePtr& queue,
                            std::optional<std::span<const std::uint8_t>> data, bool isDone,
                            bool checksumFailed, const GWErrorPtr& error);
+
+    // Extracts `file` (and its subtree) to `url` on the calling thread. True
+    // when the item is there; `checksumIsInvalid` then says whether a digest
+    // failed or metadata could not be applied.
+    bool extractFile(const GWXARFilePtr& file, const GWURL& url, bool* checksumIsInvalid,
+                     GWErrorPtr* error);
+    // The same on `queue` (the archive's own when none); `operation` receives
+    // the operation for cancelling before it is queued.
+    void extractFile(const GWXARFilePtr& file, const GWURL& url, const GWOperationQueuePtr& queue,
+                     std::shared_ptr<GWXARExtractOperation>* operation,
+                     ExtractionCompletionHandler completionHandler);
 
 private:
     // Copies a finished load's results in.

@@ -1,7 +1,8 @@
-// The archive's read path for stored streams.
+// The archive's read path for stored streams, and its extract-to-disk entry points.
 
 #include "GWArchiveSupport/GWArchiveConstants.h"
 #include "GWXARArchive.h"
+#include "GWXARExtractOperation.h"
 
 namespace {
 
@@ -97,4 +98,38 @@ void GWXARArchive::extractDataReference(const GWXARDataReferencePtr& reference,
          [self](bool cancelled) { self->setIsCancelled(cancelled); },
          [self, item] { return item->archive() == self; }},
         handler);
+}
+
+bool GWXARArchive::extractFile(const GWXARFilePtr& file, const GWURL& url, bool* checksumIsInvalid,
+                               GWErrorPtr* error) {
+    auto operation = GWXARExtractOperation::initWithFile(file, url, shared_from_this());
+    operation->start();
+    if (checksumIsInvalid) {
+        *checksumIsInvalid = operation->checksumIsInvalid();
+    }
+    if (auto failure = operation->error()) {
+        return GWFail(error, std::move(failure));
+    }
+    return true;
+}
+
+void GWXARArchive::extractFile(const GWXARFilePtr& file, const GWURL& url,
+                               const GWOperationQueuePtr& queue,
+                               std::shared_ptr<GWXARExtractOperation>* operation,
+                               ExtractionCompletionHandler completionHandler) {
+    auto extraction = GWXARExtractOperation::initWithFile(file, url, shared_from_this());
+    std::weak_ptr<GWXARExtractOperation> weakExtraction = extraction;
+    extraction->setCompletionBlock([weakExtraction, completionHandler] {
+        auto finished = weakExtraction.lock();
+        if (completionHandler && finished) {
+            completionHandler(finished->checksumIsInvalid(), finished->error());
+        }
+    });
+    if (operation) {
+        *operation = extraction;
+    }
+    const GWOperationQueuePtr target = queue ? queue : operationQueue();
+    if (target) {
+        target->addOperation(extraction);
+    }
 }

@@ -5,6 +5,7 @@
 #include "GWArchiveConstants.h"
 #include "GWXARArchive.h"
 #include "GWXARDataReference.h"
+#include "GWXARExtractOperation.h"
 #include "GWXARFile.h"
 #include "GWZipArchive.h"
 #include "GWZipFile.h"

@@ -1,6 +1,7 @@
 #pragma once
 
 #include <cstdint>
+#include <map>
 #include <optional>
 #include <string>
 #include <vector>
@@ -40,5 +41,24 @@ struct StreamCalls {
 // A handler that records each call into `calls` and refuses the call with
 // index `refuseAt` (never when negative).
 GWXARDataHandler recordingHandler(StreamCalls& calls, int refuseAt = -1);
+
+// One item of an extracted tree, as lstat and the file system describe it.
+struct TreeItem {
+    mode_t mode = 0;
+    uid_t owner = 0;
+    gid_t group = 0;
+    std::int64_t modificationSeconds = 0;
+    dev_t device = 0;
+    ino_t inode = 0;
+    std::string linkText;
+    GWData digest;                             // SHA-1 of a regular file's bytes
+    std::map<std::string, GWData> attributes;  // user.* extended attributes
+};
+
+// Every item below `root`, by path relative to it ("" is the root itself).
+std::map<std::string, TreeItem> snapshotTree(const std::string& root);
+
+// Paths of regular files that share an inode with another one, grouped.
+std::vector<std::vector<std::string>> hardLinkGroups(const std::map<std::string, TreeItem>& tree);
 
 }  // namespace gwtest

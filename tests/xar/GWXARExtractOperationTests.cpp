@@ -1,0 +1,514 @@
+// Extracting XAR items to disk: each kind of item, its metadata, hard links,
+// names that must not leave the destination, and what failures leave behind.
+
+#include <gtest/gtest.h>
+
+#include <dirent.h>
+#include <linux/fs.h>
+#include <sys/ioctl.h>
+#include <sys/stat.h>
+#include <sys/sysmacros.h>
+#include <sys/xattr.h>
+#include <unistd.h>
+
+#include <cstdlib>
+
+#include "GWArchiveSupport/GWArchiveConstants.h"
+#include "XarExtractTestSupport.h"
+#include "XarTestSupport.h"
+#include "foundation/GWChecksum.h"
+#include "foundation/GWDispatch.h"
+#include "foundation/GWFileDescriptor.h"
+#include "foundation/GWMetadataStore.h"
+#include "xar/GWXARExtractOperation.h"
+
+namespace {
+
+using gwtest::XarBuilder;
+using gwtest::XarEncoding;
+using gwtest::xarFileElement;
+
+std::vector<std::string> directoryNames(const std::string& path) {
+    std::vector<std::string> names;
+    if (DIR* directory = opendir(path.c_str())) {
+        while (const dirent* entry = readdir(directory)) {
+            const std::string name = entry->d_name;
+            if (name != "." && name != "..") {
+                names.push_back(name);
+            }
+        }
+        closedir(directory);
+    }
+    return names;
+}
+
+class XarExtraction : public ::testing::Test {
+protected:
+    void SetUp() override {
+        // A private temporary folder, so that leftovers are ours to count.
+        previousTMPDIR_ = std::getenv("TMPDIR") ? std::getenv("TMPDIR") : "";
+        temporaryRoot_ = directory.file("tmp");
+        mkdir(temporaryRoot_.c_str(), 0700);
+        setenv("TMPDIR", temporaryRoot_.c_str(), 1);
+    }
+    void TearDown() override {
+        if (previousTMPDIR_.empty()) {
+            unsetenv("TMPDIR");
+        } else {
+            setenv("TMPDIR", previousTMPDIR_.c_str(), 1);
+        }
+    }
+
+    GWXARArchivePtr open(const std::string& body) {
+        xar.setFiles(body);
+        return gwtest::openBuiltXar(xar, directory);
+    }
+
+    // Extracts `path` of the archive to "out/<name>" (out is created).
+    bool extract(const GWXARArchivePtr& archive, const std::string& path, const std::string& name,
+                 bool* checksumIsInvalid = nullptr, GWErrorPtr* error = nullptr) {
+        mkdir(directory.file("out").c_str(), 0755);
+        return archive->extractFile(archive->fileWithPath(path), output(name), checksumIsInvalid,
+                                    error);
+    }
+    GWURL output(const std::string& name) const { return directory.url("out/" + name); }
+    std::string outputPath(const std::string& name) const { return directory.file("out/" + name); }
+    std::vector<std::string> temporaryLeftovers() const { return directoryNames(temporaryRoot_); }
+
+    gwtest::TemporaryDirectory directory;
+    XarBuilder xar;
+
+private:
+    std::string previousTMPDIR_;
+    std::string temporaryRoot_;
+};
+
+TEST_F(XarExtraction, RegularFileGetsBytesModeOwnerAndDates) {
+    const GWData content = gwtest::textBytes(200000, 4);
+    auto archive =
+        open(xarFileElement(1, "f", "file", "0640",
+                            "<uid>1234</uid><gid>567</gid><mtime>2001-02-03T04:05:06Z</mtime>"
+                            "<atime>2002-03-04T05:06:07Z</atime>" +
+                                xar.dataElement("data", content, XarEncoding::bzip2)));
+    ASSERT_TRUE(archive);
+    bool invalid = true;
+    GWErrorPtr error;
+    ASSERT_TRUE(extract(archive, "f", "copy", &invalid, &error)) << error->localizedDescription();
+    EXPECT_FALSE(invalid);
+    struct stat info;  // before reading, which moves the access date
+    ASSERT_EQ(lstat(outputPath("copy").c_str(), &info), 0);
+    EXPECT_EQ(gwtest::readFile(outputPath("copy")), content);
+    EXPECT_TRUE(S_ISREG(info.st_mode));
+    EXPECT_EQ(info.st_mode & 07777, 0640u);
+    EXPECT_EQ(info.st_mtim.tv_sec, 981173106);
+    EXPECT_EQ(info.st_atim.tv_sec, 1015218367);
+    if (geteuid() == 0) {
+        EXPECT_EQ(info.st_uid, 1234u);
+        EXPECT_EQ(info.st_gid, 567u);
+    }
+    EXPECT_TRUE(temporaryLeftovers().empty());
+}
+
+TEST_F(XarExtraction, DirectoryTreeKeepsNamesKindsAndLinkTexts) {
+    auto archive = open(xarFileElement(
+        1, "top", "directory", "0750",
+        "<mtime>2010-01-01T00:00:00Z</mtime>" +
+            xarFileElement(2, "a", "file", "0600",
+                           xar.dataElement("data", gwtest::bytesOf("A"), XarEncoding::gzip)) +
+            xarFileElement(3, "sub", "directory", "0700",
+                           xarFileElement(4, "empty", "file", "0644")) +
+            xarFileElement(5, "rel", "symlink", "0777", "<link type=\"file\">a</link>") +
+            xarFileElement(6, "abs", "symlink", "0777",
+                           "<link type=\"broken\">/nonexistent/x</link>") +
+            xarFileElement(7, "pipe", "fifo", "0620")));
+    ASSERT_TRUE(archive);
+    GWErrorPtr error;
+    ASSERT_TRUE(extract(archive, "top", "top", nullptr, &error)) << error->localizedDescription();
+
+    const auto tree = gwtest::snapshotTree(outputPath("top"));
+    ASSERT_EQ(tree.size(), 7u);
+    EXPECT_EQ(tree.at("").mode, S_IFDIR | 0750);
+    EXPECT_EQ(tree.at("").modificationSeconds, 1262304000) << "set after the children";
+    EXPECT_EQ(tree.at("a").mode, S_IFREG | 0600);
+    EXPECT_EQ(tree.at("sub").mode, S_IFDIR | 0700);
+    EXPECT_EQ(tree.at("sub/empty").digest, GWChecksum::checksumForData({}, 5));
+    EXPECT_EQ(tree.at("rel").linkText, "a");
+    EXPECT_EQ(tree.at("abs").linkText, "/nonexistent/x");
+    EXPECT_EQ(tree.at("pipe").mode, S_IFIFO | 0620);
+}
+
+TEST_F(XarExtraction, DevicesAreMadeFromMajorAndMinor) {
+    if (geteuid() != 0) {
+        GTEST_SKIP() << "mknod of devices needs root";
+    }
+    auto archive = open(xarFileElement(1, "null", "character special", "0666",
+                                       "<device><major>1</major><minor>3</minor></device>") +
+                        xarFileElement(2, "loop", "block special", "0600",
+                                       "<device><major>7</major><minor>200</minor></device>"));
+    ASSERT_TRUE(archive);
+    ASSERT_TRUE(extract(archive, "null", "null"));
+    ASSERT_TRUE(extract(archive, "loop", "loop"));
+    struct stat info;
+    ASSERT_EQ(lstat(outputPath("null").c_str(), &info), 0);
+    EXPECT_TRUE(S_ISCHR(info.st_mode));
+    EXPECT_EQ(major(info.st_rdev), 1u);
+    EXPECT_EQ(minor(info.st_rdev), 3u);
+    EXPECT_EQ(info.st_mode & 07777, 0666u);
+    ASSERT_EQ(lstat(outputPath("loop").c_str(), &info), 0);
+    EXPECT_TRUE(S_ISBLK(info.st_mode));
+    EXPECT_EQ(major(info.st_rdev), 7u);
+    EXPECT_EQ(minor(info.st_rdev), 200u);
+}
+
+TEST_F(XarExtraction, ExtendedAttributesAndResourceForkAreWritten) {
+    const GWData fork = gwtest::randomBytes(3000, 5);
+    const std::string inner = xar.dataElement("data", gwtest::bytesOf("data"), XarEncoding::none) +
+                              xar.dataElement("ea", gwtest::bytesOf("value one"), XarEncoding::gzip,
+                                              "sha1", "<name>user.one</name>") +
+                              xar.dataElement("ea", fork, XarEncoding::bzip2, "md5",
+                                              "<name>com.apple.ResourceFork</name>") +
+                              xar.dataElement("ea", gwtest::bytesOf("mac"), XarEncoding::none,
+                                              "sha1", "<name>com.example.note</name>");
+    auto archive = open(xarFileElement(1, "f", "file", "0644", inner));
+    ASSERT_TRUE(archive);
+    bool invalid = true;
+    ASSERT_TRUE(extract(archive, "f", "f", &invalid));
+    EXPECT_FALSE(invalid);
+
+    GWMetadataStore store(outputPath("f"));
+    EXPECT_EQ(store.attribute("user.one", nullptr), gwtest::bytesOf("value one"));
+    EXPECT_EQ(store.attribute("com.apple.ResourceFork", nullptr), fork);
+    EXPECT_EQ(store.attribute("com.example.note", nullptr), gwtest::bytesOf("mac"));
+}
+
+TEST_F(XarExtraction, ResourceForkRefusedByTheFileSystemGoesToTheSideFile) {
+    GWMetadataStore::setAttributeSizeLimitForTesting(1000);
+    const GWData fork = gwtest::randomBytes(5000, 6);
+    auto archive = open(xarFileElement(1, "f", "file", "0644",
+                                       xar.dataElement("ea", fork, XarEncoding::gzip, "sha1",
+                                                       "<name>com.apple.ResourceFork</name>")));
+    ASSERT_TRUE(archive);
+    const bool extracted = extract(archive, "f", "f");
+    GWMetadataStore::setAttributeSizeLimitForTesting(std::nullopt);
+    ASSERT_TRUE(extracted);
+    EXPECT_EQ(access(directory.file("out/._f").c_str(), F_OK), 0);
+    EXPECT_EQ(GWMetadataStore(outputPath("f")).attribute("com.apple.ResourceFork", nullptr), fork);
+    EXPECT_TRUE(temporaryLeftovers().empty());
+}
+
+TEST_F(XarExtraction, ResourceForkMayNotPassFourGiB) {
+    auto archive = open(xarFileElement(1, "f", "file", "0644"));
+    ASSERT_TRUE(archive);
+    auto operation =
+        GWXARExtractOperation::initWithFile(archive->fileWithPath("f"), output("f"), archive);
+    gwtest::writeFile(directory.file("target"), {});
+    std::uint32_t position = 0xFFFFFFF0u;
+    GWErrorPtr error;
+    const GWData piece(0x10, 1);
+    EXPECT_TRUE(operation->appendDataToResourceFork({}, directory.url("target"), position, &error));
+    EXPECT_FALSE(operation->appendDataToResourceFork(GWData(0x11, 1), directory.url("target"),
+                                                     position, &error));
+    ASSERT_TRUE(error);
+    EXPECT_TRUE(error->is(kGWPOSIXErrorDomain, 27));
+    EXPECT_EQ(error->URL(), archive->URL());
+    EXPECT_EQ(error->detailString(kGWXARArchiveUnknownEntityErrorKey), "com.apple.ResourceFork");
+    EXPECT_EQ(position, 0xFFFFFFF0u);
+
+    position = 4;
+    ASSERT_TRUE(
+        operation->appendDataToResourceFork(piece, directory.url("target"), position, &error));
+    EXPECT_EQ(position, 4u + 0x10);
+}
+
+TEST_F(XarExtraction, MetadataFailureKeepsTheItemAndFlagsTheChecksum) {
+    // Linux keeps user attributes off symbolic links.
+    auto archive =
+        open(xarFileElement(1, "s", "symlink", "0777",
+                            "<link type=\"broken\">x</link>" +
+                                xar.dataElement("ea", gwtest::bytesOf("v"), XarEncoding::none,
+                                                "sha1", "<name>user.on-a-link</name>")));
+    ASSERT_TRUE(archive);
+    gwtest::LogCapture log;
+    bool invalid = false;
+    GWErrorPtr error;
+    ASSERT_TRUE(extract(archive, "s", "s", &invalid, &error));
+    EXPECT_FALSE(error);
+    EXPECT_TRUE(invalid);
+    struct stat info;
+    EXPECT_EQ(lstat(outputPath("s").c_str(), &info), 0);
+    ASSERT_FALSE(log.lines().empty());
+    EXPECT_NE(log.lines()[0].find("Failed to apply metadata for"), std::string::npos);
+}
+
+TEST_F(XarExtraction, ChecksumMismatchStillExtracts) {
+    const GWData content = gwtest::bytesOf("content");
+    auto archive = open(xarFileElement(1, "f", "file", "0644",
+                                       xar.dataElement("data", content, XarEncoding::gzip)));
+    ASSERT_TRUE(archive);
+    archive->fileWithPath("f")->dataFork()->setUncompressedChecksum(GWData(20, 0));
+    bool invalid = false;
+    ASSERT_TRUE(extract(archive, "f", "f", &invalid));
+    EXPECT_TRUE(invalid);
+    EXPECT_EQ(gwtest::readFile(outputPath("f")), content);
+}
+
+TEST_F(XarExtraction, ImmutableSystemFlagIsDroppedAndUserFlagsApply) {
+    if (geteuid() != 0) {
+        GTEST_SKIP() << "inode flags need root";
+    }
+    auto archive =
+        open(xarFileElement(1, "f", "file", "0644",
+                            "<flags><UserNoDump/><SystemImmutable/></flags>" +
+                                xar.dataElement("data", gwtest::bytesOf("x"), XarEncoding::none)));
+    ASSERT_TRUE(archive);
+    ASSERT_TRUE(extract(archive, "f", "f"));
+    auto fd = GWFileDescriptor::open(outputPath("f").c_str(), O_RDONLY);
+    int flags = 0;
+    if (ioctl(fd.get(), FS_IOC_GETFLAGS, &flags) != 0) {
+        GTEST_SKIP() << "the file system has no inode flags";
+    }
+    EXPECT_TRUE(flags & FS_NODUMP_FL);
+    EXPECT_FALSE(flags & FS_IMMUTABLE_FL);
+}
+
+TEST_F(XarExtraction, ImmutableTopLevelItemIsFlaggedOnceInPlace) {
+    if (geteuid() != 0) {
+        GTEST_SKIP() << "inode flags need root";
+    }
+    auto archive =
+        open(xarFileElement(1, "f", "file", "0644",
+                            "<flags><UserImmutable/></flags>" +
+                                xar.dataElement("data", gwtest::bytesOf("x"), XarEncoding::none)));
+    ASSERT_TRUE(archive);
+    ASSERT_TRUE(extract(archive, "f", "f"));
+    auto fd = GWFileDescriptor::open(outputPath("f").c_str(), O_RDONLY);
+    int flags = 0;
+    if (ioctl(fd.get(), FS_IOC_GETFLAGS, &flags) != 0) {
+        GTEST_SKIP() << "the file system has no inode flags";
+    }
+    EXPECT_TRUE(flags & FS_IMMUTABLE_FL);
+    flags &= ~FS_IMMUTABLE_FL;
+    ioctl(fd.get(), FS_IOC_SETFLAGS, &flags);  // so that the fixture can clean up
+    EXPECT_TRUE(temporaryLeftovers().empty());
+}
+
+// A directory "d" holding "f" and a hard link "h" to it. The link entry has
+// its own data fork; `linkContent` is what its digest was made from.
+std::string hardLinkTree(XarBuilder& xar, const GWData& content, const GWData& linkContent) {
+    const std::string link =
+        "<file id=\"3\"><name>h</name><type link=\"2\">hardlink</type>"
+        "<mode>0644</mode>" +
+        xar.dataElement("data", linkContent, XarEncoding::gzip) + "</file>";
+    return xarFileElement(1, "d", "directory", "0755",
+                          xarFileElement(2, "f", "file", "0644",
+                                         xar.dataElement("data", content, XarEncoding::gzip)) +
+                              link);
+}
+
+TEST_F(XarExtraction, HardLinkSharesTheInodeWhenTheDigestsMatch) {
+    const GWData content = gwtest::bytesOf("shared");
+    auto archive = open(hardLinkTree(xar, content, content));
+    ASSERT_TRUE(archive);
+    ASSERT_EQ(archive->fileWithPath("d/h")->type(), GWXARFileTypeHardLink);
+    ASSERT_TRUE(extract(archive, "d", "d"));
+    const auto tree = gwtest::snapshotTree(outputPath("d"));
+    EXPECT_EQ(tree.at("f").inode, tree.at("h").inode);
+    EXPECT_EQ(gwtest::readFile(outputPath("d/h")), content);
+}
+
+TEST_F(XarExtraction, HardLinkIsCopiedWhenTheDigestsDiffer) {
+    const GWData content = gwtest::bytesOf("shared");
+    auto archive = open(hardLinkTree(xar, content, gwtest::bytesOf("other")));
+    ASSERT_TRUE(archive);
+    ASSERT_TRUE(extract(archive, "d", "d"));
+    const auto tree = gwtest::snapshotTree(outputPath("d"));
+    EXPECT_NE(tree.at("f").inode, tree.at("h").inode);
+    EXPECT_EQ(gwtest::readFile(outputPath("d/h")), content) << "a copy of the target's data";
+}
+
+TEST_F(XarExtraction, HardLinksBelowATopLevelItemBecomeCopies) {
+    const GWData content = gwtest::bytesOf("shared");
+    auto archive =
+        open(xarFileElement(10, "top", "directory", "0755", hardLinkTree(xar, content, content)));
+    ASSERT_TRUE(archive);
+    // The target's archive path climbs to the top level, outside "top/d".
+    ASSERT_TRUE(extract(archive, "top/d", "d"));
+    const auto tree = gwtest::snapshotTree(outputPath("d"));
+    EXPECT_NE(tree.at("f").inode, tree.at("h").inode);
+    EXPECT_EQ(gwtest::readFile(outputPath("d/h")), content);
+}
+
+TEST_F(XarExtraction, HardLinkNeverReachesOutsideTheItem) {
+    // A file outside with the very bytes the link claims to hold.
+    const GWData content = gwtest::bytesOf("outside");
+    const std::string outsidePath = directory.file("victim");
+    gwtest::writeFile(outsidePath, content);
+    const std::string body =
+        xarFileElement(1, "d", "directory", "0755",
+                       xarFileElement(2, "s", "symlink", "0777",
+                                      "<link type=\"directory\">" + directory.path() + "</link>") +
+                           "<file id=\"4\"><name>h</name><type link=\"3\">hardlink</type>"
+                           "<mode>0644</mode>" +
+                           xar.dataElement("data", content, XarEncoding::none) + "</file>") +
+        xarFileElement(3, "victim", "file", "0644",
+                       xar.dataElement("data", content, XarEncoding::none));
+    auto archive = open(body);
+    ASSERT_TRUE(archive);
+    // Give the target the archive path d/s/victim, which runs through the
+    // symbolic link d/s once extracted.
+    auto d = archive->fileWithPath("d");
+    auto s = GWXARFile::initWithArchive(nullptr);
+    s->setName("s");
+    s->setParent(d);
+    archive->fileWithPath("victim")->setParent(s);
+    ASSERT_EQ(archive->fileWithPath("d/h")->hardlinkPath(), "../d/s/victim");
+
+    ASSERT_TRUE(extract(archive, "d", "d"));
+    struct stat outside;
+    ASSERT_EQ(stat(outsidePath.c_str(), &outside), 0);
+    EXPECT_EQ(outside.st_nlink, 1u) << "linked to a file outside the extraction";
+    EXPECT_EQ(gwtest::readFile(outputPath("d/h")), content);
+}
+
+TEST_F(XarExtraction, NamesThatLeaveTheDirectoryAreRefused) {
+    for (const std::string bad : {"..", ".", "a/b"}) {
+        auto archive = open(xarFileElement(
+            1, "d", "directory", "0755",
+            xarFileElement(2, "ok", "file", "0644") + xarFileElement(3, "x", "file", "0644")));
+        ASSERT_TRUE(archive);
+        archive->fileWithPath("d/x")->setName(bad);
+        GWErrorPtr error;
+        EXPECT_FALSE(extract(archive, "d", "d-" + std::to_string(bad.size()), nullptr, &error))
+            << bad;
+        ASSERT_TRUE(error);
+        EXPECT_TRUE(error->is(kGWXARArchiveErrorDomain, 20)) << bad;
+        EXPECT_EQ(error->detailString(kGWXARArchiveUnknownEntityErrorKey), bad);
+    }
+    EXPECT_TRUE(directoryNames(directory.file("out")).empty());
+    EXPECT_TRUE(temporaryLeftovers().empty());
+}
+
+TEST_F(XarExtraction, NameWithNULIsRefused) {
+    // base64 of "a\0b".
+    auto archive = open(xarFileElement(
+        1, "d", "directory", "0755",
+        "<file id=\"2\"><name enctype=\"base64\">YQBi</name><type>file</type></file>"));
+    ASSERT_TRUE(archive);
+    GWErrorPtr error;
+    EXPECT_FALSE(extract(archive, "d", "d", nullptr, &error));
+    ASSERT_TRUE(error);
+    EXPECT_TRUE(error->is(kGWXARArchiveErrorDomain, 20));
+    EXPECT_TRUE(directoryNames(directory.file("out")).empty());
+}
+
+TEST_F(XarExtraction, TopLevelNameDoesNotPlaceTheItem) {
+    auto archive = open(xarFileElement(
+        1, "f", "file", "0644", xar.dataElement("data", gwtest::bytesOf("x"), XarEncoding::none)));
+    ASSERT_TRUE(archive);
+    archive->fileWithPath("f")->setName("../../escape");
+    mkdir(directory.file("out").c_str(), 0755);
+    GWErrorPtr error;
+    ASSERT_TRUE(archive->extractFile(archive->files()[0], output("here"), nullptr, &error))
+        << error->localizedDescription();
+    EXPECT_EQ(gwtest::readFile(outputPath("here")), gwtest::bytesOf("x"));
+    EXPECT_EQ(directoryNames(directory.file("out")), std::vector<std::string>{"here"});
+    EXPECT_EQ(access(directory.file("escape").c_str(), F_OK), -1);
+}
+
+TEST_F(XarExtraction, ExistingDestinationIsLeftUntouched) {
+    auto archive =
+        open(xarFileElement(1, "f", "file", "0644",
+                            xar.dataElement("data", gwtest::bytesOf("new"), XarEncoding::gzip)));
+    ASSERT_TRUE(archive);
+    mkdir(directory.file("out").c_str(), 0755);
+    gwtest::writeFile(outputPath("f"), gwtest::bytesOf("old"));
+    GWErrorPtr error;
+    EXPECT_FALSE(extract(archive, "f", "f", nullptr, &error));
+    ASSERT_TRUE(error);
+    EXPECT_TRUE(error->is(kGWPOSIXErrorDomain, EEXIST));
+    EXPECT_EQ(gwtest::readFile(outputPath("f")), gwtest::bytesOf("old"));
+    EXPECT_TRUE(temporaryLeftovers().empty());
+}
+
+TEST_F(XarExtraction, FailureLeavesNothingBehind) {
+    // The socket deep inside fails the whole directory.
+    auto archive = open(xarFileElement(
+        1, "d", "directory", "0755",
+        xarFileElement(2, "a", "file", "0644",
+                       xar.dataElement("data", gwtest::bytesOf("a"), XarEncoding::none)) +
+            xarFileElement(3, "sub", "directory", "0755",
+                           xarFileElement(4, "sock", "socket", "0644"))));
+    ASSERT_TRUE(archive);
+    GWErrorPtr error;
+    EXPECT_FALSE(extract(archive, "d", "d", nullptr, &error));
+    ASSERT_TRUE(error);
+    EXPECT_TRUE(error->is(kGWXARArchiveErrorDomain, 11));
+    ASSERT_TRUE(error->URL());
+    EXPECT_EQ(error->URL()->lastPathComponent(), "sock");
+    EXPECT_TRUE(directoryNames(directory.file("out")).empty());
+    EXPECT_TRUE(temporaryLeftovers().empty());
+}
+
+TEST_F(XarExtraction, DamagedDataFailsTheExtraction) {
+    auto archive = open(
+        xarFileElement(1, "f", "file", "0644",
+                       xar.dataElement("data", gwtest::textBytes(9000, 1), XarEncoding::gzip)));
+    ASSERT_TRUE(archive);
+    archive->fileWithPath("f")->dataFork()->setCompressionType(GWXARCompressionTypeLZMA);
+    GWErrorPtr error;
+    EXPECT_FALSE(extract(archive, "f", "f", nullptr, &error));
+    ASSERT_TRUE(error);
+    EXPECT_TRUE(error->is(kGWXARArchiveErrorDomain, 13));
+    EXPECT_TRUE(directoryNames(directory.file("out")).empty());
+    EXPECT_TRUE(temporaryLeftovers().empty());
+}
+
+TEST_F(XarExtraction, NonFileDestinationIsRefused) {
+    auto archive = open(xarFileElement(1, "f", "file", "0644"));
+    ASSERT_TRUE(archive);
+    GWErrorPtr error;
+    EXPECT_FALSE(archive->extractFile(archive->fileWithPath("f"),
+                                      *GWURL::URLWithString("https://example.com/f"), nullptr,
+                                      &error));
+    ASSERT_TRUE(error);
+    EXPECT_TRUE(error->is(kGWCocoaErrorDomain, 518));
+}
+
+TEST_F(XarExtraction, CancelledOperationCreatesNothing) {
+    auto archive = open(xarFileElement(1, "f", "file", "0644"));
+    ASSERT_TRUE(archive);
+    auto operation =
+        GWXARExtractOperation::initWithFile(archive->fileWithPath("f"), output("f"), archive);
+    operation->cancel();
+    operation->main();
+    ASSERT_TRUE(operation->error());
+    EXPECT_TRUE(operation->error()->is(kGWCocoaErrorDomain, GWUserCancelledError));
+    EXPECT_EQ(operation->error()->URL(), output("f"));
+    EXPECT_EQ(access(outputPath("f").c_str(), F_OK), -1);
+}
+
+TEST_F(XarExtraction, AsynchronousExtractionReportsThroughTheHandler) {
+    const GWData content = gwtest::textBytes(70000, 2);
+    auto archive = open(xarFileElement(1, "f", "file", "0644",
+                                       xar.dataElement("data", content, XarEncoding::gzip)));
+    ASSERT_TRUE(archive);
+    mkdir(directory.file("out").c_str(), 0755);
+    auto queue = std::make_shared<GWOperationQueue>();
+    GWSemaphore done;
+    bool handlerInvalid = true;
+    GWErrorPtr handlerError = GWCocoaError(1);
+    GWXARExtractOperationPtr operation;
+    archive->extractFile(archive->fileWithPath("f"), output("f"), queue, &operation,
+                         [&](bool checksumIsInvalid, const GWErrorPtr& error) {
+                             handlerInvalid = checksumIsInvalid;
+                             handlerError = error;
+                             done.signal();
+                         });
+    ASSERT_TRUE(operation);
+    done.wait();
+    EXPECT_FALSE(handlerInvalid);
+    EXPECT_FALSE(handlerError);
+    EXPECT_EQ(gwtest::readFile(outputPath("f")), content);
+}
+
+}  // namespace

@@ -1,0 +1,191 @@
+// Creating each kind of item on disk, and streaming data forks into files.
+
+#include <fcntl.h>
+#include <sys/stat.h>
+#include <sys/sysmacros.h>
+#include <unistd.h>
+
+#include <atomic>
+
+#include "GWXARArchive.h"
+#include "GWXARExtractOperation.h"
+#include "foundation/GWChecksum.h"
+#include "foundation/GWDispatch.h"
+#include "foundation/GWFileDescriptor.h"
+
+bool GWXARExtractOperation::extractRegularFile(const GWXARFilePtr& file, const GWURL& url,
+                                               GWErrorPtr* error) {
+    // O_EXCL and O_NOFOLLOW: the private directory holds nothing we did not make.
+    auto fd = GWFileDescriptor::open(url.path().c_str(),
+                                     O_WRONLY | O_CREAT | O_EXCL | O_NOFOLLOW | O_TRUNC, 0600);
+    if (!fd.isValid()) {
+        return GWFail(error, GWPOSIXError(errno, url));
+    }
+    if (!writeDataForkOfFile(file, fd.get(), url, error)) {
+        return false;
+    }
+    if (::close(fd.release()) != 0) {
+        return GWFail(error, GWPOSIXError(errno, url));
+    }
+    return true;
+}
+
+bool GWXARExtractOperation::writeDataForkOfFile(const GWXARFilePtr& file, int fd, const GWURL& url,
+                                                GWErrorPtr* error) {
+    auto archive = archive_.lock();
+    if (!archive) {
+        return false;
+    }
+    auto queue = std::make_shared<GWOperationQueue>();
+    auto semaphore = std::make_shared<GWSemaphore>(0);
+    // Shared with the handler, which the reading machinery may outlive us with.
+    struct State {
+        std::atomic<bool> stop{false};
+        std::mutex mutex;
+        GWErrorPtr error;
+        std::uint64_t written = 0;
+    };
+    auto state = std::make_shared<State>();
+    auto weakSelf = std::weak_ptr<GWXARExtractOperation>(
+        std::static_pointer_cast<GWXARExtractOperation>(shared_from_this()));
+    auto fail = [state, semaphore](GWErrorPtr failure) {
+        state->stop.store(true);
+        {
+            std::lock_guard lock(state->mutex);
+            if (!state->error) {
+                state->error = std::move(failure);
+            }
+        }
+        semaphore->signal();
+        return false;
+    };
+    archive->extractDataForkOfFile(
+        file, queue,
+        [state, semaphore, weakSelf, fail, fd, url](
+            std::optional<std::span<const std::uint8_t>> data, bool isDone, bool checksumFailed,
+            const GWErrorPtr& streamError) {
+            if (state->stop.load()) {
+                return false;
+            }
+            if (checksumFailed) {
+                if (auto self = weakSelf.lock()) {
+                    self->markChecksumInvalid();
+                }
+            }
+            if (streamError) {
+                return fail(streamError);
+            }
+            if (data && !data->empty()) {
+                if (!GWWriteFully(fd, state->written, *data)) {
+                    return fail(GWPOSIXError(errno, url));
+                }
+                state->written += data->size();
+            }
+            if (isDone) {
+                semaphore->signal();
+            }
+            return true;
+        });
+    semaphore->wait();
+    std::lock_guard lock(state->mutex);
+    if (state->error) {
+        return GWFail(error, state->error);
+    }
+    return true;
+}
+
+bool GWXARExtractOperation::extractDirectory(const GWXARFilePtr& file, const GWURL& url,
+                                             GWErrorPtr* error) {
+    // Owner-only until the archived mode is applied after the subtree.
+    if (::mkdir(url.path().c_str(), 0700) != 0) {
+        return GWFail(error, GWPOSIXError(errno, url));
+    }
+    std::vector<DeferredHardLink> hardLinks;
+    if (!extractChildrenOfDirectory(file, url, hardLinks, error)) {
+        return false;
+    }
+    for (const auto& link : hardLinks) {
+        if (isCancelled()) {
+            return GWFail(error, cancelledError());
+        }
+        if (!extractFile(link.file, link.url, error)) {
+            return false;
+        }
+    }
+    return true;
+}
+
+bool GWXARExtractOperation::extractChildrenOfDirectory(const GWXARFilePtr& directory,
+                                                       const GWURL& url,
+                                                       std::vector<DeferredHardLink>& hardLinks,
+                                                       GWErrorPtr* error) {
+    for (const auto& child : directory->children()) {
+        if (isCancelled()) {
+            return GWFail(error, cancelledError());
+        }
+        auto destination = childURL(url, *child, error);
+        if (!destination) {
+            return false;
+        }
+        // Hard links come after everything else in the directory, so that
+        // targets among the siblings and their subtrees exist.
+        if (child->type() == GWXARFileTypeHardLink) {
+            hardLinks.push_back({child, *destination});
+        } else if (!extractFile(child, *destination, error)) {
+            return false;
+        }
+    }
+    return true;
+}
+
+bool GWXARExtractOperation::extractSymbolicLink(const GWXARFilePtr& file, const GWURL& url,
+                                                GWErrorPtr* error) {
+    if (!url.isFileURL()) {
+        return GWFail(error, GWCocoaError(GWFileWriteUnsupportedSchemeError, url));
+    }
+    const std::string text = file->symlinkDestination().value_or("");
+    if (::symlink(text.c_str(), url.path().c_str()) != 0) {
+        return GWFail(error, GWPOSIXError(errno, url));
+    }
+    return true;
+}
+
+bool GWXARExtractOperation::extractHardLink(const GWXARFilePtr& file, const GWURL& url,
+                                            GWErrorPtr* error) {
+    // Link only to a file proven to hold the link's own data; anything less
+    // becomes an independent copy of the target.
+    const auto& fork = file->dataFork();
+    if (fork && fork->uncompressedChecksum()) {
+        if (const auto target = hardLinkTargetPath(*file, url)) {
+            const auto digest = GWChecksum::checksumAtURL(
+                GWURL::fileURLWithPath(*target), int(fork->uncompressedChecksumType()), nullptr);
+            if (digest && *digest == *fork->uncompressedChecksum() &&
+                ::link(target->c_str(), url.path().c_str()) == 0) {
+                return true;
+            }
+        }
+    }
+    auto destination = file->hardlinkDestination();
+    if (!destination) {
+        return GWFail(error, GWCocoaError(GWFileWriteUnknownError, url));
+    }
+    return extractRegularFile(destination, url, error);
+}
+
+bool GWXARExtractOperation::extractDevice(const GWXARFilePtr& file, const GWURL& url,
+                                          GWErrorPtr* error) {
+    const dev_t device = ::makedev(static_cast<unsigned int>(file->deviceMajorNumber()),
+                                   static_cast<unsigned int>(file->deviceMinorNumber()));
+    if (::mknod(url.path().c_str(), file->permissionsMode(), device) != 0) {
+        return GWFail(error, GWPOSIXError(errno, url));
+    }
+    return true;
+}
+
+bool GWXARExtractOperation::extractFIFO(const GWXARFilePtr& file, const GWURL& url,
+                                        GWErrorPtr* error) {
+    if (::mkfifo(url.path().c_str(), file->permissionsMode() & 07777) != 0) {
+        return GWFail(error, GWPOSIXError(errno, url));
+    }
+    return true;
+}

@@ -1,0 +1,138 @@
+#include "GWXARExtractOperation.h"
+
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <exception>
+
+#include "GWArchiveSupport/GWArchiveConstants.h"
+#include "foundation/GWItemReplacement.h"
+#include "foundation/GWLog.h"
+#include "foundation/GWMetadataStore.h"
+
+GWXARExtractOperation::GWXARExtractOperation(GWXARFilePtr file, GWURL destinationURL,
+                                             const std::shared_ptr<GWXARArchive>& archive)
+    : file_(std::move(file)), destURL_(std::move(destinationURL)), archive_(archive) {}
+
+GWXARExtractOperationPtr GWXARExtractOperation::initWithFile(
+    GWXARFilePtr file, GWURL destinationURL, const std::shared_ptr<GWXARArchive>& archive) {
+    return GWXARExtractOperationPtr(
+        new GWXARExtractOperation(std::move(file), std::move(destinationURL), archive));
+}
+
+GWErrorPtr GWXARExtractOperation::error() const {
+    std::lock_guard lock(errorMutex_);
+    return error_;
+}
+
+void GWXARExtractOperation::setError(GWErrorPtr error) {
+    std::lock_guard lock(errorMutex_);
+    error_ = std::move(error);
+}
+
+GWErrorPtr GWXARExtractOperation::cancelledError() const {
+    return GWCocoaError(GWUserCancelledError, destURL_);
+}
+
+void GWXARExtractOperation::main() {
+    try {
+        GWErrorPtr failure;
+        if (performExtractionOperationWithFile(file_, destURL_, &failure)) {
+            setError(nullptr);
+        } else {
+            setError(failure ? failure : GWCocoaError(GWFileWriteUnknownError, destURL_));
+        }
+    } catch (const std::exception& exception) {
+        setError(GWGenerateError(kGWCocoaErrorDomain, GWFileWriteUnknownError, destURL_, nullptr,
+                                 {}, "%s", exception.what()));
+    }
+}
+
+bool GWXARExtractOperation::performExtractionOperationWithFile(const GWXARFilePtr& file,
+                                                               const GWURL& destinationURL,
+                                                               GWErrorPtr* error) {
+    if (isCancelled()) {
+        return GWFail(error, cancelledError());
+    }
+    if (!destinationURL.isFileURL()) {
+        return GWFail(error, GWCocoaError(GWFileWriteUnsupportedSchemeError, destinationURL));
+    }
+    if (!file) {
+        return GWFail(error, GWCocoaError(GWFileWriteUnknownError, destinationURL));
+    }
+    const std::string destinationPath = destinationURL.path();
+    auto temporary = GWItemReplacementDirectory::createForDestination(destinationPath, error);
+    if (!temporary) {
+        return false;
+    }
+    // Hard links find their targets by archive path, so the item keeps its
+    // archive name in the private directory; a name that is no single path
+    // component ("/", "..") only costs those links their sharing.
+    const GWURL temporaryURL = GWURL::fileURLWithPath(temporary->path());
+    const GWURL itemURL = childURL(temporaryURL, *file, nullptr)
+                              .value_or(temporaryURL.URLByAppendingPathComponent("item"));
+    temporaryItemURL_ = itemURL;
+    deferTopLevelFlags_ = false;
+    if (!extractFile(file, itemURL, error)) {
+        return false;
+    }
+    // Moving a directory updates its "..", which needs write permission on
+    // it; without privileges a read-only one gets that for the move only.
+    struct stat itemInfo;
+    const bool lendWrite = ::lstat(itemURL.path().c_str(), &itemInfo) == 0 &&
+                           S_ISDIR(itemInfo.st_mode) && !(itemInfo.st_mode & S_IWUSR) &&
+                           ::geteuid() != 0;
+    if (lendWrite) {
+        ::chmod(itemURL.path().c_str(), (itemInfo.st_mode & 07777) | S_IWUSR);
+    }
+    if (!GWMoveItemNoReplace(itemURL.path(), destinationPath, error)) {
+        return false;
+    }
+    if (lendWrite) {
+        ::chmod(destinationPath.c_str(), itemInfo.st_mode & 07777);
+    }
+    // A side file holding a refused resource fork follows its item; failing
+    // to move it loses only that metadata.
+    const std::string sideFile = GWMetadataSideFile::pathForItem(itemURL.path());
+    GWErrorPtr sideFileError;
+    if (::access(sideFile.c_str(), F_OK) == 0 &&
+        !GWMetadataStore::moveMetadata(itemURL.path(), destinationPath, &sideFileError)) {
+        GWLog("Failed to apply metadata for %s: %s", destinationPath.c_str(),
+              sideFileError->localizedDescription().c_str());
+        markChecksumInvalid();
+    }
+    if (deferTopLevelFlags_) {
+        applyFlags(*file, destinationURL);
+    }
+    return true;
+}
+
+bool GWXARExtractOperation::extractFile(const GWXARFilePtr& file, const GWURL& url,
+                                        GWErrorPtr* error) {
+    bool created = false;
+    switch (file->type()) {
+        case GWXARFileTypeRegular: created = extractRegularFile(file, url, error); break;
+        case GWXARFileTypeDirectory: created = extractDirectory(file, url, error); break;
+        case GWXARFileTypeSymbolicLink: created = extractSymbolicLink(file, url, error); break;
+        case GWXARFileTypeHardLink: created = extractHardLink(file, url, error); break;
+        case GWXARFileTypeCharacterSpecial:
+        case GWXARFileTypeBlockSpecial: created = extractDevice(file, url, error); break;
+        case GWXARFileTypeFIFO: created = extractFIFO(file, url, error); break;
+        default:
+            return GWFail(error, GWGenerateError(
+                                     kGWXARArchiveErrorDomain, GWXARArchiveUnsupportedFileTypeError,
+                                     url, nullptr, {}, "%s is a %s, which cannot be extracted.",
+                                     file->path().c_str(),
+                                     GWXARFile::stringFromFileType(file->type()).c_str()));
+    }
+    if (!created) {
+        return false;
+    }
+    GWErrorPtr metadataError;
+    if (!applyMetadataToFile(file, url, &metadataError)) {
+        GWLog("Failed to apply metadata for %s: %s", url.path().c_str(),
+              metadataError ? metadataError->localizedDescription().c_str() : "(null)");
+        markChecksumInvalid();
+    }
+    return true;
+}

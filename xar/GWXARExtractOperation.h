@@ -1,0 +1,115 @@
+#pragma once
+
+#include <atomic>
+#include <cstdint>
+#include <memory>
+#include <mutex>
+#include <optional>
+#include <span>
+#include <vector>
+
+#include "GWXARFile.h"
+#include "foundation/GWError.h"
+#include "foundation/GWOperation.h"
+#include "foundation/GWURL.h"
+
+class GWXARArchive;
+class GWXARExtractOperation;
+using GWXARExtractOperationPtr = std::shared_ptr<GWXARExtractOperation>;
+
+// Recreates one archive item, and for a directory its whole subtree, on disk
+// with its metadata. The item is built in a private directory on the
+// destination's file system and moved into place only when complete, never
+// over an existing item; a failed extraction leaves nothing at the destination.
+//
+// Data comes through the archive's streaming read path; this operation only
+// creates file-system objects and writes bytes. Results are published in
+// error() and checksumIsInvalid() before the operation finishes.
+class GWXARExtractOperation : public GWOperation {
+public:
+    static GWXARExtractOperationPtr initWithFile(GWXARFilePtr file, GWURL destinationURL,
+                                                 const std::shared_ptr<GWXARArchive>& archive);
+
+    const GWXARFilePtr& file() const { return file_; }
+    const GWURL& destURL() const { return destURL_; }
+    std::shared_ptr<GWXARArchive> archive() const { return archive_.lock(); }
+    // None on success.
+    GWErrorPtr error() const;
+    // Set when a stream's digests did not match, and also when metadata could
+    // not be applied: the item is there, but not exactly as archived.
+    bool checksumIsInvalid() const { return checksumIsInvalid_.load(); }
+
+    void main() override;
+
+    // The private-directory wrapper around extractFile.
+    bool performExtractionOperationWithFile(const GWXARFilePtr& file, const GWURL& destinationURL,
+                                            GWErrorPtr* error);
+    // Creates one item by its type, then applies its metadata.
+    bool extractFile(const GWXARFilePtr& file, const GWURL& url, GWErrorPtr* error);
+
+    // --- One per kind (GWXARExtractItems.cpp) ---------------------------------
+    bool extractRegularFile(const GWXARFilePtr& file, const GWURL& url, GWErrorPtr* error);
+    bool extractDirectory(const GWXARFilePtr& file, const GWURL& url, GWErrorPtr* error);
+    bool extractSymbolicLink(const GWXARFilePtr& file, const GWURL& url, GWErrorPtr* error);
+    bool extractHardLink(const GWXARFilePtr& file, const GWURL& url, GWErrorPtr* error);
+    bool extractDevice(const GWXARFilePtr& file, const GWURL& url, GWErrorPtr* error);
+    bool extractFIFO(const GWXARFilePtr& file, const GWURL& url, GWErrorPtr* error);
+
+    // A hard link waiting for the rest of its directory.
+    struct DeferredHardLink {
+        GWXARFilePtr file;
+        GWURL url;
+    };
+    // Extracts the children in order; hard links are only recorded, to be
+    // made once everything else in the directory exists.
+    bool extractChildrenOfDirectory(const GWXARFilePtr& directory, const GWURL& url,
+                                    std::vector<DeferredHardLink>& hardLinks, GWErrorPtr* error);
+    // Streams the data fork into an open file.
+    bool writeDataForkOfFile(const GWXARFilePtr& file, int fd, const GWURL& url, GWErrorPtr* error);
+
+    // --- Metadata (GWXARExtractMetadata.cpp) ----------------------------------
+    // Dates, extended attributes, owner, group, mode, ACL, then BSD flags.
+    bool applyMetadataToFile(const GWXARFilePtr& file, const GWURL& url, GWErrorPtr* error);
+    bool applyExtendedAttributesForFile(const GWXARFilePtr& file, const GWURL& url,
+                                        GWErrorPtr* error);
+    // Writes a piece of the resource fork at `position` and advances it;
+    // a fork may not pass 4 GiB.
+    bool appendDataToResourceFork(std::span<const std::uint8_t> data, const GWURL& url,
+                                  std::uint32_t& position, GWErrorPtr* error);
+
+    GWErrorPtr cancelledError() const;
+
+    // Whole attributes other than the resource fork are gathered in memory
+    // before they are set; one larger than this is refused (E2BIG).
+    static constexpr std::size_t kMaxBufferedAttributeSize = 16 * 1024 * 1024;
+
+private:
+    GWXARExtractOperation(GWXARFilePtr file, GWURL destinationURL,
+                          const std::shared_ptr<GWXARArchive>& archive);
+
+    void setError(GWErrorPtr error);
+    void markChecksumInvalid() { checksumIsInvalid_.store(true); }
+    // Where a child of the directory at `directory` goes; refuses names that
+    // would leave the directory.
+    std::optional<GWURL> childURL(const GWURL& directory, const GWXARFile& child,
+                                  GWErrorPtr* error) const;
+    // The existing regular file a hard link at `linkURL` may share, found by
+    // the link's relative archive path; none when it is missing or lies
+    // outside the item being extracted.
+    std::optional<std::string> hardLinkTargetPath(const GWXARFile& link,
+                                                  const GWURL& linkURL) const;
+    // BSD flags as Linux inode flags; those that would pin the item where it
+    // is are held back for the top-level item until it has been moved.
+    void applyFlags(const GWXARFile& file, const GWURL& url);
+
+    GWXARFilePtr file_;
+    GWURL destURL_;
+    std::weak_ptr<GWXARArchive> archive_;
+    mutable std::mutex errorMutex_;
+    GWErrorPtr error_;
+    std::atomic<bool> checksumIsInvalid_{false};
+    // The top-level item in the private directory, and whether its flags
+    // wait for the move.
+    std::optional<GWURL> temporaryItemURL_;
+    bool deferTopLevelFlags_ = false;
+};
