@@ -69,12 +69,6 @@ std::uint16_t msdosMode(std::string_view name, std::uint32_t externalAttributes)
     return mode;
 }
 
-GWDate dateFromDOS(std::uint16_t time, std::uint16_t date) {
-    // The seconds field is used as it stands (0 to 31), not doubled.
-    return GWDate::gregorianDateWithYear((date >> 9) + 1980, (date >> 5) & 0x0F, date & 0x1F,
-                                         time >> 11, (time >> 5) & 0x3F, time & 0x1F);
-}
-
 std::optional<std::uint64_t> infoNumber(const GWDictionary& info, const char* key) {
     const GWValue* value = GWDictionaryValue(info, key);
     if (value && value->isNumber()) {
@@ -96,6 +90,20 @@ std::string parentPath(std::string_view path) {
 }
 
 }  // namespace
+
+GWDate GWZipLoadOperation::dateFromDOS(std::uint16_t time, std::uint16_t date) {
+    const std::uint32_t key = (std::uint32_t(date) << 16) | time;
+    auto found = dosDates_.find(key);
+    if (found != dosDates_.end()) {
+        return found->second;
+    }
+    // The seconds field is used as it stands (0 to 31), not doubled.
+    const GWDate converted =
+        GWDate::gregorianDateWithYear((date >> 9) + 1980, (date >> 5) & 0x0F, date & 0x1F,
+                                      time >> 11, (time >> 5) & 0x3F, time & 0x1F);
+    dosDates_.emplace(key, converted);
+    return converted;
+}
 
 bool GWZipLoadOperation::readLocalHeaderRecord(GWZipLocalFileHeader* record,
                                                GWRemoteFileHandle& file, GWErrorPtr* error) const {
@@ -353,8 +361,18 @@ bool GWZipLoadOperation::addItemWithFilename(
     const auto group = infoNumber(extraInfo, kGWZipGroupIDKey);
 
     // Missing directories on the way are made; "." and ".." are resolved.
-    GWZipFilePtr parent = rootItems.fileWithPathComponents(
-        GWZipFile::standardizedComponentsForPath(parentPath(filename)), true);
+    // Entries of one directory usually follow each other, so the last
+    // parent is reused until a replacement could change what a path finds.
+    std::string directoryPath = parentPath(filename);
+    GWZipFilePtr parent;
+    if (lastParent_ && directoryPath == lastParentPath_) {
+        parent = lastParent_;
+    } else {
+        parent = rootItems.fileWithPathComponents(
+            GWZipFile::standardizedComponentsForPath(directoryPath), true);
+        lastParent_ = parent;
+        lastParentPath_ = std::move(directoryPath);
+    }
     // "/" is its own last component, as the platform's paths have it.
     std::string name = filename == "/" ? filename : GWZipLastPOSIXPathComponent(filename);
 
@@ -371,15 +389,14 @@ bool GWZipLoadOperation::addItemWithFilename(
         owner ? std::uint32_t(*owner) : getuid(), group ? std::uint32_t(*group) : getgid(),
         permissionsMode, modificationDate, std::move(linkTarget), localHeaderOffset,
         generalPurposeFlags, compressionMethod, std::move(extraInfo));
-    if (parent) {
-        // An explicit directory entry replaces the implicit one made for its
-        // children earlier. At the root a duplicate stays, by design.
-        auto existing = rootItems.childNamed(parent, name);
-        if (existing && existing->isDirectory()) {
-            rootItems.moveChildren(existing, node);
-            rootItems.removeChild(parent, existing);
-        }
+    auto existing = rootItems.addChild(parent, node);
+    // An explicit directory entry replaces the implicit one made for its
+    // children earlier, and takes its place at the end. At the root a
+    // duplicate stays, by design.
+    if (parent && existing && existing->isDirectory()) {
+        rootItems.moveChildren(existing, node);
+        rootItems.removeChild(parent, existing);
+        lastParent_ = nullptr;
     }
-    rootItems.addChild(parent, node);
     return true;
 }

@@ -186,6 +186,7 @@ std::optional<GWZipFileArray> GWZipLoadOperation::loadFilesFromZipArchiveAtHandl
             return std::nullopt;
         }
     }
+    lastParent_ = nullptr;
     GWZipFileArray roots = tree.finish();
     if (!setUpMetadataItemsForFiles(roots, error)) {
         return std::nullopt;

@@ -9,6 +9,7 @@
 #include <span>
 #include <string>
 #include <string_view>
+#include <unordered_map>
 
 #include "GWZipEntryList.h"
 #include "GWZipFile.h"
@@ -150,6 +151,9 @@ private:
     // elsewhere (a prefix whose length a tool added to every offset).
     bool chooseStartOffset(const GWZipEndOfCentralDirectoryRecord& end, std::uint64_t endOffset,
                            GWRemoteFileHandle& file, GWErrorPtr* error);
+    // A DOS date and time in the system's zone. Converting costs a time-zone
+    // lookup, and archives repeat a few stamps thousands of times.
+    GWDate dateFromDOS(std::uint16_t time, std::uint16_t date);
     GWErrorPtr corruptError(const char* format, ...) const __attribute__((format(printf, 2, 3)));
     GWErrorPtr cancelledError() const;
     // Looks the path up in the roots, or makes the placeholder entry a lone
@@ -159,6 +163,9 @@ private:
 
     GWURL url_;
     std::uint64_t startOffset_ = 0;
+    std::unordered_map<std::uint32_t, GWDate> dosDates_;
+    GWZipFilePtr lastParent_;
+    std::string lastParentPath_;
     mutable std::mutex resultMutex_;
     std::optional<GWZipFileArray> files_;
     GWErrorPtr error_;

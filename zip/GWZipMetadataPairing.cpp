@@ -61,6 +61,22 @@ GWZipFilePtr GWZipLoadOperation::fileWithName(std::string_view name, const GWZip
 }
 
 bool GWZipLoadOperation::setUpMetadataItemsForFiles(GWZipFileArray& files, GWErrorPtr* error) {
+    // Most archives have nothing to pair; they need no index of their roots.
+    const bool anyCandidate = std::any_of(files.begin(), files.end(), [](const GWZipFilePtr& file) {
+        if (!file) {
+            return false;
+        }
+        const std::string& name = file->name();
+        return name == kAppleDoubleFolderName || name == kResourceForkFolderNames[0] ||
+               name == kResourceForkFolderNames[1] ||
+               (!name.empty() && name.back() == 'r' && isMarkedResourceFork(*file));
+    });
+    if (!anyCandidate) {
+        if (isCancelled()) {
+            return GWFail(error, cancelledError());
+        }
+        return true;
+    }
     GWZipEntryList roots(files);
     GWZipFilePtr appleDoubleFolder = roots.firstNamed(kAppleDoubleFolderName);
     GWZipFilePtr resourceForkFolder;

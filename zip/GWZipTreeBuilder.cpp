@@ -15,15 +15,14 @@ GWZipFilePtr GWZipTreeBuilder::childNamed(const GWZipFilePtr& parent, std::strin
     return found == children_.end() ? nullptr : found->second.list.firstNamed(name);
 }
 
-void GWZipTreeBuilder::addChild(const GWZipFilePtr& parent, const GWZipFilePtr& child) {
+GWZipFilePtr GWZipTreeBuilder::addChild(const GWZipFilePtr& parent, const GWZipFilePtr& child) {
     child->setParent(parent);
     if (!parent) {
-        roots_.append(child);
-        return;
+        return roots_.append(child);
     }
     auto& children = children_[parent.get()];
     children.owner = parent;
-    children.list.append(child);
+    return children.list.append(child);
 }
 
 void GWZipTreeBuilder::removeChild(const GWZipFilePtr& parent, const GWZipFilePtr& child) {

@@ -22,8 +22,9 @@ public:
 
     GWZipFilePtr childNamed(const GWZipFilePtr& parent, std::string_view name) const;
     // Appends to the parent's children, or to the roots without a parent, and
-    // sets the child's parent link.
-    void addChild(const GWZipFilePtr& parent, const GWZipFilePtr& child);
+    // sets the child's parent link. Returns the entry that was the first of
+    // the child's name there before.
+    GWZipFilePtr addChild(const GWZipFilePtr& parent, const GWZipFilePtr& child);
     void removeChild(const GWZipFilePtr& parent, const GWZipFilePtr& child);
     // Moves the children of `from` to `to`, re-parenting them.
     void moveChildren(const GWZipFilePtr& from, const GWZipFilePtr& to);
