@@ -1,0 +1,237 @@
+// Malformed and hostile archives: every broken structure is
+// GWFileReadCorruptFileError, never a crash, a hang or a huge allocation.
+
+#include <gtest/gtest.h>
+
+#include <functional>
+
+#include "support/TestSupport.h"
+#include "support/ZipBuilder.h"
+#include "support/ZipExtraFields.h"
+#include "zip/GWZipArchive.h"
+#include "zip/ZipTestSupport.h"
+
+namespace {
+
+using namespace gwtest;
+
+void put32(GWData& bytes, std::size_t at, std::uint32_t value) {
+    for (int i = 0; i < 4; ++i) {
+        bytes[at + i] = std::uint8_t(value >> (8 * i));
+    }
+}
+
+void put16(GWData& bytes, std::size_t at, std::uint16_t value) {
+    bytes[at] = std::uint8_t(value);
+    bytes[at + 1] = std::uint8_t(value >> 8);
+}
+
+std::size_t find(const GWData& bytes, std::initializer_list<std::uint8_t> pattern) {
+    auto at = std::search(bytes.begin(), bytes.end(), pattern.begin(), pattern.end());
+    return std::size_t(at - bytes.begin());
+}
+
+// Two plain entries; the mutations below break one structure each.
+GWData sampleArchive() {
+    ZipBuilder zip;
+    zip.addFile("one.txt", bytesOf("first entry"));
+    zip.addFile("dir/two.txt", textBytes(400, 7), 8);
+    return zip.bytes();
+}
+
+struct HostileCase {
+    const char* name;
+    std::function<GWData()> bytes;
+};
+
+class GWZipArchiveHostile : public ::testing::TestWithParam<HostileCase> {};
+
+TEST_P(GWZipArchiveHostile, FailsWithCorruptFileError) {
+    TemporaryDirectory directory;
+    writeFile(directory.file("bad.zip"), GetParam().bytes());
+    GWErrorPtr error;
+    ZipLogCapture log;
+    auto archive = GWZipArchive::initWithURL(directory.url("bad.zip"), &error);
+    EXPECT_FALSE(archive);
+    ASSERT_TRUE(error);
+    EXPECT_EQ(error->domain(), kGWCocoaErrorDomain);
+    EXPECT_EQ(error->code(), GWFileReadCorruptFileError) << error->localizedDescription();
+}
+
+const HostileCase kHostileCases[] = {
+    {"Empty", [] { return GWData(); }},
+    {"NoLocalHeaderOnlyAnEndRecord",
+     [] {
+         ZipBuilder zip;
+         return zip.bytes();
+     }},
+    {"ShorterThanAnEndRecord", [] { return GWData{'P', 'K', 3, 4, 0, 0, 0}; }},
+    {"EndRecordMissing",
+     [] {
+         GWData bytes = sampleArchive();
+         bytes.resize(bytes.size() - 22);
+         return bytes;
+     }},
+    {"EndRecordSignatureOnlyNearTheEnd",
+     [] {
+         GWData bytes = sampleArchive();
+         bytes.resize(bytes.size() - 4);
+         return bytes;
+     }},
+    {"CentralSignatureBroken",
+     [] {
+         GWData bytes = sampleArchive();
+         bytes[find(bytes, {'P', 'K', 1, 2}) + 3] = 9;
+         return bytes;
+     }},
+    {"MoreEntriesThanTheDirectoryHolds",
+     [] {
+         ZipBuilder zip;
+         zip.addFile("a", bytesOf("x"));
+         zip.endRecordEntryCount = 0xFFF0;
+         return zip.bytes();
+     }},
+    {"Zip64CountOfBillions",
+     [] {
+         GWData bytes = [] {
+             ZipBuilder zip;
+             zip.addFile("a", bytesOf("x"));
+             zip.zip64EndRecord = true;
+             return zip.bytes();
+         }();
+         const std::size_t record = find(bytes, {'P', 'K', 6, 6});
+         put32(bytes, record + 24, 0xFFFFFFFF);
+         put32(bytes, record + 28, 0x0FFFFFFF);
+         put32(bytes, record + 32, 0xFFFFFFFF);
+         put32(bytes, record + 36, 0x0FFFFFFF);
+         return bytes;
+     }},
+    {"DirectoryOffsetPastTheEnd",
+     [] {
+         ZipBuilder zip;
+         zip.addFile("a", bytesOf("x"));
+         zip.endRecordCentralDirectoryOffset = 0x7FFFFFFF;
+         return zip.bytes();
+     }},
+    {"Zip64OffsetWithoutLocator",
+     [] {
+         ZipBuilder zip;
+         zip.addFile("a", bytesOf("x"));
+         zip.endRecordCentralDirectoryOffset = 0xFFFFFFFF;
+         return zip.bytes();
+     }},
+    {"Zip64LocatorPointsPastItself",
+     [] {
+         ZipBuilder zip;
+         zip.addFile("a", bytesOf("x"));
+         zip.zip64EndRecord = true;
+         GWData bytes = zip.bytes();
+         const std::size_t locator = find(bytes, {'P', 'K', 6, 7});
+         put32(bytes, locator + 8, 0x7FFFFFF0);
+         return bytes;
+     }},
+    {"Zip64RecordSignatureBroken",
+     [] {
+         ZipBuilder zip;
+         zip.addFile("a", bytesOf("x"));
+         zip.zip64EndRecord = true;
+         GWData bytes = zip.bytes();
+         bytes[find(bytes, {'P', 'K', 6, 6}) + 2] = 0;
+         return bytes;
+     }},
+    {"LocalHeaderOffsetPastTheEnd",
+     [] {
+         ZipBuilder zip;
+         zip.addFile("a", bytesOf("x"));
+         zip.addFile("b", bytesOf("y")).centralLocalHeaderOffset = 0x7FFFFFFF;
+         return zip.bytes();
+     }},
+    {"LocalHeaderOffsetIntoData",
+     [] {
+         ZipBuilder zip;
+         zip.addFile("a", bytesOf("some data that is not a header"));
+         zip.addFile("b", bytesOf("y")).centralLocalHeaderOffset = 40;
+         return zip.bytes();
+     }},
+    {"LocalNameRunsPastTheFile",
+     [] {
+         GWData bytes = sampleArchive();
+         put16(bytes, find(bytes, {'P', 'K', 3, 4}) + 26, 0xFFFF);
+         return bytes;
+     }},
+    {"CentralNameRunsPastTheDirectory",
+     [] {
+         GWData bytes = sampleArchive();
+         put16(bytes, find(bytes, {'P', 'K', 1, 2}) + 28, 0xFFFF);
+         return bytes;
+     }},
+    {"CentralExtraRunsPastTheDirectory",
+     [] {
+         GWData bytes = sampleArchive();
+         put16(bytes, find(bytes, {'P', 'K', 1, 2}) + 30, 0xFFF0);
+         return bytes;
+     }},
+    {"NameNoEncodingDecodes",
+     [] {
+         ZipBuilder zip;
+         ZipEntry entry;
+         // 0x81 is undefined in Windows-1252, -1250, -1253 and -1254, 0x98
+         // in -1251, and a lone 0xA0 (after the pair 81 98) in Shift JIS.
+         entry.name = GWData{0x81, 0x98, 0xA0};
+         entry.host = kZipHostMSDOS;
+         zip.add(entry);
+         return zip.bytes();
+     }},
+};
+
+INSTANTIATE_TEST_SUITE_P(Mutations, GWZipArchiveHostile, ::testing::ValuesIn(kHostileCases),
+                         [](const auto& info) { return std::string(info.param.name); });
+
+TEST(GWZipArchiveTruncation, EveryCutOfAnArchiveIsCorrupt) {
+    const GWData whole = sampleArchive();
+    TemporaryDirectory directory;
+    ZipLogCapture log;
+    for (std::size_t length = 0; length < whole.size(); ++length) {
+        writeFile(directory.file("cut.zip"), GWData(whole.begin(), whole.begin() + length));
+        GWErrorPtr error;
+        EXPECT_FALSE(GWZipArchive::initWithURL(directory.url("cut.zip"), &error)) << length;
+        ASSERT_TRUE(error) << length;
+        EXPECT_TRUE(error->is(kGWCocoaErrorDomain, GWFileReadCorruptFileError))
+            << length << ": " << error->localizedDescription();
+    }
+}
+
+TEST(GWZipArchiveTruncation, MissingFilesAndRefusedURLsReportTheirOwnErrors) {
+    TemporaryDirectory directory;
+    GWErrorPtr error;
+    EXPECT_FALSE(GWZipArchive::initWithURL(directory.url("absent.zip"), &error));
+    ASSERT_TRUE(error);
+    EXPECT_EQ(error->domain(), kGWPOSIXErrorDomain);
+    EXPECT_EQ(error->code(), ENOENT);
+
+    error = nullptr;
+    EXPECT_FALSE(GWZipArchive::initWithURL(GWURL(), &error));
+    ASSERT_TRUE(error);
+    EXPECT_TRUE(error->is(kGWCocoaErrorDomain, GWFileReadUnsupportedSchemeError));
+}
+
+TEST(GWZipArchiveTruncation, RecordsThatFailAreLogged) {
+    TemporaryDirectory directory;
+    GWData bytes = sampleArchive();
+    bytes[find(bytes, {'P', 'K', 1, 2}) + 3] = 9;
+    writeFile(directory.file("bad.zip"), bytes);
+    ZipLogCapture log;
+    EXPECT_FALSE(GWZipArchive::initWithURL(directory.url("bad.zip"), nullptr));
+    EXPECT_TRUE(log.contains("Couldn't read central directory record!"));
+
+    ZipBuilder zip64;
+    zip64.addFile("a", bytesOf("x"));
+    zip64.zip64EndRecord = true;
+    GWData broken = zip64.bytes();
+    broken[find(broken, {'P', 'K', 6, 6}) + 2] = 0;
+    writeFile(directory.file("zip64.zip"), broken);
+    EXPECT_FALSE(GWZipArchive::initWithURL(directory.url("zip64.zip"), nullptr));
+    EXPECT_TRUE(log.contains("error parsing Zip64 end of central dir record"));
+}
+
+}  // namespace
