@@ -1,0 +1,179 @@
+// Recognising ZIP archives and self-extracting executables, and opening
+// archives that follow a stub.
+
+#include <gtest/gtest.h>
+
+#include <cstring>
+
+#include "support/TestSupport.h"
+#include "support/ZipBuilder.h"
+#include "zip/GWZipArchive.h"
+
+namespace {
+
+using namespace gwtest;
+
+constexpr std::size_t kPEHeader = 0x80;
+constexpr std::size_t kSectionTable = kPEHeader + 0xF8;
+
+struct Section {
+    std::string name;
+    std::uint32_t rawOffset;
+    std::uint32_t rawSize;
+};
+
+void put32(GWData& bytes, std::size_t at, std::uint32_t value) {
+    for (int i = 0; i < 4; ++i) {
+        bytes[at + i] = std::uint8_t(value >> (8 * i));
+    }
+}
+
+// An MS-DOS header, a stub, a PE (or other) signature and section headers;
+// the image is padded to `size` bytes.
+GWData executable(const std::string& stub, const std::vector<Section>& sections,
+                  std::size_t size = 0x1000, const char* signature = "PE\0\0") {
+    GWData bytes(size, 0);
+    bytes[0] = 'M';
+    bytes[1] = 'Z';
+    bytes[8] = 4;  // header paragraphs: the stub starts at 64
+    put32(bytes, 0x3C, kPEHeader);
+    std::memcpy(bytes.data() + 64, stub.data(), std::min<std::size_t>(stub.size(), 64));
+    std::memcpy(bytes.data() + kPEHeader, signature, 4);
+    for (std::size_t i = 0; i < sections.size(); ++i) {
+        const std::size_t header = kSectionTable + 40 * i;
+        std::memcpy(bytes.data() + header, sections[i].name.data(),
+                    std::min<std::size_t>(sections[i].name.size(), 8));
+        put32(bytes, header + 16, sections[i].rawSize);
+        put32(bytes, header + 20, sections[i].rawOffset);
+    }
+    return bytes;
+}
+
+GWData smallZip() {
+    ZipBuilder zip;
+    zip.addFile("inside.txt", bytesOf("packed"));
+    return zip.bytes();
+}
+
+// Trailing bytes that push the ZIP's end record out of the fallback's reach,
+// so only the marker being tested can answer yes.
+GWData farFromTheEnd(GWData bytes) {
+    bytes.insert(bytes.end(), 70000, 0);
+    return bytes;
+}
+
+GWData withZipAt(GWData image, std::size_t offset) {
+    image.resize(offset);
+    const GWData zip = smallZip();
+    image.insert(image.end(), zip.begin(), zip.end());
+    return image;
+}
+
+class GWZipSelfExtracting : public ::testing::Test {
+protected:
+    bool isSelfExtracting(const GWData& bytes) {
+        writeFile(directory.file("setup.exe"), bytes);
+        return GWZipArchive::isSelfExtractingZipArchiveAtURL(directory.url("setup.exe"));
+    }
+    bool isZip(const GWData& bytes) {
+        writeFile(directory.file("file"), bytes);
+        return GWZipArchive::isZipArchiveAtURL(directory.url("file"));
+    }
+
+    TemporaryDirectory directory;
+};
+
+TEST_F(GWZipSelfExtracting, APKSFXStubIsEnoughWithoutAPEImage) {
+    EXPECT_TRUE(isSelfExtracting(executable("PKSFX ready", {}, 0x400, "NE\0\0")));
+    // Only the 32 bytes at the stub's start are searched.
+    EXPECT_FALSE(isSelfExtracting(executable(std::string(40, ' ') + "PKSFX", {}, 0x400, "NE\0\0")));
+}
+
+TEST_F(GWZipSelfExtracting, ALocalHeaderAfterTheRelocationsIsAccepted) {
+    const GWData image = executable("stub", {{".text", 0x400, 0x200}, {".reloc", 0x600, 0x100}});
+    EXPECT_TRUE(isSelfExtracting(farFromTheEnd(withZipAt(image, 0x700 + 0x20))));
+    EXPECT_FALSE(isSelfExtracting(farFromTheEnd(withZipAt(image, 0x700 + 0x200))));
+}
+
+TEST_F(GWZipSelfExtracting, WinZipAndPackedSectionsAreAccepted) {
+    EXPECT_TRUE(isSelfExtracting(
+        farFromTheEnd(executable("stub", {{".text", 0x400, 0x200}, {"_winzip_", 0x600, 0x10}}))));
+    for (const char* packed : {"UPX0", "PEC2", "UPX2"}) {
+        SCOPED_TRACE(packed);
+        const GWData image = executable("stub", {{packed, 0x400, 0x300}});
+        EXPECT_TRUE(isSelfExtracting(farFromTheEnd(withZipAt(image, 0x700))));
+        EXPECT_FALSE(isSelfExtracting(farFromTheEnd(withZipAt(image, 0x704))));
+    }
+    const GWData imports = executable("stub", {{".idata", 0x400, 0x100}});
+    EXPECT_TRUE(isSelfExtracting(farFromTheEnd(withZipAt(imports, 0x500))));
+}
+
+TEST_F(GWZipSelfExtracting, TheFallbackLooksForAnEndRecordNearTheEnd) {
+    const GWData plain = executable("stub", {{".text", 0x400, 0x200}});
+    EXPECT_TRUE(isSelfExtracting(withZipAt(plain, 0x600)));
+    EXPECT_FALSE(isSelfExtracting(farFromTheEnd(withZipAt(plain, 0x600))));
+    EXPECT_FALSE(isSelfExtracting(plain));
+    // Not a PE image: straight to the fallback.
+    EXPECT_TRUE(isSelfExtracting(withZipAt(executable("stub", {}, 0x400, "NE\0\0"), 0x400)));
+    // .idata without a ZIP after it falls back too.
+    EXPECT_TRUE(isSelfExtracting(withZipAt(executable("stub", {{".idata", 0x400, 0x10}}), 0x600)));
+}
+
+TEST_F(GWZipSelfExtracting, ShortOrForeignFilesAreRejected) {
+    GWData shortExecutable = executable("PKSFX", {}, 0x400);
+    shortExecutable.resize(63);
+    EXPECT_FALSE(isSelfExtracting(shortExecutable));
+    EXPECT_FALSE(isSelfExtracting(smallZip()));
+    EXPECT_FALSE(isSelfExtracting({}));
+    EXPECT_FALSE(GWZipArchive::isSelfExtractingZipArchiveAtURL(directory.url("absent.exe")));
+    EXPECT_FALSE(GWZipArchive::isSelfExtractingZipArchiveAtURL(
+        *GWURL::URLWithString("https://example.invalid/setup.exe")));
+}
+
+TEST_F(GWZipSelfExtracting, IsZipArchiveAcceptsZipsExecutablesAndTrailingEndRecords) {
+    EXPECT_TRUE(isZip(smallZip()));
+    EXPECT_TRUE(isZip(executable("PKSFX", {}, 0x400)));
+    GWData prefixed = randomBytes(5000, 1);
+    prefixed[0] = 'X';
+    const GWData zip = smallZip();
+    prefixed.insert(prefixed.end(), zip.begin(), zip.end());
+    EXPECT_TRUE(isZip(prefixed));
+
+    ZipBuilder commented;
+    commented.prefix = bytesOf("XXXX");
+    commented.addFile("a", bytesOf("x"));
+    commented.archiveComment = GWData(600, 'c');
+    EXPECT_FALSE(isZip(commented.bytes()));
+    EXPECT_FALSE(isZip(bytesOf("PK\x03")));
+    EXPECT_FALSE(isZip(textBytes(3000, 2)));
+    EXPECT_FALSE(GWZipArchive::isZipArchiveAtURL(directory.url("absent.zip")));
+}
+
+TEST_F(GWZipSelfExtracting, ArchivesBehindAStubOpenWithTheirStartOffset) {
+    GWData stub = executable("stub", {{".text", 0x200, 0x100}}, 1000);
+    GWData bytes = stub;
+    const GWData zip = smallZip();
+    bytes.insert(bytes.end(), zip.begin(), zip.end());
+    writeFile(directory.file("sfx.exe"), bytes);
+    GWErrorPtr error;
+    auto archive = GWZipArchive::initWithURL(directory.url("sfx.exe"), &error);
+    ASSERT_TRUE(archive) << error->localizedDescription();
+    EXPECT_EQ(archive->startOffset(), 1000u);
+    ASSERT_EQ(archive->files().size(), 1u);
+    EXPECT_EQ(archive->files()[0]->localHeaderOffset(), 0u);
+
+    if (!toolAvailable("zip")) {
+        GTEST_SKIP() << "zip is not installed";
+    }
+    // zip -A adds the stub's length to every offset.
+    writeFile(directory.file("adjusted.exe"), bytes);
+    ASSERT_EQ(runCommand("zip -qA " + shellQuote(directory.file("adjusted.exe"))).status, 0);
+    auto adjusted = GWZipArchive::initWithURL(directory.url("adjusted.exe"), &error);
+    ASSERT_TRUE(adjusted) << error->localizedDescription();
+    EXPECT_EQ(adjusted->startOffset(), 0u);
+    ASSERT_EQ(adjusted->files().size(), 1u);
+    EXPECT_EQ(adjusted->files()[0]->localHeaderOffset(), 1000u);
+    EXPECT_EQ(adjusted->files()[0]->storedUncompressedSize(), 6u);
+}
+
+}  // namespace
