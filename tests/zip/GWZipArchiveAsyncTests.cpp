@@ -1,0 +1,164 @@
+// The asynchronous initialiser: returns at once, loads on the loading queue,
+// reports there, and can be cancelled through the operation it hands back.
+
+#include <gtest/gtest.h>
+
+#include <atomic>
+#include <chrono>
+#include <future>
+
+#include "foundation/GWOperationQueue.h"
+#include "support/TestSupport.h"
+#include "support/ZipBuilder.h"
+#include "zip/GWZipArchive.h"
+
+namespace {
+
+using namespace gwtest;
+
+class GWZipArchiveAsync : public ::testing::Test {
+protected:
+    void SetUp() override {
+        ZipBuilder zip;
+        zip.addFile("a.txt", bytesOf("alpha"));
+        zip.addFile("b/c.txt", bytesOf("gamma"));
+        zip.write(directory.file("async.zip"));
+        queue->setMaxConcurrentOperationCount(1);
+    }
+
+    struct Outcome {
+        GWErrorPtr error;
+        std::size_t filesSeen = 0;
+        bool ranOnQueue = false;
+    };
+
+    GWZipArchive::CompletionHandler handler(const GWZipArchivePtr* archive) {
+        return [this, archive](const GWErrorPtr& error) {
+            Outcome outcome;
+            outcome.error = error;
+            outcome.filesSeen = *archive ? (*archive)->files().size() : 0;
+            // The handler is itself one of the loading queue's operations.
+            outcome.ranOnQueue = queue->operationCount() > 0;
+            done.set_value(outcome);
+        };
+    }
+
+    Outcome wait() {
+        auto future = done.get_future();
+        EXPECT_EQ(future.wait_for(std::chrono::seconds(20)), std::future_status::ready);
+        return future.get();
+    }
+
+    TemporaryDirectory directory;
+    GWOperationQueuePtr queue = std::make_shared<GWOperationQueue>();
+    std::promise<Outcome> done;
+};
+
+TEST_F(GWZipArchiveAsync, ReturnsAtOnceAndSetsFilesBeforeTheHandlerRuns) {
+    queue->setSuspended(true);
+    GWZipArchivePtr archive;
+    GWZipLoadOperationPtr operation;
+    archive =
+        GWZipArchive::initWithURL(directory.url("async.zip"), queue, &operation, handler(&archive));
+    ASSERT_TRUE(archive);
+    ASSERT_TRUE(operation);
+    EXPECT_TRUE(archive->files().empty());
+    EXPECT_FALSE(operation->isFinished());
+    queue->setSuspended(false);
+    const Outcome outcome = wait();
+    EXPECT_FALSE(outcome.error);
+    EXPECT_EQ(outcome.filesSeen, 2u);
+    EXPECT_TRUE(outcome.ranOnQueue);
+    EXPECT_EQ(archive->fileWithPath("b/c.txt")->storedUncompressedSize(), 5u);
+}
+
+TEST_F(GWZipArchiveAsync, CancellingTheOperationReportsCancellation) {
+    queue->setSuspended(true);
+    GWZipArchivePtr archive;
+    GWZipLoadOperationPtr operation;
+    archive =
+        GWZipArchive::initWithURL(directory.url("async.zip"), queue, &operation, handler(&archive));
+    ASSERT_TRUE(operation);
+    operation->cancel();
+    queue->setSuspended(false);
+    const Outcome outcome = wait();
+    ASSERT_TRUE(outcome.error);
+    EXPECT_TRUE(outcome.error->is(kGWCocoaErrorDomain, GWUserCancelledError));
+    EXPECT_EQ(outcome.filesSeen, 0u);
+    EXPECT_TRUE(outcome.ranOnQueue);
+}
+
+TEST_F(GWZipArchiveAsync, LoadFailuresAndRefusedURLsReachTheHandler) {
+    queue->setSuspended(true);
+    GWZipArchivePtr archive;
+    archive =
+        GWZipArchive::initWithURL(directory.url("absent.zip"), queue, nullptr, handler(&archive));
+    EXPECT_TRUE(archive);
+    queue->setSuspended(false);
+    const Outcome outcome = wait();
+    ASSERT_TRUE(outcome.error);
+    EXPECT_EQ(outcome.error->code(), ENOENT);
+
+    std::promise<GWErrorPtr> refused;
+    GWZipLoadOperationPtr operation;
+    EXPECT_FALSE(GWZipArchive::initWithURL(
+        GWURL(), queue, &operation, [&](const GWErrorPtr& error) { refused.set_value(error); }));
+    EXPECT_FALSE(operation);
+    auto future = refused.get_future();
+    ASSERT_EQ(future.wait_for(std::chrono::seconds(20)), std::future_status::ready);
+    EXPECT_TRUE(future.get());
+}
+
+TEST_F(GWZipArchiveAsync, WithoutAHandlerOrQueueTheArchiveStillLoads) {
+    GWZipLoadOperationPtr operation;
+    auto archive =
+        GWZipArchive::initWithURL(directory.url("async.zip"), nullptr, &operation, nullptr);
+    ASSERT_TRUE(archive);
+    ASSERT_TRUE(operation);
+    operation->waitUntilFinished();
+    EXPECT_EQ(archive->files().size(), 2u);
+}
+
+TEST(GWZipLoadOperationCancel, ACancelledLoadStopsInTheSearch) {
+    TemporaryDirectory directory;
+    ZipBuilder zip;
+    zip.addFile("a", bytesOf("x"));
+    zip.write(directory.file("a.zip"));
+    auto operation = GWZipLoadOperation::initWithURL(directory.url("a.zip"));
+    operation->cancel();
+    operation->main();
+    ASSERT_TRUE(operation->error());
+    EXPECT_TRUE(operation->error()->is(kGWCocoaErrorDomain, GWUserCancelledError));
+    EXPECT_FALSE(operation->files());
+    EXPECT_EQ(operation->compressedSize(), 0u);
+}
+
+TEST(GWZipLoadOperationCancel, SearchFindsPatternsAcrossChunksAndHonoursItsRange) {
+    TemporaryDirectory directory;
+    GWData bytes(40000, 'x');
+    const std::size_t at = 16384 - 2;  // split between the first two reads
+    bytes[at] = 'P';
+    bytes[at + 1] = 'K';
+    bytes[at + 2] = 3;
+    bytes[at + 3] = 4;
+    writeFile(directory.file("data"), bytes);
+    auto file = GWRemoteFileHandle::initForReadingFromURL(directory.url("data"), nullptr);
+    ASSERT_TRUE(file);
+    const std::uint8_t pattern[] = {'P', 'K', 3, 4};
+    std::uint64_t found = 0;
+    GWErrorPtr error;
+    ASSERT_TRUE(
+        GWZipLoadOperation::searchForData(pattern, *file, 0, UINT64_MAX, &found, nullptr, &error));
+    EXPECT_EQ(found, at);
+    ASSERT_TRUE(
+        GWZipLoadOperation::searchForData(pattern, *file, at + 1, 1000, &found, nullptr, &error));
+    EXPECT_EQ(found, GWZipLoadOperation::kNotFound);
+    ASSERT_TRUE(
+        GWZipLoadOperation::searchForData(pattern, *file, 0, at + 3, &found, nullptr, &error));
+    EXPECT_EQ(found, GWZipLoadOperation::kNotFound);
+    EXPECT_FALSE(GWZipLoadOperation::searchForData(
+        pattern, *file, 0, UINT64_MAX, &found, [] { return true; }, &error));
+    EXPECT_TRUE(error->is(kGWCocoaErrorDomain, GWUserCancelledError));
+}
+
+}  // namespace
