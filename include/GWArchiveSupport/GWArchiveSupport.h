@@ -7,6 +7,7 @@
 #include "GWXARDataReference.h"
 #include "GWXARExtractOperation.h"
 #include "GWXARFile.h"
+#include "GWXARSignature.h"
 #include "GWZipArchive.h"
 #include "GWZipFile.h"
 #include "GWZipLoadOperation.h"
