@@ -14,6 +14,7 @@
 
 #include "GWXARDataReference.h"
 #include "GWXARFile.h"
+#include "GWXARSignature.h"
 #include "foundation/GWError.h"
 #include "foundation/GWOperation.h"
 #include "foundation/GWRemoteFileHandle.h"
@@ -164,6 +165,36 @@ public:
     std::optional<std::string> textContentOfElement(const pugi::xml_node& element,
                                                     GWErrorPtr* error);
 
+    // --- Signatures (GWXARLoadOperationSignatures.cpp) ------------------------
+
+    // The digest of the stored table of contents, which every signature signs:
+    // the bytes computedTOCChecksum() returns.
+    const GWData& tocChecksum() const { return computedTOCChecksum_; }
+    void setTOCChecksum(GWData checksum) { computedTOCChecksum_ = std::move(checksum); }
+    // None until the signatures were loaded; empty for an unsigned archive.
+    const std::optional<GWXARSignatureArray>& signatures() const { return signatures_; }
+
+    // Loads the TOC's "signature" elements, then its "x-signature" elements,
+    // with their bytes from the heap. On failure `signatures` keeps its value.
+    bool loadSignaturesWithTOC(const pugi::xml_node& toc, GWErrorPtr* error);
+    // The certificates of a "KeyInfo" element's "X509Data" children, in order.
+    std::optional<GWCertificateArray> certificatesFromKeyInfo(const pugi::xml_node& keyInfo,
+                                                              GWErrorPtr* error);
+    // Loads the signatures and checks each, in order, over `tocChecksum`; true
+    // also when there are none. `checksumAlgorithm` is the header's GWChecksum
+    // number: with none, a signed archive is false without an error object.
+    bool verifySignaturesWithTOC(const pugi::xml_node& toc, int checksumAlgorithm,
+                                 GWErrorPtr* error);
+    // Whether the certificates (leaf first) lead to a trusted root.
+    bool canTrustSignature(const GWXARSignature& signature, GWErrorPtr* error);
+    bool validateData(const GWData& data, const GWXARSignature& signature, GWErrorPtr* error);
+    // RSA, DSA and ECDSA: `data` is the signed digest itself.
+    bool validateDataWithTypicalSignature(const GWData& data, const GWXARSignature& signature,
+                                          GWErrorPtr* error);
+    // The content checked is always `tocChecksum`, which is what `data` holds.
+    bool validateDataWithCMSSignature(const GWData& data, const GWXARSignature& signature,
+                                      GWErrorPtr* error);
+
     // --- Errors (GWXARLoadOperation.cpp) --------------------------------------
 
     // An error for the archive's URL with the entity and the node (as its XML
@@ -189,6 +220,7 @@ private:
     std::optional<GWURL> archiveURL_;
     std::shared_ptr<GWRemoteFileHandle> fileHandle_;
     std::uint64_t heapStart_ = 0;
+    std::optional<GWXARSignatureArray> signatures_;
 
     std::optional<GWXARFileArray> files_;
     GWXARSubdocuments subdocuments_;
