@@ -136,6 +136,13 @@ std::string XarBuilder::dataElement(const std::string& tag, const GWData& conten
     return xml;
 }
 
+GWData XarBuilder::tocChecksum() const {
+    const std::string document = tocDocument();
+    const GWData plain(document.begin(), document.end());
+    const GWData stored = compressTOC ? xarEncode(plain, XarEncoding::gzip) : plain;
+    return digestLength() > 0 ? GWChecksum::checksumForData(stored, digestAlgorithm_) : GWData();
+}
+
 GWData XarBuilder::bytes() const {
     const std::string document = tocDocument();
     const GWData plain(document.begin(), document.end());

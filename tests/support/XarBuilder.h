@@ -30,11 +30,14 @@ public:
 
     // The "file" elements (and anything else) inside <toc>, after the checksum element.
     void setFiles(std::string tocBody) { tocBody_ = std::move(tocBody); }
+    const std::string& files() const { return tocBody_; }
     // Replaces the whole generated document: written exactly as given.
     void setTOCDocument(std::string document) { document_ = std::move(document); }
     // The document as it will be stored (before compression).
     std::string tocDocument() const;
 
+    // The offset from the heap's start that the next addHeapBytes will return.
+    std::uint64_t nextHeapOffset() const { return digestLength() + heap_.size(); }
     // Appends bytes to the heap and returns their offset from the heap's start.
     std::uint64_t addHeapBytes(const GWData& bytes);
     // Appends `content` encoded as asked and returns a "data"-like element
@@ -59,6 +62,9 @@ public:
 
     // Length of the digest at the heap's start (0 without one).
     std::size_t digestLength() const;
+    // The digest of the stored table of contents as it stands, which is what
+    // signatures sign (uncorrupted, whatever corruptStoredChecksum says).
+    GWData tocChecksum() const;
     GWData bytes() const;
     void write(const std::string& path) const;
 
