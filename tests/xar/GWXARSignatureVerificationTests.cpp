@@ -1,0 +1,387 @@
+#include <gtest/gtest.h>
+
+#include <cstdlib>
+#include <optional>
+
+#include <openssl/x509_vfy.h>
+
+#include "GWArchiveSupport/GWArchiveConstants.h"
+#include "XarSignatureTestSupport.h"
+#include "foundation/GWChecksum.h"
+
+namespace {
+
+using gwtest::affectedNode;
+using gwtest::bytesOf;
+using gwtest::SignedTOCFixture;
+using gwtest::TOCSignature;
+using gwtest::unknownEntity;
+using gwtest::XarKeyType;
+using gwtest::XarSigning;
+
+class GWXARSignatureVerification : public ::testing::Test {
+protected:
+    void SetUp() override {
+        ASSERT_TRUE(signing().ok()) << signing().problem();
+        trust_.emplace(signing().rootCertificateFile());
+    }
+
+    static XarSigning& signing() { return gwtest::sharedSigning(); }
+
+    // A signature of `style` by the leaf of `type` over `checksum`, carrying its chain.
+    static TOCSignature signedBy(const std::string& style, XarKeyType type,
+                                 const GWData& checksum) {
+        const auto& identity = signing().leaf(type);
+        return {style, signing().sign(style, identity, checksum),
+                XarSigning::keyInfoElement(identity.chain)};
+    }
+
+    static void expectXARError(const GWErrorPtr& error, long code) {
+        ASSERT_TRUE(error);
+        EXPECT_EQ(error->domain(), kGWXARArchiveErrorDomain) << error->localizedDescription();
+        EXPECT_EQ(error->code(), code) << error->localizedDescription();
+    }
+
+    const GWData checksum_ =
+        GWChecksum::checksumForData(bytesOf("a table of contents"), GWChecksumAlgorithmSHA1);
+    std::optional<gwtest::TrustedRootScope> trust_;
+};
+
+TEST_F(GWXARSignatureVerification, RawSignaturesOfEveryKeyTypeVerify) {
+    const std::pair<std::string, XarKeyType> cases[] = {
+        {"RSA", XarKeyType::rsa}, {"DSA", XarKeyType::dsa}, {"ECDSA", XarKeyType::ecdsa}};
+    for (const auto& [style, type] : cases) {
+        const TOCSignature signature = signedBy(style, type, checksum_);
+        SignedTOCFixture fixture({signature}, checksum_);
+        GWErrorPtr error;
+        EXPECT_TRUE(fixture.verify(&error)) << style << ": " << gwtest::unknownEntity(error)
+                                            << (error ? error->localizedDescription() : "");
+        ASSERT_TRUE(fixture.operation().signatures());
+        ASSERT_EQ(fixture.operation().signatures()->size(), 1u);
+        const auto& loaded = *fixture.operation().signatures()->front();
+        EXPECT_EQ(loaded.signatureData(), signature.bytes) << style;
+        EXPECT_FALSE(loaded.isExtended());
+        EXPECT_EQ(loaded.certificateCommonNames(), signing().leaf(type).commonNames);
+    }
+}
+
+TEST_F(GWXARSignatureVerification, CMSSignatureVerifies) {
+    SignedTOCFixture fixture({signedBy("CMS", XarKeyType::rsa, checksum_)}, checksum_);
+    GWErrorPtr error;
+    EXPECT_TRUE(fixture.verify(&error)) << (error ? error->localizedDescription() : "");
+    EXPECT_EQ(fixture.operation().signatures()->front()->type(), GWXARSignatureTypeCMS);
+}
+
+TEST_F(GWXARSignatureVerification, MD5ChecksumsAreSignedAsMD5Digests) {
+    const GWData md5 = GWChecksum::checksumForData(bytesOf("toc"), GWChecksumAlgorithmMD5);
+    for (const auto& [style, type] :
+         {std::pair{"RSA", XarKeyType::rsa}, std::pair{"ECDSA", XarKeyType::ecdsa},
+          std::pair{"CMS", XarKeyType::ecdsa}}) {
+        SignedTOCFixture fixture({signedBy(style, type, md5)}, md5);
+        GWErrorPtr error;
+        EXPECT_TRUE(fixture.verify(&error, GWChecksumAlgorithmMD5))
+            << style << ": " << (error ? error->localizedDescription() : "");
+    }
+}
+
+TEST_F(GWXARSignatureVerification, AlteredSignatureBytesDoNotVerify) {
+    for (const auto& [style, type] :
+         {std::pair{"RSA", XarKeyType::rsa}, std::pair{"DSA", XarKeyType::dsa},
+          std::pair{"ECDSA", XarKeyType::ecdsa}, std::pair{"CMS", XarKeyType::rsa}}) {
+        TOCSignature signature = signedBy(style, type, checksum_);
+        ASSERT_FALSE(signature.bytes.empty());
+        // The last byte lies in the signature value for all four encodings.
+        signature.bytes.back() ^= 0x01;
+        SignedTOCFixture fixture({signature}, checksum_);
+        GWErrorPtr error;
+        EXPECT_FALSE(fixture.verify(&error)) << style;
+        expectXARError(error, GWXARArchiveInvalidSignatureError);
+        EXPECT_EQ(unknownEntity(error), "") << style;
+        EXPECT_EQ(affectedNode(error), "") << style;
+    }
+}
+
+TEST_F(GWXARSignatureVerification, SignaturesOverAnotherChecksumDoNotVerify) {
+    GWData other = checksum_;
+    other[7] ^= 0x80;
+    for (const auto& [style, type] :
+         {std::pair{"RSA", XarKeyType::rsa}, std::pair{"CMS", XarKeyType::rsa}}) {
+        SignedTOCFixture fixture({signedBy(style, type, other)}, checksum_);
+        GWErrorPtr error;
+        EXPECT_FALSE(fixture.verify(&error)) << style;
+        expectXARError(error, GWXARArchiveInvalidSignatureError);
+    }
+}
+
+TEST_F(GWXARSignatureVerification, CertificatesWithoutATrustedRootAreNotTrusted) {
+    const auto& selfSigned = signing().selfSignedLeaf();
+    ASSERT_TRUE(signing().ok()) << signing().problem();
+    SignedTOCFixture fixture({{"RSA", signing().signDigest(selfSigned, checksum_),
+                               XarSigning::keyInfoElement(selfSigned.chain)}},
+                             checksum_);
+    GWErrorPtr error;
+    EXPECT_FALSE(fixture.verify(&error));
+    expectXARError(error, GWXARArchiveUntrustedCertificateError);
+    EXPECT_EQ(unknownEntity(error), "");
+    EXPECT_EQ(affectedNode(error), "");
+    // Why the chain failed stays with the error.
+    ASSERT_TRUE(error->underlyingError());
+    EXPECT_EQ(error->underlyingError()->domain(), GWSecurityErrorDomain);
+    EXPECT_EQ(error->underlyingError()->code(), X509_V_ERR_DEPTH_ZERO_SELF_SIGNED_CERT);
+
+    // A chain that is sound but whose root the store does not hold.
+    trust_.reset();
+    gwtest::TrustedRootScope otherRoot(selfSigned.certificateFile);
+    SignedTOCFixture unanchored({signedBy("RSA", XarKeyType::rsa, checksum_)}, checksum_);
+    EXPECT_FALSE(unanchored.verify(&error));
+    expectXARError(error, GWXARArchiveUntrustedCertificateError);
+}
+
+TEST_F(GWXARSignatureVerification, TheIntermediateMustComeWithTheLeaf) {
+    const auto& identity = signing().leaf(XarKeyType::ecdsa);
+    SignedTOCFixture fixture({{"ECDSA", signing().signDigest(identity, checksum_),
+                               XarSigning::keyInfoElement({identity.chain.front()})}},
+                             checksum_);
+    GWErrorPtr error;
+    EXPECT_FALSE(fixture.verify(&error));
+    expectXARError(error, GWXARArchiveUntrustedCertificateError);
+}
+
+TEST_F(GWXARSignatureVerification, CMSSignerNotTrustedIsASecurityError) {
+    const auto& selfSigned = signing().selfSignedLeaf();
+    SignedTOCFixture fixture({{"CMS", signing().signCMS(selfSigned, checksum_),
+                               XarSigning::keyInfoElement(selfSigned.chain)}},
+                             checksum_);
+    {
+        // With the self-signed certificate as the root, KeyInfo and the signer are trusted.
+        gwtest::TrustedRootScope both(selfSigned.certificateFile);
+        GWErrorPtr error;
+        EXPECT_TRUE(fixture.verify(&error)) << (error ? error->localizedDescription() : "");
+    }
+
+    // KeyInfo names a trusted chain; the message's own signer is not trusted.
+    SignedTOCFixture mixed({{"CMS", signing().signCMS(selfSigned, checksum_),
+                             XarSigning::keyInfoElement(signing().leaf(XarKeyType::rsa).chain)}},
+                           checksum_);
+    GWErrorPtr error;
+    EXPECT_FALSE(mixed.verify(&error));
+    ASSERT_TRUE(error);
+    EXPECT_EQ(error->domain(), GWSecurityErrorDomain);
+    EXPECT_EQ(error->code(), X509_V_ERR_DEPTH_ZERO_SELF_SIGNED_CERT);
+    EXPECT_FALSE(error->URL());
+}
+
+TEST_F(GWXARSignatureVerification, CMSMessageWithoutSignersVerifies) {
+    const auto& identity = signing().leaf(XarKeyType::rsa);
+    SignedTOCFixture fixture({{"CMS", signing().certificatesOnlyCMS(identity),
+                               XarSigning::keyInfoElement(identity.chain)}},
+                             checksum_);
+    GWErrorPtr error;
+    EXPECT_TRUE(fixture.verify(&error)) << (error ? error->localizedDescription() : "");
+}
+
+TEST_F(GWXARSignatureVerification, CMSBytesThatAreNoMessageAreASecurityError) {
+    SignedTOCFixture fixture({{"CMS", bytesOf("not DER at all"),
+                               XarSigning::keyInfoElement(signing().leaf(XarKeyType::rsa).chain)}},
+                             checksum_);
+    GWErrorPtr error;
+    EXPECT_FALSE(fixture.verify(&error));
+    ASSERT_TRUE(error);
+    EXPECT_EQ(error->domain(), GWSecurityErrorDomain);
+    EXPECT_NE(error->code(), 0);
+}
+
+TEST_F(GWXARSignatureVerification, CertificateTextThatIsNoCertificate) {
+    const std::string text = gwtest::base64Encode(bytesOf("this is not a certificate"));
+    const std::string keyInfo =
+        "<KeyInfo><X509Data><X509Certificate>" + text + "</X509Certificate></X509Data></KeyInfo>";
+    SignedTOCFixture fixture({{"RSA", bytesOf("sig"), keyInfo}}, checksum_);
+    GWErrorPtr error;
+    EXPECT_FALSE(fixture.verify(&error));
+    expectXARError(error, GWXARArchiveUntrustedCertificateError);
+    EXPECT_EQ(unknownEntity(error), text);
+    EXPECT_EQ(affectedNode(error), "<X509Certificate>" + text + "</X509Certificate>");
+    EXPECT_FALSE(fixture.operation().signatures());
+
+    // A certificate followed by stray bytes is not a certificate either.
+    GWData padded = signing().leaf(XarKeyType::rsa).chain.front();
+    padded.push_back(0);
+    SignedTOCFixture trailing({{"RSA", bytesOf("sig"), XarSigning::keyInfoElement({padded})}},
+                              checksum_);
+    EXPECT_FALSE(trailing.verify(&error));
+    expectXARError(error, GWXARArchiveUntrustedCertificateError);
+}
+
+TEST_F(GWXARSignatureVerification, CertificateTextThatIsNoBase64) {
+    const std::string keyInfo =
+        "<KeyInfo><X509Data><X509Certificate>***</X509Certificate></X509Data></KeyInfo>";
+    SignedTOCFixture fixture({{"RSA", bytesOf("sig"), keyInfo}}, checksum_);
+    GWErrorPtr error;
+    EXPECT_FALSE(fixture.verify(&error));
+    ASSERT_TRUE(error);
+    EXPECT_TRUE(error->is(kGWCocoaErrorDomain, GWFileReadCorruptFileError));
+}
+
+TEST_F(GWXARSignatureVerification, SignaturesWithoutCertificates) {
+    const GWData bytes = signedBy("RSA", XarKeyType::rsa, checksum_).bytes;
+    // KeyInfo without X509Data loads, then fails the check; so does no KeyInfo at all.
+    for (const std::string& keyInfo :
+         {std::string("<KeyInfo><KeyName>k</KeyName></KeyInfo>"), std::string()}) {
+        SignedTOCFixture fixture({{"RSA", bytes, keyInfo}}, checksum_);
+        GWErrorPtr error;
+        ASSERT_TRUE(fixture.operation().loadSignaturesWithTOC(fixture.toc(), &error));
+        const auto& certificates = fixture.operation().signatures()->front()->certificates();
+        EXPECT_EQ(certificates.has_value(), !keyInfo.empty());
+        EXPECT_FALSE(fixture.verify(&error));
+        expectXARError(error, GWXARArchiveMissingCertificateError);
+        EXPECT_EQ(unknownEntity(error), "");
+        EXPECT_EQ(affectedNode(error), "");
+    }
+
+    // X509Data without a certificate fails the load and names the signature element.
+    SignedTOCFixture empty({{"RSA", bytes, "<KeyInfo><X509Data/></KeyInfo>"}}, checksum_);
+    GWErrorPtr error;
+    EXPECT_FALSE(empty.operation().loadSignaturesWithTOC(empty.toc(), &error));
+    expectXARError(error, GWXARArchiveMissingCertificateError);
+    EXPECT_EQ(affectedNode(error).rfind("<signature style=\"RSA\">", 0), 0u) << affectedNode(error);
+}
+
+TEST_F(GWXARSignatureVerification, StylesMapToTypesWhateverTheirCase) {
+    const std::pair<std::string, std::uint64_t> cases[] = {
+        {"SHA1withRSA", GWXARSignatureTypeRSA}, {"sha1WITHrsa", GWXARSignatureTypeRSA},
+        {"rsa", GWXARSignatureTypeRSA},         {"SHA1withDSA", GWXARSignatureTypeDSA},
+        {"DSA", GWXARSignatureTypeDSA},         {"SHA256withECDSA", GWXARSignatureTypeECDSA},
+        {"ecdsa", GWXARSignatureTypeECDSA},     {"Cms", GWXARSignatureTypeCMS},
+    };
+    for (const auto& [style, type] : cases) {
+        SignedTOCFixture fixture({{style, bytesOf("sig"), ""}}, checksum_);
+        GWErrorPtr error;
+        ASSERT_TRUE(fixture.operation().loadSignaturesWithTOC(fixture.toc(), &error)) << style;
+        EXPECT_EQ(fixture.operation().signatures()->front()->type(), type) << style;
+    }
+}
+
+TEST_F(GWXARSignatureVerification, UnknownStylesAreRefusedWithTheStyleAsWritten) {
+    for (const std::string style : {"SHA1withFOO", "CMSwithRSA ", "withrsa2", ""}) {
+        SignedTOCFixture fixture({{style, bytesOf("sig"), ""}}, checksum_);
+        GWErrorPtr error;
+        EXPECT_FALSE(fixture.verify(&error)) << style;
+        expectXARError(error, GWXARArchiveUnknownSignatureStyleError);
+        EXPECT_EQ(unknownEntity(error), style);
+        EXPECT_NE(affectedNode(error).find("<signature"), std::string::npos);
+    }
+    SignedTOCFixture noStyle({}, checksum_, "<signature><offset>0</offset></signature>");
+    GWErrorPtr error;
+    EXPECT_FALSE(noStyle.verify(&error));
+    expectXARError(error, GWXARArchiveUnknownSignatureStyleError);
+    EXPECT_FALSE(error->userInfo().count(kGWXARArchiveUnknownEntityErrorKey));
+}
+
+TEST_F(GWXARSignatureVerification, MalformedNumbersAreRefused) {
+    for (const std::string child : {"<offset>twelve</offset>", "<size>-</size>",
+                                    "<offset>99999999999999999999999</offset>"}) {
+        SignedTOCFixture fixture({}, checksum_,
+                                 "<signature style=\"RSA\">" + child + "</signature>");
+        GWErrorPtr error;
+        EXPECT_FALSE(fixture.verify(&error)) << child;
+        expectXARError(error, GWXARArchiveMalformedValueError);
+        EXPECT_EQ(affectedNode(error), child);
+    }
+}
+
+TEST_F(GWXARSignatureVerification, ExtendedSignaturesLoadAfterTheOthers) {
+    const TOCSignature rsa = signedBy("RSA", XarKeyType::rsa, checksum_);
+    TOCSignature ecdsa = signedBy("ECDSA", XarKeyType::ecdsa, checksum_);
+    ecdsa.extended = true;
+    SignedTOCFixture fixture({ecdsa, rsa}, checksum_);
+    GWErrorPtr error;
+    EXPECT_TRUE(fixture.verify(&error)) << (error ? error->localizedDescription() : "");
+    const auto& signatures = *fixture.operation().signatures();
+    ASSERT_EQ(signatures.size(), 2u);
+    EXPECT_EQ(signatures[0]->type(), GWXARSignatureTypeRSA);
+    EXPECT_FALSE(signatures[0]->isExtended());
+    EXPECT_EQ(signatures[1]->type(), GWXARSignatureTypeECDSA);
+    EXPECT_TRUE(signatures[1]->isExtended());
+    EXPECT_EQ(signatures[1]->signatureData(), ecdsa.bytes);
+}
+
+TEST_F(GWXARSignatureVerification, TheFirstBadSignatureDecides) {
+    const TOCSignature good = signedBy("RSA", XarKeyType::rsa, checksum_);
+    TOCSignature bad = signedBy("DSA", XarKeyType::dsa, checksum_);
+    bad.bytes.back() ^= 0x01;
+    const auto& selfSigned = signing().selfSignedLeaf();
+    const TOCSignature untrusted{"RSA", signing().signDigest(selfSigned, checksum_),
+                                 XarSigning::keyInfoElement(selfSigned.chain)};
+
+    SignedTOCFixture badFirst({bad, untrusted}, checksum_);
+    GWErrorPtr error;
+    EXPECT_FALSE(badFirst.verify(&error));
+    expectXARError(error, GWXARArchiveInvalidSignatureError);
+
+    SignedTOCFixture untrustedSecond({good, untrusted}, checksum_);
+    EXPECT_FALSE(untrustedSecond.verify(&error));
+    expectXARError(error, GWXARArchiveUntrustedCertificateError);
+}
+
+TEST_F(GWXARSignatureVerification, NoChecksumAlgorithmMeansNoValidSignature) {
+    SignedTOCFixture fixture({signedBy("RSA", XarKeyType::rsa, checksum_)}, checksum_);
+    GWErrorPtr error = GWCocoaError(GWFileReadUnknownError);
+    EXPECT_FALSE(fixture.verify(&error, GWChecksumAlgorithmNone));
+    EXPECT_EQ(error, nullptr);
+    // The signatures were still loaded.
+    EXPECT_EQ(fixture.operation().signatures()->size(), 1u);
+
+    SignedTOCFixture unsigned_({}, checksum_);
+    EXPECT_TRUE(unsigned_.verify(&error, GWChecksumAlgorithmNone));
+}
+
+TEST_F(GWXARSignatureVerification, AnUnsignedTableOfContentsVerifies) {
+    SignedTOCFixture fixture({}, checksum_, "<file id=\"1\"><name>a</name></file>");
+    EXPECT_FALSE(fixture.operation().signatures());
+    GWErrorPtr error;
+    EXPECT_TRUE(fixture.verify(&error));
+    ASSERT_TRUE(fixture.operation().signatures());
+    EXPECT_TRUE(fixture.operation().signatures()->empty());
+}
+
+TEST_F(GWXARSignatureVerification, AFailedLoadKeepsTheEarlierSignatures) {
+    SignedTOCFixture fixture({{"RSA", bytesOf("sig"), ""}}, checksum_);
+    GWErrorPtr error;
+    ASSERT_TRUE(fixture.operation().loadSignaturesWithTOC(fixture.toc(), &error));
+    pugi::xml_document broken;
+    broken.load_string("<toc><signature style=\"RSA\"/><signature style=\"XYZ\"/></toc>");
+    EXPECT_FALSE(fixture.operation().loadSignaturesWithTOC(broken.child("toc"), &error));
+    ASSERT_EQ(fixture.operation().signatures()->size(), 1u);
+    EXPECT_EQ(fixture.operation().signatures()->front()->signatureData(), bytesOf("sig"));
+}
+
+TEST_F(GWXARSignatureVerification, SignaturesReadFromTheHeapOffset) {
+    SignedTOCFixture fixture({{"RSA", bytesOf("first"), ""}, {"DSA", bytesOf("second!"), ""}},
+                             checksum_);
+    GWErrorPtr error;
+    ASSERT_TRUE(fixture.operation().loadSignaturesWithTOC(fixture.toc(), &error));
+    const auto& signatures = *fixture.operation().signatures();
+    EXPECT_EQ(signatures[0]->signatureData(), bytesOf("first"));
+    EXPECT_EQ(signatures[1]->signatureData(), bytesOf("second!"));
+
+    // Without a file to read from, the load says so instead of reading anything.
+    fixture.operation().setFileHandle(nullptr);
+    EXPECT_FALSE(fixture.operation().loadSignaturesWithTOC(fixture.toc(), &error));
+    ASSERT_TRUE(error);
+    EXPECT_EQ(error->domain(), kGWPOSIXErrorDomain);
+}
+
+TEST(GWXARTrustedRootScope, RestoresTheEnvironment) {
+    setenv("SSL_CERT_FILE", "/before", 1);
+    unsetenv("SSL_CERT_DIR");
+    {
+        gwtest::TrustedRootScope scope("/during");
+        EXPECT_STREQ(std::getenv("SSL_CERT_FILE"), "/during");
+        EXPECT_NE(std::getenv("SSL_CERT_DIR"), nullptr);
+    }
+    EXPECT_STREQ(std::getenv("SSL_CERT_FILE"), "/before");
+    EXPECT_EQ(std::getenv("SSL_CERT_DIR"), nullptr);
+    unsetenv("SSL_CERT_FILE");
+}
+
+}  // namespace
