@@ -86,9 +86,10 @@ GWXARArchivePtr GWXARArchive::initWithURL(const GWURL& url, bool failOnInvalidSi
 void GWXARArchive::takeResultsOfLoad(const GWXARLoadOperation& operation) {
     setFiles(operation.files().value_or(GWXARFileArray{}));
     setSubdocuments(operation.subdocuments());
-    setTOCChecksum(operation.computedTOCChecksum());
+    setTOCChecksum(operation.tocChecksum());
     setChecksumIsValid(operation.checksumIsValid());
     setChecksumValidationError(operation.checksumValidationError());
+    setSignatures(operation.signatures().value_or(GWXARSignatureArray{}));
     setPrivateSignatureIsValid(operation.signatureIsValid());
     setPrivateSignatureValidationError(operation.signatureError());
 }
@@ -141,6 +142,16 @@ GWErrorPtr GWXARArchive::checksumValidationError() const {
 void GWXARArchive::setChecksumValidationError(GWErrorPtr error) {
     std::lock_guard<std::mutex> lock(mutex_);
     checksumValidationError_ = std::move(error);
+}
+
+GWXARSignatureArray GWXARArchive::signatures() const {
+    std::lock_guard<std::mutex> lock(mutex_);
+    return signatures_;
+}
+
+void GWXARArchive::setSignatures(GWXARSignatureArray signatures) {
+    std::lock_guard<std::mutex> lock(mutex_);
+    signatures_ = std::move(signatures);
 }
 
 GWErrorPtr GWXARArchive::privateSignatureValidationError() const {

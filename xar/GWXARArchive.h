@@ -13,6 +13,7 @@
 #include "GWXARFile.h"
 #include "GWXARHeapStream.h"
 #include "GWXARLoadOperation.h"
+#include "GWXARSignature.h"
 #include "foundation/GWCoder.h"
 #include "foundation/GWError.h"
 #include "foundation/GWOperationQueue.h"
@@ -83,6 +84,9 @@ public:
     void setChecksumIsValid(bool valid) { checksumIsValid_.store(valid); }
     GWErrorPtr checksumValidationError() const;
     void setChecksumValidationError(GWErrorPtr error);
+    // The signatures the table of contents carries, verified or not.
+    GWXARSignatureArray signatures() const;
+    void setSignatures(GWXARSignatureArray signatures);
     bool privateSignatureIsValid() const { return privateSignatureIsValid_.load(); }
     void setPrivateSignatureIsValid(bool valid) { privateSignatureIsValid_.store(valid); }
     GWErrorPtr privateSignatureValidationError() const;
@@ -191,6 +195,7 @@ private:
     GWData tocChecksum_;
     std::atomic<bool> checksumIsValid_{false};
     GWErrorPtr checksumValidationError_;
+    GWXARSignatureArray signatures_;
     std::atomic<bool> privateSignatureIsValid_{false};
     GWErrorPtr privateSignatureValidationError_;
     GWOperationQueuePtr operationQueue_;

@@ -14,6 +14,7 @@ const char* const kSubdocumentsKey = "Subdocuments";
 const char* const kTOCChecksumKey = "TOCChecksum";
 const char* const kChecksumIsValidKey = "ChecksumIsValid";
 const char* const kChecksumValidationErrorKey = "ChecksumValidationError";
+const char* const kSignaturesKey = "Signatures";
 const char* const kSignatureIsValidKey = "SignatureIsValid";
 const char* const kSignatureValidationErrorKey = "SignatureValidationError";
 
@@ -88,6 +89,7 @@ void GWXARArchive::encodeWithCoder(GWCoder& coder) const {
     coder.encodeValue(GWValue(tocChecksum()), kTOCChecksumKey);
     coder.encodeBool(checksumIsValid(), kChecksumIsValidKey);
     coder.encodeError(checksumValidationError(), kChecksumValidationErrorKey);
+    coder.encodeArrayOfObjects(signatures(), kSignaturesKey);
     coder.encodeBool(privateSignatureIsValid(), kSignatureIsValidKey);
     coder.encodeError(privateSignatureValidationError(), kSignatureValidationErrorKey);
 }
@@ -106,6 +108,8 @@ GWXARArchivePtr GWXARArchive::initWithCoder(GWCoder& coder) {
     archive->tocChecksum_ = coder.decodeData(kTOCChecksumKey).value_or(GWData{});
     archive->checksumIsValid_ = coder.decodeBool(kChecksumIsValidKey);
     archive->checksumValidationError_ = coder.decodeError(kChecksumValidationErrorKey);
+    archive->signatures_ = coder.decodeArrayOfObjectsOfClass<GWXARSignature>(kSignaturesKey)
+                               .value_or(GWXARSignatureArray{});
     archive->privateSignatureIsValid_ = coder.decodeBool(kSignatureIsValidKey);
     archive->privateSignatureValidationError_ = coder.decodeError(kSignatureValidationErrorKey);
     // Children find the archive through their parents.
@@ -124,6 +128,12 @@ GWXARArchivePtr GWXARArchive::copy() const {
     archive->tocChecksum_ = tocChecksum_;
     archive->checksumIsValid_ = checksumIsValid_.load();
     archive->checksumValidationError_ = checksumValidationError_;
+    archive->signatures_.reserve(signatures_.size());
+    for (const auto& signature : signatures_) {
+        if (signature) {
+            archive->signatures_.push_back(signature->copy());
+        }
+    }
     archive->privateSignatureIsValid_ = privateSignatureIsValid_.load();
     archive->privateSignatureValidationError_ = privateSignatureValidationError_;
     archive->files_.reserve(files_.size());

@@ -95,7 +95,7 @@ std::optional<GWXARFileArray> GWXARLoadOperation::readArchiveContents(bool failO
     if (!document) {
         return std::nullopt;
     }
-    computedTOCChecksum_ = std::move(checksum);
+    setTOCChecksum(std::move(checksum));
 
     auto files = parseTOC(*document, checksumAlgorithm, failOnInvalidSignature, error);
     if (!files) {

@@ -1,5 +1,5 @@
 // What the load does with a parsed table of contents before building its
-// entries: the checksum verdict and the split-off subdocuments.
+// entries: the checksum and signature verdicts and the split-off subdocuments.
 
 #include <cstring>
 
@@ -40,9 +40,19 @@ std::optional<GWXARFileArray> GWXARLoadOperation::parseTOC(pugi::xml_document& d
         return std::nullopt;
     }
 
-    // Signatures are not checked yet: an archive never counts as signed.
-    signatureIsValid_ = false;
-    signatureError_ = nullptr;
+    GWErrorPtr signatureFailure;
+    if (verifySignaturesWithTOC(toc, checksumAlgorithm, &signatureFailure)) {
+        // Verifying nothing succeeds, yet an unsigned archive is not validly signed.
+        signatureIsValid_ = signatures() && !signatures()->empty();
+        signatureError_ = nullptr;
+    } else if (failOnInvalidSignature) {
+        // Possibly no error object: the load then reports a general read error.
+        GWFail(error, signatureFailure);
+        return std::nullopt;
+    } else {
+        signatureIsValid_ = false;
+        signatureError_ = signatureFailure;
+    }
 
     return filesFromTOCElement(toc, error);
 }
@@ -73,7 +83,7 @@ bool GWXARLoadOperation::verifyTOCChecksum(int algorithm, const pugi::xml_node& 
     if (!stored) {
         return false;
     }
-    if (storedAlgorithm != algorithm || *stored != computedTOCChecksum_) {
+    if (storedAlgorithm != algorithm || *stored != tocChecksum()) {
         return invalid();
     }
     return true;

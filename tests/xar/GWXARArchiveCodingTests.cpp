@@ -86,7 +86,7 @@ TEST(GWXARArchiveCoding, WritesItsKeysInOrderAndNothingWithoutKeys) {
     loaded.archive->encodeWithCoder(keyed);
     EXPECT_EQ(keyed.keys,
               (std::vector<std::string>{"GWRef", "Files", "Subdocuments", "TOCChecksum",
-                                        "ChecksumIsValid", "ChecksumValidationError",
+                                        "ChecksumIsValid", "ChecksumValidationError", "Signatures",
                                         "SignatureIsValid", "SignatureValidationError"}));
     EXPECT_EQ(*keyed.values["Subdocuments"].dictionary()->at("info").string(),
               "<about kind=\"test\">text</about>");
