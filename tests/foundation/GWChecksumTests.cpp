@@ -14,41 +14,38 @@ std::string digest(const std::string& text, int algorithm) {
 
 }  // namespace
 
-TEST(GWChecksum, CRC32IsLaidOutLeastSignificantByteFirst) {
-    // The CRC-32 of "1234" is 0x9BE3E0A3.
-    EXPECT_EQ(digest("1234", GWChecksumAlgorithmCRC32), "a3e0e39b");
-    EXPECT_EQ(digest("", GWChecksumAlgorithmCRC32), "00000000");
-}
-
-TEST(GWChecksum, MD2MatchesThePublishedVectors) {
-    EXPECT_EQ(digest("", GWChecksumAlgorithmMD2), "8350e5a3e24c153df2275c9f80692773");
-    EXPECT_EQ(digest("a", GWChecksumAlgorithmMD2), "32ec01ec4a6dac72c0ab96fb34c0b5d1");
-    EXPECT_EQ(digest("abc", GWChecksumAlgorithmMD2), "da853b0d3f88d99b30283a69e6ded6bb");
-    EXPECT_EQ(digest("message digest", GWChecksumAlgorithmMD2), "ab4f496bfb2a530b219ff33031fe06b0");
-    EXPECT_EQ(digest("abcdefghijklmnopqrstuvwxyz", GWChecksumAlgorithmMD2),
-              "4e8ddff3650292ab5a4108c3aa47940b");
-    EXPECT_EQ(digest("ABCDEFGHIJKLMNOPQRSTUVWXYZabcdefghijklmnopqrstuvwxyz0123456789",
-                     GWChecksumAlgorithmMD2),
-              "da33def2a42df13975352846c30338cd");
-    EXPECT_EQ(digest("1234567890123456789012345678901234567890123456789012345678901234567890123"
-                     "4567890",
-                     GWChecksumAlgorithmMD2),
-              "d5976f79d83d3a0dc9806c3c66f3efd8");
-}
-
-TEST(GWChecksum, MD5AndTheSHAFamilyMatchThePublishedVectors) {
-    EXPECT_EQ(digest("abc", GWChecksumAlgorithmMD5), "900150983cd24fb0d6963f7d28e17f72");
-    EXPECT_EQ(digest("abc", GWChecksumAlgorithmSHA1), "a9993e364706816aba3e25717850c26c9cd0d89d");
-    EXPECT_EQ(digest("abc", GWChecksumAlgorithmSHA224),
-              "23097d223405d8228642a477bda255b32aadbce4bda0b3f7e36c9da7");
-    EXPECT_EQ(digest("abc", GWChecksumAlgorithmSHA256),
-              "ba7816bf8f01cfea414140de5dae2223b00361a396177a9cb410ff61f20015ad");
-    EXPECT_EQ(digest("abc", GWChecksumAlgorithmSHA384),
-              "cb00753f45a35e8bb5a03d699ac65007272c32ab0eded1631a8b605a43ff5bed8086072ba1e7cc2358"
-              "baeca134c825a7");
-    EXPECT_EQ(digest("abc", GWChecksumAlgorithmSHA512),
-              "ddaf35a193617abacc417349ae20413112e6fa4e89a97ea20a9eeee64b55d39a2192992a274fc1a83"
-              "6ba3c23a3feebbd454d4423643ce80e2a9ac94fa54ca49f");
+TEST(GWChecksum, DigestsMatchThePublishedVectors) {
+    const std::string alphabet = "abcdefghijklmnopqrstuvwxyz";
+    const std::tuple<int, std::string, const char*> vectors[] = {
+        // The CRC-32 of "1234" is 0x9BE3E0A3, laid out least significant byte first.
+        {GWChecksumAlgorithmCRC32, "1234", "a3e0e39b"},
+        {GWChecksumAlgorithmCRC32, "", "00000000"},
+        {GWChecksumAlgorithmMD2, "", "8350e5a3e24c153df2275c9f80692773"},
+        {GWChecksumAlgorithmMD2, "a", "32ec01ec4a6dac72c0ab96fb34c0b5d1"},
+        {GWChecksumAlgorithmMD2, "abc", "da853b0d3f88d99b30283a69e6ded6bb"},
+        {GWChecksumAlgorithmMD2, "message digest", "ab4f496bfb2a530b219ff33031fe06b0"},
+        {GWChecksumAlgorithmMD2, alphabet, "4e8ddff3650292ab5a4108c3aa47940b"},
+        {GWChecksumAlgorithmMD2, "ABCDEFGHIJKLMNOPQRSTUVWXYZ" + alphabet + "0123456789",
+         "da33def2a42df13975352846c30338cd"},
+        {GWChecksumAlgorithmMD2,
+         "12345678901234567890123456789012345678901234567890123456789012345678901234567890",
+         "d5976f79d83d3a0dc9806c3c66f3efd8"},
+        {GWChecksumAlgorithmMD5, "abc", "900150983cd24fb0d6963f7d28e17f72"},
+        {GWChecksumAlgorithmSHA1, "abc", "a9993e364706816aba3e25717850c26c9cd0d89d"},
+        {GWChecksumAlgorithmSHA224, "abc",
+         "23097d223405d8228642a477bda255b32aadbce4bda0b3f7e36c9da7"},
+        {GWChecksumAlgorithmSHA256, "abc",
+         "ba7816bf8f01cfea414140de5dae2223b00361a396177a9cb410ff61f20015ad"},
+        {GWChecksumAlgorithmSHA384, "abc",
+         "cb00753f45a35e8bb5a03d699ac65007272c32ab0eded1631a8b605a43ff5bed8086072ba1e7cc2358"
+         "baeca134c825a7"},
+        {GWChecksumAlgorithmSHA512, "abc",
+         "ddaf35a193617abacc417349ae20413112e6fa4e89a97ea20a9eeee64b55d39a2192992a274fc1a83"
+         "6ba3c23a3feebbd454d4423643ce80e2a9ac94fa54ca49f"},
+    };
+    for (const auto& [algorithm, text, expected] : vectors) {
+        EXPECT_EQ(digest(text, algorithm), expected) << algorithm << " of \"" << text << "\"";
+    }
 }
 
 TEST(GWChecksum, AlgorithmsWithoutADigestGiveNothing) {

@@ -41,20 +41,19 @@ TEST(GWConversions, UniqueIDsAreDistinctUUIDs) {
     EXPECT_EQ(seen.size(), 1000u);
 }
 
-TEST(GWBase64, DecodesStandardTextWithSpacesAndLineBreaks) {
-    auto decode = [](const char* text) {
-        return GWPropertyListSerialization::dataWithBase64String(text, nullptr);
-    };
-    EXPECT_EQ(decode("aGVsbG8gd29ybGQ="), gwtest::bytesOf("hello world"));
-    EXPECT_EQ(decode("aGVs\nbG8g\r\nd29y bGQ="), gwtest::bytesOf("hello world"));
-    EXPECT_EQ(decode("QUJD"), gwtest::bytesOf("ABC"));
-    EXPECT_EQ(decode("QQ=="), gwtest::bytesOf("A"));
-    EXPECT_EQ(decode("QQ"), gwtest::bytesOf("A"));
-    EXPECT_EQ(decode(""), GWData());
-    EXPECT_EQ(decode("+/+/"), (GWData{0xFB, 0xFF, 0xBF}));
-}
-
-TEST(GWBase64, RefusesAnythingElse) {
+TEST(GWBase64, DecodesStandardTextWithSpacesAndLineBreaksAndRefusesAnythingElse) {
+    const std::pair<const char*, GWData> good[] = {
+        {"aGVsbG8gd29ybGQ=", gwtest::bytesOf("hello world")},
+        {"aGVs\nbG8g\r\nd29y bGQ=", gwtest::bytesOf("hello world")},
+        {"QUJD", gwtest::bytesOf("ABC")},
+        {"QQ==", gwtest::bytesOf("A")},
+        {"QQ", gwtest::bytesOf("A")},
+        {"", GWData()},
+        {"+/+/", GWData{0xFB, 0xFF, 0xBF}}};
+    for (const auto& [text, expected] : good) {
+        EXPECT_EQ(GWPropertyListSerialization::dataWithBase64String(text, nullptr), expected)
+            << text;
+    }
     for (const char* text : {"aGVsbG8*", "QQ=A", "Q", "QUJD=", "Q===", "QQ=", "aGVs-bG8"}) {
         GWErrorPtr error;
         EXPECT_FALSE(GWPropertyListSerialization::dataWithBase64String(text, &error)) << text;

@@ -5,6 +5,18 @@
 #include "GWArchiveSupport/GWArchiveConstants.h"
 #include "foundation/GWFoundation.h"
 
+TEST(GWValue, IntegersCompareByValueAndNumbersConvert) {
+    EXPECT_EQ(GWValue(std::int64_t(7)), GWValue(std::uint64_t(7)));
+    EXPECT_NE(GWValue(std::int64_t(-1)), GWValue(UINT64_MAX));
+    EXPECT_NE(GWValue(true), GWValue(1));
+    // Numbers read as the other numeric kinds; text reads as nothing.
+    EXPECT_TRUE(GWValue(2).boolValue());
+    EXPECT_EQ(GWValue(true).integerValue(), 1);
+    EXPECT_EQ(GWValue(2.9).integerValue(), 2);
+    EXPECT_EQ(GWValue("text").integerValue(), 0);
+    EXPECT_EQ(GWValue(std::int64_t(-1)).unsignedValue(), UINT64_MAX);
+}
+
 TEST(GWURL, FileURLsKeepTheirPathAndParts) {
     const GWURL url = GWURL::fileURLWithPath("/tmp/some dir/archive.tar.xar");
     EXPECT_TRUE(url.isFileURL());
@@ -19,12 +31,9 @@ TEST(GWURL, FileURLsKeepTheirPathAndParts) {
     EXPECT_EQ(GWURL::fileURLWithPath("/a/").path(), "/a");
     EXPECT_TRUE(GWURL::fileURLWithPath("/a/").hasDirectoryPath());
     EXPECT_EQ(GWURL::fileURLWithPath(".hidden").pathExtension(), "");
-}
-
-TEST(GWURL, RelativePathsResolveAgainstTheCurrentDirectory) {
-    const GWURL url = GWURL::fileURLWithPath("relative.zip");
-    EXPECT_EQ(url.path().front(), '/');
-    EXPECT_EQ(url.lastPathComponent(), "relative.zip");
+    // Relative paths resolve against the current directory.
+    EXPECT_EQ(GWURL::fileURLWithPath("relative.zip").path().front(), '/');
+    EXPECT_EQ(GWURL::fileURLWithPath("relative.zip").lastPathComponent(), "relative.zip");
 }
 
 TEST(GWURL, ParsingStrings) {
