@@ -10,6 +10,7 @@
 #include "GWZipFieldReader.h"
 #include "GWZipLoadOperation.h"
 #include "GWZipNames.h"
+#include "GWZipUnicodePathCRC.h"
 #include "foundation/GWByteReader.h"
 #include "foundation/GWChecksum.h"
 #include "foundation/GWStringEncoding.h"
@@ -173,7 +174,7 @@ bool GWZipLoadOperation::readCentralDirRecord(
         }
     }
     if (!extraBytes.empty() && extraFieldData) {
-        *extraFieldData = GWData(extraBytes.begin(), extraBytes.end());
+        *extraFieldData = GWZipNormaliseUnicodeFieldCRCs(extraBytes, nameBytes, commentBytes);
     }
     if (!commentBytes.empty() && comment) {
         *comment = GWStringFromBytes(commentBytes, GWStringEncoding::UTF8);
@@ -287,8 +288,9 @@ bool GWZipLoadOperation::addItemFromCentralDirectoryRecord(
             filename = std::move(*localName);
         }
         if (local.extraFieldLength) {
-            auto localInfo =
-                infoFromExtraFieldData(variable->subspan(local.filenameLength), true, error);
+            const GWData localExtra = GWZipNormaliseUnicodeFieldCRCs(
+                variable->subspan(local.filenameLength), variable->first(local.filenameLength), {});
+            auto localInfo = infoFromExtraFieldData(localExtra, true, error);
             if (!localInfo) {
                 return false;
             }
