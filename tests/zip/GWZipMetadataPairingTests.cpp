@@ -187,6 +187,22 @@ TEST_F(GWZipMetadataPairing, AHugeMacOSXFolderPairsEveryEntry) {
     }
 }
 
+TEST_F(GWZipMetadataPairing, DeeplyNestedCompanionsPairWithoutRecursion) {
+    std::string path;
+    for (int level = 0; level < 30000; ++level) {
+        path += "d/";
+    }
+    ZipBuilder zip;
+    zip.addFile(path + "x", bytesOf("deep"));
+    zip.addFile("__MACOSX/" + path + "._x", GWData(82, 1));
+    auto archive = open(zip);
+    ASSERT_TRUE(archive);
+    EXPECT_EQ(rootNames(archive), std::vector<std::string>{"d"});
+    auto x = archive->fileWithPath(path + "x");
+    ASSERT_TRUE(x);
+    EXPECT_TRUE(x->appleDoubleFile());
+}
+
 TEST_F(GWZipMetadataPairing, CancellationStopsThePairing) {
     auto operation = GWZipLoadOperation::initWithURL(directory.url("unused.zip"));
     auto folder = GWZipFile::initWithName("__MACOSX", nullptr, 0, 0, std::nullopt, 0, 0, 0, 040755,
