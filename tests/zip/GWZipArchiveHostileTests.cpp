@@ -201,6 +201,34 @@ TEST(GWZipArchiveTruncation, EveryCutOfAnArchiveIsCorrupt) {
     }
 }
 
+TEST(GWZipArchiveTruncation, RandomDamageEndsInAnArchiveOrAnError) {
+    ZipBuilder zip;
+    zip.addFile("a.txt", textBytes(300, 1), 8);
+    zip.addFile("dir/b", bytesOf("b")).zip64Sizes = true;
+    zip.addFile("__MACOSX/dir/._b", GWData(82, 1));
+    zip.addFile("XtraStuf.mac/a.txt", GWData(20, 1));
+    zip.zip64EndRecord = true;
+    const GWData whole = zip.bytes();
+    TemporaryDirectory directory;
+    ZipLogCapture log;
+    std::uint32_t state = 12345;
+    auto next = [&state] {
+        state = state * 1103515245u + 12345u;
+        return state >> 8;
+    };
+    for (int round = 0; round < 400; ++round) {
+        GWData damaged = whole;
+        const int flips = 1 + int(next() % 4);
+        for (int i = 0; i < flips; ++i) {
+            damaged[next() % damaged.size()] = std::uint8_t(next());
+        }
+        writeFile(directory.file("damaged.zip"), damaged);
+        GWErrorPtr error;
+        auto archive = GWZipArchive::initWithURL(directory.url("damaged.zip"), &error);
+        EXPECT_NE(bool(archive), bool(error)) << "round " << round;
+    }
+}
+
 TEST(GWZipArchiveTruncation, MissingFilesAndRefusedURLsReportTheirOwnErrors) {
     TemporaryDirectory directory;
     GWErrorPtr error;
