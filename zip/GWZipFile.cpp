@@ -103,16 +103,82 @@ GWZipFile::~GWZipFile() {
     }
 }
 
+// --- Fields under the state lock ----------------------------------------------
+
+std::uint64_t GWZipFile::storedUncompressedSize() const {
+    std::lock_guard lock(stateMutex_);
+    return uncompressedSize_;
+}
+
+void GWZipFile::setUncompressedSize(std::uint64_t size) {
+    std::lock_guard lock(stateMutex_);
+    uncompressedSize_ = size;
+}
+
+std::string GWZipFile::name() const {
+    std::lock_guard lock(stateMutex_);
+    return name_;
+}
+
 void GWZipFile::setName(std::string name) {
+    std::lock_guard lock(stateMutex_);
     if (name != name_) {
         name_ = std::move(name);
         gRenameEpoch.fetch_add(1, std::memory_order_relaxed);
     }
 }
 
+std::uint64_t GWZipFile::compressedSize() const {
+    std::lock_guard lock(stateMutex_);
+    return compressedSize_;
+}
+
+void GWZipFile::setCompressedSize(std::uint64_t size) {
+    std::lock_guard lock(stateMutex_);
+    compressedSize_ = size;
+}
+
+std::optional<std::string> GWZipFile::symlinkDestination() const {
+    std::lock_guard lock(stateMutex_);
+    return symlinkDestination_;
+}
+
+void GWZipFile::setSymlinkDestination(std::optional<std::string> destination) {
+    std::lock_guard lock(stateMutex_);
+    symlinkDestination_ = std::move(destination);
+}
+
+std::optional<GWData> GWZipFile::privateUncompressedChecksum() const {
+    std::lock_guard lock(stateMutex_);
+    return checksum_;
+}
+
+void GWZipFile::setPrivateUncompressedChecksum(std::optional<GWData> checksum) {
+    std::lock_guard lock(stateMutex_);
+    checksum_ = std::move(checksum);
+}
+
+std::uint64_t GWZipFile::privateUncompressedChecksumAlgorithm() const {
+    std::lock_guard lock(stateMutex_);
+    return checksumAlgorithm_;
+}
+
+void GWZipFile::setPrivateUncompressedChecksumAlgorithm(std::uint64_t algorithm) {
+    std::lock_guard lock(stateMutex_);
+    checksumAlgorithm_ = algorithm;
+}
+
+GWDictionary GWZipFile::extraInfo() const {
+    std::lock_guard lock(stateMutex_);
+    return extraInfo_;
+}
+
 void GWZipFile::setExtraInfo(GWDictionary extraInfo) {
-    if (auto filename = filenameFromExtraInfo(extraInfo)) {
-        setName(std::move(*filename));
+    auto filename = filenameFromExtraInfo(extraInfo);
+    std::lock_guard lock(stateMutex_);
+    if (filename && *filename != name_) {
+        name_ = std::move(*filename);
+        gRenameEpoch.fetch_add(1, std::memory_order_relaxed);
     }
     extraInfo_ = std::move(extraInfo);
 }
@@ -163,7 +229,7 @@ void GWZipFile::addChild(const GWZipFilePtr& child) {
     children_->push_back(child);
     std::lock_guard lock(indexMutex_);
     if (index_.valid && index_.childrenGeneration == childrenGeneration_ && child) {
-        index_.first.emplace(child->name_, children_->size() - 1);
+        index_.first.emplace(child->name(), children_->size() - 1);
     }
 }
 
@@ -194,7 +260,7 @@ std::optional<std::size_t> GWZipFile::indexOfChildNamed(std::string_view name) c
         index_.first.reserve(children_->size());
         for (std::size_t i = 0; i < children_->size(); ++i) {
             if (const auto& child = (*children_)[i]) {
-                index_.first.emplace(child->name_, i);
+                index_.first.emplace(child->name(), i);
             }
         }
         index_.childrenGeneration = childrenGeneration_;
@@ -216,30 +282,28 @@ GWZipFilePtr GWZipFile::childNamed(std::string_view name) const {
 // --- Derived properties ----------------------------------------------------------
 
 std::string GWZipFile::path() const {
-    std::vector<const std::string*> names{&name_};
-    std::vector<GWZipFilePtr> ancestors;  // keeps each ancestor alive while its name is used
+    std::vector<std::string> names{name()};
     for (auto ancestor = parent(); ancestor; ancestor = ancestor->parent()) {
-        names.push_back(&ancestor->name_);
-        ancestors.push_back(ancestor);
+        names.push_back(ancestor->name());
     }
     std::string path;
     for (auto it = names.rbegin(); it != names.rend(); ++it) {
-        if (!path.empty() && path.back() != '/' && !(*it)->empty()) {
+        if (!path.empty() && path.back() != '/' && !it->empty()) {
             path += '/';
         }
-        path += **it;
+        path += *it;
     }
     return path;
 }
 
 std::uint64_t GWZipFile::uncompressedSize() const {
-    std::uint64_t total = uncompressedSize_;
+    std::uint64_t total = storedUncompressedSize();
     std::vector<const GWZipFile*> pending{resourceFork_.get(), appleDoubleFile_.get()};
     while (!pending.empty()) {
         const GWZipFile* companion = pending.back();
         pending.pop_back();
         if (companion) {
-            total += companion->uncompressedSize_;
+            total += companion->storedUncompressedSize();
             pending.push_back(companion->resourceFork_.get());
             pending.push_back(companion->appleDoubleFile_.get());
         }
@@ -248,11 +312,13 @@ std::uint64_t GWZipFile::uncompressedSize() const {
 }
 
 std::optional<std::string> GWZipFile::type() const {
+    std::lock_guard lock(stateMutex_);
     return isDirectory() ? std::optional<std::string>("fold")
                          : stringInfo(extraInfo_, kGWZipTypeCodeKey);
 }
 
 std::optional<std::string> GWZipFile::creator() const {
+    std::lock_guard lock(stateMutex_);
     return isDirectory() ? std::optional<std::string>("MACS")
                          : stringInfo(extraInfo_, kGWZipCreatorCodeKey);
 }
@@ -268,18 +334,22 @@ std::uint32_t GWZipFile::creatorCode() const {
 }
 
 std::int16_t GWZipFile::iconLocationV() const {
+    std::lock_guard lock(stateMutex_);
     return std::int16_t(numberInfo(extraInfo_, kGWZipVerticalIconLocationKey));
 }
 
 std::int16_t GWZipFile::iconLocationH() const {
+    std::lock_guard lock(stateMutex_);
     return std::int16_t(numberInfo(extraInfo_, kGWZipHorizontalIconLocationKey));
 }
 
 std::optional<GWDate> GWZipFile::creationDate() const {
+    std::lock_guard lock(stateMutex_);
     return preferredDate(extraInfo_, kGWZipUTCCreationDateKey, kGWZipCreationDateKey);
 }
 
 std::optional<GWDate> GWZipFile::modificationDate() const {
+    std::lock_guard lock(stateMutex_);
     if (auto date =
             preferredDate(extraInfo_, kGWZipUTCModificationDateKey, kGWZipModificationDateKey)) {
         return date;
@@ -288,49 +358,63 @@ std::optional<GWDate> GWZipFile::modificationDate() const {
 }
 
 std::optional<GWDate> GWZipFile::backupDate() const {
+    std::lock_guard lock(stateMutex_);
     return preferredDate(extraInfo_, kGWZipUTCBackupDateKey, kGWZipBackupDateKey);
 }
 
 std::optional<GWDate> GWZipFile::accessDate() const {
+    std::lock_guard lock(stateMutex_);
     return preferredDate(extraInfo_, kGWZipUTCAccessDateKey, kGWZipAccessDateKey);
 }
 
 std::uint16_t GWZipFile::finderFlags() const {
+    std::lock_guard lock(stateMutex_);
     return std::uint16_t(numberInfo(extraInfo_, kGWZipFinderFlagsKey));
 }
 
 std::uint16_t GWZipFile::extendedFinderFlags() const {
+    std::lock_guard lock(stateMutex_);
     return std::uint16_t(numberInfo(extraInfo_, kGWZipExtendedFinderFlagsKey));
 }
 
 std::uint8_t GWZipFile::versionNumber() const {
+    std::lock_guard lock(stateMutex_);
     return std::uint8_t(numberInfo(extraInfo_, kGWZipVersionNumberKey));
 }
 
 std::uint8_t GWZipFile::accessRights() const {
+    std::lock_guard lock(stateMutex_);
     return std::uint8_t(numberInfo(extraInfo_, kGWZipAccessRightsKey));
 }
 
 std::uint16_t GWZipFile::putAwayFolderID() const {
+    std::lock_guard lock(stateMutex_);
     return std::uint16_t(numberInfo(extraInfo_, kGWZipPutAwayFolderKey));
 }
 
 std::optional<std::string> GWZipFile::comment() const {
+    std::lock_guard lock(stateMutex_);
     return stringInfo(extraInfo_, kGWZipCommentKey);
 }
 
 bool GWZipFile::isMacBinaryEncoded() const {
+    std::lock_guard lock(stateMutex_);
     return !isDirectory() && boolInfo(extraInfo_, kGWZipIsMacBinaryEncodedKey);
 }
 
 bool GWZipFile::moreInfoAvailableInLocalHeader() const {
+    std::lock_guard lock(stateMutex_);
     return boolInfo(extraInfo_, kGWZipMoreInfoAvailableInLocalHeaderKey);
 }
 
 std::optional<GWData> GWZipFile::uncompressedChecksum() const {
-    return isMacBinaryEncoded() ? std::nullopt : checksum_;
+    const bool macBinary = isMacBinaryEncoded();
+    std::lock_guard lock(stateMutex_);
+    return macBinary ? std::nullopt : checksum_;
 }
 
 std::uint64_t GWZipFile::uncompressedChecksumAlgorithm() const {
-    return isMacBinaryEncoded() ? 0 : checksumAlgorithm_;
+    const bool macBinary = isMacBinaryEncoded();
+    std::lock_guard lock(stateMutex_);
+    return macBinary ? 0 : checksumAlgorithm_;
 }

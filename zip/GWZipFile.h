@@ -26,6 +26,10 @@ using GWZipFileArrayPtr = std::shared_ptr<const GWZipFileArray>;
 // its extra fields carried. A node owns its children and its Mac companions
 // (resource-fork and AppleDouble entries); the parent link is weak, so a tree
 // is owned from its roots. Create nodes with initWithName.
+//
+// Extraction refreshes an entry from its local header while other threads
+// may read it; the fields it touches are therefore guarded and returned by
+// value. Tree building (children, companions, parent) is single-threaded.
 class GWZipFile : public GWCoding {
 public:
     static constexpr const char* kClassName = "GWZipFile";
@@ -60,17 +64,15 @@ public:
     // The date of the central directory record (see modificationDate()).
     const std::optional<GWDate>& storedModificationDate() const { return modificationDate_; }
     // This entry's own size, without its companions (see uncompressedSize()).
-    std::uint64_t storedUncompressedSize() const { return uncompressedSize_; }
-    void setUncompressedSize(std::uint64_t size) { uncompressedSize_ = size; }
+    std::uint64_t storedUncompressedSize() const;
+    void setUncompressedSize(std::uint64_t size);
     // The last path component.
-    const std::string& name() const { return name_; }
+    std::string name() const;
     void setName(std::string name);
-    std::uint64_t compressedSize() const { return compressedSize_; }
-    void setCompressedSize(std::uint64_t size) { compressedSize_ = size; }
-    const std::optional<std::string>& symlinkDestination() const { return symlinkDestination_; }
-    void setSymlinkDestination(std::optional<std::string> destination) {
-        symlinkDestination_ = std::move(destination);
-    }
+    std::uint64_t compressedSize() const;
+    void setCompressedSize(std::uint64_t size);
+    std::optional<std::string> symlinkDestination() const;
+    void setSymlinkDestination(std::optional<std::string> destination);
     const GWZipFilePtr& resourceFork() const { return resourceFork_; }
     void setResourceFork(GWZipFilePtr file) { resourceFork_ = std::move(file); }
     const GWZipFilePtr& appleDoubleFile() const { return appleDoubleFile_; }
@@ -81,16 +83,12 @@ public:
     // Relative to the start of the ZIP data, which may follow a prefix.
     std::uint64_t localHeaderOffset() const { return localHeaderOffset_; }
     void setLocalHeaderOffset(std::uint64_t offset) { localHeaderOffset_ = offset; }
-    const std::optional<GWData>& privateUncompressedChecksum() const { return checksum_; }
-    void setPrivateUncompressedChecksum(std::optional<GWData> checksum) {
-        checksum_ = std::move(checksum);
-    }
+    std::optional<GWData> privateUncompressedChecksum() const;
+    void setPrivateUncompressedChecksum(std::optional<GWData> checksum);
     // A GWChecksum algorithm number.
-    std::uint64_t privateUncompressedChecksumAlgorithm() const { return checksumAlgorithm_; }
-    void setPrivateUncompressedChecksumAlgorithm(std::uint64_t algorithm) {
-        checksumAlgorithm_ = algorithm;
-    }
-    const GWDictionary& extraInfo() const { return extraInfo_; }
+    std::uint64_t privateUncompressedChecksumAlgorithm() const;
+    void setPrivateUncompressedChecksumAlgorithm(std::uint64_t algorithm);
+    GWDictionary extraInfo() const;
     // Renames the entry when the dictionary names it (filenameFromExtraInfo),
     // then stores it.
     void setExtraInfo(GWDictionary extraInfo);
@@ -143,10 +141,10 @@ public:
     std::optional<GWData> uncompressedChecksum() const;
     std::uint64_t uncompressedChecksumAlgorithm() const;
     void setUncompressedChecksum(std::optional<GWData> checksum) {
-        checksum_ = std::move(checksum);
+        setPrivateUncompressedChecksum(std::move(checksum));
     }
     void setUncompressedChecksumAlgorithm(std::uint64_t algorithm) {
-        checksumAlgorithm_ = algorithm;
+        setPrivateUncompressedChecksumAlgorithm(algorithm);
     }
 
     // The name the dictionary gives an entry of this kind, or none.
@@ -191,6 +189,12 @@ private:
     static GWZipFilePtr makeImplicitDirectory(const std::string& name, const GWZipFilePtr& parent);
     // Position of the first child of that name, through the name index.
     std::optional<std::size_t> indexOfChildNamed(std::string_view name) const;
+
+    // Extraction refreshes the name, sizes, checksum, link target and extra
+    // info from the local header on a worker thread while other threads may
+    // read the entry, so those fields are read and written under this lock
+    // and handed out as copies.
+    mutable std::mutex stateMutex_;
 
     std::uint16_t permissionsMode_ = 0;
     std::uint16_t generalPurposeFlags_ = 0;

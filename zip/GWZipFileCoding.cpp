@@ -28,25 +28,31 @@ void GWZipFile::encodeWithCoder(GWCoder& coder) const {
     if (!coder.allowsKeyedCoding()) {
         return;
     }
+    std::unique_lock lock(stateMutex_);
     coder.encodeValue(GWValue(name_), kNameKey);
+    lock.unlock();
     if (children_) {
         coder.encodeArrayOfObjects(*children_, kChildrenKey);
     }
+    lock.lock();
     coder.encodeUInt64(compressedSize_, kCompressedSizeKey);
     coder.encodeUInt64(uncompressedSize_, kUncompressedSizeKey);
     coder.encodeValue(checksum_, kUncompressedChecksumKey);
     coder.encodeInteger(std::int64_t(checksumAlgorithm_), kUncompressedChecksumAlgorithmKey);
+    const auto symlinkDestination = symlinkDestination_;
+    const auto extraInfo = extraInfo_;
+    lock.unlock();
     coder.encodeInt32(std::int32_t(owner_), kOwnerKey);
     coder.encodeInt32(std::int32_t(groupOwner_), kGroupOwnerKey);
     coder.encodeInteger(permissionsMode_, kPermissionsModeKey);
     coder.encodeValue(modificationDate_, kModificationDateKey);
-    coder.encodeValue(symlinkDestination_, kSymlinkDestinationKey);
+    coder.encodeValue(symlinkDestination, kSymlinkDestinationKey);
     coder.encodeObject(resourceFork_, kResourceForkKey);
     coder.encodeObject(appleDoubleFile_, kAppleDoubleFileKey);
     coder.encodeUInt64(localHeaderOffset_, kLocalHeaderOffsetKey);
     coder.encodeInt32(generalPurposeFlags_, kGeneralPurposeFlagsKey);
     coder.encodeInt32(compressionMethod_, kCompressionMethodKey);
-    coder.encodeValue(GWValue(extraInfo_), kExtraInfoKey);
+    coder.encodeValue(GWValue(extraInfo), kExtraInfoKey);
 }
 
 GWZipFilePtr GWZipFile::initWithCoder(GWCoder& coder) {
@@ -83,6 +89,7 @@ GWZipFilePtr GWZipFile::newInstance() const {
 }
 
 void GWZipFile::copyFieldsTo(GWZipFile& target) const {
+    std::scoped_lock lock(stateMutex_, target.stateMutex_);
     target.permissionsMode_ = permissionsMode_;
     target.generalPurposeFlags_ = generalPurposeFlags_;
     target.compressionMethod_ = compressionMethod_;

@@ -27,7 +27,7 @@ std::vector<std::string> GWZipFile::standardizedComponentsForPath(std::string_vi
 
 GWZipFilePtr GWZipFile::fileNamed(std::string_view name, const GWZipFileArray& files) {
     for (const auto& file : files) {
-        if (file && file->name_ == name) {
+        if (file && file->name() == name) {
             return file;
         }
     }

@@ -16,7 +16,8 @@ const char* const kAppleDoublePrefix = "._";
 const char* const kResourceForkFolderNames[] = {"XtraStuf.mac", "Re$0urce.Fk"};
 
 bool isMarkedResourceFork(const GWZipFile& file) {
-    const GWValue* value = GWDictionaryValue(file.extraInfo(), kGWZipIsResourceForkKey);
+    const GWDictionary info = file.extraInfo();
+    const GWValue* value = GWDictionaryValue(info, kGWZipIsResourceForkKey);
     return value && value->boolValue();
 }
 
