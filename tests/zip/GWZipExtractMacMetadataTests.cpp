@@ -1,0 +1,260 @@
+// Mac metadata on extraction: AppleDouble and resource-fork companions,
+// MacBinary members, Finder information and ownership.
+
+#include <gtest/gtest.h>
+#include <linux/capability.h>
+#include <sys/stat.h>
+#include <sys/syscall.h>
+#include <unistd.h>
+
+#include "foundation/GWConversions.h"
+#include "foundation/GWFileInfo.h"
+#include "foundation/GWMetadataStore.h"
+#include "foundation/GWRemoteFileHandle.h"
+#include "support/AppleDoubleBuilder.h"
+#include "support/MacBinaryBuilder.h"
+#include "support/MetadataTestSupport.h"
+#include "support/TestSupport.h"
+#include "support/ZipBuilder.h"
+#include "support/ZipExtraFields.h"
+#include "zip/ZipExtractTestSupport.h"
+
+namespace {
+
+using namespace gwtest;
+
+class GWZipExtractMacMetadata : public ::testing::Test {
+protected:
+    void SetUp() override {
+        if (!userAttributesSupported(directory.path())) {
+            GTEST_SKIP() << "no user extended attributes here";
+        }
+    }
+
+    GWZipExtractOperationPtr extract(const GWZipFilePtr& file, const std::string& name) {
+        GWErrorPtr error;
+        auto operation = GWZipExtractOperation::initForExtractingFile(
+            file, GWURL::fileURLWithPath(archivePath), 0, directory.url(name), true, nullptr,
+            &error);
+        runToEnd(operation);
+        return operation;
+    }
+
+    std::optional<GWData> attribute(const std::string& name, std::string_view attributeName) {
+        return GWMetadataStore(directory.file(name)).attribute(attributeName, nullptr);
+    }
+
+    TemporaryDirectory directory;
+    std::string archivePath = directory.file("archive.zip");
+};
+
+TEST_F(GWZipExtractMacMetadata, AnAppleDoubleCompanionGivesFinderInfoForkAndAttributes) {
+    AppleDoubleFile companion;
+    companion.finderInfo = finderInfoBytes("TEXT", "R*ch", 0x0100, 12, 34);
+    companion.attributes = {{"com.example.label", bytesOf("blue")}};
+    companion.resourceFork = randomBytes(3000, 4);
+    ZipBuilder zip;
+    zip.addFile("Document.txt", bytesOf("the data fork"), 8);
+    zip.addFile("__MACOSX/._Document.txt", buildAppleDouble(companion), 8);
+    zip.write(archivePath);
+    auto file = zipEntryFromBuilder(zip, 0);
+    file->setAppleDoubleFile(zipEntryFromBuilder(zip, 1));
+
+    auto operation = extract(file, "Document.txt");
+    ASSERT_FALSE(operation->error()) << operation->error()->localizedDescription();
+    EXPECT_EQ(readFile(directory.file("Document.txt")), bytesOf("the data fork"));
+    EXPECT_EQ(attribute("Document.txt", "com.apple.ResourceFork"), companion.resourceFork);
+    EXPECT_EQ(attribute("Document.txt", "com.example.label"), bytesOf("blue"));
+    auto info = GWFileInfo::initWithURL(directory.url("Document.txt"), nullptr);
+    ASSERT_TRUE(info);
+    EXPECT_EQ(info->typeCode(), GWFourCharCode("TEXT"));
+    EXPECT_EQ(info->creatorCode(), GWFourCharCode("R*ch"));
+    EXPECT_EQ(info->finderFlags(), 0x0100);
+}
+
+TEST_F(GWZipExtractMacMetadata, AnUnmergeableCompanionIsNoFailure) {
+    ZipBuilder zip;
+    zip.addFile("a.txt", bytesOf("data"));
+    zip.addFile("__MACOSX/._a.txt", bytesOf("not an AppleDouble file"));
+    zip.write(archivePath);
+    auto file = zipEntryFromBuilder(zip, 0);
+    file->setAppleDoubleFile(zipEntryFromBuilder(zip, 1));
+    auto operation = extract(file, "a.txt");
+    EXPECT_FALSE(operation->error());
+    EXPECT_EQ(readFile(directory.file("a.txt")), bytesOf("data"));
+}
+
+TEST_F(GWZipExtractMacMetadata, AResourceForkCompanionIsWrittenWholeWhenItIsOnePiece) {
+    const GWData fork = randomBytes(2000, 6);
+    ZipBuilder zip;
+    zip.addFile("Icon", bytesOf("data"));
+    zip.addFile("XtraStuf.mac/Icon", fork, 8);
+    zip.write(archivePath);
+    auto file = zipEntryFromBuilder(zip, 0);
+    file->setResourceFork(zipEntryFromBuilder(zip, 1));
+    auto operation = extract(file, "Icon");
+    ASSERT_FALSE(operation->error()) << operation->error()->localizedDescription();
+    EXPECT_EQ(attribute("Icon", "com.apple.ResourceFork"), fork);
+}
+
+TEST_F(GWZipExtractMacMetadata, EveryResourceForkPieceIsWrittenAtPositionZero) {
+    // A fork of several decoded pieces: each later piece overwrites the start
+    // of the earlier ones, and nothing is truncated.
+    const GWData fork = randomBytes(GWRemoteFileHandle::kDefaultPieceSize + 100, 7);
+    ZipBuilder zip;
+    zip.addFile("Icon", bytesOf("data"));
+    zip.addFile("XtraStuf.mac/Icon", fork, 0);
+    zip.write(archivePath);
+    auto file = zipEntryFromBuilder(zip, 0);
+    file->setResourceFork(zipEntryFromBuilder(zip, 1));
+
+    // The pieces the fork decodes in, as a data handler sees them.
+    DataHandlerLog pieces;
+    GWErrorPtr error;
+    runToEnd(GWZipExtractOperation::initForExtractingFile(
+        file->resourceFork(), GWURL::fileURLWithPath(archivePath), 0, pieces.handler(), &error));
+    ASSERT_EQ(pieces.bytes, fork);
+    ASSERT_GE(pieces.sizes.size(), 3u);
+    GWData expected;
+    std::size_t offset = 0;
+    for (std::size_t size : pieces.sizes) {
+        if (expected.size() < size) {
+            expected.resize(size);
+        }
+        std::copy_n(fork.begin() + std::ptrdiff_t(offset), size, expected.begin());
+        offset += size;
+    }
+    ASSERT_LT(expected.size(), fork.size());
+
+    auto operation = extract(file, "Icon");
+    ASSERT_FALSE(operation->error()) << operation->error()->localizedDescription();
+    EXPECT_EQ(attribute("Icon", "com.apple.ResourceFork"), expected);
+}
+
+TEST_F(GWZipExtractMacMetadata, AMacBinaryMemberBecomesItsDataForkWithForkAndFinderInfo) {
+    MacBinaryFile mac;
+    mac.type = "APPL";
+    mac.creator = "CARO";
+    mac.finderFlags = 0x2000;
+    mac.dataFork = textBytes(1000, 3);
+    mac.resourceFork = randomBytes(700, 5);
+    for (bool smartZip : {false, true}) {
+        SCOPED_TRACE(smartZip ? "SmartZIP" : "ZipIt");
+        ZipBuilder zip;
+        ZipEntry& entry = zip.addFile("Program.bin", buildMacBinary(mac), 8);
+        if (smartZip) {
+            SmartZipInfo info;
+            info.type = "APPL";
+            info.creator = "CARO";
+            info.finderFlags = 0x2000;
+            entry.centralExtra = zipExtraBlock(0x4D63, smartZipPayload(info));
+        } else {
+            entry.centralExtra =
+                zipExtraBlock(0x2605, zipItPayload(std::string("Program"), "APPL", "CARO", 0x2000));
+        }
+        zip.write(archivePath);
+        auto file = zipEntryFromBuilder(zip, 0);
+        ASSERT_TRUE(file->isMacBinaryEncoded());
+        const std::string name = smartZip ? "smart" : "zipit";
+        auto operation = extract(file, name);
+        ASSERT_FALSE(operation->error()) << operation->error()->localizedDescription();
+        EXPECT_EQ(readFile(directory.file(name)), mac.dataFork);
+        EXPECT_EQ(attribute(name, "com.apple.ResourceFork"), mac.resourceFork);
+        auto info = GWFileInfo::initWithURL(directory.url(name), nullptr);
+        ASSERT_TRUE(info);
+        EXPECT_EQ(info->typeCode(), GWFourCharCode("APPL"));
+        EXPECT_EQ(info->creatorCode(), GWFourCharCode("CARO"));
+        EXPECT_EQ(info->finderFlags(), 0x2000);
+    }
+}
+
+TEST_F(GWZipExtractMacMetadata, ABrokenMacBinaryMemberFailsAndLeavesNoDecodedFile) {
+    ZipBuilder zip;
+    ZipEntry& entry = zip.addFile("x.bin", GWData(200, 0xAA));
+    entry.centralExtra = zipExtraBlock(0x2605, zipItPayload(std::string("x"), "TEXT", "ttxt", 0));
+    zip.write(archivePath);
+    auto operation = extract(zipEntryFromBuilder(zip, 0), "x");
+    ASSERT_TRUE(operation->error());
+    EXPECT_TRUE(operation->error()->is(kGWCocoaErrorDomain, GWFileReadCorruptFileError));
+    EXPECT_FALSE(fileExists(directory.file("x")));
+}
+
+TEST_F(GWZipExtractMacMetadata, FinderInformationFromTheExtraFieldIsApplied) {
+    ZipBuilder zip;
+    ZipEntry& entry = zip.addFile("note", bytesOf("text"));
+    SmartZipInfo info;
+    info.type = "ttro";
+    info.creator = "ttxt";
+    info.finderFlags = 0x0400;
+    info.vertical = 40;
+    info.horizontal = 80;
+    entry.centralExtra = zipExtraBlock(0x4D63, smartZipPayload(info));
+    zip.write(archivePath);
+    auto file = zipEntryFromBuilder(zip, 0);
+    GWErrorPtr error;
+    writeFile(directory.file("plain"), bytesOf("text"));
+    auto operation = GWZipExtractOperation::initForExtractingFile(
+        file, GWURL::fileURLWithPath(archivePath), 0, directory.url("unused"), false, nullptr,
+        &error);
+    ASSERT_TRUE(operation->setInfoForFile(file, directory.url("plain"), &error));
+    auto applied = GWFileInfo::initWithURL(directory.url("plain"), nullptr);
+    ASSERT_TRUE(applied);
+    EXPECT_EQ(applied->typeCode(), GWFourCharCode("ttro"));
+    EXPECT_EQ(applied->finderFlags(), 0x0400);
+    EXPECT_EQ(applied->location(), 40u | (80u << 16));
+}
+
+// Takes CAP_CHOWN out of the calling thread's effective set while it lives,
+// so that even root is refused another owner. Capabilities are per thread.
+class ScopedNoChown {
+public:
+    ScopedNoChown() {
+        header_.version = _LINUX_CAPABILITY_VERSION_3;
+        if (syscall(SYS_capget, &header_, data_) != 0) {
+            return;
+        }
+        saved_[0] = data_[0];
+        saved_[1] = data_[1];
+        data_[0].effective &= ~(1u << CAP_CHOWN);
+        active_ = syscall(SYS_capset, &header_, data_) == 0;
+    }
+    ~ScopedNoChown() {
+        if (active_) {
+            syscall(SYS_capset, &header_, saved_);
+        }
+    }
+    bool active() const { return active_; }
+
+private:
+    __user_cap_header_struct header_{};
+    __user_cap_data_struct data_[2]{};
+    __user_cap_data_struct saved_[2]{};
+    bool active_ = false;
+};
+
+TEST_F(GWZipExtractMacMetadata, AnOwnerThatCannotBeAppliedStillExtracts) {
+    ZipBuilder zip;
+    ZipEntry& entry = zip.addFile("owned.txt", bytesOf("mine"));
+    entry.externalAttributes = 0100640u << 16;
+    zip.write(archivePath);
+    auto base = zipEntryFromBuilder(zip, 0);
+    const std::uint32_t stranger = ::getuid() + 4242;
+    auto file = GWZipFile::initWithName(
+        base->name(), nullptr, base->compressedSize(), base->storedUncompressedSize(),
+        base->privateUncompressedChecksum(), 1, stranger, stranger, base->permissionsMode(),
+        base->storedModificationDate(), std::nullopt, base->localHeaderOffset(), 0, 0, {});
+    ScopedNoChown noChown;
+    if (::getuid() == 0 && !noChown.active()) {
+        GTEST_SKIP() << "root without a way to refuse ownership changes";
+    }
+    // start() runs the whole pipeline on this thread, without CAP_CHOWN.
+    auto operation = extract(file, "owned.txt");
+    EXPECT_FALSE(operation->error());
+    struct stat status {};
+    ASSERT_EQ(::stat(directory.file("owned.txt").c_str(), &status), 0);
+    EXPECT_NE(status.st_uid, stranger);
+    EXPECT_EQ(status.st_mode & 07777, 0640u);
+    EXPECT_EQ(readFile(directory.file("owned.txt")), bytesOf("mine"));
+}
+
+}  // namespace

@@ -1,0 +1,409 @@
+// One entry extracted by GWZipExtractOperation: methods, kinds of entry,
+// atomic and in-place writing, handlers, cancellation and local headers.
+
+#include <gtest/gtest.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <cerrno>
+
+#include "GWArchiveSupport/GWArchiveConstants.h"
+#include "support/MetadataTestSupport.h"
+#include "support/TestSupport.h"
+#include "support/ZipBuilder.h"
+#include "support/ZipExtraFields.h"
+#include "support/ZipLegacyEncoders.h"
+#include "zip/ZipExtractTestSupport.h"
+#include "zip/ZipTestSupport.h"
+
+namespace {
+
+using namespace gwtest;
+
+class GWZipExtractOperationTest : public ::testing::Test {
+protected:
+    TemporaryDirectory directory;
+    std::string archivePath = directory.file("archive.zip");
+    GWURL archiveURL = GWURL::fileURLWithPath(archivePath);
+
+    void write(const ZipBuilder& zip) { zip.write(archivePath); }
+
+    GWZipExtractOperationPtr toDisk(const GWZipFilePtr& file, const std::string& name,
+                                    bool atomically,
+                                    GWZipExtractOperation::ProgressHandler progress = nullptr) {
+        GWErrorPtr error;
+        auto operation = GWZipExtractOperation::initForExtractingFile(
+            file, archiveURL, 0, directory.url(name), atomically, std::move(progress), &error);
+        EXPECT_TRUE(operation) << (error ? error->localizedDescription() : "");
+        return operation;
+    }
+
+    GWZipExtractOperationPtr toHandler(const GWZipFilePtr& file, DataHandlerLog& log,
+                                       bool answer = true) {
+        GWErrorPtr error;
+        auto operation = GWZipExtractOperation::initForExtractingFile(file, archiveURL, 0,
+                                                                      log.handler(answer), &error);
+        EXPECT_TRUE(operation);
+        return operation;
+    }
+};
+
+// --- Compression methods -------------------------------------------------------
+
+struct MethodCase {
+    const char* label;
+    std::uint16_t method;
+    std::uint16_t flags;
+};
+
+class GWZipExtractMethods : public GWZipExtractOperationTest,
+                            public ::testing::WithParamInterface<MethodCase> {};
+
+TEST_P(GWZipExtractMethods, WritesTheDecodedBytes) {
+    const MethodCase& c = GetParam();
+    const GWData content = textBytes(300000, 17);
+    ZipBuilder zip;
+    ZipEntry& entry = zip.addFile("member.txt", content, c.method);
+    entry.flags = c.flags;
+    if (c.method == 1) {
+        entry.stored = shrinkBytes(content);
+    } else if (c.method == 6) {
+        ImplodeSettings settings;
+        settings.largeDictionary = (c.flags & 2) != 0;
+        settings.literalTree = (c.flags & 4) != 0;
+        entry.stored = implodeBytes(content, settings);
+    }
+    write(zip);
+    auto operation = toDisk(zipEntryFromBuilder(zip, 0), "out.txt", true);
+    runToEnd(operation);
+    ASSERT_FALSE(operation->error()) << operation->error()->localizedDescription();
+    EXPECT_TRUE(operation->started());
+    EXPECT_TRUE(operation->done());
+    EXPECT_EQ(readFile(directory.file("out.txt")), content);
+}
+
+INSTANTIATE_TEST_SUITE_P(EveryDecoder, GWZipExtractMethods,
+                         ::testing::Values(MethodCase{"Stored", 0, 0}, MethodCase{"Shrunk", 1, 0},
+                                           MethodCase{"Imploded", 6, 0},
+                                           MethodCase{"ImplodedLargeWithTree", 6, 6},
+                                           MethodCase{"Deflated", 8, 0},
+                                           MethodCase{"Bzip2", 12, 0}),
+                         [](const auto& info) { return std::string(info.param.label); });
+
+TEST_F(GWZipExtractOperationTest, Deflate64IsRefusedWithItsMethodNumber) {
+    ZipBuilder zip;
+    zip.addFile("a.bin", bytesOf("data"), 9);
+    write(zip);
+    DataHandlerLog log;
+    auto operation = toHandler(zipEntryFromBuilder(zip, 0), log);
+    runToEnd(operation);
+    ASSERT_TRUE(operation->error());
+    EXPECT_TRUE(operation->error()->is(kGWZipArchiveErrorDomain, 1));
+    EXPECT_EQ(operation->error()->detailString(kGWZipArchiveUnknownEntityErrorKey), "9");
+    // The handler hears of the failure once, with no data.
+    ASSERT_EQ(log.doneFlags.size(), 1u);
+    EXPECT_TRUE(log.doneFlags[0]);
+    EXPECT_FALSE(log.hadData[0]);
+    EXPECT_EQ(log.errors[0], operation->error());
+}
+
+TEST_F(GWZipExtractOperationTest, ACorruptStreamFailsAndTellsTheHandlerLast) {
+    ZipBuilder zip;
+    ZipEntry& entry = zip.addFile("bad.txt", textBytes(5000, 1), 8);
+    entry.stored = GWData{0xFF, 0xFF, 0xFF, 0xFF, 0xFF, 0xFF};
+    write(zip);
+    DataHandlerLog log;
+    auto operation = toHandler(zipEntryFromBuilder(zip, 0), log);
+    runToEnd(operation);
+    ASSERT_TRUE(operation->error());
+    ASSERT_FALSE(log.doneFlags.empty());
+    EXPECT_TRUE(log.doneFlags.back());
+    EXPECT_EQ(log.errors.back(), operation->error());
+}
+
+// --- Kinds of entry ------------------------------------------------------------
+
+TEST_F(GWZipExtractOperationTest, AnEmptyEntryMakesAnEmptyFileWithoutAnyHandlerCall) {
+    ZipBuilder zip;
+    zip.addFile("empty", {});
+    write(zip);
+    ProgressLog progress;
+    auto operation = toDisk(zipEntryFromBuilder(zip, 0), "empty", false, progress.handler());
+    runToEnd(operation);
+    ASSERT_FALSE(operation->error());
+    EXPECT_EQ(progress.calls, 0u);
+    struct stat status {};
+    ASSERT_EQ(::stat(directory.file("empty").c_str(), &status), 0);
+    EXPECT_TRUE(S_ISREG(status.st_mode));
+    EXPECT_EQ(status.st_size, 0);
+}
+
+TEST_F(GWZipExtractOperationTest, ADirectoryIsMadeAndReportsOneEmptyFinalChunk) {
+    ZipBuilder zip;
+    zip.addDirectory("folder/");
+    write(zip);
+    auto entry = zipEntryFromBuilder(zip, 0);
+    ASSERT_TRUE(entry->isDirectory());
+
+    DataHandlerLog log;
+    runToEnd(toHandler(entry, log));
+    ASSERT_EQ(log.doneFlags.size(), 1u);
+    EXPECT_TRUE(log.doneFlags[0]);
+    EXPECT_TRUE(log.hadData[0]);
+    EXPECT_TRUE(log.bytes.empty());
+
+    auto operation = toDisk(entry, "deep/er/folder", false);
+    runToEnd(operation);
+    ASSERT_FALSE(operation->error());
+    struct stat status {};
+    ASSERT_EQ(::stat(directory.file("deep/er/folder").c_str(), &status), 0);
+    EXPECT_TRUE(S_ISDIR(status.st_mode));
+}
+
+TEST_F(GWZipExtractOperationTest, SymbolicLinksTakeTheirTargetFromTheData) {
+    ZipBuilder zip;
+    zip.addSymlink("relative", "../sibling/file");
+    zip.addSymlink("absolute", "/etc/hostname");
+    write(zip);
+    for (std::size_t i = 0; i < 2; ++i) {
+        auto entry = zipEntryFromBuilder(zip, i);
+        ASSERT_TRUE(entry->isSymbolicLink());
+        EXPECT_FALSE(entry->symlinkDestination());
+        const std::string name = entry->name();
+        auto operation = toDisk(entry, "links/" + name, true);
+        runToEnd(operation);
+        ASSERT_FALSE(operation->error()) << operation->error()->localizedDescription();
+        char target[256] = {};
+        const ssize_t length =
+            ::readlink(directory.file("links/" + name).c_str(), target, sizeof target - 1);
+        ASSERT_GT(length, 0);
+        const std::string expected = i == 0 ? "../sibling/file" : "/etc/hostname";
+        EXPECT_EQ(std::string(target, std::size_t(length)), expected);
+        EXPECT_EQ(entry->symlinkDestination(), expected);
+    }
+}
+
+TEST_F(GWZipExtractOperationTest, AKnownLinkTargetWinsOverTheData) {
+    ZipBuilder zip;
+    zip.addSymlink("link", "from-data");
+    write(zip);
+    auto entry = zipEntryFromBuilder(zip, 0);
+    entry->setSymlinkDestination(std::string("from-listing"));
+    runToEnd(toDisk(entry, "link", false));
+    char target[64] = {};
+    ASSERT_GT(::readlink(directory.file("link").c_str(), target, sizeof target - 1), 0);
+    EXPECT_STREQ(target, "from-listing");
+}
+
+// --- Atomic and in-place writing -------------------------------------------------
+
+TEST_F(GWZipExtractOperationTest, AtomicExtractionDoesNotReplaceAnExistingItem) {
+    ZipBuilder zip;
+    zip.addFile("a.txt", bytesOf("new"));
+    write(zip);
+    writeFile(directory.file("a.txt"), bytesOf("old"));
+    auto operation = toDisk(zipEntryFromBuilder(zip, 0), "a.txt", true);
+    runToEnd(operation);
+    ASSERT_TRUE(operation->error());
+    EXPECT_TRUE(operation->error()->is(kGWPOSIXErrorDomain, EEXIST));
+    EXPECT_EQ(readFile(directory.file("a.txt")), bytesOf("old"));
+}
+
+TEST_F(GWZipExtractOperationTest, AtomicExtractionShowsNothingUntilTheDataIsComplete) {
+    ZipBuilder zip;
+    zip.addFile("a.txt", textBytes(200000, 4), 8);
+    write(zip);
+    const std::string destination = directory.file("a.txt");
+    bool seenEarly = false;
+    auto operation = toDisk(zipEntryFromBuilder(zip, 0), "a.txt", true, [&](std::uint64_t) {
+        seenEarly = seenEarly || fileExists(destination);
+        return true;
+    });
+    runToEnd(operation);
+    ASSERT_FALSE(operation->error());
+    EXPECT_FALSE(seenEarly);
+    EXPECT_EQ(readFile(destination), textBytes(200000, 4));
+}
+
+TEST_F(GWZipExtractOperationTest, InPlaceExtractionReplacesAnExistingItem) {
+    ZipBuilder zip;
+    zip.addFile("a.txt", bytesOf("new"));
+    write(zip);
+    ::mkdir(directory.file("a.txt").c_str(), 0755);
+    writeFile(directory.file("a.txt/inside"), bytesOf("old"));
+    auto operation = toDisk(zipEntryFromBuilder(zip, 0), "a.txt", false);
+    runToEnd(operation);
+    ASSERT_FALSE(operation->error());
+    EXPECT_EQ(readFile(directory.file("a.txt")), bytesOf("new"));
+}
+
+TEST_F(GWZipExtractOperationTest, ModeAndModificationDateAreApplied) {
+    ZipBuilder zip;
+    ZipEntry& entry = zip.addFile("script.sh", bytesOf("#!/bin/sh\n"));
+    entry.externalAttributes = 0100751u << 16;
+    entry.centralExtra = zipExtraBlock(0x5455, extendedTimestampPayload(1, {1234567890}));
+    write(zip);
+    auto operation = toDisk(zipEntryFromBuilder(zip, 0), "script.sh", true);
+    runToEnd(operation);
+    ASSERT_FALSE(operation->error());
+    struct stat status {};
+    ASSERT_EQ(::stat(directory.file("script.sh").c_str(), &status), 0);
+    EXPECT_EQ(status.st_mode & 07777, 0751u);
+    EXPECT_EQ(status.st_mtim.tv_sec, 1234567890);
+}
+
+// --- Handlers and cancellation ----------------------------------------------------
+
+TEST_F(GWZipExtractOperationTest, TheDataHandlerGetsTheExactBytesWithTheDoneCallLast) {
+    const GWData content = randomBytes(3 * 1024 * 1024 + 5, 9);
+    ZipBuilder zip;
+    zip.addFile("big.bin", content, 8);
+    write(zip);
+    DataHandlerLog log;
+    auto operation = toHandler(zipEntryFromBuilder(zip, 0), log);
+    runToEnd(operation);
+    ASSERT_FALSE(operation->error());
+    EXPECT_EQ(log.bytes, content);
+    ASSERT_GE(log.doneFlags.size(), 2u);
+    EXPECT_TRUE(log.doneFlags.back());
+    EXPECT_EQ(std::count(log.doneFlags.begin(), log.doneFlags.end(), true), 1);
+    EXPECT_FALSE(fileExists(directory.file("big.bin")));
+}
+
+TEST_F(GWZipExtractOperationTest, ProgressDeltasAddUpToTheEntrysSize) {
+    const GWData content = textBytes(2 * 1024 * 1024 + 77, 5);
+    ZipBuilder zip;
+    zip.addFile("a.txt", content, 12);
+    write(zip);
+    ProgressLog progress;
+    auto operation = toDisk(zipEntryFromBuilder(zip, 0), "a.txt", false, progress.handler());
+    runToEnd(operation);
+    ASSERT_FALSE(operation->error());
+    EXPECT_EQ(progress.total, content.size());
+    EXPECT_GE(progress.calls, 2u);
+}
+
+TEST_F(GWZipExtractOperationTest, AProgressHandlerAnsweringFalseCancels) {
+    ZipBuilder zip;
+    zip.addFile("a.txt", textBytes(100000, 2), 8);
+    write(zip);
+    ProgressLog progress;
+    auto operation = toDisk(zipEntryFromBuilder(zip, 0), "a.txt", true, progress.handler(false));
+    runToEnd(operation);
+    ASSERT_TRUE(operation->error());
+    EXPECT_TRUE(operation->error()->is(kGWCocoaErrorDomain, GWUserCancelledError));
+    EXPECT_TRUE(operation->isCancelled());
+    EXPECT_EQ(progress.calls, 1u);
+    EXPECT_FALSE(fileExists(directory.file("a.txt")));
+}
+
+TEST_F(GWZipExtractOperationTest, ACancelledOperationEndsWithoutTouchingTheDisk) {
+    ZipBuilder zip;
+    zip.addFile("a.txt", bytesOf("x"));
+    write(zip);
+    auto operation = toDisk(zipEntryFromBuilder(zip, 0), "sub/a.txt", false);
+    operation->cancel();
+    runToEnd(operation);
+    EXPECT_TRUE(operation->done());
+    EXPECT_TRUE(operation->isFinished());
+    EXPECT_FALSE(fileExists(directory.file("sub")));
+}
+
+TEST_F(GWZipExtractOperationTest, AMissingArchiveIsTheOpenError) {
+    ZipBuilder zip;
+    zip.addFile("a.txt", bytesOf("x"));
+    write(zip);
+    auto entry = zipEntryFromBuilder(zip, 0);
+    DataHandlerLog log;
+    GWErrorPtr error;
+    auto operation = GWZipExtractOperation::initForExtractingFile(
+        entry, directory.url("missing.zip"), 0, log.handler(), &error);
+    runToEnd(operation);
+    ASSERT_TRUE(operation->error());
+    EXPECT_TRUE(operation->error()->is(kGWPOSIXErrorDomain, ENOENT));
+}
+
+TEST_F(GWZipExtractOperationTest, NoEntryIsAWriteError) {
+    GWErrorPtr error;
+    EXPECT_FALSE(GWZipExtractOperation::initForExtractingFile(
+        nullptr, archiveURL, 0, directory.url("x"), true, nullptr, &error));
+    ASSERT_TRUE(error);
+    EXPECT_TRUE(error->is(kGWCocoaErrorDomain, GWFileWriteUnknownError));
+}
+
+// --- Local headers -----------------------------------------------------------------
+
+TEST_F(GWZipExtractOperationTest, AForeignLocalHeaderIsCorruptAndLogged) {
+    ZipBuilder zip;
+    zip.prefix = GWData(64, 0);
+    zip.addFile("a.txt", bytesOf("abc"));
+    write(zip);
+    auto entry = zipEntryFromBuilder(zip, 0);
+    entry->setLocalHeaderOffset(entry->localHeaderOffset() + 1);
+    ZipLogCapture capture;
+    DataHandlerLog log;
+    GWErrorPtr error;
+    auto operation =
+        GWZipExtractOperation::initForExtractingFile(entry, archiveURL, 64, log.handler(), &error);
+    runToEnd(operation);
+    ASSERT_TRUE(operation->error());
+    EXPECT_TRUE(operation->error()->is(kGWCocoaErrorDomain, GWFileReadCorruptFileError));
+    EXPECT_TRUE(capture.contains("error reading local record for file a.txt"));
+}
+
+TEST_F(GWZipExtractOperationTest, TheStartOffsetIsAddedToTheLocalHeaderOffset) {
+    ZipBuilder zip;
+    zip.prefix = bytesOf("#!/bin/sh\nexit 0\n");
+    zip.addFile("a.txt", bytesOf("behind a stub"), 8);
+    write(zip);
+    DataHandlerLog log;
+    GWErrorPtr error;
+    auto operation = GWZipExtractOperation::initForExtractingFile(
+        zipEntryFromBuilder(zip, 0), archiveURL, zip.prefix.size(), log.handler(), &error);
+    runToEnd(operation);
+    ASSERT_FALSE(operation->error());
+    EXPECT_EQ(log.bytes, bytesOf("behind a stub"));
+}
+
+TEST_F(GWZipExtractOperationTest, ALocalHeaderWithMoreInfoRefreshesTheEntry) {
+    ZipBuilder zip;
+    ZipEntry& entry = zip.addFile("central.txt", bytesOf("hello"), 8);
+    entry.localName = bytesOf("dir/local.txt");
+    entry.centralExtra = zipExtraBlock(0x5455, extendedTimestampPayload(1, {1000}));
+    entry.localExtra = zipExtraBlock(0x5455, extendedTimestampPayload(3, {2000000000, 3000}));
+    write(zip);
+    auto file = zipEntryFromBuilder(zip, 0);
+    ASSERT_TRUE(file->moreInfoAvailableInLocalHeader());
+    file->setUncompressedSize(999);
+
+    auto operation = toDisk(file, "out.txt", true);
+    runToEnd(operation);
+    ASSERT_FALSE(operation->error());
+    EXPECT_EQ(file->name(), "local.txt");
+    EXPECT_EQ(file->storedUncompressedSize(), 5u);
+    EXPECT_FALSE(file->moreInfoAvailableInLocalHeader());
+    ASSERT_TRUE(file->modificationDate());
+    EXPECT_EQ(file->modificationDate()->timeIntervalSince1970(), 2000000000);
+    struct stat status {};
+    ASSERT_EQ(::stat(directory.file("out.txt").c_str(), &status), 0);
+    EXPECT_EQ(status.st_mtim.tv_sec, 2000000000);
+}
+
+TEST_F(GWZipExtractOperationTest, ADataDescriptorLeavesTheCentralValuesAlone) {
+    ZipBuilder zip;
+    ZipEntry& entry = zip.addFile("a.txt", textBytes(4000, 8), 8);
+    entry.dataDescriptor = true;
+    entry.centralExtra = zipExtraBlock(0x5455, extendedTimestampPayload(1, {1000}));
+    write(zip);
+    auto file = zipEntryFromBuilder(zip, 0);
+    const auto checksum = file->privateUncompressedChecksum();
+    const auto compressed = file->compressedSize();
+    DataHandlerLog log;
+    runToEnd(toHandler(file, log));
+    EXPECT_EQ(log.bytes, textBytes(4000, 8));
+    EXPECT_EQ(file->privateUncompressedChecksum(), checksum);
+    EXPECT_EQ(file->compressedSize(), compressed);
+    EXPECT_EQ(file->storedUncompressedSize(), 4000u);
+}
+
+}  // namespace

@@ -1,0 +1,151 @@
+#include <cerrno>
+
+#include "GWZipExtractOperation.h"
+#include "applefile/GWAppleFileDecoder.h"
+#include "foundation/GWFileDescriptor.h"
+#include "foundation/GWFileInfo.h"
+#include "foundation/GWFileManager.h"
+#include "foundation/GWMetadataStore.h"
+#include "foundation/GWRemoteFileHandle.h"
+
+bool GWZipExtractOperation::setInfoForFile(const GWZipFilePtr& file, const GWURL& url,
+                                           GWErrorPtr* error) {
+    auto info = GWFileInfo::initWithURL(url, error);
+    if (!info) {
+        return false;
+    }
+    if (auto date = file->creationDate()) {
+        info->setCreationDate(*date);
+    }
+    if (auto date = file->modificationDate()) {
+        info->setModificationDate(*date);
+    }
+    if (auto date = file->backupDate()) {
+        info->setBackupDate(*date);
+    }
+    if (auto date = file->accessDate()) {
+        info->setAccessDate(*date);
+    }
+    // Only what the entry knows: its zeros would wipe the Finder information
+    // an AppleDouble companion or a MacBinary header has just given the file.
+    if (const std::uint32_t code = file->typeCode()) {
+        info->setTypeCode(code);
+    }
+    if (const std::uint32_t code = file->creatorCode()) {
+        info->setCreatorCode(code);
+    }
+    const std::uint32_t location = std::uint32_t(std::uint16_t(file->iconLocationV())) |
+                                   std::uint32_t(std::uint16_t(file->iconLocationH())) << 16;
+    if (location) {
+        info->setLocation(location);
+    }
+    if (const std::uint16_t flags = file->finderFlags()) {
+        info->setFinderFlags(flags);
+    }
+    if (const std::uint16_t flags = file->extendedFinderFlags()) {
+        info->setExtendedFinderFlags(flags);
+    }
+    if (const std::uint16_t folder = file->putAwayFolderID()) {
+        info->setPutAwayFolderID(folder);
+    }
+    if (!info->applyToURL(url, error)) {
+        return false;
+    }
+    const std::uint32_t mode = file->permissionsMode() & 07777;
+    if (file->owner() != info->ownerID() || file->groupOwner() != info->groupID() ||
+        mode != info->permissionsMode()) {
+        info->setOwnerID(file->owner());
+        info->setGroupID(file->groupOwner());
+        info->setPermissionsMode(mode);
+        // Another user's ownership is often refused; the file is still good.
+        info->applyToURL(url, nullptr);
+    }
+    if (auto comment = file->comment(); comment && !comment->empty()) {
+        GWSetSpotlightComments(*comment, url, nullptr);
+    }
+    return true;
+}
+
+void GWZipExtractOperation::writeResourceForkForFile(const GWZipFilePtr& file,
+                                                     const GWRemoteFileHandlePtr& handle,
+                                                     const GWURL& url, Completion completion) {
+    const std::string path = url.path();
+    auto descriptor =
+        std::make_shared<GWFileDescriptor>(GWFileDescriptor::open(path.c_str(), O_RDWR));
+    if (!descriptor->isValid()) {
+        completion(GWPOSIXError(errno, url));
+        return;
+    }
+    auto store = std::make_shared<GWMetadataStore>(descriptor->get(), path);
+    // The position never advances: every piece lands at 0. Known and kept;
+    // a fork longer than one decoded piece keeps only what was written last.
+    const std::uint64_t position = 0;
+    ChunkHandler write = [store, position](std::span<const std::uint8_t> data, bool,
+                                           GWErrorPtr* error) {
+        if (position > UINT32_MAX) {
+            return GWFail(error, GWPOSIXError(EFBIG));
+        }
+        return store->writeResourceFork(data, std::uint32_t(position), error);
+    };
+    unpackFile(file->resourceFork(), handle, std::move(write),
+               [descriptor, store, completion](const GWErrorPtr& error) {
+                   descriptor->reset();
+                   completion(error);
+               });
+}
+
+void GWZipExtractOperation::applyAppleDoubleMetadataForFile(const GWZipFilePtr& file,
+                                                            const GWRemoteFileHandlePtr& handle,
+                                                            const GWURL& url,
+                                                            Completion completion) {
+    const GWURL temporary = GWZipExtractTemporaryURL();
+    GWErrorPtr error;
+    if (!GWCreateEmptyFileAtomicallyAtURL(temporary, &error)) {
+        completion(error);
+        return;
+    }
+    auto writer = GWRemoteFileHandle::initForWritingToURL(temporary, &error);
+    if (!writer) {
+        completion(error);
+        return;
+    }
+    ChunkHandler write = [writer](std::span<const std::uint8_t> data, bool, GWErrorPtr* error) {
+        return writer->writeData(data, error);
+    };
+    unpackFile(file->appleDoubleFile(), handle, std::move(write),
+               [writer, temporary, url, completion](const GWErrorPtr& error) {
+                   writer->closeFileAndReturnError(nullptr);
+                   if (error) {
+                       GWRemoveItemAtURL(temporary, nullptr);
+                       completion(error);
+                       return;
+                   }
+                   // A companion that does not merge is no reason to fail the
+                   // entry. After a merge the copy stays behind: known and kept.
+                   const auto& decoder = GWAppleFileDecoder::sharedInstance();
+                   if (!decoder->mergeAppleDoubleFileAtURL(temporary, url, nullptr)) {
+                       GWRemoveItemAtURL(temporary, nullptr);
+                   }
+                   completion(nullptr);
+               });
+}
+
+void GWZipExtractOperation::decodeMacBinaryFileAtURL(const GWURL& url, Completion completion) {
+    GWDispatchQueue::globalQueue()->async([url, completion = std::move(completion)] {
+        const GWURL temporary = GWZipExtractTemporaryURL();
+        GWErrorPtr error;
+        if (!GWAppleFileDecoder::sharedInstance()->decodeMacBinaryFileAtURL(url, temporary,
+                                                                            &error)) {
+            if (GWItemExistsAtURL(temporary)) {
+                GWRemoveItemAtURL(temporary, nullptr);
+            }
+            completion(error);
+            return;
+        }
+        if (!GWRemoveItemAtURL(url, &error) || !GWMoveItemAtURL(temporary, url, &error)) {
+            completion(error);
+            return;
+        }
+        completion(nullptr);
+    });
+}

@@ -1,0 +1,147 @@
+#pragma once
+
+#include <atomic>
+#include <cstdint>
+#include <functional>
+#include <memory>
+#include <mutex>
+#include <optional>
+#include <span>
+#include <string>
+
+#include "GWZipFile.h"
+#include "GWZipWorkOperation.h"
+#include "foundation/GWDispatch.h"
+#include "foundation/GWError.h"
+#include "foundation/GWURL.h"
+#include "foundation/GWValue.h"
+
+class GWZipArchive;
+class GWRemoteFileHandle;
+class GWZipExtractOperation;
+using GWZipExtractOperationPtr = std::shared_ptr<GWZipExtractOperation>;
+using GWRemoteFileHandlePtr = std::shared_ptr<GWRemoteFileHandle>;
+
+// Extracts one entry of a ZIP archive, either to a location on disk (a file,
+// a directory or a symbolic link, with its Mac metadata and attributes) or,
+// piece by piece, to a data handler. An asynchronous operation: it finishes
+// when its pipeline has ended, which may be on another thread (MacBinary
+// decoding runs on the global queue).
+//
+// Data is streamed: each decoded piece is written or handed on as it comes,
+// so memory stays bounded whatever the entry's size (only a link's target
+// text is collected).
+class GWZipExtractOperation : public GWZipWorkOperation {
+public:
+    // (decoded piece or none, is the last call, error) -> go on? The last
+    // call carries is-done; after a failure it carries no data and the error.
+    using DataHandler = std::function<bool(std::optional<std::span<const std::uint8_t>> data,
+                                           bool isDone, const GWErrorPtr& error)>;
+    // The byte count of one decoded piece (a delta); false stops.
+    using ProgressHandler = std::function<bool(std::uint64_t count)>;
+    // Between the steps of the pipeline: (piece, is-done, error out) -> go on?
+    using ChunkHandler =
+        std::function<bool(std::span<const std::uint8_t> data, bool isDone, GWErrorPtr* error)>;
+    using Completion = std::function<void(const GWErrorPtr& error)>;
+
+    // Destination mode: every decoded piece is also reported to the progress
+    // handler. Fails (Cocoa 512) without an entry. The archive's location and
+    // the offset of its ZIP data are given directly.
+    static GWZipExtractOperationPtr initForExtractingFile(
+        const GWZipFilePtr& file, const GWURL& archiveURL, std::uint64_t startOffset,
+        const GWURL& toURL, bool atomically, ProgressHandler progressHandler, GWErrorPtr* error);
+    static GWZipExtractOperationPtr initForExtractingFile(const GWZipFilePtr& file,
+                                                          const GWURL& archiveURL,
+                                                          std::uint64_t startOffset,
+                                                          DataHandler dataHandler,
+                                                          GWErrorPtr* error);
+
+    const GWZipFilePtr& file() const { return file_; }
+    const GWURL& srcURL() const { return srcURL_; }
+    // None in data-handler mode.
+    const std::optional<GWURL>& destURL() const { return destURL_; }
+    const DataHandler& dataHandler() const { return dataHandler_; }
+    bool isAtomic() const { return isAtomic_; }
+    // Added to every local header offset.
+    std::uint64_t startOffset() const { return startOffset_; }
+    // The error the operation ended with; none while running and on success.
+    GWErrorPtr error() const;
+    bool started() const { return started_.load(); }
+    bool done() const { return done_.load(); }
+
+    bool isAsynchronous() const override { return true; }
+    // Runs main() on the calling thread; a cancelled operation finishes there.
+    void start() override;
+    void main() override;
+
+    // --- The pipeline, outermost first --------------------------------------
+
+    void unpackWithHandler(ChunkHandler handler, Completion completion);
+    // Writes the entry at `target` (none: only the handler sees the data)
+    // and applies the Mac companion that belongs to it.
+    void unpackFile(const GWZipFilePtr& file, const GWRemoteFileHandlePtr& handle,
+                    const std::optional<GWURL>& target, ChunkHandler handler,
+                    Completion completion);
+    // Streams the entry's decoded data to `handler` after its local header.
+    void unpackFile(const GWZipFilePtr& file, const GWRemoteFileHandlePtr& handle,
+                    ChunkHandler handler, Completion completion);
+    // Decodes [offset, offset + length) of the archive, or `data` when given.
+    void extractFile(const GWZipFilePtr& file, std::uint64_t offset, std::uint64_t length,
+                     const std::optional<GWData>& data, std::uint16_t compressionMethod,
+                     const GWRemoteFileHandlePtr& handle, ChunkHandler handler,
+                     Completion completion);
+    // Takes sizes and checksum from a header without a data descriptor, and
+    // the name and extra info the local header gives.
+    bool loadExtraInfoFromLocalHeader(const GWZipLocalFileHeader& header, const GWZipFilePtr& file,
+                                      const GWRemoteFileHandlePtr& handle, GWErrorPtr* error);
+    // Relative targets stay relative.
+    bool createSymbolicLinkAtURL(const GWURL& url, const std::string& destinationPath,
+                                 GWErrorPtr* error);
+
+    // --- Mac metadata --------------------------------------------------------
+
+    // Dates, Finder information, then owner, group and mode (a refused
+    // ownership change is not a failure), then the comment.
+    bool setInfoForFile(const GWZipFilePtr& file, const GWURL& url, GWErrorPtr* error);
+    void writeResourceForkForFile(const GWZipFilePtr& file, const GWRemoteFileHandlePtr& handle,
+                                  const GWURL& url, Completion completion);
+    void applyAppleDoubleMetadataForFile(const GWZipFilePtr& file,
+                                         const GWRemoteFileHandlePtr& handle, const GWURL& url,
+                                         Completion completion);
+    // Replaces the MacBinary file at `url` by its decoded data fork with its
+    // forks and Finder information; runs on the global queue.
+    void decodeMacBinaryFileAtURL(const GWURL& url, Completion completion);
+
+    // Serialises the preparation of destinations across the whole process.
+    static GWSemaphore& creationSemaphore();
+
+    // Temporary names are this, ".temp." and a unique string.
+    static constexpr const char* kBundleIdentifier = "org.gwarchive.GWArchiveSupport";
+
+private:
+    GWZipExtractOperation() = default;
+    static GWZipExtractOperationPtr make(const GWZipFilePtr& file, const GWURL& archiveURL,
+                                         std::uint64_t startOffset, GWErrorPtr* error);
+
+    // Where the data is written: the destination or a fresh place in an
+    // item-replacement directory. Holds the creation semaphore meanwhile.
+    std::optional<GWURL> prepareTarget(bool isDirectory, bool isSymbolicLink, GWErrorPtr* error);
+    void setError(GWErrorPtr error);
+    void markDone();
+
+    GWZipFilePtr file_;
+    GWURL srcURL_;
+    std::optional<GWURL> destURL_;
+    DataHandler dataHandler_;
+    bool isAtomic_ = false;
+    std::uint64_t startOffset_ = 0;
+
+    mutable std::mutex errorMutex_;
+    GWErrorPtr error_;
+    std::atomic<bool> started_{false};
+    std::atomic<bool> done_{false};
+};
+
+// A temporary location in the process's temporary directory, named after the
+// library's bundle identifier.
+GWURL GWZipExtractTemporaryURL();
