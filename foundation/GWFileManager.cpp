@@ -144,16 +144,17 @@ bool GWCreateEmptyFileAtomicallyAtURL(const GWURL& url, GWErrorPtr* error) {
         return false;
     }
     const std::string path = url.path();
-    std::string temporary = path + ".gwtemp-XXXXXX";
-    const int fd = ::mkstemp(temporary.data());
-    if (fd < 0) {
+    // open() rather than mkstemp(), so that the umask gives the usual mode.
+    // A short name of its own, beside the file: the file's name may already
+    // be as long as names can be.
+    const std::string temporary =
+        url.URLByDeletingLastPathComponent().path() + "/.gwtemp-" + GWUniqueID();
+    GWFileDescriptor file =
+        GWFileDescriptor::open(temporary.c_str(), O_WRONLY | O_CREAT | O_EXCL, 0666);
+    if (!file.isValid()) {
         return GWFail(error, posixError(errno, url, "writing"));
     }
-    GWFileDescriptor owned(fd);
-    // mkstemp makes 0600; an ordinary new file gets the default mode.
-    const mode_t mask = ::umask(0);
-    ::umask(mask);
-    ::fchmod(fd, 0666 & ~mask);
+    file.reset();
     if (::rename(temporary.c_str(), path.c_str()) != 0) {
         const int number = errno;
         ::unlink(temporary.c_str());
