@@ -47,34 +47,6 @@ TEST_F(GWFileManagerTest, RefusedMetadataMovesWithItsItem) {
               GWData(64, 7));
 }
 
-TEST_F(GWFileManagerTest, RemovingTakesADirectoryWithItsContents) {
-    ASSERT_TRUE(GWCreateDirectoryAtURL(directory.url("a/b/c"), true, &error));
-    writeFile(directory.file("a/b/c/file"), bytesOf("x"));
-    ASSERT_TRUE(::symlink("/nonexistent", directory.file("a/link").c_str()) == 0);
-    ASSERT_TRUE(GWRemoveItemAtURL(directory.url("a"), &error));
-    EXPECT_FALSE(fileExists(directory.file("a")));
-
-    EXPECT_FALSE(GWRemoveItemAtURL(directory.url("a"), &error));
-    EXPECT_TRUE(error->is(kGWPOSIXErrorDomain, ENOENT));
-}
-
-TEST_F(GWFileManagerTest, CreatingDirectoriesOverAFileFails) {
-    writeFile(directory.file("file"), bytesOf("x"));
-    EXPECT_FALSE(GWCreateDirectoryAtURL(directory.url("file/sub"), true, &error));
-    ASSERT_TRUE(error);
-    EXPECT_EQ(error->domain(), kGWPOSIXErrorDomain);
-    EXPECT_TRUE(GWCreateDirectoryAtURL(directory.url("dir"), true, &error));
-    EXPECT_TRUE(GWCreateDirectoryAtURL(directory.url("dir"), true, &error));
-    EXPECT_FALSE(GWCreateDirectoryAtURL(directory.url("dir"), false, &error));
-}
-
-TEST_F(GWFileManagerTest, AnEmptyFileReplacesWhatWasThere) {
-    writeFile(directory.file("f"), bytesOf("content"));
-    ASSERT_TRUE(GWCreateEmptyFileAtomicallyAtURL(directory.url("f"), &error));
-    EXPECT_TRUE(readFile(directory.file("f")).empty());
-    EXPECT_FALSE(GWCreateEmptyFileAtomicallyAtURL(directory.url("missing/f"), &error));
-}
-
 TEST_F(GWFileManagerTest, AReplacementDirectoryIsFreshPrivateAndOnTheSameDevice) {
     auto first = GWItemReplacementDirectoryForURL(directory.url(""), &error);
     auto second = GWItemReplacementDirectoryForURL(directory.url(""), &error);

@@ -84,19 +84,6 @@ TEST_F(GWZipExtractMacMetadata, AnUnmergeableCompanionIsNoFailure) {
     EXPECT_EQ(readFile(directory.file("a.txt")), bytesOf("data"));
 }
 
-TEST_F(GWZipExtractMacMetadata, AResourceForkCompanionIsWrittenWholeWhenItIsOnePiece) {
-    const GWData fork = randomBytes(2000, 6);
-    ZipBuilder zip;
-    zip.addFile("Icon", bytesOf("data"));
-    zip.addFile("XtraStuf.mac/Icon", fork, 8);
-    zip.write(archivePath);
-    auto file = zipEntryFromBuilder(zip, 0);
-    file->setResourceFork(zipEntryFromBuilder(zip, 1));
-    auto operation = extract(file, "Icon");
-    ASSERT_FALSE(operation->error()) << operation->error()->localizedDescription();
-    EXPECT_EQ(attribute("Icon", "com.apple.ResourceFork"), fork);
-}
-
 TEST_F(GWZipExtractMacMetadata, EveryResourceForkPieceIsWrittenAtPositionZero) {
     // A fork of several decoded pieces: each later piece overwrites the start
     // of the earlier ones, and nothing is truncated.

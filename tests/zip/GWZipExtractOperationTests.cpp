@@ -183,18 +183,6 @@ TEST_F(GWZipExtractOperationTest, SymbolicLinksTakeTheirTargetFromTheData) {
     }
 }
 
-TEST_F(GWZipExtractOperationTest, AKnownLinkTargetWinsOverTheData) {
-    ZipBuilder zip;
-    zip.addSymlink("link", "from-data");
-    write(zip);
-    auto entry = zipEntryFromBuilder(zip, 0);
-    entry->setSymlinkDestination(std::string("from-listing"));
-    runToEnd(toDisk(entry, "link", false));
-    char target[64] = {};
-    ASSERT_GT(::readlink(directory.file("link").c_str(), target, sizeof target - 1), 0);
-    EXPECT_STREQ(target, "from-listing");
-}
-
 // --- Atomic and in-place writing -------------------------------------------------
 
 TEST_F(GWZipExtractOperationTest, AtomicExtractionDoesNotReplaceAnExistingItem) {
@@ -307,28 +295,6 @@ TEST_F(GWZipExtractOperationTest, ACancelledOperationEndsWithoutTouchingTheDisk)
     EXPECT_TRUE(operation->done());
     EXPECT_TRUE(operation->isFinished());
     EXPECT_FALSE(fileExists(directory.file("sub")));
-}
-
-TEST_F(GWZipExtractOperationTest, AMissingArchiveIsTheOpenError) {
-    ZipBuilder zip;
-    zip.addFile("a.txt", bytesOf("x"));
-    write(zip);
-    auto entry = zipEntryFromBuilder(zip, 0);
-    DataHandlerLog log;
-    GWErrorPtr error;
-    auto operation = GWZipExtractOperation::initForExtractingFile(
-        entry, directory.url("missing.zip"), 0, log.handler(), &error);
-    runToEnd(operation);
-    ASSERT_TRUE(operation->error());
-    EXPECT_TRUE(operation->error()->is(kGWPOSIXErrorDomain, ENOENT));
-}
-
-TEST_F(GWZipExtractOperationTest, NoEntryIsAWriteError) {
-    GWErrorPtr error;
-    EXPECT_FALSE(GWZipExtractOperation::initForExtractingFile(
-        nullptr, archiveURL, 0, directory.url("x"), true, nullptr, &error));
-    ASSERT_TRUE(error);
-    EXPECT_TRUE(error->is(kGWCocoaErrorDomain, GWFileWriteUnknownError));
 }
 
 // --- Local headers -----------------------------------------------------------------
