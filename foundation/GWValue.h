@@ -69,3 +69,6 @@ struct GWValue {
 
 // The value under `key`, or nullptr.
 const GWValue* GWDictionaryValue(const GWDictionary& dictionary, const std::string& key);
+// The answer would point into a dictionary that dies with the statement
+// (such as a getter's copy): keep the dictionary in a variable first.
+const GWValue* GWDictionaryValue(GWDictionary&& dictionary, const std::string& key) = delete;
