@@ -9,6 +9,7 @@
 #include "GWXARFile.h"
 #include "GWXARSignature.h"
 #include "GWZipArchive.h"
+#include "GWZipExtractOperation.h"
 #include "GWZipFile.h"
 #include "GWZipLoadOperation.h"
 #include "GWZipWorkOperation.h"
