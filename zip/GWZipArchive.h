@@ -4,10 +4,12 @@
 #include <functional>
 #include <memory>
 #include <mutex>
+#include <optional>
 #include <string>
 #include <unordered_map>
 #include <vector>
 
+#include "GWZipExtractOperation.h"
 #include "GWZipFile.h"
 #include "GWZipLoadOperation.h"
 #include "foundation/GWCoder.h"
@@ -105,4 +107,45 @@ private:
     // Name -> first root of that name, built on the first lookup.
     mutable std::unordered_map<std::string, std::size_t> rootIndex_;
     mutable bool rootIndexValid_ = false;
+
+    // --- Extraction (zip/GWZipArchiveExtraction.cpp) ----------------------------------
+    //
+    // Every entry is extracted by its own GWZipExtractOperation, at its full
+    // archive path below the directory; a directory brings its whole subtree,
+    // its children starting only after it finished. The progress handler
+    // (byte count of each decoded piece; false stops) is shared by the whole
+    // batch and may be called from several threads at once.
+public:
+    using ProgressHandler = GWZipExtractOperation::ProgressHandler;
+    using DataHandler = GWZipExtractOperation::DataHandler;
+
+    // Synchronous: waits for the batch and reports its first error. Must not
+    // be called from a thread the extraction queue needs.
+    bool extractFile(const GWZipFilePtr& file, const GWURL& directory, bool atomically,
+                     ProgressHandler progressHandler, GWErrorPtr* error);
+    bool extractFiles(const GWZipFileArray& files, const GWURL& directory, bool atomically,
+                      ProgressHandler progressHandler, GWErrorPtr* error);
+    // On `queue` (none: a new queue twice as wide as the processor count).
+    // The first error cancels the rest of the batch; the completion handler
+    // runs on the queue with it, or with none. If the operations cannot be
+    // built the handler is never called (known and kept).
+    void extractFile(const GWZipFilePtr& file, const GWURL& directory, bool atomically,
+                     const GWOperationQueuePtr& queue, ProgressHandler progressHandler,
+                     CompletionHandler completionHandler);
+    void extractFiles(const GWZipFileArray& files, const GWURL& directory, bool atomically,
+                      const GWOperationQueuePtr& queue, ProgressHandler progressHandler,
+                      CompletionHandler completionHandler);
+    // The operations of a batch, each entry's directory operation before
+    // its descendants, which depend on it.
+    std::optional<std::vector<GWZipExtractOperationPtr>> operationsToExtractFiles(
+        const GWZipFileArray& files, const GWURL& directory, bool atomically,
+        ProgressHandler progressHandler, GWErrorPtr* error);
+    // `destination` is the entry's own location, not its parent directory.
+    std::optional<std::vector<GWZipExtractOperationPtr>> operationsToExtractFile(
+        const GWZipFilePtr& file, const GWURL& destination, bool atomically,
+        ProgressHandler progressHandler, GWErrorPtr* error);
+    // Streams the entry's data fork to the handler from an operation on
+    // `queue` (none: a new queue).
+    void extractDataForkOfFile(const GWZipFilePtr& file, const GWOperationQueuePtr& queue,
+                               DataHandler handler);
 };

@@ -1,3 +1,4 @@
+#include "GWZipExtractDestination.h"
 #include "GWZipExtractOperation.h"
 #include "foundation/GWConversions.h"
 #include "foundation/GWFileManager.h"
@@ -50,4 +51,21 @@ GWURL GWZipExtractTemporaryURL() {
     return GWURL::fileURLWithPath(GWTemporaryDirectoryPath() + "/" +
                                   GWZipExtractOperation::kBundleIdentifier + ".temp." +
                                   GWUniqueID());
+}
+
+GWURL GWZipEntryDestinationURL(const GWURL& base, std::string_view relativePath) {
+    GWURL destination = base;
+    std::size_t start = 0;
+    while (start <= relativePath.size()) {
+        std::size_t end = relativePath.find('/', start);
+        if (end == std::string_view::npos) {
+            end = relativePath.size();
+        }
+        if (end > start) {
+            destination =
+                destination.URLByAppendingPathComponent(relativePath.substr(start, end - start));
+        }
+        start = end + 1;
+    }
+    return destination;
 }

@@ -1,5 +1,7 @@
 #include "GWZipExtractOperation.h"
 
+#include "GWZipArchive.h"
+
 #include "foundation/GWFileManager.h"
 #include "foundation/GWRemoteFileHandle.h"
 
@@ -45,6 +47,37 @@ GWZipExtractOperationPtr GWZipExtractOperation::initForExtractingFile(const GWZi
         operation->dataHandler_ = std::move(dataHandler);
     }
     return operation;
+}
+
+namespace {
+
+GWErrorPtr missingArchiveError() {
+    return GWGenerateError(kGWCocoaErrorDomain, GWFileWriteUnknownError, std::nullopt, nullptr, {},
+                           "No archive to extract from");
+}
+
+}  // namespace
+
+GWZipExtractOperationPtr GWZipExtractOperation::initForExtractingFile(
+    const GWZipFilePtr& file, const std::shared_ptr<GWZipArchive>& archive, const GWURL& toURL,
+    bool atomically, ProgressHandler progressHandler, GWErrorPtr* error) {
+    if (!archive) {
+        GWFail(error, missingArchiveError());
+        return nullptr;
+    }
+    return initForExtractingFile(file, archive->URL(), archive->startOffset(), toURL, atomically,
+                                 std::move(progressHandler), error);
+}
+
+GWZipExtractOperationPtr GWZipExtractOperation::initForExtractingFile(
+    const GWZipFilePtr& file, const std::shared_ptr<GWZipArchive>& archive, DataHandler dataHandler,
+    GWErrorPtr* error) {
+    if (!archive) {
+        GWFail(error, missingArchiveError());
+        return nullptr;
+    }
+    return initForExtractingFile(file, archive->URL(), archive->startOffset(),
+                                 std::move(dataHandler), error);
 }
 
 GWErrorPtr GWZipExtractOperation::error() const {

@@ -45,8 +45,16 @@ public:
     using Completion = std::function<void(const GWErrorPtr& error)>;
 
     // Destination mode: every decoded piece is also reported to the progress
-    // handler. Fails (Cocoa 512) without an entry. The archive's location and
-    // the offset of its ZIP data are given directly.
+    // handler. Fails (Cocoa 512) without an entry or an archive.
+    static GWZipExtractOperationPtr initForExtractingFile(
+        const GWZipFilePtr& file, const std::shared_ptr<GWZipArchive>& archive, const GWURL& toURL,
+        bool atomically, ProgressHandler progressHandler, GWErrorPtr* error);
+    // Data-handler mode.
+    static GWZipExtractOperationPtr initForExtractingFile(
+        const GWZipFilePtr& file, const std::shared_ptr<GWZipArchive>& archive,
+        DataHandler dataHandler, GWErrorPtr* error);
+    // The same with the archive's location and the offset of its ZIP data
+    // given directly.
     static GWZipExtractOperationPtr initForExtractingFile(
         const GWZipFilePtr& file, const GWURL& archiveURL, std::uint64_t startOffset,
         const GWURL& toURL, bool atomically, ProgressHandler progressHandler, GWErrorPtr* error);

@@ -1,0 +1,231 @@
+// Batches of entries extracted through GWZipArchive: destinations, directory
+// ordering, the shared first error, queues and the data-fork stream.
+
+#include <gtest/gtest.h>
+#include <sys/stat.h>
+
+#include <atomic>
+
+#include "GWArchiveSupport/GWArchiveConstants.h"
+#include "foundation/GWDispatch.h"
+#include "foundation/GWMetadataStore.h"
+#include "support/AppleDoubleBuilder.h"
+#include "support/MetadataTestSupport.h"
+#include "support/TestSupport.h"
+#include "support/ZipBuilder.h"
+#include "zip/GWZipArchive.h"
+#include "zip/ZipExtractTestSupport.h"
+
+namespace {
+
+using namespace gwtest;
+
+class GWZipArchiveExtraction : public ::testing::Test {
+protected:
+    GWZipArchivePtr open(const ZipBuilder& zip) {
+        zip.write(directory.file("archive.zip"));
+        GWErrorPtr error;
+        auto archive = GWZipArchive::initWithURL(directory.url("archive.zip"), &error);
+        EXPECT_TRUE(archive) << (error ? error->localizedDescription() : "");
+        return archive;
+    }
+
+    TemporaryDirectory directory;
+    GWErrorPtr error;
+};
+
+TEST_F(GWZipArchiveExtraction, AnEntryGoesToItsFullPathBelowTheDirectory) {
+    ZipBuilder zip;
+    zip.addFile("a/b/c", bytesOf("deep"), 8);
+    auto archive = open(zip);
+    auto file = archive->fileWithPath("a/b/c");
+    ASSERT_TRUE(file);
+    for (bool atomically : {true, false}) {
+        const std::string out = atomically ? "atomic" : "in-place";
+        ASSERT_TRUE(archive->extractFile(file, directory.url(out), atomically, nullptr, &error))
+            << error->localizedDescription();
+        EXPECT_EQ(readFile(directory.file(out + "/a/b/c")), bytesOf("deep"));
+    }
+}
+
+TEST_F(GWZipArchiveExtraction, ADirectoryBringsItsWholeSubtree) {
+    ZipBuilder zip;
+    zip.addDirectory("top/");
+    zip.addFile("top/one.txt", bytesOf("1"));
+    zip.addDirectory("top/sub/");
+    zip.addFile("top/sub/two.txt", bytesOf("22"), 8);
+    zip.addSymlink("top/sub/link", "two.txt");
+    zip.addFile("elsewhere.txt", bytesOf("not asked for"));
+    auto archive = open(zip);
+    ASSERT_TRUE(archive->extractFile(archive->fileWithPath("top"), directory.url("out"), true,
+                                     nullptr, &error))
+        << error->localizedDescription();
+    EXPECT_EQ(readFile(directory.file("out/top/one.txt")), bytesOf("1"));
+    EXPECT_EQ(readFile(directory.file("out/top/sub/two.txt")), bytesOf("22"));
+    EXPECT_EQ(readFile(directory.file("out/top/sub/link")), bytesOf("22"));
+    EXPECT_FALSE(fileExists(directory.file("out/elsewhere.txt")));
+}
+
+TEST_F(GWZipArchiveExtraction, DirectoryOperationsComeFirstAndAreDependedOn) {
+    ZipBuilder zip;
+    zip.addDirectory("d/");
+    zip.addDirectory("d/e/");
+    zip.addFile("d/e/f", bytesOf("x"));
+    zip.addFile("d/g", bytesOf("y"));
+    auto archive = open(zip);
+    auto operations = archive->operationsToExtractFile(
+        archive->fileWithPath("d"), directory.url("dest"), true, nullptr, &error);
+    ASSERT_TRUE(operations);
+    ASSERT_EQ(operations->size(), 4u);
+    std::vector<std::string> paths;
+    for (const auto& operation : *operations) {
+        paths.push_back(operation->destURL()->path());
+    }
+    const std::string base = directory.file("dest");
+    EXPECT_EQ(paths, (std::vector<std::string>{base, base + "/e", base + "/e/f", base + "/g"}));
+    auto dependsOn = [](const GWZipExtractOperationPtr& operation,
+                        const GWZipExtractOperationPtr& on) {
+        for (const auto& dependency : operation->dependencies()) {
+            if (dependency == on) {
+                return true;
+            }
+        }
+        return false;
+    };
+    const auto& ops = *operations;
+    EXPECT_TRUE(ops[0]->dependencies().empty());
+    EXPECT_TRUE(dependsOn(ops[1], ops[0]));
+    EXPECT_TRUE(dependsOn(ops[2], ops[1]));
+    EXPECT_TRUE(dependsOn(ops[3], ops[0]));
+}
+
+TEST_F(GWZipArchiveExtraction, AnEmptyListCompletesWithoutError) {
+    ZipBuilder zip;
+    zip.addFile("a", bytesOf("x"));
+    auto archive = open(zip);
+    EXPECT_TRUE(archive->extractFiles({}, directory.url("out"), true, nullptr, &error));
+
+    GWSemaphore done(0);
+    GWErrorPtr reported = GWCocoaError(GWFileReadUnknownError);
+    archive->extractFiles({}, directory.url("out"), true, nullptr, nullptr,
+                          [&](const GWErrorPtr& batchError) {
+                              reported = batchError;
+                              done.signal();
+                          });
+    done.wait();
+    EXPECT_FALSE(reported);
+}
+
+TEST_F(GWZipArchiveExtraction, AProgressHandlerAnsweringFalseCancelsTheBatch) {
+    ZipBuilder zip;
+    for (int i = 0; i < 30; ++i) {
+        zip.addFile("f" + std::to_string(i), textBytes(50000, i), 8);
+    }
+    auto archive = open(zip);
+    std::atomic<int> calls{0};
+    EXPECT_FALSE(archive->extractFiles(
+        archive->files(), directory.url("out"), true,
+        [&](std::uint64_t) {
+            ++calls;
+            return false;
+        },
+        &error));
+    ASSERT_TRUE(error);
+    EXPECT_TRUE(error->is(kGWCocoaErrorDomain, GWUserCancelledError));
+    EXPECT_GE(calls.load(), 1);
+    // Stopped or cancelled, no entry reached its destination.
+    for (int i = 0; i < 30; ++i) {
+        EXPECT_FALSE(fileExists(directory.file("out/f" + std::to_string(i)))) << i;
+    }
+}
+
+TEST_F(GWZipArchiveExtraction, TheFirstErrorIsTheBatchsResult) {
+    ZipBuilder zip;
+    zip.addFile("good", bytesOf("fine"));
+    zip.addFile("bad", bytesOf("data"), 9);
+    auto archive = open(zip);
+    auto queue = std::make_shared<GWOperationQueue>();
+    GWSemaphore done(0);
+    GWErrorPtr reported;
+    archive->extractFiles(archive->files(), directory.url("out"), false, queue, nullptr,
+                          [&](const GWErrorPtr& batchError) {
+                              reported = batchError;
+                              done.signal();
+                          });
+    done.wait();
+    ASSERT_TRUE(reported);
+    EXPECT_TRUE(reported->is(kGWZipArchiveErrorDomain, 1));
+}
+
+TEST_F(GWZipArchiveExtraction, TheDataForkStreamsToTheHandlerOnTheQueue) {
+    const GWData content = randomBytes(700000, 3);
+    ZipBuilder zip;
+    zip.addFile("blob", content, 8);
+    auto archive = open(zip);
+    DataHandlerLog log;
+    GWSemaphore done(0);
+    auto handler = log.handler();
+    archive->extractDataForkOfFile(archive->fileWithPath("blob"), nullptr,
+                                   [&](auto data, bool isDone, const GWErrorPtr& handlerError) {
+                                       const bool answer = handler(data, isDone, handlerError);
+                                       if (isDone) {
+                                           done.signal();
+                                       }
+                                       return answer;
+                                   });
+    done.wait();
+    EXPECT_EQ(log.bytes, content);
+    EXPECT_TRUE(log.doneFlags.back());
+    EXPECT_FALSE(log.errors.back());
+}
+
+TEST_F(GWZipArchiveExtraction, NoEntryToStreamReportsTheErrorToTheHandler) {
+    ZipBuilder zip;
+    zip.addFile("a", bytesOf("x"));
+    auto archive = open(zip);
+    GWSemaphore done(0);
+    GWErrorPtr reported;
+    bool sawData = true;
+    archive->extractDataForkOfFile(nullptr, nullptr,
+                                   [&](auto data, bool isDone, const GWErrorPtr& handlerError) {
+                                       sawData = data.has_value();
+                                       reported = handlerError;
+                                       EXPECT_TRUE(isDone);
+                                       done.signal();
+                                       return true;
+                                   });
+    done.wait();
+    EXPECT_FALSE(sawData);
+    ASSERT_TRUE(reported);
+    EXPECT_TRUE(reported->is(kGWCocoaErrorDomain, GWFileWriteUnknownError));
+}
+
+TEST_F(GWZipArchiveExtraction, MacCompanionsListedByTheLoaderBecomeMetadata) {
+    if (!userAttributesSupported(directory.path())) {
+        GTEST_SKIP() << "no user extended attributes here";
+    }
+    AppleDoubleFile companion;
+    companion.finderInfo = finderInfoBytes("TEXT", "ttxt", 0x0400);
+    companion.attributes = {{"com.example.tag", bytesOf("red")}};
+    ZipBuilder zip;
+    zip.addFile("docs/a.txt", bytesOf("a"), 8);
+    zip.addFile("__MACOSX/docs/._a.txt", buildAppleDouble(companion), 8);
+    zip.addFile("docs/Icon", bytesOf("i"));
+    zip.addFile("XtraStuf.mac/docs/Icon", bytesOf("resource bytes"), 8);
+    auto archive = open(zip);
+    ASSERT_EQ(archive->files().size(), 1u);
+    ASSERT_TRUE(
+        archive->extractFiles(archive->files(), directory.url("out"), true, nullptr, &error))
+        << error->localizedDescription();
+    const std::string a = directory.file("out/docs/a.txt");
+    EXPECT_EQ(readFile(a), bytesOf("a"));
+    EXPECT_EQ(GWMetadataStore(a).attribute("com.example.tag", nullptr), bytesOf("red"));
+    EXPECT_EQ(GWMetadataStore(a).attribute("com.apple.FinderInfo", nullptr), companion.finderInfo);
+    EXPECT_EQ(GWMetadataStore(directory.file("out/docs/Icon"))
+                  .attribute("com.apple.ResourceFork", nullptr),
+              bytesOf("resource bytes"));
+    EXPECT_FALSE(fileExists(directory.file("out/__MACOSX")));
+    EXPECT_FALSE(fileExists(directory.file("out/XtraStuf.mac")));
+}
+
+}  // namespace

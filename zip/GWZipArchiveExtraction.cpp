@@ -1,0 +1,194 @@
+#include <thread>
+
+#include "GWZipArchive.h"
+#include "GWZipExtractDestination.h"
+#include "foundation/GWDispatch.h"
+
+namespace {
+
+// What the operations of one batch share: the first error, and the lock
+// that serialises their completion steps.
+struct BatchState {
+    GWSemaphore lock{1};
+    GWErrorPtr firstError;
+    std::vector<std::weak_ptr<GWZipExtractOperation>> operations;
+};
+
+GWOperationQueuePtr extractionQueue() {
+    auto queue = std::make_shared<GWOperationQueue>();
+    const unsigned processors = std::max(1u, std::thread::hardware_concurrency());
+    queue->setMaxConcurrentOperationCount(long(processors) * 2);
+    return queue;
+}
+
+}  // namespace
+
+bool GWZipArchive::extractFile(const GWZipFilePtr& file, const GWURL& directory, bool atomically,
+                               ProgressHandler progressHandler, GWErrorPtr* error) {
+    return extractFiles(GWZipFileArray{file}, directory, atomically, std::move(progressHandler),
+                        error);
+}
+
+bool GWZipArchive::extractFiles(const GWZipFileArray& files, const GWURL& directory,
+                                bool atomically, ProgressHandler progressHandler,
+                                GWErrorPtr* error) {
+    struct Result {
+        GWSemaphore done{0};
+        std::mutex mutex;
+        GWErrorPtr error;
+        bool set = false;
+    };
+    auto result = std::make_shared<Result>();
+    // When the operations cannot be built the completion never runs and this
+    // waits for ever: known and kept.
+    extractFiles(files, directory, atomically, nullptr, std::move(progressHandler),
+                 [result](const GWErrorPtr& batchError) {
+                     {
+                         std::lock_guard lock(result->mutex);
+                         if (!result->set) {
+                             result->error = batchError;
+                             result->set = true;
+                         }
+                     }
+                     result->done.signal();
+                 });
+    result->done.wait();
+    std::lock_guard lock(result->mutex);
+    if (result->error) {
+        return GWFail(error, result->error);
+    }
+    return true;
+}
+
+void GWZipArchive::extractFile(const GWZipFilePtr& file, const GWURL& directory, bool atomically,
+                               const GWOperationQueuePtr& queue, ProgressHandler progressHandler,
+                               CompletionHandler completionHandler) {
+    extractFiles(GWZipFileArray{file}, directory, atomically, queue, std::move(progressHandler),
+                 std::move(completionHandler));
+}
+
+void GWZipArchive::extractFiles(const GWZipFileArray& files, const GWURL& directory,
+                                bool atomically, const GWOperationQueuePtr& queue,
+                                ProgressHandler progressHandler,
+                                CompletionHandler completionHandler) {
+    const GWOperationQueuePtr runQueue = queue ? queue : extractionQueue();
+    GWErrorPtr error;
+    auto operations =
+        operationsToExtractFiles(files, directory, atomically, std::move(progressHandler), &error);
+    if (!operations) {
+        // The completion handler is deliberately never called here.
+        return;
+    }
+    auto state = std::make_shared<BatchState>();
+    for (const auto& operation : *operations) {
+        state->operations.push_back(operation);
+    }
+    auto finalOperation = std::make_shared<GWBlockOperation>();
+    for (const auto& operation : *operations) {
+        std::weak_ptr<GWZipExtractOperation> weakOperation = operation;
+        operation->setCompletionBlock([weakOperation, state] {
+            state->lock.wait();
+            if (auto finished = weakOperation.lock()) {
+                if (finished->isCancelled() && !state->firstError) {
+                    state->firstError = GWCocoaError(GWUserCancelledError);
+                }
+                if (auto operationError = finished->error(); operationError && !state->firstError) {
+                    state->firstError = operationError;
+                }
+            }
+            if (state->firstError) {
+                for (const auto& weak : state->operations) {
+                    if (auto other = weak.lock()) {
+                        other->cancel();
+                    }
+                }
+            }
+            state->lock.signal();
+        });
+        finalOperation->addDependency(operation);
+        runQueue->addOperation(operation);
+    }
+    finalOperation->addExecutionBlock(
+        [runQueue, state, completion = std::move(completionHandler)]() mutable {
+            if (completion) {
+                runQueue->addOperationWithBlock(
+                    [state, completion = std::move(completion)] { completion(state->firstError); });
+            }
+        });
+    runQueue->addOperation(finalOperation);
+}
+
+std::optional<std::vector<GWZipExtractOperationPtr>> GWZipArchive::operationsToExtractFiles(
+    const GWZipFileArray& files, const GWURL& directory, bool atomically,
+    ProgressHandler progressHandler, GWErrorPtr* error) {
+    std::vector<GWZipExtractOperationPtr> operations;
+    for (const auto& file : files) {
+        if (!file) {
+            GWFail(error, GWCocoaError(GWFileWriteUnknownError));
+            return std::nullopt;
+        }
+        auto more = operationsToExtractFile(file, GWZipEntryDestinationURL(directory, file->path()),
+                                            atomically, progressHandler, error);
+        if (!more) {
+            return std::nullopt;
+        }
+        operations.insert(operations.end(), more->begin(), more->end());
+    }
+    return operations;
+}
+
+std::optional<std::vector<GWZipExtractOperationPtr>> GWZipArchive::operationsToExtractFile(
+    const GWZipFilePtr& file, const GWURL& destination, bool atomically,
+    ProgressHandler progressHandler, GWErrorPtr* error) {
+    // Built with a work list, not recursion: a tree may be thousands deep.
+    // Each operation depends on its directory's, and through it on every
+    // ancestor's; a directory comes before its descendants in the list.
+    struct Pending {
+        GWZipFilePtr file;
+        GWURL destination;
+        GWZipExtractOperationPtr directoryOperation;
+    };
+    std::vector<GWZipExtractOperationPtr> operations;
+    std::vector<Pending> pending{{file, destination, nullptr}};
+    const GWURL archiveURL = URL();
+    while (!pending.empty()) {
+        Pending next = std::move(pending.back());
+        pending.pop_back();
+        auto operation = GWZipExtractOperation::initForExtractingFile(
+            next.file, archiveURL, startOffset(), next.destination, atomically, progressHandler,
+            error);
+        if (!operation) {
+            return std::nullopt;
+        }
+        if (next.directoryOperation) {
+            operation->addDependency(next.directoryOperation);
+        }
+        operations.push_back(operation);
+        if (next.file->isDirectory()) {
+            if (auto children = next.file->children()) {
+                // Reversed onto the stack, so children come out in order.
+                for (auto it = children->rbegin(); it != children->rend(); ++it) {
+                    if (*it) {
+                        pending.push_back(
+                            {*it, GWZipEntryDestinationURL(next.destination, (*it)->name()),
+                             operation});
+                    }
+                }
+            }
+        }
+    }
+    return operations;
+}
+
+void GWZipArchive::extractDataForkOfFile(const GWZipFilePtr& file, const GWOperationQueuePtr& queue,
+                                         DataHandler handler) {
+    const GWOperationQueuePtr runQueue = queue ? queue : std::make_shared<GWOperationQueue>();
+    GWErrorPtr error;
+    auto operation =
+        GWZipExtractOperation::initForExtractingFile(file, URL(), startOffset(), handler, &error);
+    if (operation) {
+        runQueue->addOperation(operation);
+    } else if (handler) {
+        runQueue->addOperationWithBlock([handler, error] { handler(std::nullopt, true, error); });
+    }
+}
