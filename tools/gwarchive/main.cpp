@@ -1,30 +1,88 @@
 #include <cstdio>
 #include <cstring>
+#include <string>
+#include <vector>
 
+#include "Command.h"
+#include "Diagnostics.h"
 #include "GWArchiveSupport/GWArchiveSupport.h"
+
+using namespace gwarchive;
 
 namespace {
 
-const char kUsage[] =
-    "usage: gwarchive [--version] [--help]\n"
-    "\n"
-    "Reads ZIP and XAR archives, keeping the metadata that archives made on Macs carry.\n"
-    "\n"
-    "options:\n"
-    "  --version   print the library version and exit\n"
-    "  --help      print this help and exit\n";
+const Command* const kCommands[] = {
+    &kListCommand, &kExtractCommand,   &kCatCommand,        &kTestCommand,
+    &kInfoCommand, &kDetectCommand,    &kMacBinaryCommand, &kAppleDoubleCommand,
+};
+
+void printToolHelp(std::FILE* stream) {
+    std::fputs(
+        "usage: gwarchive COMMAND [OPTIONS] [ARGUMENTS]\n"
+        "       gwarchive --version | --help\n"
+        "\n"
+        "Reads ZIP and XAR archives, keeping the metadata that archives made on Macs carry:\n"
+        "resource forks, Finder information, AppleDouble and MacBinary members; and for XAR,\n"
+        "owners, modes, extended attributes, links, devices, checksums and signatures.\n"
+        "\n"
+        "commands:\n",
+        stream);
+    for (const Command* command : kCommands) {
+        std::fprintf(stream, "  %-12s %s\n", command->name, command->summary);
+    }
+    std::fputs(
+        "\n"
+        "Every command takes -h/--help for its manual and -v/--verbose to show the\n"
+        "library's log. Exit status: 0 success, 1 failure, 2 wrong usage.\n",
+        stream);
+}
+
+int usageError(const Command& command, const std::string& message) {
+    std::fprintf(stderr, "gwarchive %s: %s\n(see 'gwarchive %s --help')\n", command.name,
+                 message.c_str(), command.name);
+    return kExitUsage;
+}
+
+int runCommand(const Command& command, const std::vector<std::string>& words) {
+    std::vector<OptionSpec> specs = command.options;
+    specs.push_back({'h', "help", false});
+    specs.push_back({'v', "verbose", false});
+    std::string message;
+    auto arguments = parseArguments(words, specs, &message);
+    if (!arguments) return usageError(command, message);
+    if (arguments->has("help")) {
+        std::fputs(command.help, stdout);
+        return kExitSuccess;
+    }
+    std::size_t count = arguments->operands.size();
+    if (count < command.minOperands) return usageError(command, "missing operand");
+    if (count > command.maxOperands) {
+        return usageError(command, "unexpected operand '" + arguments->operands[command.maxOperands] + "'");
+    }
+    setVerbose(arguments->has("verbose"));
+    return command.run(*arguments);
+}
 
 }  // namespace
 
 int main(int argc, char** argv) {
-    if (argc == 2 && std::strcmp(argv[1], "--version") == 0) {
+    if (argc < 2) {
+        printToolHelp(stderr);
+        return kExitUsage;
+    }
+    std::string first = argv[1];
+    if (first == "--version") {
         std::printf("gwarchive %s\n", GWArchiveSupportVersionString);
-        return 0;
+        return kExitSuccess;
     }
-    if (argc == 2 && (std::strcmp(argv[1], "--help") == 0 || std::strcmp(argv[1], "-h") == 0)) {
-        std::fputs(kUsage, stdout);
-        return 0;
+    if (first == "--help" || first == "-h" || first == "help") {
+        printToolHelp(stdout);
+        return kExitSuccess;
     }
-    std::fputs(kUsage, stderr);
-    return 2;
+    for (const Command* command : kCommands) {
+        if (first == command->name) return runCommand(*command, {argv + 2, argv + argc});
+    }
+    std::fprintf(stderr, "gwarchive: unknown command '%s'\n\n", first.c_str());
+    printToolHelp(stderr);
+    return kExitUsage;
 }

@@ -1,0 +1,83 @@
+#include <cerrno>
+#include <cstdio>
+
+#include "Command.h"
+#include "Diagnostics.h"
+#include "Locations.h"
+#include "ToolArchive.h"
+
+namespace gwarchive {
+
+namespace {
+
+int runCat(const ParsedArguments& arguments) {
+    const std::string& operand = arguments.operands[0];
+    const std::string& path = arguments.operands[1];
+    GWErrorPtr error;
+    auto archive = ToolArchive::open(archiveURL(operand), &error);
+    if (!archive) {
+        reportError(operand, std::nullopt, error);
+        return kExitFailure;
+    }
+    auto selected = archive->selectPath(path);
+    if (!selected) {
+        reportError(operand, path, GWPOSIXError(ENOENT));
+        return kExitFailure;
+    }
+    std::size_t index = selected->front();
+    if (archive->entries()[index].type == EntryType::directory) {
+        reportError(operand, path, GWPOSIXError(EISDIR));
+        return kExitFailure;
+    }
+    bool written = true;
+    bool streamed = archive->stream(
+        index,
+        [&](const std::uint8_t* bytes, std::size_t length) {
+            written = std::fwrite(bytes, 1, length, stdout) == length;
+            return written;
+        },
+        &error);
+    if (std::fflush(stdout) != 0) written = false;
+    if (!written) {
+        reportError(operand, path, GWPOSIXError(errno ? errno : EIO));
+        return kExitFailure;
+    }
+    if (!streamed) {
+        reportError(operand, path, error);
+        return kExitFailure;
+    }
+    return kExitSuccess;
+}
+
+}  // namespace
+
+const Command kCatCommand = {
+    "cat",
+    "write the decoded data of one entry to standard output",
+    "NAME\n"
+    "    gwarchive cat - write one entry's data to standard output\n"
+    "\n"
+    "SYNOPSIS\n"
+    "    gwarchive cat [-v] ARCHIVE PATH\n"
+    "\n"
+    "DESCRIPTION\n"
+    "    Decodes the data fork of the entry PATH of ARCHIVE and writes it to\n"
+    "    standard output as it is decoded, without a temporary file. For a\n"
+    "    symbolic link the link text is written. Metadata (resource forks,\n"
+    "    Finder information, extended attributes) is not part of the output.\n"
+    "\n"
+    "EXIT STATUS\n"
+    "    0 when all the data was written; 1 when ARCHIVE cannot be opened, PATH is\n"
+    "    not a file in it, the data is corrupt or standard output fails; 2 on\n"
+    "    wrong usage. For a XAR entry whose stored checksum does not match, the\n"
+    "    data is written and the status is 1.\n"
+    "\n"
+    "EXAMPLE\n"
+    "    gwarchive cat Archive.zip docs/README.txt | less\n",
+    {},
+    2,
+    2,
+    runCat,
+};
+
+}  // namespace gwarchive

@@ -1,0 +1,122 @@
+#include <unistd.h>
+
+#include <cstdio>
+#include <memory>
+#include <set>
+
+#include "Command.h"
+#include "Diagnostics.h"
+#include "Locations.h"
+#include "ProgressBar.h"
+#include "ToolArchive.h"
+
+namespace gwarchive {
+
+namespace {
+
+bool wantsProgressBar(const ParsedArguments& arguments) {
+    if (arguments.has("no-progress")) return false;
+    if (arguments.has("progress")) return true;
+    return isatty(STDERR_FILENO) == 1;
+}
+
+int runExtract(const ParsedArguments& arguments) {
+    const std::string& operand = arguments.operands[0];
+    GWErrorPtr error;
+    auto archive = ToolArchive::open(archiveURL(operand), &error);
+    if (!archive) {
+        reportError(operand, std::nullopt, error);
+        return kExitFailure;
+    }
+    bool allFound = true;
+    std::vector<std::size_t> selected;
+    if (arguments.operands.size() > 1) {
+        std::set<std::size_t> seen;
+        for (std::size_t position = 1; position < arguments.operands.size(); ++position) {
+            const std::string& path = arguments.operands[position];
+            auto indexes = archive->selectPath(path);
+            if (!indexes) {
+                reportError(operand, path, GWPOSIXError(ENOENT));
+                allFound = false;
+                continue;
+            }
+            for (std::size_t index : *indexes) {
+                if (seen.insert(index).second) selected.push_back(index);
+            }
+        }
+        if (selected.empty()) return kExitFailure;
+    } else {
+        for (std::size_t index = 0; index < archive->entries().size(); ++index) {
+            selected.push_back(index);
+        }
+    }
+
+    ExtractOptions options{localURL(arguments.value("directory").value_or(".")),
+                           arguments.has("overwrite"), nullptr};
+    std::unique_ptr<ProgressBar> bar;
+    if (wantsProgressBar(arguments)) {
+        std::uint64_t total = 0;
+        for (std::size_t index : selected) total += archive->entries()[index].size;
+        bar = std::make_unique<ProgressBar>(stderr, total);
+        options.progress = [&bar](std::uint64_t bytes) {
+            bar->advance(bytes);
+            return true;
+        };
+    }
+    bool extracted = archive->extract(selected, options, operand);
+    if (bar) bar->finish();
+    return extracted && allFound ? kExitSuccess : kExitFailure;
+}
+
+}  // namespace
+
+const Command kExtractCommand = {
+    "extract",
+    "extract entries with their metadata",
+    "NAME\n"
+    "    gwarchive extract - extract entries of a ZIP or XAR archive\n"
+    "\n"
+    "SYNOPSIS\n"
+    "    gwarchive extract [-C DIR] [--overwrite] [--progress|--no-progress] [-v]\n"
+    "                      ARCHIVE [PATH...]\n"
+    "\n"
+    "DESCRIPTION\n"
+    "    Extracts every entry of ARCHIVE, or the named PATHs and everything below\n"
+    "    them, beneath DIR (default: the current directory), at their full paths\n"
+    "    in the archive. Each file is written to a temporary name on the same file\n"
+    "    system and moved into place when complete, so a failure never leaves a\n"
+    "    partial file. An item that already exists is an error for that entry and\n"
+    "    the other entries go on; existing directories are merged into.\n"
+    "\n"
+    "    Mac metadata comes back as extended attributes: resource forks in\n"
+    "    user.com.apple.ResourceFork, Finder information in user.com.apple.FinderInfo\n"
+    "    (or an AppleDouble file ._name beside the file where the file system\n"
+    "    refuses large attributes), comments in user.xdg.comment. AppleDouble\n"
+    "    companions and MacBinary members are merged into the file they describe.\n"
+    "    XAR owners, modes, flags, ACLs, extended attributes, hard links, devices\n"
+    "    and FIFOs are restored as far as the system and the user's rights allow.\n"
+    "\n"
+    "OPTIONS\n"
+    "    -C, --directory DIR  extract beneath DIR.\n"
+    "    --overwrite          replace existing items instead of failing.\n"
+    "    --progress           always show the progress bar on standard error.\n"
+    "    --no-progress        never show it. By default it is shown when standard\n"
+    "                         error is a terminal: bytes done and total, rate and\n"
+    "                         time left.\n"
+    "    -v, --verbose        show the library's log on standard error.\n"
+    "\n"
+    "EXIT STATUS\n"
+    "    0 when every entry was extracted; 1 when ARCHIVE cannot be opened, a PATH\n"
+    "    is not in it or any entry failed; 2 on wrong usage.\n"
+    "\n"
+    "EXAMPLES\n"
+    "    gwarchive extract -C ~/Restored Photos.zip\n"
+    "    gwarchive extract --overwrite Installer.pkg Payload\n",
+    {{'C', "directory", true}, {0, "overwrite", false}, {0, "progress", false},
+     {0, "no-progress", false}},
+    1,
+    kAnyNumber,
+    runExtract,
+};
+
+}  // namespace gwarchive

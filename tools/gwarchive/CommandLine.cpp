@@ -1,0 +1,88 @@
+#include "CommandLine.h"
+
+#include <algorithm>
+
+namespace gwarchive {
+
+std::optional<std::string> ParsedArguments::value(const std::string& name) const {
+    auto found = options.find(name);
+    if (found == options.end()) return std::nullopt;
+    return found->second;
+}
+
+namespace {
+
+const OptionSpec* findLong(const std::vector<OptionSpec>& specs, const std::string& name) {
+    auto found = std::find_if(specs.begin(), specs.end(),
+                              [&](const OptionSpec& spec) { return name == spec.longName; });
+    return found == specs.end() ? nullptr : &*found;
+}
+
+const OptionSpec* findShort(const std::vector<OptionSpec>& specs, char name) {
+    auto found = std::find_if(specs.begin(), specs.end(),
+                              [&](const OptionSpec& spec) { return spec.shortName == name; });
+    return found == specs.end() ? nullptr : &*found;
+}
+
+}  // namespace
+
+std::optional<ParsedArguments> parseArguments(const std::vector<std::string>& words,
+                                              const std::vector<OptionSpec>& specs,
+                                              std::string* message) {
+    ParsedArguments parsed;
+    auto fail = [&](std::string text) -> std::optional<ParsedArguments> {
+        if (message) *message = std::move(text);
+        return std::nullopt;
+    };
+    for (std::size_t index = 0; index < words.size(); ++index) {
+        const std::string& word = words[index];
+        if (word == "--") {
+            parsed.operands.insert(parsed.operands.end(), words.begin() + index + 1, words.end());
+            break;
+        }
+        if (word.size() < 2 || word[0] != '-') {
+            parsed.operands.push_back(word);
+            continue;
+        }
+        if (word[1] == '-') {
+            std::string name = word.substr(2);
+            std::optional<std::string> inlineValue;
+            if (auto equals = name.find('='); equals != std::string::npos) {
+                inlineValue = name.substr(equals + 1);
+                name.resize(equals);
+            }
+            const OptionSpec* spec = findLong(specs, name);
+            if (!spec) return fail("unknown option '--" + name + "'");
+            if (!spec->takesValue) {
+                if (inlineValue) return fail("option '--" + name + "' takes no value");
+                parsed.options[name] = "";
+            } else if (inlineValue) {
+                parsed.options[name] = *inlineValue;
+            } else if (index + 1 < words.size()) {
+                parsed.options[name] = words[++index];
+            } else {
+                return fail("option '--" + name + "' needs a value");
+            }
+            continue;
+        }
+        for (std::size_t position = 1; position < word.size(); ++position) {
+            const OptionSpec* spec = findShort(specs, word[position]);
+            if (!spec) return fail(std::string("unknown option '-") + word[position] + "'");
+            if (!spec->takesValue) {
+                parsed.options[spec->longName] = "";
+                continue;
+            }
+            if (position + 1 < word.size()) {
+                parsed.options[spec->longName] = word.substr(position + 1);
+            } else if (index + 1 < words.size()) {
+                parsed.options[spec->longName] = words[++index];
+            } else {
+                return fail(std::string("option '-") + word[position] + "' needs a value");
+            }
+            break;
+        }
+    }
+    return parsed;
+}
+
+}  // namespace gwarchive

@@ -1,0 +1,199 @@
+#include <cstdio>
+#include <ctime>
+#include <set>
+
+#include "Command.h"
+#include "Diagnostics.h"
+#include "JsonWriter.h"
+#include "Locations.h"
+#include "ToolArchive.h"
+
+namespace gwarchive {
+
+namespace {
+
+void writeEntry(JsonWriter& json, const EntryRecord& entry) {
+    json.beginObject();
+    json.key("path");
+    json.value(entry.path);
+    json.key("type");
+    json.value(entryTypeName(entry.type));
+    json.key("mode");
+    json.value(static_cast<std::uint64_t>(entry.mode));
+    json.key("size");
+    json.value(entry.size);
+    json.key("compressedSize");
+    json.value(entry.compressedSize);
+    json.key("mtime");
+    if (entry.modificationDate) {
+        json.value(entry.modificationDate->ISO8601String());
+    } else {
+        json.null();
+    }
+    json.key("uid");
+    json.value(static_cast<std::uint64_t>(entry.uid));
+    json.key("gid");
+    json.value(static_cast<std::uint64_t>(entry.gid));
+    auto optionalText = [&](const char* key, const std::optional<std::string>& text) {
+        if (!text) return;
+        json.key(key);
+        json.value(*text);
+    };
+    optionalText("linkTarget", entry.linkTarget);
+    optionalText("typeCode", entry.typeCode);
+    optionalText("creatorCode", entry.creatorCode);
+    if (entry.resourceForkSize) {
+        json.key("resourceForkSize");
+        json.value(*entry.resourceForkSize);
+    }
+    json.key("appleDouble");
+    json.value(entry.appleDouble);
+    json.key("macBinary");
+    json.value(entry.macBinary);
+    json.key("xattrs");
+    json.beginArray();
+    for (const std::string& name : entry.xattrs) json.value(name);
+    json.endArray();
+    optionalText("compression", entry.compression);
+    json.endObject();
+}
+
+std::string modeString(const EntryRecord& entry) {
+    static const char kTypeLetters[] = "-dlhcbpsw?";
+    std::string text(1, kTypeLetters[static_cast<int>(entry.type)]);
+    const char* letters = "rwxrwxrwx";
+    for (int bit = 0; bit < 9; ++bit) text += (entry.mode & (0400 >> bit)) ? letters[bit] : '-';
+    if (entry.mode & 04000) text[3] = (entry.mode & 0100) ? 's' : 'S';
+    if (entry.mode & 02000) text[6] = (entry.mode & 0010) ? 's' : 'S';
+    if (entry.mode & 01000) text[9] = (entry.mode & 0001) ? 't' : 'T';
+    return text;
+}
+
+std::string shortDate(const std::optional<GWDate>& date) {
+    if (!date) return "                ";
+    std::time_t seconds = static_cast<std::time_t>(date->wholeSeconds());
+    std::tm fields{};
+    gmtime_r(&seconds, &fields);
+    char text[32];
+    std::strftime(text, sizeof text, "%Y-%m-%d %H:%M", &fields);
+    return text;
+}
+
+std::string macNotes(const EntryRecord& entry) {
+    std::string notes;
+    auto add = [&](const std::string& note) { notes += (notes.empty() ? "  [" : ", ") + note; };
+    if (entry.typeCode || entry.creatorCode) {
+        add(entry.typeCode.value_or("    ") + "/" + entry.creatorCode.value_or("    "));
+    }
+    if (entry.resourceForkSize) add("resource fork " + std::to_string(*entry.resourceForkSize));
+    if (entry.appleDouble) add("AppleDouble");
+    if (entry.macBinary) add("MacBinary");
+    if (!entry.xattrs.empty()) add(std::to_string(entry.xattrs.size()) + " xattrs");
+    return notes.empty() ? notes : notes + "]";
+}
+
+void printEntry(const EntryRecord& entry, bool longFormat) {
+    std::string name = entry.path + (entry.type == EntryType::directory ? "/" : "");
+    if (!longFormat) {
+        std::printf("%s\n", name.c_str());
+        return;
+    }
+    std::string link = entry.linkTarget ? " -> " + *entry.linkTarget : "";
+    std::printf("%s %5u/%-5u %12llu %s %s%s%s\n", modeString(entry).c_str(), entry.uid, entry.gid,
+                static_cast<unsigned long long>(entry.size), shortDate(entry.modificationDate).c_str(),
+                name.c_str(), link.c_str(), macNotes(entry).c_str());
+}
+
+int runList(const ParsedArguments& arguments) {
+    const std::string& operand = arguments.operands[0];
+    GWErrorPtr error;
+    auto archive = ToolArchive::open(archiveURL(operand), &error);
+    if (!archive) {
+        reportError(operand, std::nullopt, error);
+        return kExitFailure;
+    }
+    int status = kExitSuccess;
+    std::vector<std::size_t> selected;
+    if (arguments.operands.size() == 1) {
+        for (std::size_t index = 0; index < archive->entries().size(); ++index) selected.push_back(index);
+    } else {
+        std::set<std::size_t> seen;
+        for (std::size_t operandIndex = 1; operandIndex < arguments.operands.size(); ++operandIndex) {
+            const std::string& path = arguments.operands[operandIndex];
+            auto indexes = archive->selectPath(path);
+            if (!indexes) {
+                reportError(operand, path, GWPOSIXError(ENOENT));
+                status = kExitFailure;
+                continue;
+            }
+            for (std::size_t index : *indexes) {
+                if (seen.insert(index).second) selected.push_back(index);
+            }
+        }
+    }
+    if (arguments.has("json")) {
+        JsonWriter json;
+        json.beginObject();
+        json.key("format");
+        json.value(archive->formatName());
+        archive->writeArchiveFields(json);
+        json.key("entries");
+        json.beginArray();
+        for (std::size_t index : selected) writeEntry(json, archive->entries()[index]);
+        json.endArray();
+        json.endObject();
+        std::printf("%s\n", json.text().c_str());
+    } else {
+        for (std::size_t index : selected) printEntry(archive->entries()[index], arguments.has("long"));
+    }
+    return status;
+}
+
+}  // namespace
+
+const Command kListCommand = {
+    "list",
+    "list the entries of an archive",
+    "NAME\n"
+    "    gwarchive list - list the entries of a ZIP or XAR archive\n"
+    "\n"
+    "SYNOPSIS\n"
+    "    gwarchive list [-l|--long] [--json] [-v] ARCHIVE [PATH...]\n"
+    "\n"
+    "DESCRIPTION\n"
+    "    Lists the entries of ARCHIVE depth-first in tree order, each directory\n"
+    "    before its contents, or only the named PATHs and what lies below them.\n"
+    "    AppleDouble companions (\"__MACOSX/._name\"), resource-fork members and\n"
+    "    MacBinary wrappers are not listed as entries of their own: they belong to\n"
+    "    the entry they describe, and the long and JSON forms say so. ARCHIVE may\n"
+    "    be a path or an http(s) URL.\n"
+    "\n"
+    "OPTIONS\n"
+    "    -l, --long  one line per entry like ls -l: mode, owner/group ids, size,\n"
+    "                modification time (UTC), path, link target, and in brackets\n"
+    "                the Mac type/creator, resource fork size, AppleDouble,\n"
+    "                MacBinary and the number of extended attributes.\n"
+    "    --json      one JSON object {\"format\": \"zip\"|\"xar\", ..., \"entries\": [...]}.\n"
+    "                Each entry has path, type (file, directory, symlink, hardlink,\n"
+    "                char, block, fifo, socket, whiteout, unknown), mode (with the\n"
+    "                type bits), size, compressedSize, mtime (RFC 3339, UTC), uid, gid,\n"
+    "                appleDouble, macBinary, xattrs, and where known linkTarget,\n"
+    "                typeCode, creatorCode, resourceForkSize and compression. ZIP\n"
+    "                archives add startOffset; XAR archives add checksumIsValid,\n"
+    "                signatureIsValid, signatures and subdocuments.\n"
+    "    -v, --verbose  show the library's log on standard error.\n"
+    "\n"
+    "EXIT STATUS\n"
+    "    0 on success; 1 when ARCHIVE cannot be opened or a PATH is not in it; 2 on\n"
+    "    wrong usage.\n"
+    "\n"
+    "EXAMPLES\n"
+    "    gwarchive list -l Photos.zip\n"
+    "    gwarchive list --json Installer.pkg | python3 -m json.tool\n",
+    {{'l', "long", false}, {0, "json", false}},
+    1,
+    kAnyNumber,
+    runList,
+};
+
+}  // namespace gwarchive

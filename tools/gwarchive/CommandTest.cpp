@@ -1,0 +1,59 @@
+#include <cstdio>
+
+#include "Command.h"
+#include "Diagnostics.h"
+#include "Locations.h"
+#include "ToolArchive.h"
+
+namespace gwarchive {
+
+namespace {
+
+int runTest(const ParsedArguments& arguments) {
+    const std::string& operand = arguments.operands[0];
+    GWErrorPtr error;
+    auto archive = ToolArchive::open(archiveURL(operand), &error);
+    if (!archive) {
+        reportError(operand, std::nullopt, error);
+        return kExitFailure;
+    }
+    std::vector<EntryProblem> problems = archive->test();
+    for (const EntryProblem& problem : problems) {
+        std::printf("%s: %s\n", problem.path.c_str(), problem.message.c_str());
+    }
+    std::printf("%s: %zu entries, %zu bad\n", operand.c_str(), archive->entries().size(),
+                problems.size());
+    return problems.empty() ? kExitSuccess : kExitFailure;
+}
+
+}  // namespace
+
+const Command kTestCommand = {
+    "test",
+    "decode every entry and check the stored checksums",
+    "NAME\n"
+    "    gwarchive test - check an archive's data without writing anything\n"
+    "\n"
+    "SYNOPSIS\n"
+    "    gwarchive test [-v] ARCHIVE\n"
+    "\n"
+    "DESCRIPTION\n"
+    "    Decodes every entry of ARCHIVE, companions included, and compares what\n"
+    "    comes out with what the archive stored: the CRC-32 and size of ZIP\n"
+    "    entries, the archived and extracted digests of XAR entries. Prints one\n"
+    "    line \"PATH: problem\" per bad entry on standard output, then a summary\n"
+    "    line with the number of entries and of bad ones.\n"
+    "\n"
+    "EXIT STATUS\n"
+    "    0 when every entry is good; 1 when ARCHIVE cannot be opened or any entry\n"
+    "    is bad; 2 on wrong usage.\n"
+    "\n"
+    "EXAMPLE\n"
+    "    gwarchive test Backup.zip\n",
+    {},
+    1,
+    1,
+    runTest,
+};
+
+}  // namespace gwarchive

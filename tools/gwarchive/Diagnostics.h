@@ -1,0 +1,23 @@
+#pragma once
+
+#include <optional>
+#include <string>
+
+#include "GWArchiveSupport/GWArchiveSupport.h"
+
+namespace gwarchive {
+
+enum ExitStatus : int { kExitSuccess = 0, kExitFailure = 1, kExitUsage = 2 };
+
+// "gwarchive: ARCHIVE[: PATH]: description (domain code)" on standard error.
+void reportError(const std::string& archive, const std::optional<std::string>& path,
+                 const GWErrorPtr& error);
+// The same line for a failure that has no library error behind it.
+void reportFailure(const std::string& archive, const std::optional<std::string>& path,
+                   const std::string& message);
+
+// The library logs only when asked to: its lines are for debugging, not for
+// people reading the tool's errors.
+void setVerbose(bool verbose);
+
+}  // namespace gwarchive

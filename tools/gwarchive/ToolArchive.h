@@ -1,0 +1,91 @@
+#pragma once
+
+#include <cstdint>
+#include <functional>
+#include <memory>
+#include <optional>
+#include <string>
+#include <vector>
+
+#include "GWArchiveSupport/GWArchiveSupport.h"
+
+namespace gwarchive {
+
+class JsonWriter;
+
+enum class EntryType { file, directory, symlink, hardlink, charDevice, blockDevice, fifo, socket,
+                       whiteout, unknown };
+const char* entryTypeName(EntryType type);
+EntryType entryTypeFromMode(std::uint32_t mode);
+
+// What the tool shows of one entry, the same for both formats.
+struct EntryRecord {
+    std::string path;
+    EntryType type = EntryType::unknown;
+    std::uint32_t mode = 0;  // type bits included
+    std::uint64_t size = 0;  // the entry's own bytes, without companions
+    std::uint64_t compressedSize = 0;
+    std::optional<GWDate> modificationDate;
+    std::uint32_t uid = 0;
+    std::uint32_t gid = 0;
+    std::optional<std::string> linkTarget;
+    std::optional<std::string> typeCode;
+    std::optional<std::string> creatorCode;
+    std::optional<std::uint64_t> resourceForkSize;
+    bool appleDouble = false;
+    bool macBinary = false;
+    std::vector<std::string> xattrs;
+    std::optional<std::string> compression;
+};
+
+// Receives an entry's decoded data piece by piece; false stops the stream.
+using DataSink = std::function<bool(const std::uint8_t* bytes, std::size_t length)>;
+// Told the byte length of every decoded piece while extracting; false stops.
+using ProgressSink = std::function<bool(std::uint64_t bytes)>;
+
+struct ExtractOptions {
+    GWURL directory;
+    bool overwrite = false;
+    ProgressSink progress;
+};
+
+// The verdict on one entry of `gwarchive test`.
+struct EntryProblem {
+    std::string path;
+    std::string message;
+};
+
+// One opened archive of either format, as the subcommands need it. Entries
+// are addressed by their index in entries().
+class ToolArchive {
+public:
+    virtual ~ToolArchive() = default;
+
+    // Opens a ZIP (self-extracting ones included) or XAR archive.
+    static std::unique_ptr<ToolArchive> open(const GWURL& url, GWErrorPtr* error);
+
+    virtual const char* formatName() const = 0;
+    // Every entry, depth-first in tree order, parents before children.
+    virtual const std::vector<EntryRecord>& entries() const = 0;
+    // The indexes of `path` and everything below it; none when it is not in the archive.
+    std::optional<std::vector<std::size_t>> selectPath(const std::string& path) const;
+
+    // Archive-wide fields of `list --json` and `info --json`.
+    virtual void writeArchiveFields(JsonWriter& json) const = 0;
+    // The format-specific lines of `info`.
+    virtual std::vector<std::string> infoLines() const = 0;
+
+    // The decoded data fork of one entry (a link's text for a symbolic link).
+    virtual bool stream(std::size_t index, const DataSink& sink, GWErrorPtr* error) = 0;
+    // Decodes every regular entry and checks its stored checksum.
+    virtual std::vector<EntryProblem> test() = 0;
+    // Extracts the given entries (all when empty); each failure is reported
+    // on standard error as it happens. Returns whether all succeeded.
+    virtual bool extract(const std::vector<std::size_t>& indexes, const ExtractOptions& options,
+                         const std::string& archiveName) = 0;
+
+protected:
+    std::vector<std::size_t> subtree(std::size_t index) const;
+};
+
+}  // namespace gwarchive
