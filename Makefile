@@ -20,7 +20,7 @@ build: deps $(BUILD_DIR)/CMakeCache.txt
 
 run: build
 	./$(BUILD_DIR)/gwarchive --version
-	./$(BUILD_DIR)/gwarchive --help
+	@bash scripts/run-samples.sh $(BUILD_DIR)
 
 test: build
 	cd $(BUILD_DIR) && ctest --output-on-failure --parallel $(JOBS)

@@ -2,6 +2,7 @@
 
 // Umbrella header: everything a caller of the library needs.
 
+#include "GWAppleFileDecoder.h"
 #include "GWArchiveConstants.h"
 #include "GWXARArchive.h"
 #include "GWXARDataReference.h"
