@@ -15,8 +15,6 @@ using namespace gwtest;
 
 namespace {
 
-GWData bytesOf(const std::string& text) { return GWData(text.begin(), text.end()); }
-
 GWData macZip() {
     ZipBuilder zip;
     zip.addDirectory("Mac Sample/");

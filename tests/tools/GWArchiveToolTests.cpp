@@ -1,0 +1,383 @@
+#include <gtest/gtest.h>
+#include <sys/stat.h>
+#include <sys/xattr.h>
+
+#include <filesystem>
+#include <regex>
+
+#include "ToolTestSupport.h"
+#include "support/AppleDoubleBuilder.h"
+#include "support/MacBinaryBuilder.h"
+#include "support/XarBuilder.h"
+#include "support/ZipBuilder.h"
+
+using namespace gwtest;
+namespace fs = std::filesystem;
+
+namespace {
+
+// "gwarchive: ARCHIVE[: PATH]: description (domain code)"
+::testing::AssertionResult isErrorLine(const std::string& text, const std::string& archive) {
+    std::regex line("^gwarchive: " + std::regex_replace(archive, std::regex(R"([.^$|()\[\]{}*+?\\])"),
+                                                        R"(\$&)") +
+                    ": .+ \\([A-Za-z]+ -?[0-9]+\\)\n$");
+    if (std::regex_match(text, line)) return ::testing::AssertionSuccess();
+    return ::testing::AssertionFailure() << "not one error line: " << text;
+}
+
+// A small tree with the kinds of items every ZIP and XAR tool handles.
+void makeSourceTree(const std::string& root) {
+    fs::create_directories(root + "/docs/deep/er");
+    fs::create_directories(root + "/empty-dir");
+    writeFile(root + "/docs/readme.txt", textBytes(20000, 1));
+    writeFile(root + "/docs/deep/er/data.bin", randomBytes(70000, 2));
+    writeFile(root + "/docs/empty.txt", {});
+    writeFile(root + "/run.sh", bytesOf("#!/bin/sh\necho hi\n"));
+    chmod((root + "/run.sh").c_str(), 0755);
+    fs::create_symlink("docs/readme.txt", root + "/latest");
+}
+
+std::string pythonJSON(const std::string& json, const std::string& expression) {
+    std::string script = "import json,sys\nd=json.load(sys.stdin)\n" + expression;
+    TemporaryDirectory scratch;
+    writeFile(scratch.file("in.json"), bytesOf(json));
+    return runCommand("python3 -c " + shellQuote(script) + " < " + shellQuote(scratch.file("in.json")))
+        .output;
+}
+
+// Name and size of every member as zipinfo reports them, directories with "/".
+std::string zipinfoListing(const std::string& archive) {
+    static const char kScript[] =
+        "import sys\n"
+        "rows = []\n"
+        "for line in sys.stdin:\n"
+        "    f = line.split(None, 9)\n"
+        "    if len(f) == 10 and f[0][0] in '-dl?':\n"
+        "        rows.append('%s %s' % (f[9].rstrip('\\n'), f[3]))\n"
+        "print('\\n'.join(sorted(rows)))\n";
+    return runCommand("zipinfo -l " + shellQuote(archive) + " | python3 -c " + shellQuote(kScript))
+        .output;
+}
+
+std::string toolListing(const std::string& archive) {
+    ToolRun run = runTool("list --json " + shellQuote(archive));
+    EXPECT_EQ(run.status, 0) << run.err;
+    return pythonJSON(run.out,
+                      "print('\\n'.join(sorted('%s %d' % (e['path'] + ('/' if e['type'] == "
+                      "'directory' else ''), e['size']) for e in d['entries'])))");
+}
+
+}  // namespace
+
+// --- Usage and errors ---------------------------------------------------------
+
+TEST(GWArchiveTool, UsageErrorsExitTwoAndHelpExitsZero) {
+    EXPECT_EQ(runTool("").status, 2);
+    EXPECT_EQ(runTool("frobnicate x").status, 2);
+    EXPECT_EQ(runTool("list").status, 2);
+    EXPECT_EQ(runTool("list --bogus a.zip").status, 2);
+    EXPECT_EQ(runTool("cat a.zip").status, 2);
+    EXPECT_EQ(runTool("extract -C").status, 2);
+    for (const char* command :
+         {"list", "extract", "cat", "test", "info", "detect", "macbinary", "appledouble"}) {
+        ToolRun help = runTool(std::string(command) + " --help");
+        EXPECT_EQ(help.status, 0) << command;
+        EXPECT_NE(help.out.find("SYNOPSIS"), std::string::npos) << command;
+        EXPECT_NE(help.out.find("EXIT STATUS"), std::string::npos) << command;
+    }
+    EXPECT_EQ(runTool("--help").status, 0);
+}
+
+TEST(GWArchiveTool, MissingNonArchiveAndTruncatedFilesGiveOneErrorLine) {
+    TemporaryDirectory directory;
+    writeFile(directory.file("notes.txt"), textBytes(3000, 3));
+    ZipBuilder zip;
+    zip.addFile("a.txt", textBytes(5000, 4), 8);
+    GWData bytes = zip.bytes();
+    bytes.resize(bytes.size() - 30);
+    writeFile(directory.file("cut.zip"), bytes);
+
+    for (const std::string& name : {"missing.zip", "notes.txt", "cut.zip"}) {
+        for (const char* command : {"list", "info", "test", "extract -C /tmp"}) {
+            ToolRun run = runTool(std::string(command) + " " + shellQuote(directory.file(name)));
+            EXPECT_EQ(run.status, 1) << command << " " << name;
+            EXPECT_TRUE(isErrorLine(run.err, directory.file(name))) << command;
+        }
+    }
+    ToolRun notThere = runTool("list " + shellQuote(directory.file("missing.zip")));
+    EXPECT_NE(notThere.err.find("(NSPOSIXErrorDomain 2)"), std::string::npos) << notThere.err;
+}
+
+TEST(GWArchiveTool, ALibraryLogLineAppearsOnlyWithVerbose) {
+    TemporaryDirectory directory;
+    writeFile(directory.file("notes.txt"), textBytes(3000, 3));
+    ToolRun quiet = runTool("list " + shellQuote(directory.file("notes.txt")));
+    ToolRun verbose = runTool("list -v " + shellQuote(directory.file("notes.txt")));
+    EXPECT_EQ(std::count(quiet.err.begin(), quiet.err.end(), '\n'), 1);
+    EXPECT_GE(verbose.err.size(), quiet.err.size());
+}
+
+// --- ZIP archives of other tools ------------------------------------------------
+
+TEST(GWArchiveTool, InfoZipArchiveListsExtractsAndCatsAsUnzipDoes) {
+    if (!toolAvailable("zip") || !toolAvailable("unzip")) GTEST_SKIP() << "Info-ZIP missing";
+    TemporaryDirectory directory;
+    makeSourceTree(directory.file("src"));
+    std::string archive = directory.file("tree.zip");
+    ASSERT_EQ(runCommand("cd " + shellQuote(directory.file("src")) + " && zip -qry " +
+                         shellQuote(archive) + " .")
+                  .status,
+              0);
+
+    EXPECT_EQ(toolListing(archive), zipinfoListing(archive));
+
+    ASSERT_EQ(runCommand("unzip -q " + shellQuote(archive) + " -d " +
+                         shellQuote(directory.file("by-unzip")))
+                  .status,
+              0);
+    ToolRun extract = runTool("extract -C " + shellQuote(directory.file("by-tool")) + " " +
+                              shellQuote(archive));
+    ASSERT_EQ(extract.status, 0) << extract.err;
+    EXPECT_TRUE(extract.err.empty()) << "no terminal, so no progress bar: " << extract.err;
+    EXPECT_EQ(describeTree(directory.file("by-tool")), describeTree(directory.file("by-unzip")));
+
+    ToolRun cat = runTool("cat " + shellQuote(archive) + " docs/deep/er/data.bin");
+    ASSERT_EQ(cat.status, 0) << cat.err;
+    EXPECT_EQ(cat.out,
+              runCommand("unzip -p " + shellQuote(archive) + " docs/deep/er/data.bin").output);
+
+    ToolRun missing = runTool("cat " + shellQuote(archive) + " docs/nothing");
+    EXPECT_EQ(missing.status, 1);
+    EXPECT_TRUE(isErrorLine(missing.err, archive + ": docs/nothing"));
+}
+
+TEST(GWArchiveTool, ExtractRefusesExistingItemsButGoesOnAndOverwriteReplaces) {
+    ZipBuilder zip;
+    zip.addFile("a.txt", bytesOf("new a"), 8);
+    zip.addFile("b.txt", bytesOf("new b"), 8);
+    TemporaryDirectory directory;
+    writeFile(directory.file("t.zip"), zip.bytes());
+    fs::create_directories(directory.file("out"));
+    writeFile(directory.file("out/a.txt"), bytesOf("old a"));
+
+    std::string arguments = "-C " + shellQuote(directory.file("out")) + " " +
+                            shellQuote(directory.file("t.zip"));
+    ToolRun first = runTool("extract " + arguments);
+    EXPECT_EQ(first.status, 1);
+    EXPECT_TRUE(isErrorLine(first.err, directory.file("t.zip") + ": a.txt"));
+    EXPECT_EQ(readFile(directory.file("out/a.txt")), bytesOf("old a"));
+    EXPECT_EQ(readFile(directory.file("out/b.txt")), bytesOf("new b"));
+
+    ToolRun second = runTool("extract --overwrite " + arguments);
+    EXPECT_EQ(second.status, 0) << second.err;
+    EXPECT_EQ(readFile(directory.file("out/a.txt")), bytesOf("new a"));
+}
+
+TEST(GWArchiveTool, SevenZipAndBsdtarZipArchivesListAsZipinfoSays) {
+    if (!toolAvailable("zipinfo")) GTEST_SKIP() << "zipinfo missing";
+    TemporaryDirectory directory;
+    makeSourceTree(directory.file("src"));
+    std::string src = shellQuote(directory.file("src"));
+    if (toolAvailable("7zz")) {
+        std::string archive = directory.file("7z.zip");
+        ASSERT_EQ(runCommand("cd " + src + " && 7zz a -tzip -bso0 " + shellQuote(archive) + " docs run.sh")
+                      .status,
+                  0);
+        EXPECT_EQ(toolListing(archive), zipinfoListing(archive));
+    }
+    if (toolAvailable("bsdtar")) {
+        std::string archive = directory.file("bsdtar.zip");
+        ASSERT_EQ(runCommand("cd " + src + " && bsdtar --format zip -cf " + shellQuote(archive) + " .")
+                      .status,
+                  0);
+        EXPECT_EQ(toolListing(archive), zipinfoListing(archive));
+    }
+}
+
+TEST(GWArchiveTool, JsonListingCarriesTheDocumentedFields) {
+    ZipBuilder zip;
+    zip.addDirectory("d/");
+    zip.addFile("d/f.txt", textBytes(1000, 5), 8);
+    zip.addSymlink("d/l", "f.txt");
+    TemporaryDirectory directory;
+    writeFile(directory.file("t.zip"), zip.bytes());
+    ToolRun run = runTool("list --json " + shellQuote(directory.file("t.zip")));
+    ASSERT_EQ(run.status, 0) << run.err;
+    EXPECT_EQ(pythonJSON(run.out,
+                         "print(d['format'], d['startOffset'])\n"
+                         "for e in d['entries']: print(e['path'], e['type'], oct(e['mode']), "
+                         "e['size'], e['mtime'], e.get('linkTarget'), e.get('compression'))"),
+              "zip 0\n"
+              "d directory 0o40755 0 2020-01-01T12:00:00Z None None\n"
+              "d/f.txt file 0o100644 1000 2020-01-01T12:00:00Z None deflate\n"
+              "d/l symlink 0o120777 5 2020-01-01T12:00:00Z f.txt stored\n");
+}
+
+// --- XAR archives ---------------------------------------------------------------
+
+TEST(GWArchiveTool, BsdtarXarArchiveListsAndExtractsAsBsdtarDoes) {
+    if (!toolAvailable("bsdtar")) GTEST_SKIP() << "bsdtar missing";
+    TemporaryDirectory directory;
+    makeSourceTree(directory.file("src"));
+    std::string archive = directory.file("tree.xar");
+    ASSERT_EQ(runCommand("cd " + shellQuote(directory.file("src")) + " && bsdtar --format xar -cf " +
+                         shellQuote(archive) + " docs empty-dir run.sh latest")
+                  .status,
+              0);
+    ToolRun list = runTool("list --json " + shellQuote(archive));
+    ASSERT_EQ(list.status, 0) << list.err;
+    EXPECT_EQ(pythonJSON(list.out, "print(d['format'], d['checksumIsValid'])\n"
+                                   "print('\\n'.join(sorted(e['path'] for e in d['entries'])))"),
+              "xar True\n" + runCommand("bsdtar -tf " + shellQuote(archive) +
+                                        " | sed 's:/$::' | LC_ALL=C sort")
+                                 .output);
+
+    fs::create_directories(directory.file("by-bsdtar"));
+    ASSERT_EQ(runCommand("bsdtar -xf " + shellQuote(archive) + " -C " +
+                         shellQuote(directory.file("by-bsdtar")))
+                  .status,
+              0);
+    ToolRun extract = runTool("extract -C " + shellQuote(directory.file("by-tool")) + " " +
+                              shellQuote(archive));
+    ASSERT_EQ(extract.status, 0) << extract.err;
+    EXPECT_EQ(describeTree(directory.file("by-tool")), describeTree(directory.file("by-bsdtar")));
+
+    ToolRun cat = runTool("cat " + shellQuote(archive) + " docs/readme.txt");
+    EXPECT_EQ(bytesOf(cat.out), readFile(directory.file("src/docs/readme.txt")));
+}
+
+// --- test ----------------------------------------------------------------------
+
+TEST(GWArchiveTool, TestFindsAFlippedByteInAStoredZipEntryAndInAXarFile) {
+    TemporaryDirectory directory;
+    ZipBuilder zip;
+    zip.addFile("good.txt", bytesOf("all fine"), 0);
+    zip.addFile("bad.txt", bytesOf("flip me here"), 0);
+    writeFile(directory.file("good.zip"), zip.bytes());
+    GWData bytes = zip.bytes();
+    std::string text(bytes.begin(), bytes.end());
+    bytes[text.find("flip me")] ^= 0x01;
+    writeFile(directory.file("bad.zip"), bytes);
+
+    ToolRun good = runTool("test " + shellQuote(directory.file("good.zip")));
+    EXPECT_EQ(good.status, 0) << good.out << good.err;
+    ToolRun bad = runTool("test " + shellQuote(directory.file("bad.zip")));
+    EXPECT_EQ(bad.status, 1);
+    EXPECT_NE(bad.out.find("bad.txt: "), std::string::npos) << bad.out;
+    EXPECT_EQ(bad.out.find("good.txt: "), std::string::npos) << bad.out;
+    EXPECT_NE(bad.out.find("2 entries, 1 bad"), std::string::npos) << bad.out;
+
+    XarBuilder xar;
+    std::string data = xar.dataElement("data", bytesOf("xar content to flip"), XarEncoding::none);
+    xar.setFiles("<file id=\"1\"><name>x.txt</name><type>file</type>" + data + "</file>");
+    GWData xarBytes = xar.bytes();
+    std::string xarText(xarBytes.begin(), xarBytes.end());
+    writeFile(directory.file("good.xar"), xarBytes);
+    xarBytes[xarText.find("to flip")] ^= 0x01;
+    writeFile(directory.file("bad.xar"), xarBytes);
+    EXPECT_EQ(runTool("test " + shellQuote(directory.file("good.xar"))).status, 0);
+    ToolRun badXar = runTool("test " + shellQuote(directory.file("bad.xar")));
+    EXPECT_EQ(badXar.status, 1);
+    EXPECT_NE(badXar.out.find("x.txt: "), std::string::npos) << badXar.out;
+}
+
+// --- detect, macbinary, appledouble ---------------------------------------------
+
+TEST(GWArchiveTool, DetectNamesEachFormat) {
+    TemporaryDirectory directory;
+    ZipBuilder zip;
+    zip.addFile("a", bytesOf("a"));
+    writeFile(directory.file("a.zip"), zip.bytes());
+    GWData stub(1000, 0);
+    stub[0] = 'M';
+    stub[1] = 'Z';
+    std::string marker = "PKSFX";
+    std::copy(marker.begin(), marker.end(), stub.begin() + 64 + 4);
+    stub[8] = 4;  // header of 4 paragraphs: the stub code starts at 64
+    zip.prefix = stub;
+    writeFile(directory.file("setup.exe"), zip.bytes());
+    XarBuilder xar;
+    xar.setFiles("");
+    writeFile(directory.file("a.xar"), xar.bytes());
+    writeFile(directory.file("a.txt"), bytesOf("plain text"));
+
+    ToolRun run = runTool("detect " + shellQuote(directory.file("a.zip")) + " " +
+                          shellQuote(directory.file("setup.exe")) + " " +
+                          shellQuote(directory.file("a.xar")) + " " +
+                          shellQuote(directory.file("a.txt")));
+    EXPECT_EQ(run.status, 0) << run.err;
+    EXPECT_EQ(run.out, directory.file("a.zip") + ": zip\n" + directory.file("setup.exe") +
+                           ": zip (self-extracting)\n" + directory.file("a.xar") + ": xar\n" +
+                           directory.file("a.txt") + ": unknown\n");
+    ToolRun missing = runTool("detect " + shellQuote(directory.file("none")));
+    EXPECT_EQ(missing.status, 1);
+    EXPECT_TRUE(isErrorLine(missing.err, directory.file("none")));
+}
+
+TEST(GWArchiveTool, MacBinaryAndAppleDoubleCommandsRestoreForksAndFinderInfo) {
+    TemporaryDirectory directory;
+    MacBinaryFile file;
+    file.name = "Letter";
+    file.type = "TEXT";
+    file.creator = "ttxt";
+    file.dataFork = bytesOf("Dear reader");
+    file.resourceFork = bytesOf("resource bytes");
+    writeFile(directory.file("Letter.bin"), buildMacBinary(file));
+    ToolRun decode = runTool("macbinary " + shellQuote(directory.file("Letter.bin")) + " " +
+                             shellQuote(directory.file("Letter")));
+    ASSERT_EQ(decode.status, 0) << decode.err;
+    EXPECT_EQ(readFile(directory.file("Letter")), bytesOf("Dear reader"));
+    char fork[64] = {};
+    EXPECT_EQ(getxattr(directory.file("Letter").c_str(), "user.com.apple.ResourceFork", fork,
+                       sizeof fork),
+              14);
+
+    AppleDoubleFile companion;
+    companion.finderInfo = finderInfoBytes("APPL", "abcd");
+    companion.resourceFork = bytesOf("fork");
+    writeFile(directory.file("._App"), buildAppleDouble(companion));
+    writeFile(directory.file("App"), bytesOf("data"));
+    ToolRun merge = runTool("appledouble " + shellQuote(directory.file("._App")) + " " +
+                            shellQuote(directory.file("App")));
+    ASSERT_EQ(merge.status, 0) << merge.err;
+    char info[32] = {};
+    ASSERT_EQ(getxattr(directory.file("App").c_str(), "user.com.apple.FinderInfo", info, 32), 32);
+    EXPECT_EQ(std::string(info, 8), "APPLabcd");
+
+    writeFile(directory.file("junk"), bytesOf("not macbinary at all"));
+    ToolRun junk = runTool("macbinary " + shellQuote(directory.file("junk")) + " " +
+                           shellQuote(directory.file("out")));
+    EXPECT_EQ(junk.status, 1);
+    EXPECT_TRUE(isErrorLine(junk.err, directory.file("junk")));
+}
+
+// --- progress -------------------------------------------------------------------
+
+TEST(GWArchiveTool, ProgressBarIsDrawnOnATerminalOnly) {
+    if (!toolAvailable("script")) GTEST_SKIP() << "script missing";
+    TemporaryDirectory directory;
+    std::string archive = directory.file("big.zip");
+    // 200 MiB of zeros deflate to little, so the test stays small on disk.
+    ASSERT_EQ(runCommand("python3 -c " +
+                         shellQuote("import zipfile,sys\n"
+                                    "with zipfile.ZipFile(sys.argv[1], 'w', zipfile.ZIP_DEFLATED) as z:\n"
+                                    "    with z.open('zeros.bin', 'w', force_zip64=True) as f:\n"
+                                    "        block = bytes(1 << 20)\n"
+                                    "        for _ in range(200): f.write(block)\n") +
+                         " " + shellQuote(archive))
+                  .status,
+              0);
+    std::string command = std::string(GW_TOOL_PATH) + " extract -C " +
+                          shellQuote(directory.file("tty")) + " " + shellQuote(archive);
+    CommandResult terminal = runCommand("script -qfec " + shellQuote(command) + " /dev/null");
+    EXPECT_EQ(terminal.status, 0) << terminal.output;
+    EXPECT_NE(terminal.output.find("200.0 MiB / 200.0 MiB"), std::string::npos) << terminal.output;
+    EXPECT_NE(terminal.output.find("100%"), std::string::npos);
+    EXPECT_NE(terminal.output.find("/s"), std::string::npos);
+
+    ToolRun piped = runTool("extract -C " + shellQuote(directory.file("pipe")) + " " +
+                            shellQuote(archive));
+    EXPECT_EQ(piped.status, 0);
+    EXPECT_EQ(piped.err, "");
+    EXPECT_EQ(fs::file_size(directory.file("pipe/zeros.bin")), 200u << 20);
+}

@@ -1,0 +1,40 @@
+#include "ToolTestSupport.h"
+
+#include <unistd.h>
+
+namespace gwtest {
+
+ToolRun runTool(const std::string& arguments) {
+    char errorPath[] = "/tmp/gwarchive-stderr-XXXXXX";
+    int descriptor = mkstemp(errorPath);
+    if (descriptor >= 0) close(descriptor);
+    CommandResult result =
+        runCommand(std::string(GW_TOOL_PATH) + " " + arguments + " 2>" + shellQuote(errorPath));
+    GWData error = readFile(errorPath);
+    unlink(errorPath);
+    return {result.status, result.output, std::string(error.begin(), error.end())};
+}
+
+std::string describeTree(const std::string& root) {
+    // Python walks without following links and reads link texts as they are.
+    static const char kScript[] =
+        "import os, stat, sys\n"
+        "root = sys.argv[1]\n"
+        "lines = []\n"
+        "for d, dirs, files in os.walk(root):\n"
+        "    for n in dirs + files:\n"
+        "        p = os.path.join(d, n)\n"
+        "        s = os.lstat(p)\n"
+        "        r = os.path.relpath(p, root)\n"
+        "        if stat.S_ISLNK(s.st_mode): what = 'link ' + os.readlink(p)\n"
+        "        elif stat.S_ISDIR(s.st_mode): what = 'dir'\n"
+        "        elif stat.S_ISREG(s.st_mode): what = 'file %d %s' % (s.st_size, "
+        "__import__('hashlib').sha1(open(p, 'rb').read()).hexdigest())\n"
+        "        else: what = 'special %o' % stat.S_IFMT(s.st_mode)\n"
+        "        mode = '' if stat.S_ISLNK(s.st_mode) else ' %o' % stat.S_IMODE(s.st_mode)\n"
+        "        lines.append(r + ' ' + what + mode)\n"
+        "print('\\n'.join(sorted(lines)))\n";
+    return runCommand("python3 -c " + shellQuote(kScript) + " " + shellQuote(root)).output;
+}
+
+}  // namespace gwtest
