@@ -30,13 +30,14 @@ int runCat(const ParsedArguments& arguments) {
         return kExitFailure;
     }
     bool written = true;
+    bool checksumFailed = false;
     bool streamed = archive->stream(
         index,
         [&](const std::uint8_t* bytes, std::size_t length) {
             written = std::fwrite(bytes, 1, length, stdout) == length;
             return written;
         },
-        &error);
+        &error, &checksumFailed);
     if (std::fflush(stdout) != 0) written = false;
     if (!written) {
         reportError(operand, path, GWPOSIXError(errno ? errno : EIO));
@@ -44,6 +45,10 @@ int runCat(const ParsedArguments& arguments) {
     }
     if (!streamed) {
         reportError(operand, path, error);
+        return kExitFailure;
+    }
+    if (checksumFailed) {
+        reportFailure(operand, path, "the data does not match its stored checksum");
         return kExitFailure;
     }
     return kExitSuccess;

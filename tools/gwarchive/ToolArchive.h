@@ -76,7 +76,9 @@ public:
     virtual std::vector<std::string> infoLines() const = 0;
 
     // The decoded data fork of one entry (a link's text for a symbolic link).
-    virtual bool stream(std::size_t index, const DataSink& sink, GWErrorPtr* error) = 0;
+    // All data reaches the sink before a stored checksum is found wrong.
+    virtual bool stream(std::size_t index, const DataSink& sink, GWErrorPtr* error,
+                        bool* checksumFailed) = 0;
     // Decodes every regular entry and checks its stored checksum.
     virtual std::vector<EntryProblem> test() = 0;
     // Extracts the given entries (all when empty); each failure is reported

@@ -1,3 +1,4 @@
+#include <cerrno>
 #include <filesystem>
 
 #include "Diagnostics.h"
@@ -93,10 +94,54 @@ public:
         return lines;
     }
 
-    bool stream(std::size_t index, const DataSink& sink, GWErrorPtr* error) override;
-    std::vector<EntryProblem> test() override;
+    bool stream(std::size_t index, const DataSink& sink, GWErrorPtr* error,
+                bool* checksumFailed) override {
+        return streamReference(nullptr, files_[index], sink, error, checksumFailed);
+    }
+
+    std::vector<EntryProblem> test() override {
+        std::vector<EntryProblem> problems;
+        auto check = [&](const GWXARDataReferencePtr& reference, const GWXARFilePtr& file,
+                         const std::string& label) {
+            GWErrorPtr error;
+            bool checksumFailed = false;
+            bool read = streamReference(
+                reference, file, [](const std::uint8_t*, std::size_t) { return true; }, &error,
+                &checksumFailed);
+            if (!read) {
+                problems.push_back({label, describe(error)});
+            } else if (checksumFailed) {
+                problems.push_back({label, "the data does not match its stored checksum"});
+            }
+        };
+        for (std::size_t index = 0; index < files_.size(); ++index) {
+            EntryType type = records_[index].type;
+            if (type != EntryType::file && type != EntryType::hardlink) continue;
+            check(nullptr, files_[index], records_[index].path);
+            for (const auto& attribute : files_[index]->extendedAttributes()) {
+                check(attribute, files_[index],
+                      records_[index].path + " (extended attribute " +
+                          attribute->name().value_or("") + ")");
+            }
+        }
+        return problems;
+    }
+
     bool extract(const std::vector<std::size_t>& indexes, const ExtractOptions& options,
-                 const std::string& archiveName) override;
+                 const std::string& archiveName) override {
+        std::vector<bool> selected(files_.size(), false);
+        for (std::size_t index : indexes) selected[index] = true;
+        bool allGood = true;
+        for (std::size_t index : indexes) {
+            std::optional<std::size_t> parent = parents_[index];
+            if (parent && selected[*parent]) continue;  // extracted with its parent
+            GWURL url = options.directory.URLByAppendingPathComponent(records_[index].path);
+            std::error_code ignored;
+            std::filesystem::create_directories(url.URLByDeletingLastPathComponent().path(), ignored);
+            allGood &= extractItem(index, url, options, archiveName);
+        }
+        return allGood;
+    }
 
 private:
     std::vector<std::string> subdocumentNames() const {
@@ -105,7 +150,7 @@ private:
         return names;
     }
 
-    void add(const GWXARFilePtr& file) {
+    void add(const GWXARFilePtr& file, std::optional<std::size_t> parent = std::nullopt) {
         EntryRecord record;
         record.path = file->path();
         record.mode = file->permissionsMode();
@@ -128,14 +173,101 @@ private:
             if (name == kResourceForkAttribute) record.resourceForkSize = attribute->uncompressedSize();
             record.xattrs.push_back(name);
         }
+        std::size_t index = records_.size();
         records_.push_back(std::move(record));
         files_.push_back(file);
-        for (const GWXARFilePtr& child : file->children()) add(child);
+        parents_.push_back(parent);
+        children_.emplace_back();
+        if (parent) children_[*parent].push_back(index);
+        for (const GWXARFilePtr& child : file->children()) add(child, index);
+    }
+
+    static std::string describe(const GWErrorPtr& error) {
+        if (!error) return "unknown error";
+        return error->localizedDescription() + " (" + error->domain() + " " +
+               std::to_string(error->code()) + ")";
+    }
+
+    // The archive streams on its own threads; the tool waits for the last call.
+    bool streamReference(const GWXARDataReferencePtr& reference, const GWXARFilePtr& file,
+                         const DataSink& sink, GWErrorPtr* error, bool* checksumFailed) {
+        GWSemaphore finished(0);
+        GWErrorPtr failure;
+        bool mismatch = false;
+        auto handler = [&](std::optional<std::span<const std::uint8_t>> data, bool isDone,
+                           bool failedChecksum, const GWErrorPtr& callError) {
+            bool last = isDone || callError;
+            bool goOn = true;
+            if (data && !data->empty() && !callError) goOn = sink(data->data(), data->size());
+            if (last) {
+                failure = callError;
+                mismatch = failedChecksum;
+                finished.signal();
+            }
+            return goOn;
+        };
+        if (reference) {
+            archive_->extractDataReference(reference, file, nullptr, handler);
+        } else {
+            archive_->extractDataForkOfFile(file, nullptr, handler);
+        }
+        finished.wait();
+        if (error) *error = failure;
+        if (checksumFailed) *checksumFailed = mismatch;
+        return failure == nullptr;
+    }
+
+    // Existing directories are merged into; anything else that exists is an
+    // error for that entry unless overwriting.
+    bool extractItem(std::size_t index, const GWURL& url, const ExtractOptions& options,
+                     const std::string& archiveName) {
+        const EntryRecord& record = records_[index];
+        std::error_code error;
+        auto status = std::filesystem::symlink_status(url.path(), error);
+        if (std::filesystem::exists(status)) {
+            if (std::filesystem::is_directory(status) && record.type == EntryType::directory) {
+                bool allGood = true;
+                for (std::size_t child : children_[index]) {
+                    allGood &= extractItem(
+                        child, url.URLByAppendingPathComponent(files_[child]->name().value_or("item")), options,
+                        archiveName);
+                }
+                return allGood;
+            }
+            if (!options.overwrite) {
+                reportError(archiveName, record.path, GWPOSIXError(EEXIST, url));
+                return false;
+            }
+            std::filesystem::remove_all(url.path(), error);
+        }
+        bool checksumIsInvalid = false;
+        GWErrorPtr failure;
+        bool extracted = archive_->extractFile(files_[index], url, &checksumIsInvalid, &failure);
+        if (options.progress) options.progress(subtreeBytes(index));
+        if (!extracted) {
+            reportError(archiveName, record.path, failure);
+            return false;
+        }
+        if (checksumIsInvalid) {
+            reportFailure(archiveName, record.path,
+                          "extracted, but a stored checksum did not match or metadata could not "
+                          "be applied");
+            return false;
+        }
+        return true;
+    }
+
+    std::uint64_t subtreeBytes(std::size_t index) const {
+        std::uint64_t bytes = 0;
+        for (std::size_t member : subtree(index)) bytes += records_[member].size;
+        return bytes;
     }
 
     GWXARArchivePtr archive_;
     std::vector<EntryRecord> records_;
     std::vector<GWXARFilePtr> files_;
+    std::vector<std::optional<std::size_t>> parents_;
+    std::vector<std::vector<std::size_t>> children_;
 };
 
 }  // namespace
