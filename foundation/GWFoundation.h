@@ -4,6 +4,7 @@
 
 #include "GWBinaryPropertyList.h"
 #include "GWByteReader.h"
+#include "GWChecksum.h"
 #include "GWCoder.h"
 #include "GWDate.h"
 #include "GWDispatch.h"

@@ -35,24 +35,26 @@ GWData macZip() {
 
 GWData linkedXar() {
     XarBuilder xar;
-    std::string notes = xar.dataElement("data", bytesOf("Notes kept in a XAR archive.\n"),
-                                        XarEncoding::gzip);
+    std::string notes =
+        xar.dataElement("data", bytesOf("Notes kept in a XAR archive.\n"), XarEncoding::gzip);
     std::string tag = xar.dataElement("ea", bytesOf("blue"), XarEncoding::none, "sha1",
                                       "<name>user.color</name>");
-    const std::string owner = "<uid>1000</uid><gid>1000</gid><user>sample</user><group>sample</group>";
-    xar.setFiles(
-        "<file id=\"1\"><name>Docs</name><type>directory</type><mode>0755</mode>" + owner +
-        "<mtime>2024-05-01T10:00:00Z</mtime>"
-        "<file id=\"2\"><name>notes.txt</name><type>file</type><mode>0644</mode>" + owner +
-        "<mtime>2024-05-01T10:00:00Z</mtime>" + notes + tag +
-        "</file>"
-        "<file id=\"3\"><name>notes-link.txt</name><type link=\"2\">hardlink</type><mode>0644</mode>" +
-        owner + "<mtime>2024-05-01T10:00:00Z</mtime>" + notes +
-        "</file>"
-        "<file id=\"4\"><name>latest</name><type>symlink</type>"
-        "<link type=\"file\">notes.txt</link><mode>0755</mode>" + owner +
-        "<mtime>2024-05-01T10:00:00Z</mtime></file>"
-        "</file>");
+    const std::string owner =
+        "<uid>1000</uid><gid>1000</gid><user>sample</user><group>sample</group>";
+    xar.setFiles("<file id=\"1\"><name>Docs</name><type>directory</type><mode>0755</mode>" + owner +
+                 "<mtime>2024-05-01T10:00:00Z</mtime>"
+                 "<file id=\"2\"><name>notes.txt</name><type>file</type><mode>0644</mode>" +
+                 owner + "<mtime>2024-05-01T10:00:00Z</mtime>" + notes + tag +
+                 "</file>"
+                 "<file id=\"3\"><name>notes-link.txt</name><type "
+                 "link=\"2\">hardlink</type><mode>0644</mode>" +
+                 owner + "<mtime>2024-05-01T10:00:00Z</mtime>" + notes +
+                 "</file>"
+                 "<file id=\"4\"><name>latest</name><type>symlink</type>"
+                 "<link type=\"file\">notes.txt</link><mode>0755</mode>" +
+                 owner +
+                 "<mtime>2024-05-01T10:00:00Z</mtime></file>"
+                 "</file>");
     return xar.bytes();
 }
 

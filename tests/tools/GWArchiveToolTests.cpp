@@ -18,10 +18,11 @@ namespace {
 
 // "gwarchive: ARCHIVE[: PATH]: description (domain code)"
 ::testing::AssertionResult isErrorLine(const std::string& text, const std::string& archive) {
-    std::regex line("^gwarchive: " + std::regex_replace(archive, std::regex(R"([.^$|()\[\]{}*+?\\])"),
-                                                        R"(\$&)") +
+    std::regex line("^gwarchive: " +
+                    std::regex_replace(archive, std::regex(R"([.^$|()\[\]{}*+?\\])"), R"(\$&)") +
                     ": .+ \\([A-Za-z]+ -?[0-9]+\\)\n$");
-    if (std::regex_match(text, line)) return ::testing::AssertionSuccess();
+    if (std::regex_match(text, line))
+        return ::testing::AssertionSuccess();
     return ::testing::AssertionFailure() << "not one error line: " << text;
 }
 
@@ -41,7 +42,8 @@ std::string pythonJSON(const std::string& json, const std::string& expression) {
     std::string script = "import json,sys\nd=json.load(sys.stdin)\n" + expression;
     TemporaryDirectory scratch;
     writeFile(scratch.file("in.json"), bytesOf(json));
-    return runCommand("python3 -c " + shellQuote(script) + " < " + shellQuote(scratch.file("in.json")))
+    return runCommand("python3 -c " + shellQuote(script) + " < " +
+                      shellQuote(scratch.file("in.json")))
         .output;
 }
 
@@ -120,7 +122,8 @@ TEST(GWArchiveTool, ALibraryLogLineAppearsOnlyWithVerbose) {
 // --- ZIP archives of other tools ------------------------------------------------
 
 TEST(GWArchiveTool, InfoZipArchiveListsExtractsAndCatsAsUnzipDoes) {
-    if (!toolAvailable("zip") || !toolAvailable("unzip")) GTEST_SKIP() << "Info-ZIP missing";
+    if (!toolAvailable("zip") || !toolAvailable("unzip"))
+        GTEST_SKIP() << "Info-ZIP missing";
     TemporaryDirectory directory;
     makeSourceTree(directory.file("src"));
     std::string archive = directory.file("tree.zip");
@@ -135,8 +138,8 @@ TEST(GWArchiveTool, InfoZipArchiveListsExtractsAndCatsAsUnzipDoes) {
                          shellQuote(directory.file("by-unzip")))
                   .status,
               0);
-    ToolRun extract = runTool("extract -C " + shellQuote(directory.file("by-tool")) + " " +
-                              shellQuote(archive));
+    ToolRun extract =
+        runTool("extract -C " + shellQuote(directory.file("by-tool")) + " " + shellQuote(archive));
     ASSERT_EQ(extract.status, 0) << extract.err;
     EXPECT_TRUE(extract.err.empty()) << "no terminal, so no progress bar: " << extract.err;
     EXPECT_EQ(describeTree(directory.file("by-tool")), describeTree(directory.file("by-unzip")));
@@ -160,8 +163,8 @@ TEST(GWArchiveTool, ExtractRefusesExistingItemsButGoesOnAndOverwriteReplaces) {
     fs::create_directories(directory.file("out"));
     writeFile(directory.file("out/a.txt"), bytesOf("old a"));
 
-    std::string arguments = "-C " + shellQuote(directory.file("out")) + " " +
-                            shellQuote(directory.file("t.zip"));
+    std::string arguments =
+        "-C " + shellQuote(directory.file("out")) + " " + shellQuote(directory.file("t.zip"));
     ToolRun first = runTool("extract " + arguments);
     EXPECT_EQ(first.status, 1);
     EXPECT_TRUE(isErrorLine(first.err, directory.file("t.zip") + ": a.txt"));
@@ -174,22 +177,25 @@ TEST(GWArchiveTool, ExtractRefusesExistingItemsButGoesOnAndOverwriteReplaces) {
 }
 
 TEST(GWArchiveTool, SevenZipAndBsdtarZipArchivesListAsZipinfoSays) {
-    if (!toolAvailable("zipinfo")) GTEST_SKIP() << "zipinfo missing";
+    if (!toolAvailable("zipinfo"))
+        GTEST_SKIP() << "zipinfo missing";
     TemporaryDirectory directory;
     makeSourceTree(directory.file("src"));
     std::string src = shellQuote(directory.file("src"));
     if (toolAvailable("7zz")) {
         std::string archive = directory.file("7z.zip");
-        ASSERT_EQ(runCommand("cd " + src + " && 7zz a -tzip -bso0 " + shellQuote(archive) + " docs run.sh")
+        ASSERT_EQ(runCommand("cd " + src + " && 7zz a -tzip -bso0 " + shellQuote(archive) +
+                             " docs run.sh")
                       .status,
                   0);
         EXPECT_EQ(toolListing(archive), zipinfoListing(archive));
     }
     if (toolAvailable("bsdtar")) {
         std::string archive = directory.file("bsdtar.zip");
-        ASSERT_EQ(runCommand("cd " + src + " && bsdtar --format zip -cf " + shellQuote(archive) + " .")
-                      .status,
-                  0);
+        ASSERT_EQ(
+            runCommand("cd " + src + " && bsdtar --format zip -cf " + shellQuote(archive) + " .")
+                .status,
+            0);
         EXPECT_EQ(toolListing(archive), zipinfoListing(archive));
     }
 }
@@ -216,18 +222,21 @@ TEST(GWArchiveTool, JsonListingCarriesTheDocumentedFields) {
 // --- XAR archives ---------------------------------------------------------------
 
 TEST(GWArchiveTool, BsdtarXarArchiveListsAndExtractsAsBsdtarDoes) {
-    if (!toolAvailable("bsdtar")) GTEST_SKIP() << "bsdtar missing";
+    if (!toolAvailable("bsdtar"))
+        GTEST_SKIP() << "bsdtar missing";
     TemporaryDirectory directory;
     makeSourceTree(directory.file("src"));
     std::string archive = directory.file("tree.xar");
-    ASSERT_EQ(runCommand("cd " + shellQuote(directory.file("src")) + " && bsdtar --format xar -cf " +
-                         shellQuote(archive) + " docs empty-dir run.sh latest")
-                  .status,
-              0);
+    ASSERT_EQ(
+        runCommand("cd " + shellQuote(directory.file("src")) + " && bsdtar --format xar -cf " +
+                   shellQuote(archive) + " docs empty-dir run.sh latest")
+            .status,
+        0);
     ToolRun list = runTool("list --json " + shellQuote(archive));
     ASSERT_EQ(list.status, 0) << list.err;
-    EXPECT_EQ(pythonJSON(list.out, "print(d['format'], d['checksumIsValid'])\n"
-                                   "print('\\n'.join(sorted(e['path'] for e in d['entries'])))"),
+    EXPECT_EQ(pythonJSON(list.out,
+                         "print(d['format'], d['checksumIsValid'])\n"
+                         "print('\\n'.join(sorted(e['path'] for e in d['entries'])))"),
               "xar True\n" + runCommand("bsdtar -tf " + shellQuote(archive) +
                                         " | sed 's:/$::' | LC_ALL=C sort")
                                  .output);
@@ -237,8 +246,8 @@ TEST(GWArchiveTool, BsdtarXarArchiveListsAndExtractsAsBsdtarDoes) {
                          shellQuote(directory.file("by-bsdtar")))
                   .status,
               0);
-    ToolRun extract = runTool("extract -C " + shellQuote(directory.file("by-tool")) + " " +
-                              shellQuote(archive));
+    ToolRun extract =
+        runTool("extract -C " + shellQuote(directory.file("by-tool")) + " " + shellQuote(archive));
     ASSERT_EQ(extract.status, 0) << extract.err;
     EXPECT_EQ(describeTree(directory.file("by-tool")), describeTree(directory.file("by-bsdtar")));
 
@@ -301,10 +310,10 @@ TEST(GWArchiveTool, DetectNamesEachFormat) {
     writeFile(directory.file("a.xar"), xar.bytes());
     writeFile(directory.file("a.txt"), bytesOf("plain text"));
 
-    ToolRun run = runTool("detect " + shellQuote(directory.file("a.zip")) + " " +
-                          shellQuote(directory.file("setup.exe")) + " " +
-                          shellQuote(directory.file("a.xar")) + " " +
-                          shellQuote(directory.file("a.txt")));
+    ToolRun run =
+        runTool("detect " + shellQuote(directory.file("a.zip")) + " " +
+                shellQuote(directory.file("setup.exe")) + " " +
+                shellQuote(directory.file("a.xar")) + " " + shellQuote(directory.file("a.txt")));
     EXPECT_EQ(run.status, 0) << run.err;
     EXPECT_EQ(run.out, directory.file("a.zip") + ": zip\n" + directory.file("setup.exe") +
                            ": zip (self-extracting)\n" + directory.file("a.xar") + ": xar\n" +
@@ -354,19 +363,21 @@ TEST(GWArchiveTool, MacBinaryAndAppleDoubleCommandsRestoreForksAndFinderInfo) {
 // --- progress -------------------------------------------------------------------
 
 TEST(GWArchiveTool, ProgressBarIsDrawnOnATerminalOnly) {
-    if (!toolAvailable("script")) GTEST_SKIP() << "script missing";
+    if (!toolAvailable("script"))
+        GTEST_SKIP() << "script missing";
     TemporaryDirectory directory;
     std::string archive = directory.file("big.zip");
     // 200 MiB of zeros deflate to little, so the test stays small on disk.
-    ASSERT_EQ(runCommand("python3 -c " +
-                         shellQuote("import zipfile,sys\n"
-                                    "with zipfile.ZipFile(sys.argv[1], 'w', zipfile.ZIP_DEFLATED) as z:\n"
-                                    "    with z.open('zeros.bin', 'w', force_zip64=True) as f:\n"
-                                    "        block = bytes(1 << 20)\n"
-                                    "        for _ in range(200): f.write(block)\n") +
-                         " " + shellQuote(archive))
-                  .status,
-              0);
+    ASSERT_EQ(
+        runCommand("python3 -c " +
+                   shellQuote("import zipfile,sys\n"
+                              "with zipfile.ZipFile(sys.argv[1], 'w', zipfile.ZIP_DEFLATED) as z:\n"
+                              "    with z.open('zeros.bin', 'w', force_zip64=True) as f:\n"
+                              "        block = bytes(1 << 20)\n"
+                              "        for _ in range(200): f.write(block)\n") +
+                   " " + shellQuote(archive))
+            .status,
+        0);
     std::string command = std::string(GW_TOOL_PATH) + " extract -C " +
                           shellQuote(directory.file("tty")) + " " + shellQuote(archive);
     CommandResult terminal = runCommand("script -qfec " + shellQuote(command) + " /dev/null");
@@ -375,8 +386,8 @@ TEST(GWArchiveTool, ProgressBarIsDrawnOnATerminalOnly) {
     EXPECT_NE(terminal.output.find("100%"), std::string::npos);
     EXPECT_NE(terminal.output.find("/s"), std::string::npos);
 
-    ToolRun piped = runTool("extract -C " + shellQuote(directory.file("pipe")) + " " +
-                            shellQuote(archive));
+    ToolRun piped =
+        runTool("extract -C " + shellQuote(directory.file("pipe")) + " " + shellQuote(archive));
     EXPECT_EQ(piped.status, 0);
     EXPECT_EQ(piped.err, "");
     EXPECT_EQ(fs::file_size(directory.file("pipe/zeros.bin")), 200u << 20);

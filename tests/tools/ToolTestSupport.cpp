@@ -7,7 +7,8 @@ namespace gwtest {
 ToolRun runTool(const std::string& arguments) {
     char errorPath[] = "/tmp/gwarchive-stderr-XXXXXX";
     int descriptor = mkstemp(errorPath);
-    if (descriptor >= 0) close(descriptor);
+    if (descriptor >= 0)
+        close(descriptor);
     CommandResult result =
         runCommand(std::string(GW_TOOL_PATH) + " " + arguments + " 2>" + shellQuote(errorPath));
     GWData error = readFile(errorPath);

@@ -10,8 +10,8 @@ int runMacBinary(const ParsedArguments& arguments) {
     const std::string& input = arguments.operands[0];
     const std::string& output = arguments.operands[1];
     GWErrorPtr error;
-    if (!GWAppleFileDecoder::sharedInstance()->decodeMacBinaryFileAtURL(
-            localURL(input), localURL(output), &error)) {
+    if (!GWAppleFileDecoder::sharedInstance()->decodeMacBinaryFileAtURL(localURL(input),
+                                                                        localURL(output), &error)) {
         reportError(input, std::nullopt, error);
         return kExitFailure;
     }

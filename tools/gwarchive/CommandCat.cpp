@@ -38,7 +38,8 @@ int runCat(const ParsedArguments& arguments) {
             return written;
         },
         &error, &checksumFailed);
-    if (std::fflush(stdout) != 0) written = false;
+    if (std::fflush(stdout) != 0)
+        written = false;
     if (!written) {
         reportError(operand, path, GWPOSIXError(errno ? errno : EIO));
         return kExitFailure;

@@ -12,9 +12,12 @@ namespace gwarchive {
 namespace {
 
 const char* formatOf(const GWURL& url) {
-    if (GWXARArchive::isXARArchiveAtURL(url)) return "xar";
-    if (GWZipArchive::isSelfExtractingZipArchiveAtURL(url)) return "zip (self-extracting)";
-    if (GWZipArchive::isZipArchiveAtURL(url)) return "zip";
+    if (GWXARArchive::isXARArchiveAtURL(url))
+        return "xar";
+    if (GWZipArchive::isSelfExtractingZipArchiveAtURL(url))
+        return "zip (self-extracting)";
+    if (GWZipArchive::isZipArchiveAtURL(url))
+        return "zip";
     return "unknown";
 }
 

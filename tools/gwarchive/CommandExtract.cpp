@@ -15,8 +15,10 @@ namespace gwarchive {
 namespace {
 
 bool wantsProgressBar(const ParsedArguments& arguments) {
-    if (arguments.has("no-progress")) return false;
-    if (arguments.has("progress")) return true;
+    if (arguments.has("no-progress"))
+        return false;
+    if (arguments.has("progress"))
+        return true;
     return isatty(STDERR_FILENO) == 1;
 }
 
@@ -41,10 +43,12 @@ int runExtract(const ParsedArguments& arguments) {
                 continue;
             }
             for (std::size_t index : *indexes) {
-                if (seen.insert(index).second) selected.push_back(index);
+                if (seen.insert(index).second)
+                    selected.push_back(index);
             }
         }
-        if (selected.empty()) return kExitFailure;
+        if (selected.empty())
+            return kExitFailure;
     } else {
         for (std::size_t index = 0; index < archive->entries().size(); ++index) {
             selected.push_back(index);
@@ -56,7 +60,8 @@ int runExtract(const ParsedArguments& arguments) {
     std::unique_ptr<ProgressBar> bar;
     if (wantsProgressBar(arguments)) {
         std::uint64_t total = 0;
-        for (std::size_t index : selected) total += archive->entries()[index].size;
+        for (std::size_t index : selected)
+            total += archive->entries()[index].size;
         bar = std::make_unique<ProgressBar>(stderr, total);
         options.progress = [&bar](std::uint64_t bytes) {
             bar->advance(bytes);
@@ -64,7 +69,8 @@ int runExtract(const ParsedArguments& arguments) {
         };
     }
     bool extracted = archive->extract(selected, options, operand);
-    if (bar) bar->finish();
+    if (bar)
+        bar->finish();
     return extracted && allFound ? kExitSuccess : kExitFailure;
 }
 
@@ -112,7 +118,9 @@ const Command kExtractCommand = {
     "EXAMPLES\n"
     "    gwarchive extract -C ~/Restored Photos.zip\n"
     "    gwarchive extract --overwrite Installer.pkg Payload\n",
-    {{'C', "directory", true}, {0, "overwrite", false}, {0, "progress", false},
+    {{'C', "directory", true},
+     {0, "overwrite", false},
+     {0, "progress", false},
      {0, "no-progress", false}},
     1,
     kAnyNumber,

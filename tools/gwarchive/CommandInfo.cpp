@@ -32,7 +32,8 @@ int runInfo(const ParsedArguments& arguments) {
     }
     std::printf("archive: %s\n", operand.c_str());
     std::printf("format: %s\n", archive->formatName());
-    for (const std::string& line : archive->infoLines()) std::printf("%s\n", line.c_str());
+    for (const std::string& line : archive->infoLines())
+        std::printf("%s\n", line.c_str());
     std::printf("entries: %zu (%zu directories, %zu others)\n", archive->entries().size(),
                 directories, files);
     std::printf("bytes: %llu (%llu compressed)\n", static_cast<unsigned long long>(bytes),

@@ -6,7 +6,8 @@ namespace gwarchive {
 
 std::optional<std::string> ParsedArguments::value(const std::string& name) const {
     auto found = options.find(name);
-    if (found == options.end()) return std::nullopt;
+    if (found == options.end())
+        return std::nullopt;
     return found->second;
 }
 
@@ -31,7 +32,8 @@ std::optional<ParsedArguments> parseArguments(const std::vector<std::string>& wo
                                               std::string* message) {
     ParsedArguments parsed;
     auto fail = [&](std::string text) -> std::optional<ParsedArguments> {
-        if (message) *message = std::move(text);
+        if (message)
+            *message = std::move(text);
         return std::nullopt;
     };
     for (std::size_t index = 0; index < words.size(); ++index) {
@@ -52,9 +54,11 @@ std::optional<ParsedArguments> parseArguments(const std::vector<std::string>& wo
                 name.resize(equals);
             }
             const OptionSpec* spec = findLong(specs, name);
-            if (!spec) return fail("unknown option '--" + name + "'");
+            if (!spec)
+                return fail("unknown option '--" + name + "'");
             if (!spec->takesValue) {
-                if (inlineValue) return fail("option '--" + name + "' takes no value");
+                if (inlineValue)
+                    return fail("option '--" + name + "' takes no value");
                 parsed.options[name] = "";
             } else if (inlineValue) {
                 parsed.options[name] = *inlineValue;
@@ -67,7 +71,8 @@ std::optional<ParsedArguments> parseArguments(const std::vector<std::string>& wo
         }
         for (std::size_t position = 1; position < word.size(); ++position) {
             const OptionSpec* spec = findShort(specs, word[position]);
-            if (!spec) return fail(std::string("unknown option '-") + word[position] + "'");
+            if (!spec)
+                return fail(std::string("unknown option '-") + word[position] + "'");
             if (!spec->takesValue) {
                 parsed.options[spec->longName] = "";
                 continue;

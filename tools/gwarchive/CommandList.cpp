@@ -35,7 +35,8 @@ void writeEntry(JsonWriter& json, const EntryRecord& entry) {
     json.key("gid");
     json.value(static_cast<std::uint64_t>(entry.gid));
     auto optionalText = [&](const char* key, const std::optional<std::string>& text) {
-        if (!text) return;
+        if (!text)
+            return;
         json.key(key);
         json.value(*text);
     };
@@ -52,7 +53,8 @@ void writeEntry(JsonWriter& json, const EntryRecord& entry) {
     json.value(entry.macBinary);
     json.key("xattrs");
     json.beginArray();
-    for (const std::string& name : entry.xattrs) json.value(name);
+    for (const std::string& name : entry.xattrs)
+        json.value(name);
     json.endArray();
     optionalText("compression", entry.compression);
     json.endObject();
@@ -62,15 +64,20 @@ std::string modeString(const EntryRecord& entry) {
     static const char kTypeLetters[] = "-dlhcbpsw?";
     std::string text(1, kTypeLetters[static_cast<int>(entry.type)]);
     const char* letters = "rwxrwxrwx";
-    for (int bit = 0; bit < 9; ++bit) text += (entry.mode & (0400 >> bit)) ? letters[bit] : '-';
-    if (entry.mode & 04000) text[3] = (entry.mode & 0100) ? 's' : 'S';
-    if (entry.mode & 02000) text[6] = (entry.mode & 0010) ? 's' : 'S';
-    if (entry.mode & 01000) text[9] = (entry.mode & 0001) ? 't' : 'T';
+    for (int bit = 0; bit < 9; ++bit)
+        text += (entry.mode & (0400 >> bit)) ? letters[bit] : '-';
+    if (entry.mode & 04000)
+        text[3] = (entry.mode & 0100) ? 's' : 'S';
+    if (entry.mode & 02000)
+        text[6] = (entry.mode & 0010) ? 's' : 'S';
+    if (entry.mode & 01000)
+        text[9] = (entry.mode & 0001) ? 't' : 'T';
     return text;
 }
 
 std::string shortDate(const std::optional<GWDate>& date) {
-    if (!date) return "                ";
+    if (!date)
+        return "                ";
     std::time_t seconds = static_cast<std::time_t>(date->wholeSeconds());
     std::tm fields{};
     gmtime_r(&seconds, &fields);
@@ -85,10 +92,14 @@ std::string macNotes(const EntryRecord& entry) {
     if (entry.typeCode || entry.creatorCode) {
         add(entry.typeCode.value_or("    ") + "/" + entry.creatorCode.value_or("    "));
     }
-    if (entry.resourceForkSize) add("resource fork " + std::to_string(*entry.resourceForkSize));
-    if (entry.appleDouble) add("AppleDouble");
-    if (entry.macBinary) add("MacBinary");
-    if (!entry.xattrs.empty()) add(std::to_string(entry.xattrs.size()) + " xattrs");
+    if (entry.resourceForkSize)
+        add("resource fork " + std::to_string(*entry.resourceForkSize));
+    if (entry.appleDouble)
+        add("AppleDouble");
+    if (entry.macBinary)
+        add("MacBinary");
+    if (!entry.xattrs.empty())
+        add(std::to_string(entry.xattrs.size()) + " xattrs");
     return notes.empty() ? notes : notes + "]";
 }
 
@@ -100,8 +111,9 @@ void printEntry(const EntryRecord& entry, bool longFormat) {
     }
     std::string link = entry.linkTarget ? " -> " + *entry.linkTarget : "";
     std::printf("%s %5u/%-5u %12llu %s %s%s%s\n", modeString(entry).c_str(), entry.uid, entry.gid,
-                static_cast<unsigned long long>(entry.size), shortDate(entry.modificationDate).c_str(),
-                name.c_str(), link.c_str(), macNotes(entry).c_str());
+                static_cast<unsigned long long>(entry.size),
+                shortDate(entry.modificationDate).c_str(), name.c_str(), link.c_str(),
+                macNotes(entry).c_str());
 }
 
 int runList(const ParsedArguments& arguments) {
@@ -115,10 +127,12 @@ int runList(const ParsedArguments& arguments) {
     int status = kExitSuccess;
     std::vector<std::size_t> selected;
     if (arguments.operands.size() == 1) {
-        for (std::size_t index = 0; index < archive->entries().size(); ++index) selected.push_back(index);
+        for (std::size_t index = 0; index < archive->entries().size(); ++index)
+            selected.push_back(index);
     } else {
         std::set<std::size_t> seen;
-        for (std::size_t operandIndex = 1; operandIndex < arguments.operands.size(); ++operandIndex) {
+        for (std::size_t operandIndex = 1; operandIndex < arguments.operands.size();
+             ++operandIndex) {
             const std::string& path = arguments.operands[operandIndex];
             auto indexes = archive->selectPath(path);
             if (!indexes) {
@@ -127,7 +141,8 @@ int runList(const ParsedArguments& arguments) {
                 continue;
             }
             for (std::size_t index : *indexes) {
-                if (seen.insert(index).second) selected.push_back(index);
+                if (seen.insert(index).second)
+                    selected.push_back(index);
             }
         }
     }
@@ -139,12 +154,14 @@ int runList(const ParsedArguments& arguments) {
         archive->writeArchiveFields(json);
         json.key("entries");
         json.beginArray();
-        for (std::size_t index : selected) writeEntry(json, archive->entries()[index]);
+        for (std::size_t index : selected)
+            writeEntry(json, archive->entries()[index]);
         json.endArray();
         json.endObject();
         std::printf("%s\n", json.text().c_str());
     } else {
-        for (std::size_t index : selected) printEntry(archive->entries()[index], arguments.has("long"));
+        for (std::size_t index : selected)
+            printEntry(archive->entries()[index], arguments.has("long"));
     }
     return status;
 }

@@ -8,7 +8,8 @@ namespace {
 
 std::string prefix(const std::string& archive, const std::optional<std::string>& path) {
     std::string line = "gwarchive: " + archive;
-    if (path) line += ": " + *path;
+    if (path)
+        line += ": " + *path;
     return line;
 }
 

@@ -12,7 +12,8 @@ std::size_t utf8SequenceLength(std::string_view text, std::size_t index) {
     unsigned char lead = byte(index);
     std::size_t length;
     std::uint32_t codePoint;
-    if (lead < 0x80) return 1;
+    if (lead < 0x80)
+        return 1;
     if (lead >= 0xC2 && lead <= 0xDF) {
         length = 2;
         codePoint = lead & 0x1F;
@@ -25,15 +26,18 @@ std::size_t utf8SequenceLength(std::string_view text, std::size_t index) {
     } else {
         return 0;
     }
-    if (index + length > text.size()) return 0;
+    if (index + length > text.size())
+        return 0;
     for (std::size_t offset = 1; offset < length; ++offset) {
         unsigned char next = byte(index + offset);
-        if ((next & 0xC0) != 0x80) return 0;
+        if ((next & 0xC0) != 0x80)
+            return 0;
         codePoint = (codePoint << 6) | (next & 0x3F);
     }
     bool overlong = (length == 3 && codePoint < 0x800) || (length == 4 && codePoint < 0x10000);
     bool surrogate = codePoint >= 0xD800 && codePoint <= 0xDFFF;
-    if (overlong || surrogate || codePoint > 0x10FFFF) return 0;
+    if (overlong || surrogate || codePoint > 0x10FFFF)
+        return 0;
     return length;
 }
 
@@ -81,7 +85,8 @@ void JsonWriter::separate() {
         return;
     }
     if (!hasMembers_.empty()) {
-        if (hasMembers_.back()) out_ += ',';
+        if (hasMembers_.back())
+            out_ += ',';
         hasMembers_.back() = true;
     }
 }

@@ -13,7 +13,8 @@ GWURL localURL(const std::string& path) {
 GWURL archiveURL(const std::string& operand) {
     for (const char* scheme : {"http://", "https://", "file://"}) {
         if (operand.rfind(scheme, 0) == 0) {
-            if (auto url = GWURL::URLWithString(operand)) return *url;
+            if (auto url = GWURL::URLWithString(operand))
+                return *url;
         }
     }
     return localURL(operand);

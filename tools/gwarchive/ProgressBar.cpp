@@ -23,7 +23,8 @@ std::string formatBytes(double bytes) {
 }
 
 std::string formatDuration(double seconds) {
-    if (!std::isfinite(seconds) || seconds < 0) return "--:--";
+    if (!std::isfinite(seconds) || seconds < 0)
+        return "--:--";
     auto whole = static_cast<unsigned long long>(seconds + 0.5);
     char text[32];
     if (whole >= 3600) {
@@ -37,7 +38,8 @@ std::string formatDuration(double seconds) {
 
 std::size_t terminalWidth(std::FILE* stream) {
     winsize size{};
-    if (ioctl(fileno(stream), TIOCGWINSZ, &size) == 0 && size.ws_col >= 40) return size.ws_col;
+    if (ioctl(fileno(stream), TIOCGWINSZ, &size) == 0 && size.ws_col >= 40)
+        return size.ws_col;
     return 80;
 }
 
@@ -46,7 +48,9 @@ std::size_t terminalWidth(std::FILE* stream) {
 ProgressBar::ProgressBar(std::FILE* stream, std::uint64_t totalBytes)
     : stream_(stream), total_(totalBytes), start_(std::chrono::steady_clock::now()) {}
 
-ProgressBar::~ProgressBar() { finish(); }
+ProgressBar::~ProgressBar() {
+    finish();
+}
 
 std::string ProgressBar::frame(std::uint64_t done, std::uint64_t total, double seconds,
                                std::size_t width) {
@@ -58,7 +62,8 @@ std::string ProgressBar::frame(std::uint64_t done, std::uint64_t total, double s
     std::string tail = " " + std::string(percent) + " " + formatBytes(done) + " / " +
                        formatBytes(total) + "  " + formatBytes(rate) + "/s  " +
                        formatDuration(left) + " left";
-    std::size_t barWidth = width > tail.size() + 12 ? std::min<std::size_t>(40, width - tail.size() - 3) : 10;
+    std::size_t barWidth =
+        width > tail.size() + 12 ? std::min<std::size_t>(40, width - tail.size() - 3) : 10;
     auto filled = static_cast<std::size_t>(fraction * barWidth);
     return "[" + std::string(filled, '#') + std::string(barWidth - filled, '-') + "]" + tail;
 }
@@ -76,17 +81,19 @@ void ProgressBar::draw(bool force) {
         return;  // another thread is drawing; its frame is as good as ours
     }
     auto now = std::chrono::steady_clock::now();
-    if (!force && now - lastDraw_ < std::chrono::milliseconds(100)) return;
+    if (!force && now - lastDraw_ < std::chrono::milliseconds(100))
+        return;
     lastDraw_ = now;
     double seconds = std::chrono::duration<double>(now - start_).count();
-    std::string line = frame(done_.load(std::memory_order_relaxed), total_, seconds,
-                             terminalWidth(stream_));
+    std::string line =
+        frame(done_.load(std::memory_order_relaxed), total_, seconds, terminalWidth(stream_));
     std::fprintf(stream_, "\r%s\x1b[K", line.c_str());
     std::fflush(stream_);
 }
 
 void ProgressBar::finish() {
-    if (finished_) return;
+    if (finished_)
+        return;
     finished_ = true;
     draw(true);
     std::fputc('\n', stream_);

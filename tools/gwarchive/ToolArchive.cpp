@@ -35,7 +35,8 @@ EntryType entryTypeFromMode(std::uint32_t mode) {
 }
 
 std::unique_ptr<ToolArchive> ToolArchive::open(const GWURL& url, GWErrorPtr* error) {
-    if (GWXARArchive::isXARArchiveAtURL(url)) return openXARArchive(url, error);
+    if (GWXARArchive::isXARArchiveAtURL(url))
+        return openXARArchive(url, error);
     return openZipArchive(url, error);
 }
 
@@ -53,10 +54,12 @@ std::vector<std::size_t> ToolArchive::subtree(std::size_t index) const {
 
 std::optional<std::vector<std::size_t>> ToolArchive::selectPath(const std::string& path) const {
     std::string wanted = path;
-    while (wanted.size() > 1 && wanted.back() == '/') wanted.pop_back();
+    while (wanted.size() > 1 && wanted.back() == '/')
+        wanted.pop_back();
     const auto& all = entries();
     for (std::size_t index = 0; index < all.size(); ++index) {
-        if (all[index].path == wanted) return subtree(index);
+        if (all[index].path == wanted)
+            return subtree(index);
     }
     return std::nullopt;
 }

@@ -13,8 +13,18 @@ namespace gwarchive {
 
 class JsonWriter;
 
-enum class EntryType { file, directory, symlink, hardlink, charDevice, blockDevice, fifo, socket,
-                       whiteout, unknown };
+enum class EntryType {
+    file,
+    directory,
+    symlink,
+    hardlink,
+    charDevice,
+    blockDevice,
+    fifo,
+    socket,
+    whiteout,
+    unknown
+};
 const char* entryTypeName(EntryType type);
 EntryType entryTypeFromMode(std::uint32_t mode);
 

@@ -39,7 +39,8 @@ const char* signatureTypeName(std::uint64_t type) {
 class XARToolArchive final : public ToolArchive {
 public:
     explicit XARToolArchive(GWXARArchivePtr archive) : archive_(std::move(archive)) {
-        for (const GWXARFilePtr& file : archive_->files()) add(file);
+        for (const GWXARFilePtr& file : archive_->files())
+            add(file);
     }
 
     const char* formatName() const override { return "xar"; }
@@ -58,8 +59,8 @@ public:
             json.value(signatureTypeName(signature->type()));
             json.key("certificates");
             json.beginArray();
-            for (const std::string& name : signature->certificateCommonNames().value_or(
-                     std::vector<std::string>{})) {
+            for (const std::string& name :
+                 signature->certificateCommonNames().value_or(std::vector<std::string>{})) {
                 json.value(name);
             }
             json.endArray();
@@ -68,13 +69,15 @@ public:
         json.endArray();
         json.key("subdocuments");
         json.beginArray();
-        for (const std::string& name : subdocumentNames()) json.value(name);
+        for (const std::string& name : subdocumentNames())
+            json.value(name);
         json.endArray();
     }
 
     std::vector<std::string> infoLines() const override {
         std::vector<std::string> lines;
-        lines.push_back(std::string("checksum: ") + (archive_->checksumIsValid() ? "valid" : "INVALID"));
+        lines.push_back(std::string("checksum: ") +
+                        (archive_->checksumIsValid() ? "valid" : "INVALID"));
         std::string verdict = archive_->signatures().empty() ? "none"
                               : archive_->signatureIsValid() ? "valid"
                                                              : "INVALID";
@@ -82,14 +85,15 @@ public:
         for (const auto& signature : archive_->signatures()) {
             std::string line = std::string("  ") + signatureTypeName(signature->type()) +
                                (signature->isExtended() ? " (extended)" : "") + ":";
-            for (const std::string& name : signature->certificateCommonNames().value_or(
-                     std::vector<std::string>{})) {
+            for (const std::string& name :
+                 signature->certificateCommonNames().value_or(std::vector<std::string>{})) {
                 line += " \"" + name + "\"";
             }
             lines.push_back(line);
         }
         std::string names;
-        for (const std::string& name : subdocumentNames()) names += (names.empty() ? "" : ", ") + name;
+        for (const std::string& name : subdocumentNames())
+            names += (names.empty() ? "" : ", ") + name;
         lines.push_back("subdocuments: " + (names.empty() ? std::string("none") : names));
         return lines;
     }
@@ -116,7 +120,8 @@ public:
         };
         for (std::size_t index = 0; index < files_.size(); ++index) {
             EntryType type = records_[index].type;
-            if (type != EntryType::file && type != EntryType::hardlink) continue;
+            if (type != EntryType::file && type != EntryType::hardlink)
+                continue;
             check(nullptr, files_[index], records_[index].path);
             for (const auto& attribute : files_[index]->extendedAttributes()) {
                 check(attribute, files_[index],
@@ -130,14 +135,17 @@ public:
     bool extract(const std::vector<std::size_t>& indexes, const ExtractOptions& options,
                  const std::string& archiveName) override {
         std::vector<bool> selected(files_.size(), false);
-        for (std::size_t index : indexes) selected[index] = true;
+        for (std::size_t index : indexes)
+            selected[index] = true;
         bool allGood = true;
         for (std::size_t index : indexes) {
             std::optional<std::size_t> parent = parents_[index];
-            if (parent && selected[*parent]) continue;  // extracted with its parent
+            if (parent && selected[*parent])
+                continue;  // extracted with its parent
             GWURL url = options.directory.URLByAppendingPathComponent(records_[index].path);
             std::error_code ignored;
-            std::filesystem::create_directories(url.URLByDeletingLastPathComponent().path(), ignored);
+            std::filesystem::create_directories(url.URLByDeletingLastPathComponent().path(),
+                                                ignored);
             allGood &= extractItem(index, url, options, archiveName);
         }
         return allGood;
@@ -146,7 +154,8 @@ public:
 private:
     std::vector<std::string> subdocumentNames() const {
         std::vector<std::string> names;
-        for (const auto& [name, document] : archive_->subdocuments()) names.push_back(name);
+        for (const auto& [name, document] : archive_->subdocuments())
+            names.push_back(name);
         return names;
     }
 
@@ -158,19 +167,22 @@ private:
         if (const auto& fork = file->dataFork()) {
             record.size = fork->uncompressedSize();
             record.compressedSize = fork->compressedSize();
-            record.compression = GWXARDataReference::stringFromCompressionType(fork->compressionType());
+            record.compression =
+                GWXARDataReference::stringFromCompressionType(fork->compressionType());
         }
         record.modificationDate = file->modificationDate();
         record.uid = file->ownerID();
         record.gid = file->groupOwnerID();
         if (record.type == EntryType::symlink) {
             record.linkTarget = file->symlinkDestination();
-        } else if (auto target = file->hardlinkDestination(); target && record.type == EntryType::hardlink) {
+        } else if (auto target = file->hardlinkDestination();
+                   target && record.type == EntryType::hardlink) {
             record.linkTarget = target->path();
         }
         for (const auto& attribute : file->extendedAttributes()) {
             std::string name = attribute->name().value_or("");
-            if (name == kResourceForkAttribute) record.resourceForkSize = attribute->uncompressedSize();
+            if (name == kResourceForkAttribute)
+                record.resourceForkSize = attribute->uncompressedSize();
             record.xattrs.push_back(name);
         }
         std::size_t index = records_.size();
@@ -178,12 +190,15 @@ private:
         files_.push_back(file);
         parents_.push_back(parent);
         children_.emplace_back();
-        if (parent) children_[*parent].push_back(index);
-        for (const GWXARFilePtr& child : file->children()) add(child, index);
+        if (parent)
+            children_[*parent].push_back(index);
+        for (const GWXARFilePtr& child : file->children())
+            add(child, index);
     }
 
     static std::string describe(const GWErrorPtr& error) {
-        if (!error) return "unknown error";
+        if (!error)
+            return "unknown error";
         return error->localizedDescription() + " (" + error->domain() + " " +
                std::to_string(error->code()) + ")";
     }
@@ -198,7 +213,8 @@ private:
                            bool failedChecksum, const GWErrorPtr& callError) {
             bool last = isDone || callError;
             bool goOn = true;
-            if (data && !data->empty() && !callError) goOn = sink(data->data(), data->size());
+            if (data && !data->empty() && !callError)
+                goOn = sink(data->data(), data->size());
             if (last) {
                 failure = callError;
                 mismatch = failedChecksum;
@@ -212,8 +228,10 @@ private:
             archive_->extractDataForkOfFile(file, nullptr, handler);
         }
         finished.wait();
-        if (error) *error = failure;
-        if (checksumFailed) *checksumFailed = mismatch;
+        if (error)
+            *error = failure;
+        if (checksumFailed)
+            *checksumFailed = mismatch;
         return failure == nullptr;
     }
 
@@ -229,8 +247,9 @@ private:
                 bool allGood = true;
                 for (std::size_t child : children_[index]) {
                     allGood &= extractItem(
-                        child, url.URLByAppendingPathComponent(files_[child]->name().value_or("item")), options,
-                        archiveName);
+                        child,
+                        url.URLByAppendingPathComponent(files_[child]->name().value_or("item")),
+                        options, archiveName);
                 }
                 return allGood;
             }
@@ -243,7 +262,8 @@ private:
         bool checksumIsInvalid = false;
         GWErrorPtr failure;
         bool extracted = archive_->extractFile(files_[index], url, &checksumIsInvalid, &failure);
-        if (options.progress) options.progress(subtreeBytes(index));
+        if (options.progress)
+            options.progress(subtreeBytes(index));
         if (!extracted) {
             reportError(archiveName, record.path, failure);
             return false;
@@ -259,7 +279,8 @@ private:
 
     std::uint64_t subtreeBytes(std::size_t index) const {
         std::uint64_t bytes = 0;
-        for (std::size_t member : subtree(index)) bytes += records_[member].size;
+        for (std::size_t member : subtree(index))
+            bytes += records_[member].size;
         return bytes;
     }
 
@@ -274,7 +295,8 @@ private:
 
 std::unique_ptr<ToolArchive> openXARArchive(const GWURL& url, GWErrorPtr* error) {
     GWXARArchivePtr archive = GWXARArchive::initWithURL(url, false, error);
-    if (!archive) return nullptr;
+    if (!archive)
+        return nullptr;
     return std::make_unique<XARToolArchive>(std::move(archive));
 }
 

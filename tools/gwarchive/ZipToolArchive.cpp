@@ -1,5 +1,7 @@
 #include <sys/stat.h>
 
+#include <algorithm>
+#include <atomic>
 #include <cerrno>
 #include <filesystem>
 #include <mutex>
@@ -33,7 +35,8 @@ std::string compressionName(std::uint16_t method) {
 class ZipToolArchive final : public ToolArchive {
 public:
     explicit ZipToolArchive(GWZipArchivePtr archive) : archive_(std::move(archive)) {
-        for (const GWZipFilePtr& file : archive_->files()) add(file);
+        for (const GWZipFilePtr& file : archive_->files())
+            add(file);
     }
 
     const char* formatName() const override { return "zip"; }
@@ -48,21 +51,25 @@ public:
         return {"start offset: " + std::to_string(archive_->startOffset())};
     }
 
-    bool stream(std::size_t index, const DataSink& sink, GWErrorPtr* error) override {
-        return streamFile(files_[index], sink, error);
+    bool stream(std::size_t index, const DataSink& sink, GWErrorPtr* error,
+                bool* checksumFailed) override {
+        return streamFile(files_[index], sink, error, checksumFailed);
     }
 
     std::vector<EntryProblem> test() override {
         std::vector<EntryProblem> problems;
         for (std::size_t index = 0; index < files_.size(); ++index) {
             const GWZipFilePtr& file = files_[index];
-            if (file->isDirectory()) continue;
+            if (file->isDirectory())
+                continue;
             checkFile(file, records_[index].path, problems);
             if (file->resourceFork()) {
-                checkFile(file->resourceFork(), records_[index].path + " (resource fork)", problems);
+                checkFile(file->resourceFork(), records_[index].path + " (resource fork)",
+                          problems);
             }
             if (file->appleDoubleFile()) {
-                checkFile(file->appleDoubleFile(), records_[index].path + " (AppleDouble)", problems);
+                checkFile(file->appleDoubleFile(), records_[index].path + " (AppleDouble)",
+                          problems);
             }
         }
         return problems;
@@ -83,12 +90,16 @@ private:
         record.uid = file->owner();
         record.gid = file->groupOwner();
         record.linkTarget = file->symlinkDestination();
-        if (file->typeCode() != 0) record.typeCode = file->type();
-        if (file->creatorCode() != 0) record.creatorCode = file->creator();
-        if (file->resourceFork()) record.resourceForkSize = file->resourceFork()->storedUncompressedSize();
+        if (file->typeCode() != 0)
+            record.typeCode = file->type();
+        if (file->creatorCode() != 0)
+            record.creatorCode = file->creator();
+        if (file->resourceFork())
+            record.resourceForkSize = file->resourceFork()->storedUncompressedSize();
         record.appleDouble = file->appleDoubleFile() != nullptr;
         record.macBinary = file->isMacBinaryEncoded();
-        if (!file->isDirectory()) record.compression = compressionName(file->compressionMethod());
+        if (!file->isDirectory())
+            record.compression = compressionName(file->compressionMethod());
         std::size_t index = records_.size();
         records_.push_back(std::move(record));
         files_.push_back(file);
@@ -96,7 +107,8 @@ private:
             records_[index].linkTarget = readLinkText(file);
         }
         if (auto children = file->children()) {
-            for (const GWZipFilePtr& child : *children) add(child);
+            for (const GWZipFilePtr& child : *children)
+                add(child);
         }
     }
 
@@ -110,25 +122,151 @@ private:
                 text.append(reinterpret_cast<const char*>(bytes), length);
                 return text.size() <= 4096;
             },
-            &ignored);
-        if (!read) return std::nullopt;
+            &ignored, nullptr);
+        if (!read)
+            return std::nullopt;
         return text;
     }
 
-    bool streamFile(const GWZipFilePtr& file, const DataSink& sink, GWErrorPtr* error);
+    // The library leaves checking to the caller: CRC-32 and size are checked
+    // here, over the bytes as they pass.
+    bool streamFile(const GWZipFilePtr& file, const DataSink& sink, GWErrorPtr* error,
+                    bool* checksumFailed) {
+        std::unique_ptr<GWChecksum> crc = GWChecksum::checksumWithAlgorithm(1);
+        std::uint64_t length = 0;
+        auto handler = [&](std::optional<std::span<const std::uint8_t>> data, bool isDone,
+                           const GWErrorPtr&) {
+            if (!data || data->empty())
+                return true;
+            crc->update(*data);
+            length += data->size();
+            return sink(data->data(), data->size());
+        };
+        GWErrorPtr initError;
+        auto operation =
+            GWZipExtractOperation::initForExtractingFile(file, archive_, handler, &initError);
+        if (!operation) {
+            if (error)
+                *error = initError;
+            return false;
+        }
+        // Every call of the handler comes before the operation finishes; an
+        // empty entry makes none at all.
+        operation->start();
+        operation->waitUntilFinished();
+        GWErrorPtr failure = operation->error();
+        if (error)
+            *error = failure;
+        if (checksumFailed) {
+            std::optional<GWData> stored = file->uncompressedChecksum();
+            bool crcKnown = file->uncompressedChecksumAlgorithm() == 1 && stored;
+            *checksumFailed = !failure && ((crcKnown && crc->finish() != *stored) ||
+                                           length != file->storedUncompressedSize());
+        }
+        return failure == nullptr;
+    }
+
     void checkFile(const GWZipFilePtr& file, const std::string& path,
-                   std::vector<EntryProblem>& problems);
+                   std::vector<EntryProblem>& problems) {
+        GWErrorPtr error;
+        bool checksumFailed = false;
+        if (!streamFile(
+                file, [](const std::uint8_t*, std::size_t) { return true; }, &error,
+                &checksumFailed)) {
+            problems.push_back({path, error
+                                          ? error->localizedDescription() + " (" + error->domain() +
+                                                " " + std::to_string(error->code()) + ")"
+                                          : "unknown error"});
+        } else if (checksumFailed) {
+            problems.push_back({path, "CRC-32 or size does not match the stored one"});
+        }
+    }
+
+    // Makes room for an entry at `url`: fails for an existing item unless overwriting.
+    bool prepare(const GWURL& url, const EntryRecord& record, const ExtractOptions& options,
+                 const std::string& archiveName) {
+        std::error_code ignored;
+        auto status = std::filesystem::symlink_status(url.path(), ignored);
+        if (std::filesystem::exists(status)) {
+            if (record.type == EntryType::directory && std::filesystem::is_directory(status)) {
+                return true;  // merged into
+            }
+            if (!options.overwrite) {
+                reportError(archiveName, record.path, GWPOSIXError(EEXIST, url));
+                return false;
+            }
+            std::filesystem::remove_all(url.path(), ignored);
+        }
+        std::filesystem::create_directories(record.type == EntryType::directory
+                                                ? url.path()
+                                                : url.URLByDeletingLastPathComponent().path(),
+                                            ignored);
+        return true;
+    }
 
     GWZipArchivePtr archive_;
     std::vector<EntryRecord> records_;
     std::vector<GWZipFilePtr> files_;
 };
 
+bool ZipToolArchive::extract(const std::vector<std::size_t>& indexes, const ExtractOptions& options,
+                             const std::string& archiveName) {
+    auto queue = std::make_shared<GWOperationQueue>();
+    long cores = static_cast<long>(std::max(1u, std::thread::hardware_concurrency()));
+    queue->setMaxConcurrentOperationCount(2 * cores);
+    std::atomic<bool> allGood{true};
+    std::vector<std::pair<GWZipFilePtr, GWURL>> directories;
+    for (std::size_t index : indexes) {
+        const EntryRecord& record = records_[index];
+        GWURL url = options.directory.URLByAppendingPathComponent(record.path);
+        if (!prepare(url, record, options, archiveName)) {
+            allGood = false;
+            continue;
+        }
+        if (record.type == EntryType::directory) {
+            directories.emplace_back(files_[index], url);
+            continue;
+        }
+        GWErrorPtr error;
+        auto operation = GWZipExtractOperation::initForExtractingFile(
+            files_[index], archive_, url, true, options.progress, &error);
+        if (!operation) {
+            reportError(archiveName, record.path, error);
+            allGood = false;
+            continue;
+        }
+        std::weak_ptr<GWZipExtractOperation> weak = operation;
+        std::string path = record.path;
+        operation->setCompletionBlock([weak, path, archiveName, &allGood] {
+            auto finished = weak.lock();
+            if (finished && finished->error()) {
+                reportError(archiveName, path, finished->error());
+                allGood = false;
+            }
+        });
+        queue->addOperation(operation);
+    }
+    queue->waitUntilAllOperationsAreFinished();
+    // Directory dates and modes last, deepest first, so that writing their
+    // contents does not undo them.
+    for (auto it = directories.rbegin(); it != directories.rend(); ++it) {
+        GWErrorPtr error;
+        auto operation = GWZipExtractOperation::initForExtractingFile(
+            it->first, archive_, it->second, false, nullptr, &error);
+        if (!operation || !operation->setInfoForFile(it->first, it->second, &error)) {
+            reportError(archiveName, it->first->path(), error);
+            allGood = false;
+        }
+    }
+    return allGood;
+}
+
 }  // namespace
 
 std::unique_ptr<ToolArchive> openZipArchive(const GWURL& url, GWErrorPtr* error) {
     GWZipArchivePtr archive = GWZipArchive::initWithURL(url, error);
-    if (!archive) return nullptr;
+    if (!archive)
+        return nullptr;
     return std::make_unique<ZipToolArchive>(std::move(archive));
 }
 

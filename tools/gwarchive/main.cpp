@@ -12,8 +12,8 @@ using namespace gwarchive;
 namespace {
 
 const Command* const kCommands[] = {
-    &kListCommand, &kExtractCommand,   &kCatCommand,        &kTestCommand,
-    &kInfoCommand, &kDetectCommand,    &kMacBinaryCommand, &kAppleDoubleCommand,
+    &kListCommand, &kExtractCommand, &kCatCommand,       &kTestCommand,
+    &kInfoCommand, &kDetectCommand,  &kMacBinaryCommand, &kAppleDoubleCommand,
 };
 
 void printToolHelp(std::FILE* stream) {
@@ -49,15 +49,18 @@ int runCommand(const Command& command, const std::vector<std::string>& words) {
     specs.push_back({'v', "verbose", false});
     std::string message;
     auto arguments = parseArguments(words, specs, &message);
-    if (!arguments) return usageError(command, message);
+    if (!arguments)
+        return usageError(command, message);
     if (arguments->has("help")) {
         std::fputs(command.help, stdout);
         return kExitSuccess;
     }
     std::size_t count = arguments->operands.size();
-    if (count < command.minOperands) return usageError(command, "missing operand");
+    if (count < command.minOperands)
+        return usageError(command, "missing operand");
     if (count > command.maxOperands) {
-        return usageError(command, "unexpected operand '" + arguments->operands[command.maxOperands] + "'");
+        return usageError(command,
+                          "unexpected operand '" + arguments->operands[command.maxOperands] + "'");
     }
     setVerbose(arguments->has("verbose"));
     return command.run(*arguments);
@@ -80,7 +83,8 @@ int main(int argc, char** argv) {
         return kExitSuccess;
     }
     for (const Command* command : kCommands) {
-        if (first == command->name) return runCommand(*command, {argv + 2, argv + argc});
+        if (first == command->name)
+            return runCommand(*command, {argv + 2, argv + argc});
     }
     std::fprintf(stderr, "gwarchive: unknown command '%s'\n\n", first.c_str());
     printToolHelp(stderr);
