@@ -134,7 +134,7 @@ private:
                     bool* checksumFailed) {
         std::unique_ptr<GWChecksum> crc = GWChecksum::checksumWithAlgorithm(1);
         std::uint64_t length = 0;
-        auto handler = [&](std::optional<std::span<const std::uint8_t>> data, bool isDone,
+        auto handler = [&](std::optional<std::span<const std::uint8_t>> data, bool,
                            const GWErrorPtr&) {
             if (!data || data->empty())
                 return true;
@@ -143,8 +143,8 @@ private:
             return sink(data->data(), data->size());
         };
         GWErrorPtr initError;
-        auto operation =
-            GWZipExtractOperation::initForExtractingFile(file, archive_, handler, &initError);
+        auto operation = GWZipExtractOperation::initForExtractingFile(
+            file, archive_->URL(), archive_->startOffset(), handler, &initError);
         if (!operation) {
             if (error)
                 *error = initError;
@@ -229,7 +229,8 @@ bool ZipToolArchive::extract(const std::vector<std::size_t>& indexes, const Extr
         }
         GWErrorPtr error;
         auto operation = GWZipExtractOperation::initForExtractingFile(
-            files_[index], archive_, url, true, options.progress, &error);
+            files_[index], archive_->URL(), archive_->startOffset(), url, true, options.progress,
+            &error);
         if (!operation) {
             reportError(archiveName, record.path, error);
             allGood = false;
@@ -252,7 +253,8 @@ bool ZipToolArchive::extract(const std::vector<std::size_t>& indexes, const Extr
     for (auto it = directories.rbegin(); it != directories.rend(); ++it) {
         GWErrorPtr error;
         auto operation = GWZipExtractOperation::initForExtractingFile(
-            it->first, archive_, it->second, false, nullptr, &error);
+            it->first, archive_->URL(), archive_->startOffset(), it->second, false, nullptr,
+            &error);
         if (!operation || !operation->setInfoForFile(it->first, it->second, &error)) {
             reportError(archiveName, it->first->path(), error);
             allGood = false;
