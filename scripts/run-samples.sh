@@ -37,7 +37,8 @@ print("  %-40s %s%s" % (path[2:], kind, extra))
 if not stat.S_ISLNK(info.st_mode):
     for name in sorted(os.listxattr(path)):
         value = os.getxattr(path, name)
-        shown = value.decode() if value.isascii() and value.isprintable() else value[:16].hex() + ("..." if len(value) > 16 else "")
+        text = value.decode("ascii", "replace")
+        shown = text if value.isascii() and text.isprintable() else value[:16].hex() + ("..." if len(value) > 16 else "")
         print("      %s = %s" % (name, shown))
 PY
 done)
