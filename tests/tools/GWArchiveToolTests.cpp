@@ -99,7 +99,7 @@ TEST(GWArchiveTool, MissingNonArchiveAndTruncatedFilesGiveOneErrorLine) {
     bytes.resize(bytes.size() - 30);
     writeFile(directory.file("cut.zip"), bytes);
 
-    for (const std::string& name : {"missing.zip", "notes.txt", "cut.zip"}) {
+    for (std::string name : {"missing.zip", "notes.txt", "cut.zip"}) {
         for (const char* command : {"list", "info", "test", "extract -C /tmp"}) {
             ToolRun run = runTool(std::string(command) + " " + shellQuote(directory.file(name)));
             EXPECT_EQ(run.status, 1) << command << " " << name;
