@@ -22,6 +22,7 @@ for archive in "$samples/Mac Sample.zip" "$samples/Linked.xar"; do
   echo
   echo "\$ gwarchive extract -C OUT '$archive'"
   "$tool" extract --no-progress -C "$out" "$archive"
+  echo
 done
 
 echo
