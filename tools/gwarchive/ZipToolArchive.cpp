@@ -143,8 +143,8 @@ private:
             return sink(data->data(), data->size());
         };
         GWErrorPtr initError;
-        auto operation = GWZipExtractOperation::initForExtractingFile(
-            file, archive_->URL(), archive_->startOffset(), handler, &initError);
+        auto operation =
+            GWZipExtractOperation::initForExtractingFile(file, archive_, handler, &initError);
         if (!operation) {
             if (error)
                 *error = initError;
@@ -227,10 +227,14 @@ bool ZipToolArchive::extract(const std::vector<std::size_t>& indexes, const Extr
             directories.emplace_back(files_[index], url);
             continue;
         }
+        // Written under a private name beside the destination, then moved into
+        // place without replacing: as atomic as the library's own mode, but
+        // without a replacement folder left in $TMPDIR for every entry.
+        GWURL temporary = url.URLByDeletingLastPathComponent().URLByAppendingPathComponent(
+            ".gwarchive-" + GWUniqueID());
         GWErrorPtr error;
         auto operation = GWZipExtractOperation::initForExtractingFile(
-            files_[index], archive_->URL(), archive_->startOffset(), url, true, options.progress,
-            &error);
+            files_[index], archive_, temporary, false, options.progress, &error);
         if (!operation) {
             reportError(archiveName, record.path, error);
             allGood = false;
@@ -238,10 +242,15 @@ bool ZipToolArchive::extract(const std::vector<std::size_t>& indexes, const Extr
         }
         std::weak_ptr<GWZipExtractOperation> weak = operation;
         std::string path = record.path;
-        operation->setCompletionBlock([weak, path, archiveName, &allGood] {
+        operation->setCompletionBlock([weak, path, temporary, url, archiveName, &allGood] {
             auto finished = weak.lock();
-            if (finished && finished->error()) {
-                reportError(archiveName, path, finished->error());
+            GWErrorPtr failure = finished ? finished->error() : nullptr;
+            if (!failure && !GWMoveItemAtURL(temporary, url, &failure) && !failure) {
+                failure = GWPOSIXError(EIO, url);
+            }
+            if (failure) {
+                GWRemoveItemAtURL(temporary, nullptr);
+                reportError(archiveName, path, failure);
                 allGood = false;
             }
         });
@@ -253,8 +262,7 @@ bool ZipToolArchive::extract(const std::vector<std::size_t>& indexes, const Extr
     for (auto it = directories.rbegin(); it != directories.rend(); ++it) {
         GWErrorPtr error;
         auto operation = GWZipExtractOperation::initForExtractingFile(
-            it->first, archive_->URL(), archive_->startOffset(), it->second, false, nullptr,
-            &error);
+            it->first, archive_, it->second, false, nullptr, &error);
         if (!operation || !operation->setInfoForFile(it->first, it->second, &error)) {
             reportError(archiveName, it->first->path(), error);
             allGood = false;
