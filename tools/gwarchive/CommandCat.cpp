@@ -13,12 +13,10 @@ namespace {
 int runCat(const ParsedArguments& arguments) {
     const std::string& operand = arguments.operands[0];
     const std::string& path = arguments.operands[1];
-    GWErrorPtr error;
-    auto archive = ToolArchive::open(archiveURL(operand), &error);
-    if (!archive) {
-        reportError(operand, std::nullopt, error);
+    auto archive = openArchiveOperand(operand);
+    if (!archive)
         return kExitFailure;
-    }
+    GWErrorPtr error;
     auto selected = archive->selectPath(path);
     if (!selected) {
         reportError(operand, path, GWPOSIXError(ENOENT));

@@ -2,7 +2,6 @@
 
 #include <cstdio>
 #include <memory>
-#include <set>
 
 #include "Command.h"
 #include "Diagnostics.h"
@@ -24,36 +23,14 @@ bool wantsProgressBar(const ParsedArguments& arguments) {
 
 int runExtract(const ParsedArguments& arguments) {
     const std::string& operand = arguments.operands[0];
-    GWErrorPtr error;
-    auto archive = ToolArchive::open(archiveURL(operand), &error);
-    if (!archive) {
-        reportError(operand, std::nullopt, error);
+    auto archive = openArchiveOperand(operand);
+    if (!archive)
         return kExitFailure;
-    }
     bool allFound = true;
-    std::vector<std::size_t> selected;
-    if (arguments.operands.size() > 1) {
-        std::set<std::size_t> seen;
-        for (std::size_t position = 1; position < arguments.operands.size(); ++position) {
-            const std::string& path = arguments.operands[position];
-            auto indexes = archive->selectPath(path);
-            if (!indexes) {
-                reportError(operand, path, GWPOSIXError(ENOENT));
-                allFound = false;
-                continue;
-            }
-            for (std::size_t index : *indexes) {
-                if (seen.insert(index).second)
-                    selected.push_back(index);
-            }
-        }
-        if (selected.empty())
-            return kExitFailure;
-    } else {
-        for (std::size_t index = 0; index < archive->entries().size(); ++index) {
-            selected.push_back(index);
-        }
-    }
+    std::vector<std::string> paths(arguments.operands.begin() + 1, arguments.operands.end());
+    std::vector<std::size_t> selected = selectEntries(*archive, operand, paths, &allFound);
+    if (selected.empty() && !paths.empty())
+        return kExitFailure;
 
     ExtractOptions options{localURL(arguments.value("directory").value_or(".")),
                            arguments.has("overwrite"), nullptr};

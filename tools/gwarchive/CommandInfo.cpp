@@ -11,12 +11,9 @@ namespace {
 
 int runInfo(const ParsedArguments& arguments) {
     const std::string& operand = arguments.operands[0];
-    GWErrorPtr error;
-    auto archive = ToolArchive::open(archiveURL(operand), &error);
-    if (!archive) {
-        reportError(operand, std::nullopt, error);
+    auto archive = openArchiveOperand(operand);
+    if (!archive)
         return kExitFailure;
-    }
     std::uint64_t bytes = 0;
     std::uint64_t compressed = 0;
     std::size_t files = 0;

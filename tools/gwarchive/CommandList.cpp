@@ -1,6 +1,5 @@
 #include <cstdio>
 #include <ctime>
-#include <set>
 
 #include "Command.h"
 #include "Diagnostics.h"
@@ -118,34 +117,12 @@ void printEntry(const EntryRecord& entry, bool longFormat) {
 
 int runList(const ParsedArguments& arguments) {
     const std::string& operand = arguments.operands[0];
-    GWErrorPtr error;
-    auto archive = ToolArchive::open(archiveURL(operand), &error);
-    if (!archive) {
-        reportError(operand, std::nullopt, error);
+    auto archive = openArchiveOperand(operand);
+    if (!archive)
         return kExitFailure;
-    }
-    int status = kExitSuccess;
-    std::vector<std::size_t> selected;
-    if (arguments.operands.size() == 1) {
-        for (std::size_t index = 0; index < archive->entries().size(); ++index)
-            selected.push_back(index);
-    } else {
-        std::set<std::size_t> seen;
-        for (std::size_t operandIndex = 1; operandIndex < arguments.operands.size();
-             ++operandIndex) {
-            const std::string& path = arguments.operands[operandIndex];
-            auto indexes = archive->selectPath(path);
-            if (!indexes) {
-                reportError(operand, path, GWPOSIXError(ENOENT));
-                status = kExitFailure;
-                continue;
-            }
-            for (std::size_t index : *indexes) {
-                if (seen.insert(index).second)
-                    selected.push_back(index);
-            }
-        }
-    }
+    bool allFound = true;
+    std::vector<std::string> paths(arguments.operands.begin() + 1, arguments.operands.end());
+    std::vector<std::size_t> selected = selectEntries(*archive, operand, paths, &allFound);
     if (arguments.has("json")) {
         JsonWriter json;
         json.beginObject();
@@ -163,7 +140,7 @@ int runList(const ParsedArguments& arguments) {
         for (std::size_t index : selected)
             printEntry(archive->entries()[index], arguments.has("long"));
     }
-    return status;
+    return allFound ? kExitSuccess : kExitFailure;
 }
 
 }  // namespace

@@ -11,12 +11,9 @@ namespace {
 
 int runTest(const ParsedArguments& arguments) {
     const std::string& operand = arguments.operands[0];
-    GWErrorPtr error;
-    auto archive = ToolArchive::open(archiveURL(operand), &error);
-    if (!archive) {
-        reportError(operand, std::nullopt, error);
+    auto archive = openArchiveOperand(operand);
+    if (!archive)
         return kExitFailure;
-    }
     std::vector<EntryProblem> problems = archive->test();
     for (const EntryProblem& problem : problems) {
         std::printf("%s: %s\n", problem.path.c_str(), problem.message.c_str());

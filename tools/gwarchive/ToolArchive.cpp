@@ -1,6 +1,11 @@
 #include "ToolArchive.h"
 
+#include <cerrno>
+#include <set>
+
+#include "Diagnostics.h"
 #include "FormatAdapters.h"
+#include "Locations.h"
 
 namespace gwarchive {
 
@@ -62,6 +67,39 @@ std::optional<std::vector<std::size_t>> ToolArchive::selectPath(const std::strin
             return subtree(index);
     }
     return std::nullopt;
+}
+
+std::unique_ptr<ToolArchive> openArchiveOperand(const std::string& operand) {
+    GWErrorPtr error;
+    auto archive = ToolArchive::open(archiveURL(operand), &error);
+    if (!archive)
+        reportError(operand, std::nullopt, error);
+    return archive;
+}
+
+std::vector<std::size_t> selectEntries(const ToolArchive& archive, const std::string& operand,
+                                       const std::vector<std::string>& paths, bool* allFound) {
+    std::vector<std::size_t> selected;
+    if (paths.empty()) {
+        for (std::size_t index = 0; index < archive.entries().size(); ++index) {
+            selected.push_back(index);
+        }
+        return selected;
+    }
+    std::set<std::size_t> seen;
+    for (const std::string& path : paths) {
+        auto indexes = archive.selectPath(path);
+        if (!indexes) {
+            reportError(operand, path, GWPOSIXError(ENOENT));
+            *allFound = false;
+            continue;
+        }
+        for (std::size_t index : *indexes) {
+            if (seen.insert(index).second)
+                selected.push_back(index);
+        }
+    }
+    return selected;
 }
 
 }  // namespace gwarchive

@@ -100,4 +100,13 @@ protected:
     std::vector<std::size_t> subtree(std::size_t index) const;
 };
 
+// Opens an ARCHIVE operand, or says why not on standard error and returns none.
+std::unique_ptr<ToolArchive> openArchiveOperand(const std::string& operand);
+
+// The entries the PATH operands name, each with everything below it, in
+// listing order without repeats; every entry when there are no PATHs. A PATH
+// that is not in the archive is reported on standard error and clears `allFound`.
+std::vector<std::size_t> selectEntries(const ToolArchive& archive, const std::string& operand,
+                                       const std::vector<std::string>& paths, bool* allFound);
+
 }  // namespace gwarchive
