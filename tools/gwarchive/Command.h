@@ -15,7 +15,7 @@ struct Command {
     const char* name;
     const char* summary;  // one line, for the tool's own help
     const char* help;     // the whole manual text of the subcommand
-    std::vector<OptionSpec> options;
+    std::vector<OptionDefinition> options;
     std::size_t minOperands;
     std::size_t maxOperands;
     int (*run)(const ParsedArguments& arguments);

@@ -13,22 +13,25 @@ std::optional<std::string> ParsedArguments::value(const std::string& name) const
 
 namespace {
 
-const OptionSpec* findLong(const std::vector<OptionSpec>& specs, const std::string& name) {
-    auto found = std::find_if(specs.begin(), specs.end(),
-                              [&](const OptionSpec& spec) { return name == spec.longName; });
-    return found == specs.end() ? nullptr : &*found;
+const OptionDefinition* findLong(const std::vector<OptionDefinition>& definitions,
+                                 const std::string& name) {
+    auto found =
+        std::find_if(definitions.begin(), definitions.end(),
+                     [&](const OptionDefinition& option) { return name == option.longName; });
+    return found == definitions.end() ? nullptr : &*found;
 }
 
-const OptionSpec* findShort(const std::vector<OptionSpec>& specs, char name) {
-    auto found = std::find_if(specs.begin(), specs.end(),
-                              [&](const OptionSpec& spec) { return spec.shortName == name; });
-    return found == specs.end() ? nullptr : &*found;
+const OptionDefinition* findShort(const std::vector<OptionDefinition>& definitions, char name) {
+    auto found =
+        std::find_if(definitions.begin(), definitions.end(),
+                     [&](const OptionDefinition& option) { return option.shortName == name; });
+    return found == definitions.end() ? nullptr : &*found;
 }
 
 }  // namespace
 
 std::optional<ParsedArguments> parseArguments(const std::vector<std::string>& words,
-                                              const std::vector<OptionSpec>& specs,
+                                              const std::vector<OptionDefinition>& definitions,
                                               std::string* message) {
     ParsedArguments parsed;
     auto fail = [&](std::string text) -> std::optional<ParsedArguments> {
@@ -53,10 +56,10 @@ std::optional<ParsedArguments> parseArguments(const std::vector<std::string>& wo
                 inlineValue = name.substr(equals + 1);
                 name.resize(equals);
             }
-            const OptionSpec* spec = findLong(specs, name);
-            if (!spec)
+            const OptionDefinition* option = findLong(definitions, name);
+            if (!option)
                 return fail("unknown option '--" + name + "'");
-            if (!spec->takesValue) {
+            if (!option->takesValue) {
                 if (inlineValue)
                     return fail("option '--" + name + "' takes no value");
                 parsed.options[name] = "";
@@ -70,17 +73,17 @@ std::optional<ParsedArguments> parseArguments(const std::vector<std::string>& wo
             continue;
         }
         for (std::size_t position = 1; position < word.size(); ++position) {
-            const OptionSpec* spec = findShort(specs, word[position]);
-            if (!spec)
+            const OptionDefinition* option = findShort(definitions, word[position]);
+            if (!option)
                 return fail(std::string("unknown option '-") + word[position] + "'");
-            if (!spec->takesValue) {
-                parsed.options[spec->longName] = "";
+            if (!option->takesValue) {
+                parsed.options[option->longName] = "";
                 continue;
             }
             if (position + 1 < word.size()) {
-                parsed.options[spec->longName] = word.substr(position + 1);
+                parsed.options[option->longName] = word.substr(position + 1);
             } else if (index + 1 < words.size()) {
-                parsed.options[spec->longName] = words[++index];
+                parsed.options[option->longName] = words[++index];
             } else {
                 return fail(std::string("option '-") + word[position] + "' needs a value");
             }

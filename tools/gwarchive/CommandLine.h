@@ -8,7 +8,7 @@
 
 namespace gwarchive {
 
-struct OptionSpec {
+struct OptionDefinition {
     char shortName;        // 0 when the option has no short form
     const char* longName;  // without the leading "--"
     bool takesValue;
@@ -29,7 +29,7 @@ struct ParsedArguments {
 // operand. A later option of the same name replaces an earlier one. On a
 // usage error returns none and says why in `message`.
 std::optional<ParsedArguments> parseArguments(const std::vector<std::string>& words,
-                                              const std::vector<OptionSpec>& specs,
+                                              const std::vector<OptionDefinition>& definitions,
                                               std::string* message);
 
 }  // namespace gwarchive

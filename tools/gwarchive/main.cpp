@@ -44,11 +44,11 @@ int usageError(const Command& command, const std::string& message) {
 }
 
 int runCommand(const Command& command, const std::vector<std::string>& words) {
-    std::vector<OptionSpec> specs = command.options;
-    specs.push_back({'h', "help", false});
-    specs.push_back({'v', "verbose", false});
+    std::vector<OptionDefinition> definitions = command.options;
+    definitions.push_back({'h', "help", false});
+    definitions.push_back({'v', "verbose", false});
     std::string message;
-    auto arguments = parseArguments(words, specs, &message);
+    auto arguments = parseArguments(words, definitions, &message);
     if (!arguments)
         return usageError(command, message);
     if (arguments->has("help")) {
