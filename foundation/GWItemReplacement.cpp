@@ -14,6 +14,7 @@
 #include <vector>
 
 #include "GWFileDescriptor.h"
+#include "GWFileManager.h"
 
 namespace {
 
@@ -104,8 +105,7 @@ std::unique_ptr<GWItemReplacementDirectory> GWItemReplacementDirectory::createFo
         GWFail(error, posixError(errno, ancestor));
         return nullptr;
     }
-    const char* environment = std::getenv("TMPDIR");
-    std::string temporary = environment && *environment ? environment : "/tmp";
+    const std::string temporary = GWTemporaryDirectoryPath();
     struct stat temporaryInfo;
     std::string created;
     if (::stat(temporary.c_str(), &temporaryInfo) == 0 &&

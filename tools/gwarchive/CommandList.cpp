@@ -123,6 +123,7 @@ int runList(const ParsedArguments& arguments) {
     bool allFound = true;
     std::vector<std::string> paths(arguments.operands.begin() + 1, arguments.operands.end());
     std::vector<std::size_t> selected = selectEntries(*archive, operand, paths, &allFound);
+    archive->loadLinkTargets();
     if (arguments.has("json")) {
         JsonWriter json;
         json.beginObject();

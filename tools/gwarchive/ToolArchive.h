@@ -77,6 +77,8 @@ public:
     virtual const char* formatName() const = 0;
     // Every entry, depth-first in tree order, parents before children.
     virtual const std::vector<EntryRecord>& entries() const = 0;
+    // Fills in link targets that only the entries' data can tell.
+    virtual void loadLinkTargets() {}
     // The indexes of `path` and everything below it; none when it is not in the archive.
     std::optional<std::vector<std::size_t>> selectPath(const std::string& path) const;
 

@@ -100,19 +100,25 @@ private:
         record.macBinary = file->isMacBinaryEncoded();
         if (!file->isDirectory())
             record.compression = compressionName(file->compressionMethod());
-        std::size_t index = records_.size();
         records_.push_back(std::move(record));
         files_.push_back(file);
-        if (records_[index].type == EntryType::symlink && !records_[index].linkTarget) {
-            records_[index].linkTarget = readLinkText(file);
-        }
         if (auto children = file->children()) {
             for (const GWZipFilePtr& child : *children)
                 add(child);
         }
     }
 
-    // A ZIP link's text is its data; small, so reading it for the listing is cheap.
+    // A ZIP link's text is its data: read only when a listing shows it, not
+    // on every open.
+    void loadLinkTargets() override {
+        for (std::size_t index = 0; index < records_.size(); ++index) {
+            EntryRecord& record = records_[index];
+            if (record.type == EntryType::symlink && !record.linkTarget) {
+                record.linkTarget = readLinkText(files_[index]);
+            }
+        }
+    }
+
     std::optional<std::string> readLinkText(const GWZipFilePtr& file) {
         std::string text;
         GWErrorPtr ignored;
