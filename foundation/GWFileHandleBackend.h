@@ -27,3 +27,5 @@ public:
 std::unique_ptr<GWFileHandleBackend> GWOpenLocalFileBackend(const GWURL& url, bool forWriting,
                                                             GWErrorPtr* error);
 std::unique_ptr<GWFileHandleBackend> GWMakeDiscardingBackend();
+// Reads an http or https resource with range requests; never writes.
+std::unique_ptr<GWFileHandleBackend> GWOpenHTTPFileBackend(const GWURL& url, GWErrorPtr* error);

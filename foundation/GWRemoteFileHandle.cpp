@@ -13,11 +13,14 @@ std::unique_ptr<GWFileHandleBackend> openBackend(const GWURL& url, bool forWriti
         return GWOpenLocalFileBackend(url, forWriting, error);
     }
     const bool remote = url.scheme() == "http" || url.scheme() == "https";
+    if (remote && !forWriting) {
+        return GWOpenHTTPFileBackend(url, error);
+    }
     GWFail(error, GWGenerateError(kGWCocoaErrorDomain,
                                   forWriting ? GWFileWriteUnsupportedSchemeError
                                              : GWFileReadUnsupportedSchemeError,
                                   url, nullptr, {},
-                                  remote ? "Remote locations cannot be %s yet: %s"
+                                  remote ? "Remote locations cannot be %s: %s"
                                          : "Not a file location, cannot be %s: %s",
                                   forWriting ? "written" : "read", url.absoluteString().c_str()));
     return nullptr;

@@ -14,6 +14,23 @@ class GWFileHandleBackend;
 
 // Position-based access to a file. Reads are positioned reads, so one handle
 // never disturbs another open on the same file. Used by one operation at a time.
+//
+// http and https URLs are read with range requests over one kept-alive
+// connection, with a small read-ahead cache; they cannot be written
+// (NSCocoaErrorDomain 518). Opening asks for the first bytes, which gives the
+// size. Remote failures are NSPOSIXErrorDomain errors:
+//   ENOENT        404 or 410
+//   EACCES        401, 403 or 407
+//   ENOTSUP       the server ignores range requests (a 200 answer)
+//   ESTALE        the resource changed size while it was read
+//   ECONNRESET    the connection ended before the whole range arrived
+//   ETIMEDOUT     no connection, or a response that stalled, within the timeouts
+//   ECONNREFUSED  nobody listens (or the errno of the failed connect)
+//   EHOSTUNREACH  the host name does not resolve
+//   EPROTO        a TLS failure, or an answer for another range than asked
+//   ELOOP         too many redirects
+//   EIO           any other status or transfer failure
+// Bytes are handed on only once their whole range has arrived.
 class GWRemoteFileHandle {
 public:
     static std::shared_ptr<GWRemoteFileHandle> initForReadingFromURL(const GWURL& url,

@@ -9,7 +9,7 @@ packages=(
   zlib1g-dev libbz2-dev libssl-dev openssl
   libpugixml-dev libacl1-dev libplist-dev libcurl4-openssl-dev libisal-dev
   libgtest-dev libgmock-dev libbenchmark-dev
-  unzip zip libarchive-tools 7zip unar macutils
+  unzip zip libarchive-tools 7zip unar macutils nginx
 )
 
 missing=()

@@ -1,0 +1,215 @@
+#include <gtest/gtest.h>
+
+#include <cerrno>
+
+#include "foundation/GWHTTPRangeReader.h"
+#include "foundation/GWRemoteFileHandle.h"
+#include "support/NginxServer.h"
+#include "support/ScriptedHTTPServer.h"
+#include "support/ServedFolderTest.h"
+#include "support/TestSupport.h"
+
+namespace {
+
+using gwtest::ScriptedHTTPServer;
+
+// Every piece of a range read joined, and the error that ended it, if any.
+struct RangeRead {
+    GWData bytes;
+    GWErrorPtr error;
+    bool sawLast = false;
+};
+
+RangeRead readRange(GWRemoteFileHandle& handle, std::uint64_t offset, std::uint64_t length) {
+    RangeRead result;
+    handle.readDataAtOffset(offset, length, UINT64_MAX,
+                            [&](GWRemoteFileHandle&, std::span<const std::uint8_t> piece,
+                                bool isLast, const GWErrorPtr& error) {
+                                result.bytes.insert(result.bytes.end(), piece.begin(), piece.end());
+                                result.error = error;
+                                result.sawLast = isLast;
+                                return true;
+                            });
+    return result;
+}
+
+void expectPOSIXError(const GWErrorPtr& error, int number) {
+    ASSERT_TRUE(error);
+    EXPECT_EQ(error->domain(), kGWPOSIXErrorDomain) << error->localizedDescription();
+    EXPECT_EQ(error->code(), number) << error->localizedDescription();
+}
+
+class GWRemoteFileHandleHTTPTest : public gwtest::ServedFolderTest {
+protected:
+    void SetUp() override {
+        contents_ = gwtest::randomBytes(3 * 1000 * 1000 + 17, 5);
+        gwtest::writeFile(directory_.file("data.bin"), contents_);
+        gwtest::writeFile(directory_.file("empty"), {});
+        ServedFolderTest::SetUp();
+    }
+
+    std::shared_ptr<GWRemoteFileHandle> open(const std::string& name, GWErrorPtr* error = nullptr) {
+        return GWRemoteFileHandle::initForReadingFromURL(server_->url(name), error);
+    }
+
+    GWData slice(std::uint64_t offset, std::size_t length) const {
+        return GWData(contents_.begin() + std::ptrdiff_t(offset),
+                      contents_.begin() + std::ptrdiff_t(offset + length));
+    }
+
+    GWData contents_;
+};
+
+}  // namespace
+
+TEST_F(GWRemoteFileHandleHTTPTest, ReadsAtPositionsAsALocalFileDoes) {
+    GWErrorPtr error;
+    auto handle = open("data.bin", &error);
+    ASSERT_TRUE(handle) << error->localizedDescription();
+    EXPECT_EQ(handle->fileSize(), contents_.size());
+    EXPECT_TRUE(handle->isSeekable());
+
+    for (std::uint64_t offset : {std::uint64_t(0), std::uint64_t(40000), std::uint64_t(2999990)}) {
+        ASSERT_TRUE(handle->seekToFileOffset(offset, nullptr));
+        auto bytes = handle->readDataOfLength(100000, &error);
+        ASSERT_TRUE(bytes);
+        EXPECT_EQ(*bytes, slice(offset, std::min<std::size_t>(100000, contents_.size() - offset)));
+        EXPECT_EQ(handle->offsetInFile(), offset + bytes->size());
+    }
+    auto empty = handle->readDataOfLength(10, &error);
+    ASSERT_TRUE(empty);
+    EXPECT_TRUE(empty->empty());
+
+    const RangeRead range = readRange(*handle, 12345, 1500000);
+    EXPECT_FALSE(range.error);
+    EXPECT_TRUE(range.sawLast);
+    EXPECT_EQ(range.bytes, slice(12345, 1500000));
+}
+
+TEST_F(GWRemoteFileHandleHTTPTest, NearbySmallReadsCostOneRequestAndLargeOnesNoMoreThanAsked) {
+    auto handle = open("data.bin");
+    ASSERT_TRUE(handle);
+    // 40 small records close together near the end, as central directory
+    // records or local headers lie.
+    const std::uint64_t base = contents_.size() - 20000;
+    server_->forgetRequests();
+    for (std::uint64_t record = 0; record < 40; ++record) {
+        ASSERT_TRUE(handle->seekToFileOffset(base + record * 400, nullptr));
+        auto bytes = handle->readDataOfLength(46, nullptr);
+        ASSERT_TRUE(bytes);
+        EXPECT_EQ(*bytes, slice(base + record * 400, 46));
+    }
+    EXPECT_LE(server_->requests().size(), 2u);
+
+    server_->forgetRequests();
+    ASSERT_TRUE(handle->seekToFileOffset(100000, nullptr));
+    ASSERT_TRUE(handle->readDataOfLength(700000, nullptr));
+    ASSERT_TRUE(handle->seekToFileOffset(900000, nullptr));
+    ASSERT_TRUE(handle->readDataOfLength(10, nullptr));
+    const auto requests = server_->requests();
+    ASSERT_EQ(requests.size(), 2u);
+    EXPECT_EQ(requests[0].bodyBytes, 700000u);
+    EXPECT_EQ(requests[0].range, "bytes=100000-799999");
+    // One kept-alive connection carries the handle's requests.
+    EXPECT_EQ(requests[0].connection, requests[1].connection);
+}
+
+TEST_F(GWRemoteFileHandleHTTPTest, AnEmptyResourceHasSizeZeroAndReadsEmpty) {
+    GWErrorPtr error;
+    auto handle = open("empty", &error);
+    ASSERT_TRUE(handle) << error->localizedDescription();
+    EXPECT_EQ(handle->fileSize(), 0u);
+    auto bytes = handle->readDataOfLength(10, &error);
+    ASSERT_TRUE(bytes);
+    EXPECT_TRUE(bytes->empty());
+}
+
+TEST_F(GWRemoteFileHandleHTTPTest, AMissingResourceIsFileNotFound) {
+    GWErrorPtr error;
+    EXPECT_FALSE(open("nothing-here.zip", &error));
+    expectPOSIXError(error, ENOENT);
+    EXPECT_NE(error->localizedDescription().find("404"), std::string::npos);
+}
+
+TEST_F(GWRemoteFileHandleHTTPTest, RemoteLocationsCannotBeWritten) {
+    GWErrorPtr error;
+    EXPECT_FALSE(GWRemoteFileHandle::initForWritingToURL(server_->url("new.bin"), &error));
+    ASSERT_TRUE(error);
+    EXPECT_TRUE(error->is(kGWCocoaErrorDomain, GWFileWriteUnsupportedSchemeError));
+}
+
+TEST_F(GWRemoteFileHandleHTTPTest, AResourceThatChangesSizeUnderneathIsAnError) {
+    auto handle = open("data.bin");
+    ASSERT_TRUE(handle);
+    gwtest::writeFile(directory_.file("data.bin"), gwtest::randomBytes(2000000, 6));
+    ASSERT_TRUE(handle->seekToFileOffset(1000000, nullptr));
+    GWErrorPtr error;
+    EXPECT_FALSE(handle->readDataOfLength(10, &error));
+    expectPOSIXError(error, ESTALE);
+}
+
+TEST(GWRemoteFileHandleMisbehavingServerTest, AServerWithoutRangeSupportIsRefusedAtOnce) {
+    ScriptedHTTPServer server(gwtest::randomBytes(4 << 20, 1),
+                              ScriptedHTTPServer::Behaviour::ignoreRanges);
+    ASSERT_TRUE(server.running());
+    GWErrorPtr error;
+    EXPECT_FALSE(GWRemoteFileHandle::initForReadingFromURL(server.url(), &error));
+    expectPOSIXError(error, ENOTSUP);
+}
+
+TEST(GWRemoteFileHandleMisbehavingServerTest, NotFoundAndAnotherRangeAreErrors) {
+    ScriptedHTTPServer missing({}, ScriptedHTTPServer::Behaviour::notFound);
+    GWErrorPtr error;
+    EXPECT_FALSE(GWRemoteFileHandle::initForReadingFromURL(missing.url(), &error));
+    expectPOSIXError(error, ENOENT);
+
+    ScriptedHTTPServer shifted(gwtest::randomBytes(1000, 2),
+                               ScriptedHTTPServer::Behaviour::wrongRange);
+    error = nullptr;
+    EXPECT_FALSE(GWRemoteFileHandle::initForReadingFromURL(shifted.url(), &error));
+    expectPOSIXError(error, EPROTO);
+}
+
+TEST(GWRemoteFileHandleMisbehavingServerTest, ADroppedConnectionFailsTheRangeWithoutShortData) {
+    const GWData content = gwtest::randomBytes(600000, 3);
+    ScriptedHTTPServer server(content, ScriptedHTTPServer::Behaviour::dropAt, 400000);
+    GWErrorPtr error;
+    auto handle = GWRemoteFileHandle::initForReadingFromURL(server.url(), &error);
+    ASSERT_TRUE(handle) << error->localizedDescription();
+
+    const RangeRead range = readRange(*handle, 100000, 500000);
+    expectPOSIXError(range.error, ECONNRESET);
+    EXPECT_TRUE(range.bytes.empty());
+
+    ASSERT_TRUE(handle->seekToFileOffset(399990, nullptr));
+    EXPECT_FALSE(handle->readDataOfLength(20, &error));
+    expectPOSIXError(error, ECONNRESET);
+    // The bytes before the cut are still there, over a new connection.
+    ASSERT_TRUE(handle->seekToFileOffset(300000, nullptr));
+    auto before = handle->readDataOfLength(50000, &error);
+    ASSERT_TRUE(before);
+    EXPECT_EQ(*before, GWData(content.begin() + 300000, content.begin() + 350000));
+}
+
+TEST(GWRemoteFileHandleMisbehavingServerTest, AStalledResponseTimesOut) {
+    const GWHTTPTimeouts saved = GWCurrentHTTPTimeouts();
+    GWSetHTTPTimeouts({2, 1});
+    ScriptedHTTPServer server(gwtest::randomBytes(200000, 4),
+                              ScriptedHTTPServer::Behaviour::stallAt, 150000);
+    GWErrorPtr error;
+    auto handle = GWRemoteFileHandle::initForReadingFromURL(server.url(), &error);
+    ASSERT_TRUE(handle);
+    ASSERT_TRUE(handle->seekToFileOffset(100000, nullptr));
+    EXPECT_FALSE(handle->readDataOfLength(100000, &error));
+    GWSetHTTPTimeouts(saved);
+    expectPOSIXError(error, ETIMEDOUT);
+}
+
+TEST(GWRemoteFileHandleMisbehavingServerTest, NobodyListeningIsConnectionRefused) {
+    const int port = gwtest::freeLocalPort();
+    auto url = GWURL::URLWithString("http://127.0.0.1:" + std::to_string(port) + "/x.zip");
+    ASSERT_TRUE(url);
+    GWErrorPtr error;
+    EXPECT_FALSE(GWRemoteFileHandle::initForReadingFromURL(*url, &error));
+    expectPOSIXError(error, ECONNREFUSED);
+}

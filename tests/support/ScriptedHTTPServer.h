@@ -1,0 +1,55 @@
+#pragma once
+
+#include <atomic>
+#include <cstdint>
+#include <mutex>
+#include <string>
+#include <thread>
+#include <vector>
+
+#include "foundation/GWFoundation.h"
+
+namespace gwtest {
+
+// A tiny HTTP/1.1 server on 127.0.0.1 that serves one resource and misbehaves
+// on purpose, for the failures nginx will not stage. Each connection gets a
+// thread; everything stops when the object goes.
+class ScriptedHTTPServer {
+public:
+    enum class Behaviour {
+        honourRanges,  // 206 with the range asked for
+        ignoreRanges,  // 200 with the whole resource
+        notFound,      // 404
+        wrongRange,    // 206 for a range that starts one byte late
+        dropAt,        // honours ranges but closes the connection at `cutOffset`
+        stallAt,       // honours ranges but goes quiet at `cutOffset`
+    };
+
+    ScriptedHTTPServer(GWData content, Behaviour behaviour, std::uint64_t cutOffset = 0);
+    ~ScriptedHTTPServer();
+    ScriptedHTTPServer(const ScriptedHTTPServer&) = delete;
+    ScriptedHTTPServer& operator=(const ScriptedHTTPServer&) = delete;
+
+    bool running() const { return listener_ >= 0; }
+    GWURL url(const std::string& name = "archive") const;
+    std::string address(const std::string& name = "archive") const;
+    int requestCount() const { return requests_; }
+
+private:
+    void acceptLoop();
+    void serve(int connection);
+    bool respond(int connection, const std::string& head);
+
+    GWData content_;
+    Behaviour behaviour_;
+    std::uint64_t cutOffset_;
+    int listener_ = -1;
+    int port_ = 0;
+    std::atomic<bool> stopping_{false};
+    std::atomic<int> requests_{0};
+    std::thread acceptor_;
+    std::mutex connectionsMutex_;
+    std::vector<std::thread> connections_;
+};
+
+}  // namespace gwtest
