@@ -1,0 +1,174 @@
+// gwarchive on http URLs: every reading command answers as for the local
+// file, large archives cost little more than the bytes asked for, and a
+// connection that drops mid-entry fails that entry.
+
+#include <gtest/gtest.h>
+
+#include <algorithm>
+#include <filesystem>
+#include <tuple>
+
+#include "ToolTestSupport.h"
+#include "support/ScriptedHTTPServer.h"
+#include "support/ServedFolderTest.h"
+#include "support/StreamingZipWriter.h"
+#include "support/XarBuilder.h"
+#include "support/ZipBuilder.h"
+
+using namespace gwtest;
+namespace fs = std::filesystem;
+
+namespace {
+
+constexpr std::uint64_t kAllowance = 256 * 1024;
+
+GWData zipArchive() {
+    ZipBuilder zip;
+    zip.addDirectory("docs/");
+    zip.addFile("docs/readme.txt", textBytes(40000, 1), 8);
+    zip.addFile("docs/data.bin", randomBytes(300000, 2));
+    zip.addFile("notes.txt", textBytes(9000, 3), 12);
+    zip.addSymlink("latest", "docs/readme.txt");
+    return zip.bytes();
+}
+
+GWData xarArchive() {
+    XarBuilder xar;
+    const std::string readme = xar.dataElement("data", textBytes(40000, 4), XarEncoding::gzip);
+    const std::string data = xar.dataElement("data", randomBytes(300000, 5), XarEncoding::none);
+    xar.setFiles(
+        "<file id=\"1\"><name>docs</name><type>directory</type><mode>0755</mode>"
+        "<file id=\"2\"><name>readme.txt</name><type>file</type><mode>0644</mode>" +
+        readme + "</file><file id=\"3\"><name>data.bin</name><type>file</type><mode>0600</mode>" +
+        data + "</file></file>");
+    return xar.bytes();
+}
+
+class GWArchiveToolRemote : public ServedFolderTest {
+protected:
+    // Runs the command on the URL and on the file; the output must agree,
+    // with the operand's spelling the only difference.
+    void expectSameRun(const std::string& command, const std::string& name,
+                       const std::string& rest = "") {
+        const std::string address = server_->address(name), path = directory_.file(name);
+        ToolRun remote = runTool(command + " " + shellQuote(address) + rest);
+        ToolRun local = runTool(command + " " + shellQuote(path) + rest);
+        EXPECT_EQ(remote.status, 0) << command << " " << name << ": " << remote.err;
+        EXPECT_EQ(remote.status, local.status) << command << " " << name;
+        std::string out = remote.out;
+        for (std::size_t at; (at = out.find(address)) != std::string::npos;) {
+            out.replace(at, address.size(), path);
+        }
+        EXPECT_EQ(out, local.out) << command << " " << name;
+        EXPECT_EQ(remote.err, local.err) << command << " " << name;
+    }
+};
+
+}  // namespace
+
+TEST_F(GWArchiveToolRemote, EveryReadingCommandAnswersAsForTheLocalFile) {
+    writeFile(directory_.file("tree.zip"), zipArchive());
+    writeFile(directory_.file("tree.xar"), xarArchive());
+    for (const std::string name : {"tree.zip", "tree.xar"}) {
+        expectSameRun("list -l", name);
+        expectSameRun("list --json", name);
+        expectSameRun("info", name);
+        expectSameRun("test", name);
+        expectSameRun("cat", name, " docs/readme.txt");
+        expectSameRun("cat", name, " docs/data.bin");
+
+        const std::string local = directory_.file("local-" + name);
+        const std::string remote = directory_.file("remote-" + name);
+        ToolRun byFile =
+            runTool("extract -C " + shellQuote(local) + " " + shellQuote(directory_.file(name)));
+        ToolRun byURL =
+            runTool("extract -C " + shellQuote(remote) + " " + shellQuote(server_->address(name)));
+        ASSERT_EQ(byURL.status, 0) << byURL.err;
+        ASSERT_EQ(byFile.status, 0) << byFile.err;
+        EXPECT_EQ(describeTree(remote), describeTree(local)) << name;
+        EXPECT_NE(describeTree(remote).find("data.bin"), std::string::npos);
+    }
+}
+
+TEST_F(GWArchiveToolRemote, ListingTwoHundredThousandEntriesCostsTheDirectoryAndLittleMore) {
+    StreamingZipWriter writer(directory_.file("many.zip"));
+    for (int index = 0; index < 200000; ++index) {
+        writer.add("d" + std::to_string(index / 1000) + "/f" + std::to_string(index), {});
+    }
+    ASSERT_TRUE(writer.finish());
+
+    server_->forgetRequests();
+    const std::string listing = directory_.file("listing.txt");
+    ToolRun list =
+        runTool("list " + shellQuote(server_->address("many.zip")) + " > " + shellQuote(listing));
+    ASSERT_EQ(list.status, 0) << list.err;
+    const GWData lines = readFile(listing);
+    EXPECT_EQ(std::count(lines.begin(), lines.end(), '\n'), 200000 + 200);
+    const std::uint64_t sent = server_->bodyBytesSent();
+    RecordProperty("centralDirectoryBytes", std::to_string(writer.centralDirectorySize()));
+    RecordProperty("bytesSent", std::to_string(sent));
+    RecordProperty("requests", std::to_string(server_->requests().size()));
+    EXPECT_GE(sent, writer.centralDirectorySize());
+    EXPECT_LE(sent, writer.centralDirectorySize() + kAllowance);
+}
+
+TEST_F(GWArchiveToolRemote, CatOfOneEntryOfAHugeArchiveCostsThatEntryAndLittleMore) {
+    // 300 MiB of stored zeros between two small members, as a sparse file.
+    const std::string path = directory_.file("huge.zip");
+    StreamingZipWriter writer(path);
+    const GWData first = textBytes(20000, 6), last = textBytes(50000, 7);
+    writer.add("first.txt", first, 8);
+    writer.addZeros("huge.bin", 300ull << 20);
+    writer.add("last.txt", last, 8);
+    ASSERT_TRUE(writer.finish());
+
+    for (const auto& [name, index, content] :
+         {std::tuple("first.txt", 0, &first), std::tuple("last.txt", 2, &last)}) {
+        server_->forgetRequests();
+        ToolRun cat = runTool("cat " + shellQuote(server_->address("huge.zip")) + " " + name);
+        ASSERT_EQ(cat.status, 0) << cat.err;
+        EXPECT_EQ(cat.out, std::string(content->begin(), content->end()));
+        const std::uint64_t sent = server_->bodyBytesSent();
+        EXPECT_LE(sent, writer.storedSize(index) + kAllowance) << name;
+        RecordProperty(std::string(name) + ".storedBytes",
+                       std::to_string(writer.storedSize(index)));
+        RecordProperty(std::string(name) + ".bytesSent", std::to_string(sent));
+    }
+    fs::remove(path);
+}
+
+TEST(GWArchiveToolDroppedConnection, AnEntryCutShortIsAnErrorNotAShortFile) {
+    ZipBuilder zip;
+    zip.addFile("before.txt", textBytes(3000, 8), 8);
+    zip.addFile("cut.bin", randomBytes(400000, 9));
+    zip.addFile("after.txt", textBytes(3000, 10), 8);
+    const GWData bytes = zip.bytes();
+    const std::uint64_t cut = zip.localHeaderOffsets()[1] + 200000;
+    ScriptedHTTPServer server(bytes, ScriptedHTTPServer::Behaviour::dropAt, cut);
+    ASSERT_TRUE(server.running());
+    const std::string address = shellQuote(server.address("cut.zip"));
+
+    ToolRun cat = runTool("cat " + address + " cut.bin");
+    EXPECT_EQ(cat.status, 1);
+    EXPECT_NE(cat.err.find("(NSPOSIXErrorDomain 104)"), std::string::npos) << cat.err;
+    EXPECT_LT(cat.out.size(), 400000u);
+
+    ToolRun test = runTool("test " + address);
+    EXPECT_EQ(test.status, 1);
+    EXPECT_NE(test.out.find("cut.bin"), std::string::npos) << test.out;
+    EXPECT_EQ(test.out.find("before.txt"), std::string::npos) << test.out;
+
+    TemporaryDirectory directory;
+    ToolRun extract = runTool("extract -C " + shellQuote(directory.path()) + " " + address);
+    EXPECT_EQ(extract.status, 1);
+    EXPECT_NE(extract.err.find("cut.bin"), std::string::npos) << extract.err;
+    EXPECT_FALSE(fs::exists(directory.file("cut.bin")));
+    EXPECT_EQ(readFile(directory.file("after.txt")), textBytes(3000, 10));
+    // Nothing written aside is left behind either.
+    std::size_t items = 0;
+    for (const auto& entry : fs::directory_iterator(directory.path())) {
+        (void)entry;
+        ++items;
+    }
+    EXPECT_EQ(items, 2u);
+}
