@@ -80,8 +80,7 @@ void GWZipExtractOperation::writeResourceForkForFile(const GWZipFilePtr& file,
     // The position never advances: every piece lands at 0. Known and kept;
     // a fork longer than one decoded piece keeps only what was written last.
     const std::uint64_t position = 0;
-    ChunkHandler write = [store, position](std::span<const std::uint8_t> data, bool,
-                                           GWErrorPtr* error) {
+    ChunkHandler write = [store](std::span<const std::uint8_t> data, bool, GWErrorPtr* error) {
         if (position > UINT32_MAX) {
             return GWFail(error, GWPOSIXError(EFBIG));
         }
