@@ -2,10 +2,13 @@
 # missing Debian packages first, then configure and build in Release mode.
 BUILD_DIR ?= build
 ASAN_BUILD_DIR ?= build-asan
+FUZZ_BUILD_DIR ?= build-fuzz
+FUZZ_SECONDS ?= 60
+FUZZ_TARGETS := $(basename $(notdir $(wildcard fuzz/fuzz_*.cpp)))
 JOBS ?= $(shell nproc)
 CMAKE_FLAGS ?=
 
-.PHONY: all deps build run test test-asan format format-check clean
+.PHONY: all deps build run test test-asan fuzz format format-check clean
 
 all: build
 
@@ -32,6 +35,23 @@ test-asan: deps
 	cd $(ASAN_BUILD_DIR) && ASAN_OPTIONS=detect_leaks=1 UBSAN_OPTIONS=print_stacktrace=1 \
 		ctest --output-on-failure --parallel $(JOBS)
 
+# Every fuzz target for FUZZ_SECONDS on its seed corpus (clang 14, libFuzzer,
+# AddressSanitizer and UndefinedBehaviorSanitizer); a finding fails the run
+# and shows the end of that target's log.
+fuzz: deps
+	CC=clang-14 CXX=clang++-14 cmake -S . -B $(FUZZ_BUILD_DIR) -DCMAKE_BUILD_TYPE=RelWithDebInfo \
+		-DGW_FUZZ=ON $(CMAKE_FLAGS)
+	cmake --build $(FUZZ_BUILD_DIR) --parallel $(JOBS) --target fuzz_all
+	@mkdir -p $(FUZZ_BUILD_DIR)/fuzz/logs
+	@for target in $(FUZZ_TARGETS); do \
+		log=$(FUZZ_BUILD_DIR)/fuzz/logs/$$target.log; \
+		if FUZZ_BUILD_DIR=$(FUZZ_BUILD_DIR) bash scripts/fuzz.sh $$target $(FUZZ_SECONDS) >$$log 2>&1; then \
+			echo "$$target: $$(grep -E '^#[0-9]+ +DONE' $$log | tail -1)"; \
+		else \
+			tail -n 60 $$log; echo "$$target: FAILED (see $$log)"; exit 1; \
+		fi; \
+	done
+
 format:
 	git ls-files '*.h' '*.cpp' | xargs clang-format -i
 
@@ -39,4 +59,4 @@ format-check:
 	git ls-files '*.h' '*.cpp' | xargs clang-format --dry-run --Werror
 
 clean:
-	rm -rf $(BUILD_DIR) $(ASAN_BUILD_DIR)
+	rm -rf $(BUILD_DIR) $(ASAN_BUILD_DIR) $(FUZZ_BUILD_DIR)

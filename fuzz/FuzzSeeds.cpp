@@ -1,0 +1,258 @@
+// Writes the seed corpus of every fuzz target into DIRECTORY/<target>/,
+// made with the archive builders the tests use, so each target starts from
+// inputs that reach deep into its parser.
+
+#include <sys/stat.h>
+
+#include <cstdio>
+#include <cstring>
+#include <string>
+#include <vector>
+
+#include "support/AppleDoubleBuilder.h"
+#include "support/MacBinaryBuilder.h"
+#include "support/TestSupport.h"
+#include "support/XarBuilder.h"
+#include "support/ZipBuilder.h"
+#include "support/ZipExtraFields.h"
+
+using namespace gwtest;
+
+namespace {
+
+using Seeds = std::vector<GWData>;
+
+void put32(GWData& bytes, std::size_t at, std::uint32_t value) {
+    for (int i = 0; i < 4; ++i) {
+        bytes[at + i] = std::uint8_t(value >> (8 * i));
+    }
+}
+
+GWData appleDouble() {
+    AppleDoubleFile file;
+    file.finderInfo = finderInfoBytes("TEXT", "ttxt", 0x0100, 10, 20);
+    file.attributes = {{"com.example.origin", bytesOf("seed")}, {"user.color", bytesOf("blue")}};
+    file.resourceFork = bytesOf("a small resource fork");
+    file.comment = "a comment";
+    return buildAppleDouble(file);
+}
+
+GWData macBinary(int version) {
+    MacBinaryFile file;
+    file.version = version;
+    file.dataFork = textBytes(300, version);
+    file.resourceFork = bytesOf("resource fork bytes");
+    file.comment = version > 1 ? "comment" : "";
+    file.creationDate = 3000000000u;
+    file.modificationDate = 3000000100u;
+    return buildMacBinary(file);
+}
+
+Seeds zipSeeds() {
+    Seeds seeds;
+    {
+        ZipBuilder zip;
+        zip.addDirectory("dir/");
+        zip.addFile("dir/stored.txt", textBytes(200, 1), 0);
+        zip.addFile("dir/deflated.txt", textBytes(2000, 2), 8);
+        zip.addFile("dir/bzip2.txt", textBytes(500, 3), 12);
+        zip.addSymlink("dir/link", "stored.txt");
+        seeds.push_back(zip.bytes());
+    }
+    {
+        ZipBuilder zip;
+        auto& entry = zip.addFile("times.txt", bytesOf("timed"), 8);
+        entry.centralExtra = concat({zipExtraBlock(0x5455, extendedTimestampPayload(3, {1, 2})),
+                                     zipExtraBlock(0x7875, infoZipUnix3GPayload(501, 20)),
+                                     zipExtraBlock(0x000A, ntfsPayload(1, 2, 3))});
+        entry.localExtra = zipExtraBlock(0x5455, extendedTimestampPayload(3, {1, 2}));
+        entry.dataDescriptor = true;
+        auto& unicode = zip.addFile("unicode.txt", bytesOf("renamed"));
+        unicode.centralExtra = zipExtraBlock(0x7075, infoZipUnicodePayload("ünïcode.txt"));
+        seeds.push_back(zip.bytes());
+    }
+    {
+        ZipBuilder zip;
+        zip.zip64EndRecord = true;
+        zip.addFile("sizes.bin", randomBytes(100, 4), 8).zip64Sizes = true;
+        // The central Zip64 block gives the offset from its first slot, so
+        // only an entry with nothing else escaped keeps a usable one.
+        zip.addFile("offset.bin", randomBytes(50, 5)).zip64Offset = true;
+        seeds.push_back(zip.bytes());
+    }
+    {
+        ZipBuilder zip;
+        zip.addFile("Read Me.txt", bytesOf("from a Mac"), 8);
+        zip.addDirectory("__MACOSX/");
+        zip.addFile("__MACOSX/._Read Me.txt", appleDouble(), 8);
+        auto& mac3 = zip.addFile("mac3.txt", bytesOf("mac3"));
+        Mac3Attributes attributes;
+        attributes.comment = "comment";
+        mac3.localExtra = zipExtraBlock(
+            0x334D,
+            mac3Payload(0x0000, "TEXT", "ttxt", mac3AttributeBlock(attributes, true, true)));
+        mac3.centralExtra = zipExtraBlock(0x334D, mac3Payload(0x0000, "TEXT", "ttxt", {}));
+        auto& bin = zip.addFile("encoded.bin", macBinary(2), 8);
+        bin.centralExtra = zipExtraBlock(0x07C8, jleePayload("TEXT", "ttxt", 0, 1, 2, true));
+        seeds.push_back(zip.bytes());
+    }
+    {
+        ZipBuilder zip;
+        zip.prefix = GWData(64, 'M');
+        zip.archiveComment = bytesOf("an archive comment");
+        zip.addFile("after-prefix.txt", textBytes(100, 5), 8).comment = bytesOf("entry comment");
+        seeds.push_back(zip.bytes());
+    }
+    return seeds;
+}
+
+Seeds extraFieldSeeds() {
+    const std::vector<GWData> fields = {
+        zipExtraBlock(0x0001, zip64Payload({1, 2, 3})),
+        zipExtraBlock(0x000A, ntfsPayload(1, 2, 3)),
+        zipExtraBlock(0x000D, unixPayload(1, 2, 3, 4, "target")),
+        zipExtraBlock(0x5855, unixPayload(1, 2, 3, 4)),
+        zipExtraBlock(0x5455, extendedTimestampPayload(7, {1, 2, 3})),
+        zipExtraBlock(0x7855, infoZipUnixPayload(1, 2)),
+        zipExtraBlock(0x7875, infoZipUnix3GPayload(1, 2)),
+        zipExtraBlock(0x7075, infoZipUnicodePayload("name")),
+        zipExtraBlock(0x6375, infoZipUnicodePayload("comment")),
+        zipExtraBlock(0x756E, asiUnixPayload(0, 0120777, 1, 2, "target")),
+        zipExtraBlock(0x07C8, jleePayload("TEXT", "ttxt", 0, 1, 2, true)),
+        zipExtraBlock(0x2605, zipItPayload("name", "TEXT", "ttxt", 0x0100)),
+        zipExtraBlock(0x2705, zipItPayload({}, "TEXT", "ttxt", 0x0100)),
+        zipExtraBlock(0x2805, zipIt135Payload(0x0100, true)),
+        zipExtraBlock(0x4D63, smartZipPayload(SmartZipInfo{.name = "name"})),
+        zipExtraBlock(0x334D, mac3Payload(0x0000, "TEXT", "ttxt",
+                                          mac3AttributeBlock(Mac3Attributes{}, true, true))),
+        zipExtraBlock(0x334D, mac3Payload(0x0004, "TEXT", "ttxt",
+                                          mac3AttributeBlock(Mac3Attributes{}, false, false))),
+        zipExtraBlock(0xA220, GWData{0, 0, 0, 0}),
+    };
+    Seeds seeds;
+    for (const auto& field : fields) {
+        for (std::uint8_t local : {0, 1}) {
+            GWData seed{local};
+            seed.insert(seed.end(), field.begin(), field.end());
+            seeds.push_back(seed);
+        }
+    }
+    return seeds;
+}
+
+std::string xarFiles(XarBuilder& xar) {
+    const std::string gz = xar.dataElement("data", textBytes(500, 6), XarEncoding::gzip);
+    const std::string bz = xar.dataElement("data", textBytes(300, 7), XarEncoding::bzip2, "md5");
+    const std::string ea = xar.dataElement("ea", bytesOf("blue"), XarEncoding::none, "sha1",
+                                           "<name>user.color</name>");
+    return "<file id=\"1\"><name>dir</name><type>directory</type><mode>0755</mode>"
+           "<uid>1</uid><gid>2</gid><user>u</user><group>g</group>"
+           "<mtime>2024-05-01T10:00:00Z</mtime><FinderCreateTime><time>2024-05-01T10:00:00"
+           "</time></FinderCreateTime><flags><UserNoDump/></flags>"
+           "<file id=\"2\"><name>a.txt</name><type>file</type><mode>0644</mode>" +
+           gz + ea + "</file><file id=\"3\"><name>b.txt</name><type>file</type>" + bz +
+           "</file><file id=\"4\"><name>hard</name><type link=\"2\">hardlink</type></file>"
+           "<file id=\"5\"><name>soft</name><type>symlink</type><link type=\"file\">a.txt"
+           "</link></file><file id=\"6\"><name>dev</name><type>character special</type>"
+           "<device><major>1</major><minor>3</minor></device></file>"
+           "<file id=\"7\"><name enctype=\"base64\">YmFzZTY0</name><type>file</type></file>"
+           "</file>";
+}
+
+Seeds xarSeeds() {
+    Seeds seeds;
+    for (std::uint32_t checksum : {0u, 1u, 2u}) {
+        XarBuilder xar(checksum);
+        xar.setFiles(xarFiles(xar));
+        seeds.push_back(xar.bytes());
+    }
+    XarBuilder stored;
+    stored.compressTOC = false;
+    stored.setFiles(xarFiles(stored));
+    seeds.push_back(stored.bytes());
+    return seeds;
+}
+
+Seeds tocEntrySeeds() {
+    XarBuilder xar;
+    return {bytesOf(xarFiles(xar)),
+            bytesOf("<file id=\"1\"><name>.</name><file id=\"2\"><name>x</name></file></file>"),
+            bytesOf("<file id=\"1\"><name>a</name><acl><access>user::rw-\ngroup::r--\nother::r--"
+                    "\n</access></acl><ea><name>n</name><offset>0</offset><size>1</size>"
+                    "<length>1</length><encoding style=\"application/octet-stream\"/>"
+                    "<extracted-checksum style=\"sha1\">00</extracted-checksum></ea></file>")};
+}
+
+Seeds appleDoubleSeeds() {
+    AppleDoubleFile plain;
+    plain.withAttributeHeader = false;
+    plain.resourceFork = bytesOf("fork");
+    return {appleDouble(), buildAppleDouble(plain)};
+}
+
+Seeds macBinarySeeds() {
+    return {macBinary(1), macBinary(2), macBinary(3)};
+}
+
+Seeds sfxSeeds() {
+    ZipBuilder zip;
+    zip.addFile("inside.txt", bytesOf("packed"));
+    const GWData archive = zip.bytes();
+    Seeds seeds;
+    for (const char* signature : {"PE\0\0", "NE\0\0"}) {
+        GWData image(0x400, 0);
+        image[0] = 'M';
+        image[1] = 'Z';
+        image[8] = 4;
+        put32(image, 0x3C, 0x80);
+        std::memcpy(image.data() + 0x80, signature, 4);
+        // One section whose raw data ends where the archive begins.
+        const std::size_t section = 0x80 + 0xF8;
+        std::memcpy(image.data() + section, ".data", 5);
+        put32(image, section + 16, 0x100);
+        put32(image, section + 20, 0x300);
+        image.insert(image.end(), archive.begin(), archive.end());
+        seeds.push_back(image);
+    }
+    GWData marked(0x200, 0);
+    marked[0] = 'M';
+    marked[1] = 'Z';
+    marked[8] = 4;
+    std::memcpy(marked.data() + 64, "PKSFX", 5);
+    seeds.push_back(marked);
+    return seeds;
+}
+
+bool writeSeeds(const std::string& directory, const std::string& target, const Seeds& seeds) {
+    const std::string folder = directory + "/" + target;
+    if (::mkdir(folder.c_str(), 0755) != 0 && errno != EEXIST) {
+        std::perror(folder.c_str());
+        return false;
+    }
+    for (std::size_t i = 0; i < seeds.size(); ++i) {
+        writeFile(folder + "/seed-" + std::to_string(i), seeds[i]);
+    }
+    return true;
+}
+
+}  // namespace
+
+int main(int argc, char** argv) {
+    if (argc != 2) {
+        std::fprintf(stderr, "usage: gwarchive_fuzz_seeds DIRECTORY\n");
+        return 2;
+    }
+    const std::string directory = argv[1];
+    if (::mkdir(directory.c_str(), 0755) != 0 && errno != EEXIST) {
+        std::perror(directory.c_str());
+        return 1;
+    }
+    const bool ok = writeSeeds(directory, "fuzz_zip_archive", zipSeeds()) &&
+                    writeSeeds(directory, "fuzz_zip_extra_fields", extraFieldSeeds()) &&
+                    writeSeeds(directory, "fuzz_xar_archive", xarSeeds()) &&
+                    writeSeeds(directory, "fuzz_xar_toc_entry", tocEntrySeeds()) &&
+                    writeSeeds(directory, "fuzz_macbinary", macBinarySeeds()) &&
+                    writeSeeds(directory, "fuzz_appledouble", appleDoubleSeeds()) &&
+                    writeSeeds(directory, "fuzz_sfx_detect", sfxSeeds());
+    return ok ? 0 : 1;
+}
