@@ -5,7 +5,7 @@
 set -euo pipefail
 
 packages=(
-  build-essential cmake pkg-config python3 clang-format
+  build-essential cmake pkg-config python3 clang-format clang-14 libclang-rt-14-dev
   zlib1g-dev libbz2-dev libssl-dev openssl
   libpugixml-dev libacl1-dev libplist-dev libcurl4-openssl-dev libisal-dev
   libgtest-dev libgmock-dev libbenchmark-dev
