@@ -69,6 +69,8 @@ const Command kCatCommand = {
     "    standard output as it is decoded, without a temporary file. For a\n"
     "    symbolic link the link text is written. Metadata (resource forks,\n"
     "    Finder information, extended attributes) is not part of the output.\n"
+    "    ARCHIVE may be a path or an http(s) URL; from a server only the\n"
+    "    directory and the entry's own bytes are fetched.\n"
     "\n"
     "EXIT STATUS\n"
     "    0 when all the data was written; 1 when ARCHIVE cannot be opened, PATH is\n"
