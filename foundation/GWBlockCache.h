@@ -4,6 +4,8 @@
 #include <cstdint>
 #include <functional>
 #include <list>
+#include <memory>
+#include <mutex>
 #include <span>
 #include <utility>
 
@@ -14,6 +16,8 @@
 // are served from a few aligned blocks kept in least-recently-used order, so
 // records that lie close together (an end record, local headers, a TOC
 // checksum) arrive in one fetch. Large reads go straight to the source.
+// Several readers of one source may share a cache from different threads;
+// fetches run outside its lock.
 class GWBlockCache {
 public:
     // Fills `into` with the bytes at `offset`, all of them or fail.
@@ -34,10 +38,12 @@ public:
     std::size_t blockSize() const { return blockSize_; }
 
 private:
-    const GWData* find(std::uint64_t block);
-    void insert(std::uint64_t block, GWData bytes);
+    using Block = std::shared_ptr<const GWData>;
+    Block find(std::uint64_t block);
+    void insert(std::uint64_t block, Block bytes);
 
-    std::size_t blockSize_;
-    std::size_t blockCount_;
-    std::list<std::pair<std::uint64_t, GWData>> blocks_;  // most recently used first
+    const std::size_t blockSize_;
+    const std::size_t blockCount_;
+    std::mutex mutex_;
+    std::list<std::pair<std::uint64_t, Block>> blocks_;  // most recently used first
 };

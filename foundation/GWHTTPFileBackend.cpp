@@ -1,24 +1,23 @@
 #include <cerrno>
 #include <mutex>
 
-#include "GWBlockCache.h"
 #include "GWFileHandleBackend.h"
 #include "GWHTTPRangeReader.h"
+#include "GWRecentHTTPResources.h"
 
 namespace {
 
 // Small enough that opening an archive and reading one member stays within a
 // few blocks of what it needs, large enough that neighbouring records share a
-// round trip.
+// round trip. The blocks of a resource are shared by all its handles.
 constexpr std::size_t kBlockSize = 32 * 1024;
-constexpr std::size_t kBlockCount = 8;
+constexpr std::size_t kBlockCount = 16;
 
 class HTTPFileBackend final : public GWFileHandleBackend {
 public:
-    HTTPFileBackend(std::unique_ptr<GWHTTPRangeReader> reader, const GWData& firstBlock)
-        : reader_(std::move(reader)), cache_(kBlockSize, kBlockCount) {
-        cache_.store(0, firstBlock, reader_->size());
-    }
+    HTTPFileBackend(std::unique_ptr<GWHTTPRangeReader> reader, std::shared_ptr<GWBlockCache> blocks,
+                    std::string address)
+        : reader_(std::move(reader)), blocks_(std::move(blocks)), address_(std::move(address)) {}
 
     bool readAt(std::uint64_t offset, std::span<std::uint8_t> into, std::size_t& got,
                 GWErrorPtr* error) override {
@@ -30,7 +29,15 @@ public:
         }
         auto fetch = [this](std::uint64_t from, std::span<std::uint8_t> bytes,
                             GWErrorPtr* failure) { return reader_->fetch(from, bytes, failure); };
-        return cache_.read(offset, into, reader_->size(), fetch, got, error);
+        GWErrorPtr failure;
+        if (!blocks_->read(offset, into, reader_->size(), fetch, got, &failure)) {
+            // What other handles know of it no longer holds.
+            if (failure && failure->is(kGWPOSIXErrorDomain, ESTALE)) {
+                GWRecentHTTPResources::shared().forget(address_);
+            }
+            return GWFail(error, failure);
+        }
+        return true;
     }
 
     bool writeAt(std::uint64_t, std::span<const std::uint8_t>, GWErrorPtr* error) override {
@@ -53,16 +60,29 @@ public:
 private:
     mutable std::mutex mutex_;
     std::unique_ptr<GWHTTPRangeReader> reader_;
-    GWBlockCache cache_;
+    std::shared_ptr<GWBlockCache> blocks_;
+    std::string address_;
 };
 
 }  // namespace
 
 std::unique_ptr<GWFileHandleBackend> GWOpenHTTPFileBackend(const GWURL& url, GWErrorPtr* error) {
+    const std::string address = url.absoluteString();
+    auto& recent = GWRecentHTTPResources::shared();
+    if (auto known = recent.find(address)) {
+        auto reader = GWHTTPRangeReader::attach(url, known->size, known->entityTag, error);
+        if (!reader) {
+            return nullptr;
+        }
+        return std::make_unique<HTTPFileBackend>(std::move(reader), known->blocks, address);
+    }
     GWData firstBlock;
     auto reader = GWHTTPRangeReader::open(url, kBlockSize, firstBlock, error);
     if (!reader) {
         return nullptr;
     }
-    return std::make_unique<HTTPFileBackend>(std::move(reader), firstBlock);
+    auto blocks = std::make_shared<GWBlockCache>(kBlockSize, kBlockCount);
+    blocks->store(0, firstBlock, reader->size());
+    recent.remember(address, {reader->size(), reader->entityTag(), blocks});
+    return std::make_unique<HTTPFileBackend>(std::move(reader), std::move(blocks), address);
 }

@@ -143,6 +143,7 @@ struct GWHTTPRangeReader::Transfer {
 
     long status = 0;
     std::optional<ContentRange> range;
+    std::string entityTag;
     bool bodyStarted = false;
     std::size_t expected = 0;
     std::size_t received = 0;
@@ -156,12 +157,15 @@ struct GWHTTPRangeReader::Transfer {
         if (line.starts_with("HTTP/")) {
             // A new response (after a redirect, say) replaces what came before.
             transfer.range.reset();
+            transfer.entityTag.clear();
             const auto space = line.find(' ');
             transfer.status = space == std::string_view::npos
                                   ? 0
                                   : long(number(line.substr(space + 1, 3)).value_or(0));
         } else if (startsWithIgnoringCase(line, "content-range:")) {
             transfer.range = parseContentRange(line.substr(14));
+        } else if (startsWithIgnoringCase(line, "etag:")) {
+            transfer.entityTag = trimmed(line.substr(5));
         }
         return size * count;
     }
@@ -222,10 +226,8 @@ GWHTTPRangeReader::~GWHTTPRangeReader() = default;
 std::unique_ptr<GWHTTPRangeReader> GWHTTPRangeReader::open(const GWURL& url,
                                                            std::size_t probeLength, GWData& probe,
                                                            GWErrorPtr* error) {
-    initialiseCurlOnce();
-    std::unique_ptr<GWHTTPRangeReader> reader(new GWHTTPRangeReader(url));
-    if (!reader->curl_) {
-        GWFail(error, GWPOSIXError(ENOMEM, url));
+    auto reader = attach(url, 0, {}, error);
+    if (!reader) {
         return nullptr;
     }
     probe.assign(std::max<std::size_t>(probeLength, 1), 0);
@@ -237,6 +239,21 @@ std::unique_ptr<GWHTTPRangeReader> GWHTTPRangeReader::open(const GWURL& url,
     }
     probe.resize(transfer.received);
     reader->size_ = transfer.range && transfer.range->total ? *transfer.range->total : 0;
+    reader->entityTag_ = transfer.entityTag;
+    return reader;
+}
+
+std::unique_ptr<GWHTTPRangeReader> GWHTTPRangeReader::attach(const GWURL& url, std::uint64_t size,
+                                                             std::string entityTag,
+                                                             GWErrorPtr* error) {
+    initialiseCurlOnce();
+    std::unique_ptr<GWHTTPRangeReader> reader(new GWHTTPRangeReader(url));
+    if (!reader->curl_) {
+        GWFail(error, GWPOSIXError(ENOMEM, url));
+        return nullptr;
+    }
+    reader->size_ = size;
+    reader->entityTag_ = std::move(entityTag);
     return reader;
 }
 
@@ -256,6 +273,11 @@ bool GWHTTPRangeReader::fetch(std::uint64_t offset, std::span<std::uint8_t> into
                                      GWFormat("the resource changed size from %llu to %llu bytes",
                                               (unsigned long long)size_,
                                               (unsigned long long)*transfer.range->total)));
+    }
+    if (!entityTag_.empty() && !transfer.entityTag.empty() && transfer.entityTag != entityTag_) {
+        return GWFail(error, failure(ESTALE, transfer,
+                                     "the resource changed: its entity tag is now " +
+                                         transfer.entityTag + ", was " + entityTag_));
     }
     if (transfer.received != into.size()) {
         return GWFail(error, failure(ECONNRESET, transfer, "the response ended early"));

@@ -32,6 +32,10 @@ public:
     // came back (fewer bytes only for a shorter resource).
     static std::unique_ptr<GWHTTPRangeReader> open(const GWURL& url, std::size_t probeLength,
                                                    GWData& probe, GWErrorPtr* error);
+    // A reader for a resource another reader opened: no request until the
+    // first fetch, which checks that size and entity tag still hold.
+    static std::unique_ptr<GWHTTPRangeReader> attach(const GWURL& url, std::uint64_t size,
+                                                     std::string entityTag, GWErrorPtr* error);
     ~GWHTTPRangeReader();
     GWHTTPRangeReader(const GWHTTPRangeReader&) = delete;
     GWHTTPRangeReader& operator=(const GWHTTPRangeReader&) = delete;
@@ -39,6 +43,8 @@ public:
     // Exactly into.size() bytes at `offset`, which must lie inside the resource.
     bool fetch(std::uint64_t offset, std::span<std::uint8_t> into, GWErrorPtr* error);
     std::uint64_t size() const { return size_; }
+    // The server's validator of this version of the resource, or empty.
+    const std::string& entityTag() const { return entityTag_; }
 
 private:
     struct Transfer;
@@ -54,4 +60,5 @@ private:
     };
     std::unique_ptr<CURL, EasyDeleter> curl_;  // kept for its connection
     std::uint64_t size_ = 0;
+    std::string entityTag_;
 };

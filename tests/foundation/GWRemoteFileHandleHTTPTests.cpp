@@ -114,6 +114,50 @@ TEST_F(GWRemoteFileHandleHTTPTest, NearbySmallReadsCostOneRequestAndLargeOnesNoM
     EXPECT_EQ(requests[0].connection, requests[1].connection);
 }
 
+TEST_F(GWRemoteFileHandleHTTPTest, HandlesOfOneResourceShareItsSizeAndBlocks) {
+    auto first = open("data.bin");
+    ASSERT_TRUE(first);
+    ASSERT_TRUE(first->seekToFileOffset(500000, nullptr));
+    ASSERT_TRUE(first->readDataOfLength(10, nullptr));
+    server_->forgetRequests();
+
+    // As an extraction opens one handle per entry.
+    auto second = open("data.bin");
+    ASSERT_TRUE(second);
+    EXPECT_EQ(second->fileSize(), contents_.size());
+    ASSERT_TRUE(second->seekToFileOffset(500010, nullptr));
+    EXPECT_EQ(second->readDataOfLength(100, nullptr), slice(500010, 100));
+    EXPECT_TRUE(server_->requests().empty());
+    ASSERT_TRUE(second->seekToFileOffset(2000000, nullptr));
+    EXPECT_EQ(second->readDataOfLength(100, nullptr), slice(2000000, 100));
+    EXPECT_EQ(server_->requests().size(), 1u);
+}
+
+TEST_F(GWRemoteFileHandleHTTPTest, AResourceReplacedAtTheSameSizeIsNoticedAndThenReread) {
+    auto first = open("data.bin");
+    ASSERT_TRUE(first);
+    const GWData replacement = gwtest::randomBytes(contents_.size(), 8);
+    gwtest::writeFile(directory_.file("data.bin"), replacement);
+    // nginx's entity tag is made of the size and the modification time.
+    ASSERT_EQ(gwtest::runCommand("touch -d '2001-02-03 04:05:06' " +
+                                 gwtest::shellQuote(directory_.file("data.bin")))
+                  .status,
+              0);
+
+    auto second = open("data.bin");
+    ASSERT_TRUE(second);
+    ASSERT_TRUE(second->seekToFileOffset(1000000, nullptr));
+    GWErrorPtr error;
+    EXPECT_FALSE(second->readDataOfLength(10, &error));
+    expectPOSIXError(error, ESTALE);
+
+    auto third = open("data.bin");
+    ASSERT_TRUE(third);
+    ASSERT_TRUE(third->seekToFileOffset(1000000, nullptr));
+    EXPECT_EQ(third->readDataOfLength(10, nullptr),
+              GWData(replacement.begin() + 1000000, replacement.begin() + 1000010));
+}
+
 TEST_F(GWRemoteFileHandleHTTPTest, AnEmptyResourceHasSizeZeroAndReadsEmpty) {
     GWErrorPtr error;
     auto handle = open("empty", &error);
