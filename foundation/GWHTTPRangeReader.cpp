@@ -1,5 +1,7 @@
 #include "GWHTTPRangeReader.h"
 
+#include <openssl/ssl.h>
+
 #include <algorithm>
 #include <atomic>
 #include <cctype>
@@ -76,6 +78,14 @@ std::optional<ContentRange> parseContentRange(std::string_view value) {
         }
     }
     return range;
+}
+
+// Servers are trusted as signing certificates are: through OpenSSL's default
+// locations (which SSL_CERT_FILE and SSL_CERT_DIR may move), besides curl's
+// own bundle.
+CURLcode addDefaultTrust(CURL*, void* context, void*) {
+    SSL_CTX_set_default_verify_paths(static_cast<SSL_CTX*>(context));
+    return CURLE_OK;
 }
 
 void initialiseCurlOnce() {
@@ -298,6 +308,7 @@ bool GWHTTPRangeReader::perform(Transfer& transfer, GWErrorPtr* error) {
     curl_easy_setopt(curl, CURLOPT_FOLLOWLOCATION, 1L);
     curl_easy_setopt(curl, CURLOPT_MAXREDIRS, 5L);
     curl_easy_setopt(curl, CURLOPT_USERAGENT, "GWArchiveSupport/1.0");
+    curl_easy_setopt(curl, CURLOPT_SSL_CTX_FUNCTION, &addDefaultTrust);
     curl_easy_setopt(curl, CURLOPT_CONNECTTIMEOUT, timeouts.connectSeconds);
     // A response that stops moving for the stall time is given up.
     curl_easy_setopt(curl, CURLOPT_LOW_SPEED_LIMIT, 1L);

@@ -1,5 +1,7 @@
 #include <gtest/gtest.h>
 
+#include <sys/stat.h>
+
 #include <cerrno>
 
 #include "foundation/GWHTTPRangeReader.h"
@@ -8,6 +10,7 @@
 #include "support/ScriptedHTTPServer.h"
 #include "support/ServedFolderTest.h"
 #include "support/TestSupport.h"
+#include "support/XarSigning.h"
 
 namespace {
 
@@ -256,4 +259,33 @@ TEST(GWRemoteFileHandleMisbehavingServerTest, NobodyListeningIsConnectionRefused
     GWErrorPtr error;
     EXPECT_FALSE(GWRemoteFileHandle::initForReadingFromURL(*url, &error));
     expectPOSIXError(error, ECONNREFUSED);
+}
+
+TEST(GWRemoteFileHandleHTTPSTest, TheServerMustBeTrustedAndThenReadsAsOverHTTP) {
+    if (!gwtest::NginxServer::available() || !gwtest::toolAvailable("openssl")) {
+        GTEST_SKIP() << "nginx or openssl is not installed";
+    }
+    gwtest::TemporaryDirectory directory;
+    const std::string certificate = directory.file("server.pem"), key = directory.file("key.pem");
+    const auto made = gwtest::runCommand(
+        "openssl req -x509 -newkey ec -pkeyopt ec_paramgen_curve:prime256v1 -nodes -days 2"
+        " -subj /CN=127.0.0.1 -addext subjectAltName=IP:127.0.0.1 -keyout " +
+        gwtest::shellQuote(key) + " -out " + gwtest::shellQuote(certificate) + " 2>&1");
+    ASSERT_EQ(made.status, 0) << made.output;
+    ASSERT_EQ(mkdir(directory.file("www").c_str(), 0755), 0);
+    const GWData contents = gwtest::randomBytes(100000, 9);
+    gwtest::writeFile(directory.file("www/data.bin"), contents);
+    gwtest::NginxServer server(directory.file("www"), {{certificate, key}});
+    ASSERT_TRUE(server.running()) << server.failure();
+
+    GWErrorPtr error;
+    EXPECT_FALSE(GWRemoteFileHandle::initForReadingFromURL(server.url("data.bin"), &error));
+    expectPOSIXError(error, EPROTO);
+
+    gwtest::TrustedRootScope trust(certificate);
+    auto handle = GWRemoteFileHandle::initForReadingFromURL(server.url("data.bin"), &error);
+    ASSERT_TRUE(handle) << error->localizedDescription();
+    ASSERT_TRUE(handle->seekToFileOffset(60000, nullptr));
+    EXPECT_EQ(handle->readDataOfLength(40000, nullptr),
+              GWData(contents.begin() + 60000, contents.end()));
 }

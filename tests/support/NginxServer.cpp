@@ -28,7 +28,8 @@ sockaddr_in loopback(int port) {
     return address;
 }
 
-std::string configuration(const std::string& folder, const std::string& root, int port) {
+std::string configuration(const std::string& folder, const std::string& root, int port,
+                          const std::optional<NginxServer::TLSFiles>& tls) {
     std::ostringstream text;
     text << "daemon off;\nmaster_process off;\nworker_processes 1;\n"
          << "pid " << folder << "/nginx.pid;\n"
@@ -43,8 +44,13 @@ std::string configuration(const std::string& folder, const std::string& root, in
     }
     text << "  default_type application/octet-stream;\n"
          << "  sendfile on;\n  keepalive_requests 100000;\n"
-         << "  server {\n    listen 127.0.0.1:" << port << ";\n    root " << root << ";\n"
-         << "    location / { }\n  }\n}\n";
+         << "  server {\n    listen 127.0.0.1:" << port << (tls ? " ssl" : "") << ";\n"
+         << "    root " << root << ";\n";
+    if (tls) {
+        text << "    ssl_certificate " << tls->certificate << ";\n"
+             << "    ssl_certificate_key " << tls->key << ";\n";
+    }
+    text << "    location / { }\n  }\n}\n";
     return text.str();
 }
 
@@ -81,7 +87,8 @@ bool NginxServer::available() {
     return ::access(kNginx, X_OK) == 0;
 }
 
-NginxServer::NginxServer(const std::string& documentRoot) {
+NginxServer::NginxServer(const std::string& documentRoot, std::optional<TLSFiles> tls)
+    : tls_(std::move(tls)) {
     if (!available()) {
         failure_ = "nginx is not installed";
         return;
@@ -100,7 +107,7 @@ bool NginxServer::start(const std::string& documentRoot, int port) {
     const std::string folder = directory_.path();
     {
         std::ofstream conf(folder + "/nginx.conf", std::ios::trunc);
-        conf << configuration(folder, documentRoot, port);
+        conf << configuration(folder, documentRoot, port, tls_);
     }
     const std::string errorLog = folder + "/error.log", conf = folder + "/nginx.conf";
     const std::string output = folder + "/output.log";
@@ -163,7 +170,8 @@ void NginxServer::stop() {
 }
 
 std::string NginxServer::address(const std::string& name) const {
-    return "http://127.0.0.1:" + std::to_string(port_) + "/" + name;
+    return std::string(tls_ ? "https" : "http") + "://127.0.0.1:" + std::to_string(port_) + "/" +
+           name;
 }
 
 GWURL NginxServer::url(const std::string& name) const {

@@ -3,6 +3,7 @@
 #include <sys/types.h>
 
 #include <cstdint>
+#include <optional>
 #include <string>
 #include <vector>
 
@@ -17,7 +18,14 @@ class NginxServer {
 public:
     static bool available();
 
-    explicit NginxServer(const std::string& documentRoot);
+    // PEM files for serving https instead of http.
+    struct TLSFiles {
+        std::string certificate;
+        std::string key;
+    };
+
+    explicit NginxServer(const std::string& documentRoot,
+                         std::optional<TLSFiles> tls = std::nullopt);
     ~NginxServer();
     NginxServer(const NginxServer&) = delete;
     NginxServer& operator=(const NginxServer&) = delete;
@@ -45,6 +53,8 @@ public:
 
 private:
     bool start(const std::string& documentRoot, int port);
+
+    std::optional<TLSFiles> tls_;
     void stop();
 
     TemporaryDirectory directory_;
