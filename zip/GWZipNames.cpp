@@ -2,6 +2,8 @@
 
 #include <algorithm>
 
+#include "foundation/GWContainment.h"
+
 std::string GWZipFilenameFromMacName(std::string_view name) {
     std::string converted(name);
     std::replace(converted.begin(), converted.end(), '/', ':');
@@ -26,6 +28,5 @@ std::string GWZipLastHFSPathComponent(std::string_view path) {
 }
 
 bool GWZipIsSafeFilename(std::string_view name) {
-    return !name.empty() && name != "." && name != ".." &&
-           name.find_first_of(std::string_view("/\0", 2)) == std::string_view::npos;
+    return GWIsPlainPathComponent(name);
 }
