@@ -98,7 +98,10 @@ public:
 std::unique_ptr<GWFileHandleBackend> GWOpenLocalFileBackend(const GWURL& url, bool forWriting,
                                                             GWErrorPtr* error) {
     const std::string path = url.path();
-    const int flags = forWriting ? O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC : O_RDONLY | O_CLOEXEC;
+    // Writes never follow a link in the last place: extraction prepares the
+    // file it writes, and a link appearing there meanwhile is refused.
+    const int flags =
+        forWriting ? O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC | O_NOFOLLOW : O_RDONLY | O_CLOEXEC;
     int fd;
     do {
         fd = ::open(path.c_str(), flags, 0666);

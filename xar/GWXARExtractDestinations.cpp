@@ -5,20 +5,13 @@
 #include <stdlib.h>
 #include <sys/stat.h>
 
-#include <string_view>
-#include <vector>
+#include <filesystem>
 
 #include "GWArchiveSupport/GWArchiveConstants.h"
 #include "GWXARExtractOperation.h"
+#include "foundation/GWContainment.h"
 
 namespace {
-
-// Names may carry anything after base64 decoding; only a plain component may
-// be created.
-bool isPlainComponent(std::string_view name) {
-    return !name.empty() && name != "." && name != ".." &&
-           name.find_first_of(std::string_view("/\0", 2)) == std::string_view::npos;
-}
 
 bool isInside(const std::string& path, const std::string& root) {
     return path == root || (path.size() > root.size() && path.compare(0, root.size(), root) == 0 &&
@@ -33,24 +26,28 @@ std::optional<std::string> realPath(const std::string& path) {
     return std::string(resolved);
 }
 
+GWErrorPtr outsideError(const GWURL& url, const GWXARFile& file, const char* what) {
+    const std::string path = file.path();
+    return GWGenerateError(kGWXARArchiveErrorDomain, GWXARArchiveEntryOutsideDestinationError, url,
+                           nullptr, {{kGWXARArchiveUnknownEntityErrorKey, GWValue(path)}},
+                           "%s %s would reach outside the destination.", what, path.c_str());
+}
+
 }  // namespace
 
 std::optional<GWURL> GWXARExtractOperation::childURL(const GWURL& directory, const GWXARFile& child,
                                                      GWErrorPtr* error) const {
     const std::string name = child.name().value_or("");
-    if (!isPlainComponent(name)) {
-        GWFail(error,
-               GWGenerateError(kGWXARArchiveErrorDomain, GWXARArchiveMalformedValueError, directory,
-                               nullptr, {{kGWXARArchiveUnknownEntityErrorKey, GWValue(name)}},
-                               "The name of an item in %s is not a single path component.",
-                               directory.path().c_str()));
+    if (!GWIsPlainPathComponent(name)) {
+        GWFail(error, outsideError(directory, child, "The name of"));
         return std::nullopt;
     }
     return directory.URLByAppendingPathComponent(name);
 }
 
 std::optional<std::string> GWXARExtractOperation::hardLinkTargetPath(const GWXARFile& link,
-                                                                     const GWURL& linkURL) const {
+                                                                     const GWURL& linkURL,
+                                                                     GWErrorPtr* refusal) const {
     const auto relative = link.hardlinkPath();
     if (!relative || !temporaryItemURL_) {
         return std::nullopt;
@@ -61,6 +58,12 @@ std::optional<std::string> GWXARExtractOperation::hardLinkTargetPath(const GWXAR
     const auto root = realPath(temporaryItemURL_->path());
     const auto target = realPath(candidate);
     if (!root || !target || !isInside(*target, *root)) {
+        // Climbing above the item by name is how links of an inner item
+        // look (they become copies); arriving elsewhere by a link is not.
+        const auto lexical = std::filesystem::path(candidate).lexically_normal().string();
+        if (root && target && isInside(lexical, *root)) {
+            GWFail(refusal, outsideError(linkURL, link, "The hard link"));
+        }
         return std::nullopt;
     }
     struct stat info;

@@ -7,9 +7,11 @@
 
 #include <atomic>
 
+#include "GWArchiveSupport/GWArchiveConstants.h"
 #include "GWXARArchive.h"
 #include "GWXARExtractOperation.h"
 #include "foundation/GWChecksum.h"
+#include "foundation/GWContainment.h"
 #include "foundation/GWDispatch.h"
 #include "foundation/GWFileDescriptor.h"
 
@@ -156,7 +158,12 @@ bool GWXARExtractOperation::extractHardLink(const GWXARFilePtr& file, const GWUR
     // becomes an independent copy of the target.
     const auto& fork = file->dataFork();
     if (fork && fork->uncompressedChecksum()) {
-        if (const auto target = hardLinkTargetPath(*file, url)) {
+        GWErrorPtr refusal;
+        const auto target = hardLinkTargetPath(*file, url, &refusal);
+        if (refusal) {
+            return GWFail(error, refusal);
+        }
+        if (target) {
             const auto digest = GWChecksum::checksumAtURL(
                 GWURL::fileURLWithPath(*target), int(fork->uncompressedChecksumType()), nullptr);
             if (digest && *digest == *fork->uncompressedChecksum() &&
@@ -174,6 +181,17 @@ bool GWXARExtractOperation::extractHardLink(const GWXARFilePtr& file, const GWUR
 
 bool GWXARExtractOperation::extractDevice(const GWXARFilePtr& file, const GWURL& url,
                                           GWErrorPtr* error) {
+    // A device node opens whatever it names, so only a caller privileged to
+    // make one on purpose gets it.
+    if (!GWMayCreateDeviceNodes()) {
+        const std::string path = file->path();
+        return GWFail(error, GWGenerateError(kGWXARArchiveErrorDomain,
+                                             GWXARArchiveDeviceNotPermittedError, url, nullptr,
+                                             {{kGWXARArchiveUnknownEntityErrorKey, GWValue(path)}},
+                                             "%s is a device, which only a privileged user "
+                                             "may extract.",
+                                             path.c_str()));
+    }
     const dev_t device = ::makedev(static_cast<unsigned int>(file->deviceMajorNumber()),
                                    static_cast<unsigned int>(file->deviceMinorNumber()));
     if (::mknod(url.path().c_str(), file->permissionsMode(), device) != 0) {

@@ -95,9 +95,10 @@ private:
                                   GWErrorPtr* error) const;
     // The existing regular file a hard link at `linkURL` may share, found by
     // the link's relative archive path; none when it is missing or lies
-    // outside the item being extracted.
-    std::optional<std::string> hardLinkTargetPath(const GWXARFile& link,
-                                                  const GWURL& linkURL) const;
+    // outside the item being extracted. A path that stays inside by name but
+    // leads elsewhere through a symbolic link also fills `refusal`.
+    std::optional<std::string> hardLinkTargetPath(const GWXARFile& link, const GWURL& linkURL,
+                                                  GWErrorPtr* refusal) const;
     // BSD flags as Linux inode flags; those that would pin the item where it
     // is are held back for the top-level item until it has been moved.
     void applyFlags(const GWXARFile& file, const GWURL& url);

@@ -132,6 +132,9 @@ std::optional<std::vector<GWZipExtractOperationPtr>> GWZipArchive::operationsToE
         if (!more) {
             return std::nullopt;
         }
+        for (const auto& operation : *more) {
+            operation->setContainmentRoot(directory);
+        }
         operations.insert(operations.end(), more->begin(), more->end());
     }
     return operations;
@@ -151,6 +154,9 @@ std::optional<std::vector<GWZipExtractOperationPtr>> GWZipArchive::operationsToE
     std::vector<GWZipExtractOperationPtr> operations;
     std::vector<Pending> pending{{file, destination, nullptr}};
     const GWURL archiveURL = URL();
+    // The caller named the entry's own destination: nothing of its subtree
+    // may land outside the directory that holds it.
+    const GWURL root = destination.URLByDeletingLastPathComponent();
     while (!pending.empty()) {
         Pending next = std::move(pending.back());
         pending.pop_back();
@@ -160,6 +166,7 @@ std::optional<std::vector<GWZipExtractOperationPtr>> GWZipArchive::operationsToE
         if (!operation) {
             return std::nullopt;
         }
+        operation->setContainmentRoot(root);
         if (next.directoryOperation) {
             operation->addDependency(next.directoryOperation);
         }

@@ -72,6 +72,18 @@ public:
     bool isAtomic() const { return isAtomic_; }
     // Added to every local header offset.
     std::uint64_t startOffset() const { return startOffset_; }
+    // The directory nothing may be written beneath except through plain
+    // names and real directories; by default the destination's own directory.
+    const std::optional<GWURL>& containmentRoot() const { return containmentRoot_; }
+    void setContainmentRoot(const GWURL& root) { containmentRoot_ = root; }
+
+    // Why `file` may not be extracted at `destination` below `root`, or none:
+    // the destination leaves `root` by name, an item between the two is a
+    // symbolic link (or no directory), or an entry of the archive between
+    // them is a link, which would be written through once it exists. The
+    // error is GWZipArchiveEntryOutsideDestinationError naming the entry.
+    static GWErrorPtr containmentErrorForFile(const GWZipFilePtr& file, const GWURL& root,
+                                              const GWURL& destination);
     // The error the operation ended with; none while running and on success.
     GWErrorPtr error() const;
     bool started() const { return started_.load(); }
@@ -143,6 +155,7 @@ private:
     DataHandler dataHandler_;
     bool isAtomic_ = false;
     std::uint64_t startOffset_ = 0;
+    std::optional<GWURL> containmentRoot_;
 
     mutable std::mutex errorMutex_;
     GWErrorPtr error_;

@@ -17,6 +17,10 @@ enum GWZipArchiveErrorCode : long {
     GWZipArchiveUnsupportedCompressionMethodError = 1,
     GWZipArchiveUnknownExtraFieldError = 2,
     GWZipArchiveUnknownExtraFieldVersionError = 3,
+    // An entry that would be written, linked or removed outside the directory
+    // the caller named: through a symbolic link, or by a name that climbs out.
+    // kGWZipArchiveUnknownEntityErrorKey holds the entry's path.
+    GWZipArchiveEntryOutsideDestinationError = 4,
 };
 
 // Codes of kGWXARArchiveErrorDomain. 0, 8, 9 and 18 are never raised.
@@ -39,4 +43,13 @@ enum GWXARArchiveErrorCode : long {
     GWXARArchiveMissingAttributeError = 17,
     GWXARArchiveMissingCertificateError = 19,
     GWXARArchiveMalformedValueError = 20,
+    // An item that would be created, linked or changed outside the destination
+    // the caller named: a name with ".." or "/", or a hard link or path leading
+    // through a symbolic link to elsewhere. kGWXARArchiveUnknownEntityErrorKey
+    // holds the item's path.
+    GWXARArchiveEntryOutsideDestinationError = 21,
+    // A character or block device, refused without the privileges to create
+    // device nodes on purpose. kGWXARArchiveUnknownEntityErrorKey holds the
+    // item's path.
+    GWXARArchiveDeviceNotPermittedError = 22,
 };

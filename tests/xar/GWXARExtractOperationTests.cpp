@@ -17,6 +17,7 @@
 #include "XarExtractTestSupport.h"
 #include "XarTestSupport.h"
 #include "foundation/GWChecksum.h"
+#include "foundation/GWContainment.h"
 #include "foundation/GWDispatch.h"
 #include "foundation/GWFileDescriptor.h"
 #include "foundation/GWMetadataStore.h"
@@ -135,6 +136,22 @@ TEST_F(XarExtraction, DirectoryTreeKeepsNamesKindsAndLinkTexts) {
     EXPECT_EQ(tree.at("rel").linkText, "a");
     EXPECT_EQ(tree.at("abs").linkText, "/nonexistent/x");
     EXPECT_EQ(tree.at("pipe").mode, S_IFIFO | 0620);
+}
+
+TEST_F(XarExtraction, DevicesAreRefusedWithoutPrivileges) {
+    GWOverrideMayCreateDeviceNodes(false);
+    auto archive =
+        open(xarFileElement(1, "d", "directory", "0755",
+                            xarFileElement(2, "null", "character special", "0666",
+                                           "<device><major>1</major><minor>3</minor></device>")));
+    ASSERT_TRUE(archive);
+    GWErrorPtr error;
+    EXPECT_FALSE(extract(archive, "d", "d", nullptr, &error));
+    GWOverrideMayCreateDeviceNodes(std::nullopt);
+    ASSERT_TRUE(error);
+    EXPECT_TRUE(error->is(kGWXARArchiveErrorDomain, GWXARArchiveDeviceNotPermittedError));
+    EXPECT_EQ(error->detailString(kGWXARArchiveUnknownEntityErrorKey), "d/null");
+    EXPECT_TRUE(directoryNames(directory.file("out")).empty());
 }
 
 TEST_F(XarExtraction, DevicesAreMadeFromMajorAndMinor) {
@@ -363,11 +380,15 @@ TEST_F(XarExtraction, HardLinkNeverReachesOutsideTheItem) {
     archive->fileWithPath("victim")->setParent(s);
     ASSERT_EQ(archive->fileWithPath("d/h")->hardlinkPath(), "../d/s/victim");
 
-    ASSERT_TRUE(extract(archive, "d", "d"));
+    GWErrorPtr error;
+    EXPECT_FALSE(extract(archive, "d", "d", nullptr, &error));
+    ASSERT_TRUE(error);
+    EXPECT_TRUE(error->is(kGWXARArchiveErrorDomain, GWXARArchiveEntryOutsideDestinationError));
+    EXPECT_EQ(error->detailString(kGWXARArchiveUnknownEntityErrorKey), "d/h");
     struct stat outside;
     ASSERT_EQ(stat(outsidePath.c_str(), &outside), 0);
     EXPECT_EQ(outside.st_nlink, 1u) << "linked to a file outside the extraction";
-    EXPECT_EQ(gwtest::readFile(outputPath("d/h")), content);
+    EXPECT_TRUE(temporaryLeftovers().empty());
 }
 
 TEST_F(XarExtraction, NamesThatLeaveTheDirectoryAreRefused) {
@@ -381,8 +402,9 @@ TEST_F(XarExtraction, NamesThatLeaveTheDirectoryAreRefused) {
         EXPECT_FALSE(extract(archive, "d", "d-" + std::to_string(bad.size()), nullptr, &error))
             << bad;
         ASSERT_TRUE(error);
-        EXPECT_TRUE(error->is(kGWXARArchiveErrorDomain, 20)) << bad;
-        EXPECT_EQ(error->detailString(kGWXARArchiveUnknownEntityErrorKey), bad);
+        EXPECT_TRUE(error->is(kGWXARArchiveErrorDomain, GWXARArchiveEntryOutsideDestinationError))
+            << bad;
+        EXPECT_EQ(error->detailString(kGWXARArchiveUnknownEntityErrorKey), "d/" + bad);
     }
     EXPECT_TRUE(directoryNames(directory.file("out")).empty());
     EXPECT_TRUE(temporaryLeftovers().empty());
@@ -397,7 +419,7 @@ TEST_F(XarExtraction, NameWithNULIsRefused) {
     GWErrorPtr error;
     EXPECT_FALSE(extract(archive, "d", "d", nullptr, &error));
     ASSERT_TRUE(error);
-    EXPECT_TRUE(error->is(kGWXARArchiveErrorDomain, 20));
+    EXPECT_TRUE(error->is(kGWXARArchiveErrorDomain, GWXARArchiveEntryOutsideDestinationError));
     EXPECT_TRUE(directoryNames(directory.file("out")).empty());
 }
 

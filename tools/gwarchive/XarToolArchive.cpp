@@ -4,6 +4,7 @@
 #include "Diagnostics.h"
 #include "FormatAdapters.h"
 #include "JsonWriter.h"
+#include "foundation/GWContainment.h"
 
 namespace gwarchive {
 
@@ -143,6 +144,10 @@ public:
             if (parent && selected[*parent])
                 continue;  // extracted with its parent
             GWURL url = options.directory.URLByAppendingPathComponent(records_[index].path);
+            if (refused(index, url, options, archiveName)) {
+                allGood = false;
+                continue;
+            }
             std::error_code ignored;
             std::filesystem::create_directories(url.URLByDeletingLastPathComponent().path(),
                                                 ignored);
@@ -235,11 +240,33 @@ private:
         return failure == nullptr;
     }
 
+    // Whether the item may not go to `url`: a name on its way from the top is
+    // not one plain component, or the folder holds a link on the way there.
+    // The library checks what lies below the item.
+    bool refused(std::size_t index, const GWURL& url, const ExtractOptions& options,
+                 const std::string& archiveName) {
+        bool plain = true;
+        for (GWXARFilePtr item = files_[index]; item && plain; item = item->parent())
+            plain = GWIsPlainPathComponent(item->name().value_or(""));
+        if (plain && GWIsContainedDestination(options.directory, url))
+            return false;
+        const std::string& path = records_[index].path;
+        reportError(
+            archiveName, path,
+            GWGenerateError(kGWXARArchiveErrorDomain, GWXARArchiveEntryOutsideDestinationError, url,
+                            nullptr, {{kGWXARArchiveUnknownEntityErrorKey, GWValue(path)}},
+                            "%s would be extracted outside %s", path.c_str(),
+                            options.directory.path().c_str()));
+        return true;
+    }
+
     // Existing directories are merged into; anything else that exists is an
     // error for that entry unless overwriting.
     bool extractItem(std::size_t index, const GWURL& url, const ExtractOptions& options,
                      const std::string& archiveName) {
         const EntryRecord& record = records_[index];
+        if (refused(index, url, options, archiveName))
+            return false;
         std::error_code error;
         auto status = std::filesystem::symlink_status(url.path(), error);
         if (std::filesystem::exists(status)) {

@@ -225,6 +225,14 @@ bool ZipToolArchive::extract(const std::vector<std::size_t>& indexes, const Extr
     for (std::size_t index : indexes) {
         const EntryRecord& record = records_[index];
         GWURL url = options.directory.URLByAppendingPathComponent(record.path);
+        // Checked before anything is made for the entry, and again by its
+        // operation, when links extracted meanwhile are on disk.
+        if (auto refusal = GWZipExtractOperation::containmentErrorForFile(files_[index],
+                                                                          options.directory, url)) {
+            reportError(archiveName, record.path, refusal);
+            allGood = false;
+            continue;
+        }
         if (!prepare(url, record, options, archiveName)) {
             allGood = false;
             continue;
@@ -246,6 +254,7 @@ bool ZipToolArchive::extract(const std::vector<std::size_t>& indexes, const Extr
             allGood = false;
             continue;
         }
+        operation->setContainmentRoot(options.directory);
         std::weak_ptr<GWZipExtractOperation> weak = operation;
         std::string path = record.path;
         operation->setCompletionBlock([weak, path, temporary, url, archiveName, &allGood] {
