@@ -149,7 +149,7 @@ GWHTTPTimeouts GWCurrentHTTPTimeouts() {
 struct GWHTTPRangeReader::Transfer {
     std::uint64_t offset = 0;
     std::span<std::uint8_t> into;
-    bool emptyResourceAllowed = false;
+    bool opening = false;  // learns the size; the resource may be empty
 
     long status = 0;
     std::optional<ContentRange> range;
@@ -243,7 +243,7 @@ std::unique_ptr<GWHTTPRangeReader> GWHTTPRangeReader::open(const GWURL& url,
     probe.assign(std::max<std::size_t>(probeLength, 1), 0);
     Transfer transfer;
     transfer.into = probe;
-    transfer.emptyResourceAllowed = true;
+    transfer.opening = true;
     if (!reader->perform(transfer, error)) {
         return nullptr;
     }
@@ -332,7 +332,7 @@ bool GWHTTPRangeReader::perform(Transfer& transfer, GWErrorPtr* error) {
             transfer.curlMessage[0] ? transfer.curlMessage : curl_easy_strerror(code);
         return GWFail(error, failure(numberForCurlCode(code, osErrno), transfer, reason));
     }
-    if (transfer.emptyResourceAllowed && isEmptyResourceAnswer(curl, code, transfer)) {
+    if (transfer.opening && isEmptyResourceAnswer(curl, code, transfer)) {
         transfer.range = ContentRange{std::nullopt, std::nullopt, 0};
         return true;
     }
@@ -357,6 +357,10 @@ bool GWHTTPRangeReader::perform(Transfer& transfer, GWErrorPtr* error) {
 
 GWErrorPtr GWHTTPRangeReader::failure(int number, const Transfer& transfer,
                                       const std::string& reason) const {
+    if (transfer.opening) {
+        return GWGenerateError(kGWPOSIXErrorDomain, number, url_, nullptr, {},
+                               "Could not open %s: %s", address_.c_str(), reason.c_str());
+    }
     return GWGenerateError(kGWPOSIXErrorDomain, number, url_, nullptr, {},
                            "Could not read bytes %llu-%llu of %s: %s",
                            (unsigned long long)transfer.offset,
