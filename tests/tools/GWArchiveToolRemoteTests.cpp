@@ -14,6 +14,7 @@
 #include "support/StreamingZipWriter.h"
 #include "support/XarBuilder.h"
 #include "support/ZipBuilder.h"
+#include "xar/XarTestSupport.h"
 
 using namespace gwtest;
 namespace fs = std::filesystem;
@@ -137,16 +138,55 @@ TEST_F(GWArchiveToolRemote, CatOfOneEntryOfAHugeArchiveCostsThatEntryAndLittleMo
     fs::remove(path);
 }
 
-TEST(GWArchiveToolDroppedConnection, AnEntryCutShortIsAnErrorNotAShortFile) {
+namespace {
+
+// Three members, the middle one 400,000 random bytes stored as they are;
+// `cut` lies halfway through it.
+struct ArchiveWithCut {
+    GWData bytes;
+    std::uint64_t cut = 0;
+};
+
+ArchiveWithCut zipWithCut() {
     ZipBuilder zip;
     zip.addFile("before.txt", textBytes(3000, 8), 8);
     zip.addFile("cut.bin", randomBytes(400000, 9));
     zip.addFile("after.txt", textBytes(3000, 10), 8);
-    const GWData bytes = zip.bytes();
-    const std::uint64_t cut = zip.localHeaderOffsets()[1] + 200000;
-    ScriptedHTTPServer server(bytes, ScriptedHTTPServer::Behaviour::dropAt, cut);
+    GWData bytes = zip.bytes();
+    return {std::move(bytes), zip.localHeaderOffsets()[1] + 200000};
+}
+
+ArchiveWithCut xarWithCut() {
+    XarBuilder xar;
+    std::string files;
+    std::uint64_t cutInHeap = 0;
+    int id = 0;
+    for (const auto& [name, content] :
+         {std::pair("before.txt", textBytes(3000, 8)), std::pair("cut.bin", randomBytes(400000, 9)),
+          std::pair("after.txt", textBytes(3000, 10))}) {
+        if (std::string(name) == "cut.bin") {
+            cutInHeap = xar.nextHeapOffset() + 200000;
+        }
+        files += "<file id=\"" + std::to_string(++id) + "\"><name>" + name +
+                 "</name><type>file</type><mode>0644</mode>" +
+                 xar.dataElement("data", content, XarEncoding::none) + "</file>";
+    }
+    xar.setFiles(files);
+    GWData bytes = xar.bytes();
+    const std::uint64_t heapStart = readXarTOC(bytes)->heapStart;
+    return {std::move(bytes), heapStart + cutInHeap};
+}
+
+}  // namespace
+
+class GWArchiveToolDroppedConnection : public ::testing::TestWithParam<const char*> {};
+
+TEST_P(GWArchiveToolDroppedConnection, AnEntryCutShortIsAnErrorNotAShortFile) {
+    const std::string format = GetParam();
+    const ArchiveWithCut archive = format == "zip" ? zipWithCut() : xarWithCut();
+    ScriptedHTTPServer server(archive.bytes, ScriptedHTTPServer::Behaviour::dropAt, archive.cut);
     ASSERT_TRUE(server.running());
-    const std::string address = shellQuote(server.address("cut.zip"));
+    const std::string address = shellQuote(server.address("cut." + format));
 
     ToolRun cat = runTool("cat " + address + " cut.bin");
     EXPECT_EQ(cat.status, 1);
@@ -172,3 +212,5 @@ TEST(GWArchiveToolDroppedConnection, AnEntryCutShortIsAnErrorNotAShortFile) {
     }
     EXPECT_EQ(items, 2u);
 }
+
+INSTANTIATE_TEST_SUITE_P(Formats, GWArchiveToolDroppedConnection, ::testing::Values("zip", "xar"));

@@ -7,7 +7,7 @@
 
 #include "GWArchiveSupport/GWArchiveConstants.h"
 #include "XarExtractTestSupport.h"
-#include "foundation/GWByteReader.h"
+#include "XarTestSupport.h"
 #include "support/ServedFolderTest.h"
 #include "support/TestSupport.h"
 #include "support/XarBuilder.h"
@@ -119,11 +119,7 @@ TEST_F(GWXARArchiveRemote, HeaderAndTableOfContentsArriveInFewRequests) {
     xar.setFiles(files);
     const GWData bytes = xar.bytes();
     writeFile(directory_.file("many.xar"), bytes);
-    GWByteReader header(bytes);
-    header.seek(4);
-    const std::uint64_t headerLength = header.u16be();
-    header.seek(8);
-    const std::uint64_t tocEnd = headerLength + header.u64be();
+    const std::uint64_t tocEnd = readXarTOC(bytes)->heapStart;
 
     server_->forgetRequests();
     auto remote = open(server_->url("many.xar"));
