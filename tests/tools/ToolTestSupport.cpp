@@ -1,5 +1,8 @@
 #include "ToolTestSupport.h"
 
+#include <fcntl.h>
+#include <sys/resource.h>
+#include <sys/wait.h>
 #include <unistd.h>
 
 namespace gwtest {
@@ -14,6 +17,38 @@ ToolRun runTool(const std::string& arguments) {
     GWData error = readFile(errorPath);
     unlink(errorPath);
     return {result.status, result.output, std::string(error.begin(), error.end())};
+}
+
+MeasuredToolRun runToolMeasured(const std::vector<std::string>& arguments) {
+    TemporaryDirectory directory;
+    const std::string errorPath = directory.file("stderr");
+    std::vector<std::string> words{GW_TOOL_PATH};
+    words.insert(words.end(), arguments.begin(), arguments.end());
+    std::vector<char*> argv;
+    for (auto& word : words)
+        argv.push_back(word.data());
+    argv.push_back(nullptr);
+    MeasuredToolRun run;
+    const pid_t child = fork();
+    if (child == 0) {
+        // Only async-signal-safe calls between fork and exec.
+        const int error = open(errorPath.c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0600);
+        const int null = open("/dev/null", O_WRONLY);
+        if (error < 0 || null < 0 || dup2(error, 2) < 0 || dup2(null, 1) < 0)
+            _exit(127);
+        execv(argv[0], argv.data());
+        _exit(127);
+    }
+    if (child < 0)
+        return run;
+    int status = 0;
+    struct rusage usage {};
+    if (wait4(child, &status, 0, &usage) == child && WIFEXITED(status))
+        run.status = WEXITSTATUS(status);
+    run.maxResidentKiB = usage.ru_maxrss;
+    const GWData error = readFile(errorPath);
+    run.err.assign(error.begin(), error.end());
+    return run;
 }
 
 std::string describeTree(const std::string& root) {

@@ -1,0 +1,126 @@
+// Length fields are claims: archives that claim enormous tables, counts or
+// forks fail with the documented error without the memory they claim.
+// Measured in the tool's own process, so the test binary's footprint does
+// not count.
+
+#include <gtest/gtest.h>
+
+#include <algorithm>
+#include <functional>
+
+#include "ToolTestSupport.h"
+#include "support/MacBinaryBuilder.h"
+#include "support/XarBuilder.h"
+#include "support/ZipBuilder.h"
+
+namespace {
+
+using namespace gwtest;
+
+constexpr long kResidentLimitKiB = 100 * 1024;
+constexpr std::uint64_t kTenGiB = 10ull << 30;
+
+void putBE32(GWData& bytes, std::size_t at, std::uint32_t value) {
+    for (int i = 0; i < 4; ++i)
+        bytes[at + i] = std::uint8_t(value >> (24 - 8 * i));
+}
+
+void putLE64(GWData& bytes, std::size_t at, std::uint64_t value) {
+    for (int i = 0; i < 8; ++i)
+        bytes[at + i] = std::uint8_t(value >> (8 * i));
+}
+
+struct HugeCase {
+    const char* name;
+    const char* fileName;
+    std::function<GWData()> build;
+    std::vector<std::string> command;  // before the input path
+    bool withOutput;                   // an output path follows the input
+    const char* error;                 // as the tool prints it
+};
+
+void PrintTo(const HugeCase& test, std::ostream* out) {
+    *out << test.name;
+}
+
+const HugeCase kHugeCases[] = {
+    {"XARTableOfContentsClaimingTenGiB",
+     "huge.xar",
+     [] {
+         XarBuilder xar;
+         xar.setFiles("<file id=\"1\"><name>a</name><type>file</type></file>");
+         xar.compressedTOCLength = kTenGiB;
+         xar.uncompressedTOCLength = kTenGiB;
+         return xar.bytes();
+     },
+     {"list"},
+     false,
+     "NSCocoaErrorDomain 259"},
+    {"XARTableOfContentsInflatingToTenGiB",
+     "inflating.xar",
+     [] {
+         XarBuilder xar;
+         xar.setFiles("<file id=\"1\"><name>a</name><type>file</type></file>");
+         xar.uncompressedTOCLength = kTenGiB;
+         return xar.bytes();
+     },
+     {"list"},
+     false,
+     "NSCocoaErrorDomain 259"},
+    {"Zip64EndRecordClaimingTwoToTheSixtyEntries",
+     "many.zip",
+     [] {
+         ZipBuilder zip;
+         zip.zip64EndRecord = true;
+         zip.addFile("a", bytesOf("one entry"));
+         GWData bytes = zip.bytes();
+         const GWData signature{'P', 'K', 6, 6};
+         auto at = std::search(bytes.begin(), bytes.end(), signature.begin(), signature.end());
+         const std::size_t record = std::size_t(at - bytes.begin());
+         putLE64(bytes, record + 24, 1ull << 60);  // entries on this disk
+         putLE64(bytes, record + 32, 1ull << 60);  // entries in all
+         return bytes;
+     },
+     {"list"},
+     false,
+     "NSCocoaErrorDomain 259"},
+    {"MacBinaryClaimingFourGiBForks",
+     "huge.bin",
+     [] {
+         MacBinaryFile file;
+         file.dataFork = bytesOf("a little data");
+         file.resourceFork = bytesOf("a little resource");
+         GWData bytes = buildMacBinary(file);
+         putBE32(bytes, 83, 0xFFFFFFFF);
+         putBE32(bytes, 87, 0xFFFFFFFF);
+         resealMacBinaryHeader(bytes);
+         return bytes;
+     },
+     // A fork piece that is not there cannot be read.
+     {"macbinary"},
+     true,
+     "NSCocoaErrorDomain 256"},
+};
+
+class GWArchiveToolHugeLength : public ::testing::TestWithParam<HugeCase> {};
+
+TEST_P(GWArchiveToolHugeLength, FailsInBoundedMemory) {
+    TemporaryDirectory directory;
+    const std::string input = directory.file(GetParam().fileName);
+    writeFile(input, GetParam().build());
+    std::vector<std::string> arguments = GetParam().command;
+    arguments.push_back(input);
+    if (GetParam().withOutput)
+        arguments.push_back(directory.file("out"));
+    const MeasuredToolRun run = runToolMeasured(arguments);
+    EXPECT_EQ(run.status, 1) << run.err;
+    EXPECT_NE(run.err.find(GetParam().error), std::string::npos) << run.err;
+    EXPECT_GT(run.maxResidentKiB, 0);
+    EXPECT_LT(run.maxResidentKiB, kResidentLimitKiB);
+    RecordProperty("maxResidentKiB", std::to_string(run.maxResidentKiB));
+}
+
+INSTANTIATE_TEST_SUITE_P(Claims, GWArchiveToolHugeLength, ::testing::ValuesIn(kHugeCases),
+                         [](const auto& info) { return std::string(info.param.name); });
+
+}  // namespace
