@@ -4,9 +4,13 @@
 
 #include <gtest/gtest.h>
 
+#include <filesystem>
+
 #include "ToolTestSupport.h"
 #include "support/ContainmentSupport.h"
 #include "support/HostileArchives.h"
+#include "support/XarBuilder.h"
+#include "support/ZipBuilder.h"
 
 namespace {
 
@@ -59,5 +63,34 @@ INSTANTIATE_TEST_SUITE_P(Hostile, GWArchiveToolContainment, ::testing::ValuesIn(
                          [](const auto& info) {
                              return info.param.extension + info.param.archive.name;
                          });
+
+// A link already in the folder (left by anyone) is not written through when
+// a PATH below it is extracted on its own.
+TEST(GWArchiveToolContainment, PathBelowALinkInTheFolderIsRefused) {
+    ZipBuilder zip;
+    zip.addFile("d/canary", bytesOf("replaced"));
+    XarBuilder xar;
+    xar.setFiles(
+        "<file id=\"1\"><name>d</name><type>directory</type><file id=\"2\"><name>canary"
+        "</name><type>file</type>" +
+        xar.dataElement("data", bytesOf("replaced"), XarEncoding::none) + "</file></file>");
+    const std::pair<std::string, GWData> archives[] = {{"zip", zip.bytes()}, {"xar", xar.bytes()}};
+    for (const auto& [extension, bytes] : archives) {
+        ContainmentSandbox sandbox;
+        std::filesystem::create_directory_symlink(sandbox.parent(), sandbox.out() + "/d");
+        TemporaryDirectory directory;
+        const std::string path = directory.file("a." + extension);
+        writeFile(path, bytes);
+        const auto before = sandbox.outside();
+        ToolRun run = runTool("extract --overwrite -C " + shellQuote(sandbox.out()) + " " +
+                              shellQuote(path) + " d/canary");
+        EXPECT_EQ(run.status, 1) << extension;
+        EXPECT_NE(run.err.find(extension == "zip" ? "GWZipArchiveErrorDomain 4"
+                                                  : "GWXARArchiveErrorDomain 21"),
+                  std::string::npos)
+            << run.err;
+        EXPECT_EQ(sandbox.outside(), before) << extension;
+    }
+}
 
 }  // namespace
