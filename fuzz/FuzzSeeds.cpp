@@ -15,6 +15,7 @@
 #include "support/XarBuilder.h"
 #include "support/ZipBuilder.h"
 #include "support/ZipExtraFields.h"
+#include "support/ZipLegacyEncoders.h"
 
 using namespace gwtest;
 
@@ -94,6 +95,20 @@ Seeds zipSeeds() {
         mac3.centralExtra = zipExtraBlock(0x334D, mac3Payload(0x0000, "TEXT", "ttxt", {}));
         auto& bin = zip.addFile("encoded.bin", macBinary(2), 8);
         bin.centralExtra = zipExtraBlock(0x07C8, jleePayload("TEXT", "ttxt", 0, 1, 2, true));
+        seeds.push_back(zip.bytes());
+    }
+    {
+        // Shrink and implode, which only this library's own encoders write.
+        ZipBuilder zip;
+        const GWData text = textBytes(3000, 8);
+        zip.addFile("shrunk.txt", text, 1).stored = shrinkBytes(text, {.clearingCodeSize = 10});
+        for (bool literalTree : {false, true}) {
+            const ImplodeSettings settings{.largeDictionary = literalTree,
+                                           .literalTree = literalTree};
+            auto& entry = zip.addFile(literalTree ? "imploded-8k.txt" : "imploded.txt", text, 6);
+            entry.stored = implodeBytes(text, settings);
+            entry.flags = settings.flags();
+        }
         seeds.push_back(zip.bytes());
     }
     {
