@@ -238,6 +238,26 @@ Seeds sfxSeeds() {
     return seeds;
 }
 
+Seeds decompressorSeeds() {
+    const GWData text = textBytes(4000, 9);
+    // Kind, expanded size in units of 64 (big-endian), piece length - 1.
+    auto seed = [](std::uint8_t kind, std::size_t expanded, std::uint8_t piece, GWData stream) {
+        GWData bytes{kind, std::uint8_t(expanded / 64 >> 8), std::uint8_t(expanded / 64), piece};
+        bytes.insert(bytes.end(), stream.begin(), stream.end());
+        return bytes;
+    };
+    Seeds seeds{seed(0, 0, 255, zipCompress(text, 8)), seed(0, 0, 7, zipCompress(text, 8)),
+                seed(1, 0, 255, zipCompress(text, 12)),
+                seed(2, text.size(), 255, shrinkBytes(text, {.clearingCodeSize = 10}))};
+    for (std::uint8_t flags : {0x00, 0x10, 0x20, 0x30}) {
+        const ImplodeSettings settings{.largeDictionary = (flags & 0x10) != 0,
+                                       .literalTree = (flags & 0x20) != 0};
+        seeds.push_back(
+            seed(std::uint8_t(3 | flags), text.size(), 100, implodeBytes(text, settings)));
+    }
+    return seeds;
+}
+
 bool writeSeeds(const std::string& directory, const std::string& target, const Seeds& seeds) {
     const std::string folder = directory + "/" + target;
     if (::mkdir(folder.c_str(), 0755) != 0 && errno != EEXIST) {
@@ -268,6 +288,7 @@ int main(int argc, char** argv) {
                     writeSeeds(directory, "fuzz_xar_toc_entry", tocEntrySeeds()) &&
                     writeSeeds(directory, "fuzz_macbinary", macBinarySeeds()) &&
                     writeSeeds(directory, "fuzz_appledouble", appleDoubleSeeds()) &&
-                    writeSeeds(directory, "fuzz_sfx_detect", sfxSeeds());
+                    writeSeeds(directory, "fuzz_sfx_detect", sfxSeeds()) &&
+                    writeSeeds(directory, "fuzz_decompressors", decompressorSeeds());
     return ok ? 0 : 1;
 }

@@ -34,6 +34,8 @@ esac
 if [[ ! -f "$build/CMakeCache.txt" ]]; then
   CC=${CC:-clang-14} CXX=${CXX:-clang++-14} cmake -S . -B "$build" \
     -DCMAKE_BUILD_TYPE=RelWithDebInfo -DGW_FUZZ=ON >/dev/null
+else
+  cmake "$build" >/dev/null  # picks up targets added since the last configure
 fi
 cmake --build "$build" --parallel "$jobs" --target "$target" gwarchive_fuzz_seeds >/dev/null
 
@@ -41,11 +43,13 @@ fuzz="$build/fuzz"
 "$fuzz/gwarchive_fuzz_seeds" "$fuzz/seeds"
 mkdir -p "$fuzz/corpus/$target" "$fuzz/findings/$target" "$fuzz/tmp"
 
-# Each target's scratch files stay in the build tree; leaks are findings.
+# Each target's scratch files stay in the build tree; leaks are findings. One
+# input runs in milliseconds; the timeout is loose only because a loaded
+# shared machine can stall a process for seconds.
 TMPDIR="$(cd "$fuzz/tmp" && pwd)" \
 ASAN_OPTIONS=${ASAN_OPTIONS:-detect_leaks=1} \
 UBSAN_OPTIONS=${UBSAN_OPTIONS:-print_stacktrace=1:halt_on_error=1} \
-  "$fuzz/$target" -max_total_time="$seconds" -max_len="$max_len" -timeout=10 \
+  "$fuzz/$target" -max_total_time="$seconds" -max_len="$max_len" -timeout=30 \
   -rss_limit_mb=2048 -print_final_stats=1 \
   -artifact_prefix="$fuzz/findings/$target/" "$@" \
   "$fuzz/corpus/$target" "$fuzz/seeds/$target"
