@@ -46,7 +46,7 @@ fuzz: deps
 	@for target in $(FUZZ_TARGETS); do \
 		log=$(FUZZ_BUILD_DIR)/fuzz/logs/$$target.log; \
 		if FUZZ_BUILD_DIR=$(FUZZ_BUILD_DIR) bash scripts/fuzz.sh $$target $(FUZZ_SECONDS) >$$log 2>&1; then \
-			echo "$$target: $$(grep -E '^#[0-9]+ +DONE' $$log | tail -1)"; \
+			echo "$$target: $$(grep -E '^#[0-9]+[[:space:]]+DONE' $$log | tail -1)"; \
 		else \
 			tail -n 60 $$log; echo "$$target: FAILED (see $$log)"; exit 1; \
 		fi; \
