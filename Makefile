@@ -8,7 +8,7 @@ FUZZ_TARGETS := $(basename $(notdir $(wildcard fuzz/fuzz_*.cpp)))
 JOBS ?= $(shell nproc)
 CMAKE_FLAGS ?=
 
-.PHONY: all deps build run test test-asan fuzz format format-check clean
+.PHONY: all deps build run test test-asan fuzz bench format format-check clean
 
 all: build
 
@@ -51,6 +51,11 @@ fuzz: deps
 			tail -n 60 $$log; echo "$$target: FAILED (see $$log)"; exit 1; \
 		fi; \
 	done
+
+# gwarchive against unzip, bsdtar, 7zz and unar on a generated corpus (kept
+# in $(BUILD_DIR)/bench-corpus); writes bench/RESULTS.md.
+bench: build
+	python3 bench/run.py --build $(BUILD_DIR)
 
 format:
 	git ls-files '*.h' '*.cpp' | xargs clang-format -i

@@ -1,0 +1,214 @@
+#!/usr/bin/env python3
+"""Times gwarchive against the peer tools on the benchmark corpus and writes
+bench/RESULTS.md.
+
+    bench/run.py --build BUILD_DIR [--out bench/RESULTS.md] [--only NAME,...]
+
+Each workload is one hyperfine call holding every tool that can do it, so all
+of them see the same machine load. Every command runs under /usr/bin/time -v,
+which records its peak resident memory without an extra run."""
+
+import argparse
+import datetime
+import json
+import os
+import platform
+import shutil
+import subprocess
+import sys
+
+HERE = os.path.dirname(os.path.abspath(__file__))
+MiB = 1024 * 1024
+
+
+def log(message):
+    print(f"[bench] {message}", flush=True)
+
+
+class Workload:
+    def __init__(self, name, title, archive, runs, commands, goal_peer, goal_ratio, prepare=True):
+        self.name = name
+        self.title = title
+        self.archive = archive
+        self.runs = runs
+        self.commands = commands  # tool -> command template
+        self.goal_peer = goal_peer
+        self.goal_ratio = goal_ratio
+        self.prepare = prepare
+
+
+def workloads():
+    extract_zip = {
+        "gwarchive": "{gw} extract --no-progress -C {out} {archive}",
+        "unzip": "unzip -q -o {archive} -d {out}",
+        "bsdtar": "bsdtar -xf {archive} -C {out}",
+        "7zz": "7zz x -y -bd -bso0 -o{out} {archive}",
+        "unar": "unar -q -f -D -o {out} {archive}",
+    }
+    extract_xar = {k: v for k, v in extract_zip.items() if k != "unzip"}
+    text = "large/text.txt"
+    return [
+        Workload("small-zip", "Extract 20,000 small text files (ZIP, zip -6)", "small.zip", 3,
+                 extract_zip, "unzip", 0.7),
+        Workload("small-xar", "Extract 20,000 small text files (XAR, bsdtar)", "small.xar", 3,
+                 extract_xar, "bsdtar", 0.7),
+        Workload("large-zip", "Extract 3 large files, 480 MiB (ZIP, zip -6)", "large.zip", 5,
+                 extract_zip, "bsdtar", 0.4),
+        Workload("large-xar", "Extract 3 large files, 480 MiB (XAR, bsdtar)", "large.xar", 5,
+                 extract_xar, "unar", 0.5),
+        Workload("list", "List 200,000 empty entries (stored ZIP)", "list.zip", 10, {
+            "gwarchive": "{gw} list {archive}",
+            "unzip": "unzip -Z1 {archive}",
+            "bsdtar": "bsdtar -tf {archive}",
+            "7zz": "7zz l -ba {archive}",
+            "unar": "lsar {archive}",
+        }, "unzip", 0.8, prepare=False),
+        Workload("stream", "Stream the 256 MiB text entry to /dev/null (ZIP)", "large.zip", 5, {
+            "gwarchive": "{gw} cat {archive} " + text,
+            "unzip": "unzip -p {archive} " + text,
+            "bsdtar": "bsdtar -xOf {archive} " + text,
+            "7zz": "7zz e -so {archive} " + text,
+            "unar": "unar -q -o - {archive} " + text,
+        }, "bsdtar", 0.5, prepare=False),
+    ]
+
+
+def peak_rss_mib(path):
+    peak = 0
+    if os.path.exists(path):
+        for line in open(path):
+            if "Maximum resident set size" in line:
+                peak = max(peak, int(line.split(":")[1]))
+    return peak / 1024
+
+
+def run_workload(w, gw, corpus, scratch):
+    archive = os.path.join(corpus, w.archive)
+    out = os.path.join(scratch, "out")
+    rss_dir = os.path.join(scratch, "rss")
+    os.makedirs(rss_dir, exist_ok=True)
+    args = ["hyperfine", "--warmup", "1", "--runs", str(w.runs), "--style", "basic",
+            "--export-json", os.path.join(scratch, f"{w.name}.json")]
+    if w.prepare:
+        args += ["--prepare", f"rm -rf {out} && mkdir -p {out}"]
+    for tool, template in w.commands.items():
+        rss = os.path.join(rss_dir, f"{w.name}-{tool}.txt")
+        if os.path.exists(rss):
+            os.remove(rss)
+        command = template.format(gw=gw, archive=archive, out=out)
+        # Output goes to /dev/null inside the timed command so that a stream
+        # is written, not piped into hyperfine.
+        args += ["-n", tool, f"/usr/bin/time -v -a -o {rss} {command} > /dev/null"]
+    log(f"{w.title}: {', '.join(w.commands)}")
+    subprocess.run(args, check=True)
+    shutil.rmtree(out, ignore_errors=True)
+    results = json.load(open(os.path.join(scratch, f"{w.name}.json")))["results"]
+    rows = []
+    for result in results:
+        tool = result["command"]
+        rows.append({
+            "tool": tool,
+            "median": result["median"],
+            "min": result["min"],
+            "max": result["max"],
+            "rss": peak_rss_mib(os.path.join(rss_dir, f"{w.name}-{tool}.txt")),
+        })
+    return rows
+
+
+def load_average():
+    return " / ".join(f"{x:.2f}" for x in os.getloadavg())
+
+
+def cpu_model():
+    try:
+        for line in open("/proc/cpuinfo"):
+            if line.startswith("model name"):
+                return line.split(":", 1)[1].strip()
+    except OSError:
+        pass
+    return platform.processor() or "unknown"
+
+
+def write_results(path, measured, load_before, load_after, notes):
+    lines = [
+        "# Benchmark results",
+        "",
+        "Produced by `make bench` (bench/run.py); corpus from bench/corpus.py (fixed seed).",
+        "Medians of hyperfine runs after one warm-up, output folder removed before",
+        "every run; peak resident memory from `/usr/bin/time -v` (largest over the runs).",
+        "",
+        f"- date: {datetime.datetime.now(datetime.timezone.utc):%Y-%m-%d %H:%M} UTC",
+        f"- machine: {os.cpu_count()} cores ({cpu_model()}), "
+        f"{os.sysconf('SC_PAGE_SIZE') * os.sysconf('SC_PHYS_PAGES') // (1024 ** 3)} GiB, "
+        f"{platform.system()} {platform.release()}",
+        f"- load average (1/5/15 min) before: {load_before}; after: {load_after}",
+        "",
+        "| workload | gwarchive | fastest peer | ratio | goal | gwarchive peak RSS | largest peer RSS |",
+        "|---|---|---|---|---|---|---|",
+    ]
+    for w, rows in measured:
+        gw = next(r for r in rows if r["tool"] == "gwarchive")
+        peers = [r for r in rows if r["tool"] != "gwarchive"]
+        fastest = min(peers, key=lambda r: r["median"])
+        ratio = gw["median"] / fastest["median"]
+        goal_row = next((r for r in peers if r["tool"] == w.goal_peer), fastest)
+        goal_ratio = gw["median"] / goal_row["median"]
+        verdict = "met" if goal_ratio <= w.goal_ratio else "not met"
+        lines.append(
+            f"| {w.name} | {gw['median']:.3f} s | {fastest['tool']} {fastest['median']:.3f} s "
+            f"| {ratio:.2f} | ≤ {w.goal_ratio} × {w.goal_peer}: {goal_ratio:.2f}, {verdict} "
+            f"| {gw['rss']:.1f} MiB | {max(r['rss'] for r in peers):.1f} MiB |")
+    for w, rows in measured:
+        fastest = min((r for r in rows if r["tool"] != "gwarchive"), key=lambda r: r["median"])
+        lines += [
+            "",
+            f"## {w.title}",
+            "",
+            f"`{w.archive}`, {w.runs} runs.",
+            "",
+            "| tool | median | min | max | ratio to fastest peer | peak RSS |",
+            "|---|---|---|---|---|---|",
+        ]
+        for r in sorted(rows, key=lambda r: r["median"]):
+            lines.append(
+                f"| {r['tool']} | {r['median']:.3f} s | {r['min']:.3f} s | {r['max']:.3f} s "
+                f"| {r['median'] / fastest['median']:.2f} | {r['rss']:.1f} MiB |")
+    if notes:
+        lines += ["", "## Notes", "", open(notes).read().strip()]
+    with open(path, "w") as f:
+        f.write("\n".join(lines) + "\n")
+
+
+def main():
+    parser = argparse.ArgumentParser()
+    parser.add_argument("--build", required=True)
+    parser.add_argument("--out", default=os.path.join(HERE, "RESULTS.md"))
+    parser.add_argument("--notes", default=os.path.join(HERE, "NOTES.md"),
+                        help="text appended to the results (explanations, profiles)")
+    parser.add_argument("--only", default="", help="comma-separated workload names")
+    parser.add_argument("--tool", help="the gwarchive to time (default: BUILD/gwarchive)")
+    options = parser.parse_args()
+
+    build = os.path.abspath(options.build)
+    gw = os.path.abspath(options.tool) if options.tool else os.path.join(build, "gwarchive")
+    corpus = os.path.join(build, "bench-corpus")
+    scratch = os.path.join(build, "bench-scratch")
+    for tool in ["hyperfine", "/usr/bin/time", "zip", "unzip", "bsdtar", "7zz", "unar", "lsar"]:
+        if not shutil.which(tool):
+            sys.exit(f"bench: {tool} is missing (scripts/install-deps.sh installs it)")
+    subprocess.run([sys.executable, os.path.join(HERE, "corpus.py"), corpus], check=True)
+    os.makedirs(scratch, exist_ok=True)
+
+    selected = [w for w in workloads() if not options.only or w.name in options.only.split(",")]
+    load_before = load_average()
+    measured = [(w, run_workload(w, gw, corpus, scratch)) for w in selected]
+    load_after = load_average()
+    notes = options.notes if os.path.exists(options.notes) else None
+    write_results(options.out, measured, load_before, load_after, notes)
+    log(f"results in {options.out}")
+    print(open(options.out).read())
+
+
+if __name__ == "__main__":
+    main()
