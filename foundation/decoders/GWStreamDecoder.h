@@ -28,9 +28,21 @@ public:
                         bool isFinal) = 0;
 };
 
+// True when the first two bytes form a zlib header (deflate method, a window
+// of at most 32 KiB, no preset dictionary, valid check bits). A raw deflate
+// stream can begin like this only with a stored block whose padding bits are
+// set, which no encoder writes.
+inline bool GWLooksLikeZlibHeader(std::uint8_t cmf, std::uint8_t flg) {
+    return (cmf & 0x0F) == 8 && (cmf >> 4) <= 7 && (flg & 0x20) == 0 &&
+           ((unsigned(cmf) << 8) | flg) % 31 == 0;
+}
+
 std::unique_ptr<GWStreamDecoder> GWMakeCopyDecoder();
-// Raw deflate, or the zlib-wrapped form when the stream begins with a zlib header.
+// Raw deflate, or the zlib-wrapped form when the stream begins with a zlib
+// header. The default runs on ISA-L; the zlib one is the reference it is
+// tested against.
 std::unique_ptr<GWStreamDecoder> GWMakeInflateDecoder();
+std::unique_ptr<GWStreamDecoder> GWMakeZlibInflateDecoder();
 std::unique_ptr<GWStreamDecoder> GWMakeBzip2Decoder();
 // ZIP method 1 (shrink) and method 6 (implode). Neither stream marks its end,
 // so both stop after `uncompressedSize` bytes.
