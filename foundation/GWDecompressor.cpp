@@ -11,6 +11,10 @@ namespace {
 // Output handed back per step; a caller asked to run again gets the rest in
 // further pieces of this size.
 constexpr std::size_t kOutputPieceSize = 256 * 1024;
+// Pieces handed to a sink start this small and double while steps fill them,
+// so that the thousands of small entries of an archive do not each pay for a
+// large buffer.
+constexpr std::size_t kFirstSinkPieceSize = 16 * 1024;
 
 GWErrorPtr damagedStreamError(const std::string& reason) {
     return GWGenerateError(kGWCocoaErrorDomain, GWFileReadCorruptFileError, std::nullopt, nullptr,
@@ -50,6 +54,47 @@ std::shared_ptr<GWDecompressor> GWDecompressor::initForExplodeStreamingWithUncom
         GWMakeExplodeDecoder(size, useLargeDictionary, useLiteralTree));
 }
 
+std::span<const std::uint8_t> GWDecompressor::takeInput(std::span<const std::uint8_t> input) {
+    if (pendingStart_ == pending_.size()) {
+        return input;
+    }
+    // Input left over from an earlier step comes first; copy only then.
+    if (!input.empty()) {
+        pending_.erase(pending_.begin(), pending_.begin() + std::ptrdiff_t(pendingStart_));
+        pendingStart_ = 0;
+        pending_.insert(pending_.end(), input.begin(), input.end());
+    }
+    return std::span<const std::uint8_t>(pending_).subspan(pendingStart_);
+}
+
+void GWDecompressor::keepInput(std::span<const std::uint8_t> rest) {
+    const bool insidePending = !pending_.empty() && rest.data() >= pending_.data() &&
+                               rest.data() <= pending_.data() + pending_.size();
+    if (insidePending) {
+        // A caller running again with empty input moves through the held
+        // input without copying it each time.
+        pendingStart_ = std::size_t(rest.data() - pending_.data());
+    } else {
+        pending_.assign(rest.begin(), rest.end());
+        pendingStart_ = 0;
+    }
+}
+
+std::span<std::uint8_t> GWDecompressor::outputRoom(std::size_t size) {
+    if (scratchSize_ < size) {
+        scratch_.reset(new std::uint8_t[size]);
+        scratchSize_ = size;
+    }
+    return {scratch_.get(), scratchSize_};
+}
+
+bool GWDecompressor::fail(const std::string& reason, GWErrorPtr* error) {
+    failure_ = damagedStreamError(reason);
+    pending_.clear();
+    pendingStart_ = 0;
+    return GWFail(error, failure_);
+}
+
 std::optional<GWData> GWDecompressor::decompressedDataFromStreamWithInputData(
     std::span<const std::uint8_t> input, bool isFinal, bool* shouldRunAgain, GWErrorPtr* error) {
     if (shouldRunAgain) {
@@ -62,18 +107,10 @@ std::optional<GWData> GWDecompressor::decompressedDataFromStreamWithInputData(
     if (finished_) {
         return GWData();
     }
-    // Input left over from an earlier step comes first; copy only then.
-    std::span<const std::uint8_t> in = input;
-    if (!pending_.empty()) {
-        pending_.insert(pending_.end(), input.begin(), input.end());
-        in = pending_;
-    }
+    std::span<const std::uint8_t> in = takeInput(input);
     // Decode into a buffer kept across steps and copy out only what came, so
     // small input pieces do not pay for a large allocation each.
-    if (scratch_.empty()) {
-        scratch_.resize(kOutputPieceSize);
-    }
-    std::span<std::uint8_t> output = scratch_;
+    std::span<std::uint8_t> output = outputRoom(kOutputPieceSize).first(kOutputPieceSize);
     std::size_t produced = 0;
     bool full = false;
     for (;;) {
@@ -81,9 +118,7 @@ std::optional<GWData> GWDecompressor::decompressedDataFromStreamWithInputData(
         in = in.subspan(step.consumed);
         produced += step.produced;
         if (step.failed) {
-            failure_ = damagedStreamError(step.error);
-            pending_.clear();
-            GWFail(error, failure_);
+            fail(step.error, error);
             return std::nullopt;
         }
         if (step.finished) {
@@ -96,9 +131,7 @@ std::optional<GWData> GWDecompressor::decompressedDataFromStreamWithInputData(
         }
         if (step.consumed == 0 && step.produced == 0) {
             if (isFinal) {
-                failure_ = damagedStreamError("the compressed stream ends early");
-                pending_.clear();
-                GWFail(error, failure_);
+                fail("the compressed stream ends early", error);
                 return std::nullopt;
             }
             break;  // the engine waits for more input
@@ -106,14 +139,54 @@ std::optional<GWData> GWDecompressor::decompressedDataFromStreamWithInputData(
     }
     if (finished_) {
         pending_.clear();
-    } else if (in.data() != pending_.data() || in.size() != pending_.size()) {
-        GWData leftover(in.begin(), in.end());
-        pending_.swap(leftover);
+        pendingStart_ = 0;
+    } else {
+        keepInput(in);
     }
     if (shouldRunAgain) {
         *shouldRunAgain = full && !finished_;
     }
-    return GWData(output.begin(), output.begin() + produced);
+    return GWData(output.begin(), output.begin() + std::ptrdiff_t(produced));
+}
+
+bool GWDecompressor::decompressStreamWithInputData(std::span<const std::uint8_t> input,
+                                                   bool isFinal, const PieceSink& sink,
+                                                   GWErrorPtr* error) {
+    if (failure_) {
+        return GWFail(error, failure_);
+    }
+    if (finished_) {
+        return true;
+    }
+    std::span<const std::uint8_t> in = takeInput(input);
+    std::span<std::uint8_t> room = outputRoom(kFirstSinkPieceSize);
+    for (;;) {
+        const auto step = engine_->decode(in, room, isFinal);
+        in = in.subspan(step.consumed);
+        if (step.failed) {
+            return fail(step.error, error);
+        }
+        if (step.produced > 0 && !sink(room.first(step.produced))) {
+            keepInput(in);
+            return false;
+        }
+        if (step.produced == room.size() && room.size() < kOutputPieceSize) {
+            room = outputRoom(room.size() * 2);
+        }
+        if (step.finished) {
+            finished_ = true;
+            pending_.clear();
+            pendingStart_ = 0;
+            return true;
+        }
+        if (step.consumed == 0 && step.produced == 0) {
+            if (isFinal) {
+                return fail("the compressed stream ends early", error);
+            }
+            keepInput(in);  // the engine waits for more input
+            return true;
+        }
+    }
 }
 
 bool GWDecompressor::isDataCompressed(std::span<const std::uint8_t> data, int* algorithm) {
@@ -203,35 +276,38 @@ void GWDecompressor::decompressRemoteFileHandle(const std::shared_ptr<GWRemoteFi
         return;
     }
 
-    handle->readDataAtOffset(
-        offset, length, UINT64_MAX,
-        [&](GWRemoteFileHandle&, std::span<const std::uint8_t> chunk, bool isLast,
-            const GWErrorPtr& readError) {
-            if (readError) {
-                handler({}, storedBytes, decodedBytes, true, std::nullopt, std::nullopt, readError);
-                return false;
-            }
-            storedBytes += chunk.size();
-            if (storedDigest) {
-                storedDigest->update(chunk);
-            }
-            bool again = false;
-            std::span<const std::uint8_t> input = chunk;
-            do {
-                GWErrorPtr decodeError;
-                auto piece = decompressor->decompressedDataFromStreamWithInputData(
-                    input, isLast, &again, &decodeError);
-                if (!piece) {
-                    handler({}, storedBytes, decodedBytes, true, std::nullopt, std::nullopt,
-                            decodeError);
-                    return false;
-                }
-                input = {};
-                const bool done = isLast && !again;
-                if ((!piece->empty() || done) && !deliver(*piece, done)) {
-                    return false;
-                }
-            } while (again);
-            return true;
-        });
+    handle->readDataAtOffset(offset, length, UINT64_MAX,
+                             [&](GWRemoteFileHandle&, std::span<const std::uint8_t> chunk,
+                                 bool isLast, const GWErrorPtr& readError) {
+                                 if (readError) {
+                                     handler({}, storedBytes, decodedBytes, true, std::nullopt,
+                                             std::nullopt, readError);
+                                     return false;
+                                 }
+                                 storedBytes += chunk.size();
+                                 if (storedDigest) {
+                                     storedDigest->update(chunk);
+                                 }
+                                 GWErrorPtr decodeError;
+                                 bool delivered = true;
+                                 // Pieces go on as they are decoded, without a copy; the end is
+                                 // known only afterwards, so the digests come with an empty piece.
+                                 if (!decompressor->decompressStreamWithInputData(
+                                         chunk, isLast,
+                                         [&](std::span<const std::uint8_t> piece) {
+                                             delivered = deliver(piece, false);
+                                             return delivered;
+                                         },
+                                         &decodeError)) {
+                                     if (delivered) {
+                                         handler({}, storedBytes, decodedBytes, true, std::nullopt,
+                                                 std::nullopt, decodeError);
+                                     }
+                                     return false;
+                                 }
+                                 if (isLast && !deliver({}, true)) {
+                                     return false;
+                                 }
+                                 return true;
+                             });
 }

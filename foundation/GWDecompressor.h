@@ -39,6 +39,14 @@ public:
     std::optional<GWData> decompressedDataFromStreamWithInputData(
         std::span<const std::uint8_t> input, bool isFinal, bool* shouldRunAgain, GWErrorPtr* error);
 
+    // The same step without copies: decodes all of `input` (and with
+    // `isFinal` the stream's end), handing each decoded piece to `sink` as it
+    // comes. A piece lives until the sink returns. False for a damaged stream
+    // (with the error) and when the sink stops (without one).
+    using PieceSink = std::function<bool(std::span<const std::uint8_t> piece)>;
+    bool decompressStreamWithInputData(std::span<const std::uint8_t> input, bool isFinal,
+                                       const PieceSink& sink, GWErrorPtr* error);
+
     // True when the bytes begin a zlib (algorithm 1) or bzip2 (5) stream.
     static bool isDataCompressed(std::span<const std::uint8_t> data, int* algorithm = nullptr);
     // Decodes a whole buffer that isDataCompressed recognised. Output beyond
@@ -66,9 +74,21 @@ public:
     explicit GWDecompressor(std::unique_ptr<GWStreamDecoder> engine);
 
 private:
+    // Input held over from an earlier step followed by `input`.
+    std::span<const std::uint8_t> takeInput(std::span<const std::uint8_t> input);
+    // Keeps what the engine left of the input for the next step.
+    void keepInput(std::span<const std::uint8_t> rest);
+    bool fail(const std::string& reason, GWErrorPtr* error);
+    // Room for one step's output, at least `size` bytes.
+    std::span<std::uint8_t> outputRoom(std::size_t size);
+
     std::unique_ptr<GWStreamDecoder> engine_;
-    GWData pending_;  // input the engine has not consumed yet
-    GWData scratch_;  // output of one step before it is handed back
+    GWData pending_;                // input the engine has not consumed yet,
+    std::size_t pendingStart_ = 0;  // from this offset on
+    // Output of one step before it is handed back; left uninitialised, as
+    // the engine writes it before anyone reads it.
+    std::unique_ptr<std::uint8_t[]> scratch_;
+    std::size_t scratchSize_ = 0;
     bool finished_ = false;
     GWErrorPtr failure_;
 };

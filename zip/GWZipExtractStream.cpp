@@ -183,7 +183,7 @@ void GWZipExtractOperation::extractFile(const GWZipFilePtr& file, std::uint64_t 
     auto stopError = [](GWErrorPtr error) {
         return error ? error : GWCocoaError(GWUserCancelledError);
     };
-    auto pass = [&](const GWData& output, bool isDone) {
+    auto pass = [&](std::span<const std::uint8_t> output, bool isDone) {
         GWErrorPtr handlerError;
         if (!handler(output, isDone, &handlerError)) {
             completion(stopError(handlerError));
@@ -192,22 +192,19 @@ void GWZipExtractOperation::extractFile(const GWZipFilePtr& file, std::uint64_t 
         return true;
     };
     auto decode = [&](std::span<const std::uint8_t> input, bool isFinal) {
-        bool runAgain = false;
-        do {
-            GWErrorPtr decodeError;
-            auto output = decompressor->decompressedDataFromStreamWithInputData(
-                input, isFinal, &runAgain, &decodeError);
-            if (!output) {
-                completion(decodeError ? decodeError
-                                       : GWCocoaError(GWFileReadCorruptFileError, srcURL_));
-                return false;
-            }
-            if (!pass(*output, false)) {
-                return false;
-            }
-            input = {};
-        } while (runAgain);
-        return true;
+        bool passed = true;
+        GWErrorPtr decodeError;
+        if (decompressor->decompressStreamWithInputData(
+                input, isFinal,
+                [&](std::span<const std::uint8_t> output) { return passed = pass(output, false); },
+                &decodeError)) {
+            return true;
+        }
+        if (passed) {
+            completion(decodeError ? decodeError
+                                   : GWCocoaError(GWFileReadCorruptFileError, srcURL_));
+        }
+        return false;
     };
     auto read = [&](GWRemoteFileHandle&, std::span<const std::uint8_t> chunk, bool isFinal,
                     const GWErrorPtr& readError) {

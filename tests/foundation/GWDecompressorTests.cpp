@@ -110,6 +110,53 @@ TEST(GWDecompressor, BufferedOutputAsksToRunAgainUntilDelivered) {
     EXPECT_FALSE(again);
 }
 
+TEST(GWDecompressor, SinkStepsHandOutEveryPieceAndStopWhenTold) {
+    GWData input = gwtest::textBytes(700000, 21);
+    const GWData noise = gwtest::randomBytes(200000, 22);
+    input.insert(input.begin() + 300000, noise.begin(), noise.end());
+    const GWData stream = deflateBytes(input, Wrapping::Zlib);
+    auto decompressor =
+        GWDecompressor::initForStreamingWithAlgorithm(GWDecompressorAlgorithmDeflate, nullptr);
+    GWData output;
+    int pieces = 0;
+    for (std::size_t at = 0; at < stream.size(); at += 50000) {
+        const std::size_t length = std::min<std::size_t>(50000, stream.size() - at);
+        const bool last = at + length == stream.size();
+        GWErrorPtr error;
+        ASSERT_TRUE(decompressor->decompressStreamWithInputData(
+            std::span(stream).subspan(at, length), last,
+            [&](std::span<const std::uint8_t> piece) {
+                EXPECT_FALSE(piece.empty());
+                output.insert(output.end(), piece.begin(), piece.end());
+                ++pieces;
+                return true;
+            },
+            &error));
+    }
+    EXPECT_TRUE(output == input);
+    EXPECT_GT(pieces, 3);
+
+    // A sink that stops ends the step without an error.
+    auto stopped =
+        GWDecompressor::initForStreamingWithAlgorithm(GWDecompressorAlgorithmDeflate, nullptr);
+    GWErrorPtr error;
+    EXPECT_FALSE(stopped->decompressStreamWithInputData(
+        stream, true, [](std::span<const std::uint8_t>) { return false; }, &error));
+    EXPECT_FALSE(error);
+
+    // A cut stream is damaged, and stays so.
+    auto cut =
+        GWDecompressor::initForStreamingWithAlgorithm(GWDecompressorAlgorithmDeflate, nullptr);
+    const GWData half(stream.begin(), stream.begin() + std::ptrdiff_t(stream.size() / 2));
+    auto ignore = [](std::span<const std::uint8_t>) { return true; };
+    EXPECT_FALSE(cut->decompressStreamWithInputData(half, true, ignore, &error));
+    ASSERT_TRUE(error);
+    EXPECT_TRUE(error->is(kGWCocoaErrorDomain, GWFileReadCorruptFileError));
+    GWErrorPtr again;
+    EXPECT_FALSE(cut->decompressStreamWithInputData({}, true, ignore, &again));
+    EXPECT_TRUE(again);
+}
+
 TEST(GWDecompressor, DamagedAndTruncatedStreamsAreErrors) {
     const GWData input = gwtest::textBytes(100000, 9);
     for (const Codec& codec : kCodecs) {
