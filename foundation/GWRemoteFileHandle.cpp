@@ -89,6 +89,21 @@ std::optional<GWData> GWRemoteFileHandle::readDataOfLength(std::uint64_t length,
     return data;
 }
 
+std::optional<std::size_t> GWRemoteFileHandle::readDataAtOffset(std::uint64_t offset,
+                                                                std::span<std::uint8_t> into,
+                                                                GWErrorPtr* error) {
+    if (closed_) {
+        GWFail(error, GWPOSIXError(EBADF, url_));
+        return std::nullopt;
+    }
+    std::size_t got = 0;
+    if (!backend_->readAt(offset, into, got, error)) {
+        return std::nullopt;
+    }
+    position_ = offset + got;
+    return got;
+}
+
 bool GWRemoteFileHandle::seekToFileOffset(std::uint64_t offset, GWErrorPtr*) {
     position_ = offset;
     return true;

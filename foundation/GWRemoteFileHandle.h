@@ -48,6 +48,11 @@ public:
     // Up to `length` bytes from the current position, which advances. Fewer
     // at the end of the file, and empty data at the end.
     std::optional<GWData> readDataOfLength(std::uint64_t length, GWErrorPtr* error);
+    // The same into the caller's buffer, at `offset`: up to into.size()
+    // bytes, fewer only at the end of the file. A buffer read into again and
+    // again is cleared and allocated once, not for every read.
+    std::optional<std::size_t> readDataAtOffset(std::uint64_t offset, std::span<std::uint8_t> into,
+                                                GWErrorPtr* error);
     bool seekToFileOffset(std::uint64_t offset, GWErrorPtr* error);
     std::uint64_t offsetInFile() const { return position_; }
     std::uint64_t fileSize() const;

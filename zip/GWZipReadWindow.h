@@ -27,6 +27,7 @@ public:
 private:
     GWRemoteFileHandle& file_;
     std::size_t windowSize_;
-    GWData window_;
+    GWData window_;  // read into again and again; only its first windowLength_ bytes hold data
+    std::size_t windowLength_ = 0;
     std::uint64_t windowOffset_ = 0;
 };

@@ -1,5 +1,7 @@
 #include <gtest/gtest.h>
 
+#include <algorithm>
+
 #include "foundation/GWRemoteFileHandle.h"
 #include "support/TestSupport.h"
 
@@ -53,6 +55,27 @@ TEST_F(GWRemoteFileHandleTest, ReadingPastTheEndGivesShortThenEmptyData) {
     // A huge request is bounded by the file, not allocated as asked.
     ASSERT_TRUE(handle_->seekToFileOffset(0, nullptr));
     EXPECT_EQ(handle_->readDataOfLength(UINT64_MAX, nullptr)->size(), contents_.size());
+}
+
+TEST_F(GWRemoteFileHandleTest, ReadingIntoABufferFillsItUpToTheEnd) {
+    GWData buffer(1000, 0xEE);
+    auto got = handle_->readDataAtOffset(500, buffer, nullptr);
+    ASSERT_TRUE(got);
+    EXPECT_EQ(*got, 1000u);
+    EXPECT_TRUE(std::equal(buffer.begin(), buffer.end(), contents_.begin() + 500));
+    EXPECT_EQ(handle_->offsetInFile(), 1500u);
+    // Short at the end, and the bytes past what came are left alone.
+    buffer.assign(1000, 0xEE);
+    got = handle_->readDataAtOffset(contents_.size() - 10, buffer, nullptr);
+    ASSERT_TRUE(got);
+    EXPECT_EQ(*got, 10u);
+    EXPECT_TRUE(std::equal(buffer.begin(), buffer.begin() + 10, contents_.end() - 10));
+    EXPECT_EQ(buffer[10], 0xEE);
+    EXPECT_EQ(handle_->readDataAtOffset(contents_.size() + 5, buffer, nullptr), 0u);
+    handle_->closeFileAndReturnError(nullptr);
+    GWErrorPtr error;
+    EXPECT_FALSE(handle_->readDataAtOffset(0, buffer, &error));
+    EXPECT_TRUE(error);
 }
 
 TEST_F(GWRemoteFileHandleTest, RangesArriveInLargePiecesWithTheLastMarked) {
