@@ -249,3 +249,13 @@ std::string GWTemporaryDirectoryPath() {
     }
     return path;
 }
+
+std::uint32_t GWProcessUserID() {
+    static const std::uint32_t user = ::getuid();
+    return user;
+}
+
+std::uint32_t GWProcessGroupID() {
+    static const std::uint32_t group = ::getgid();
+    return group;
+}

@@ -1,5 +1,6 @@
 #pragma once
 
+#include <cstdint>
 #include <optional>
 #include <string>
 
@@ -43,3 +44,8 @@ std::optional<GWURL> GWItemReplacementDirectoryForURL(const GWURL& appropriateFo
 
 // $TMPDIR, or /tmp when it is unset or empty.
 std::string GWTemporaryDirectoryPath();
+
+// The running process's user and group, asked of the system once: archives
+// of many entries take them as the default owner of each.
+std::uint32_t GWProcessUserID();
+std::uint32_t GWProcessGroupID();

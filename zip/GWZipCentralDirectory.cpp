@@ -1,8 +1,6 @@
 // The central directory walk: one record at a time, its local header where
 // that is cheap or needed, names, modes and dates, and the entry tree.
 
-#include <unistd.h>
-
 #include <algorithm>
 #include <array>
 #include <cctype>
@@ -13,6 +11,7 @@
 #include "GWZipUnicodePathCRC.h"
 #include "foundation/GWByteReader.h"
 #include "foundation/GWChecksum.h"
+#include "foundation/GWFileManager.h"
 #include "foundation/GWStringEncoding.h"
 
 namespace {
@@ -388,9 +387,10 @@ bool GWZipLoadOperation::addItemWithFilename(
                              std::uint8_t(crc32 >> 16), std::uint8_t(crc32 >> 24)};
     auto node = GWZipFile::initWithName(
         name, parent, compressedSize, uncompressedSize, checksum, GWChecksumAlgorithmCRC32,
-        owner ? std::uint32_t(*owner) : getuid(), group ? std::uint32_t(*group) : getgid(),
-        permissionsMode, modificationDate, std::move(linkTarget), localHeaderOffset,
-        generalPurposeFlags, compressionMethod, std::move(extraInfo));
+        owner ? std::uint32_t(*owner) : GWProcessUserID(),
+        group ? std::uint32_t(*group) : GWProcessGroupID(), permissionsMode, modificationDate,
+        std::move(linkTarget), localHeaderOffset, generalPurposeFlags, compressionMethod,
+        std::move(extraInfo));
     auto existing = rootItems.addChild(parent, node);
     // An explicit directory entry replaces the implicit one made for its
     // children earlier, and takes its place at the end. At the root a

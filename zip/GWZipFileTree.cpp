@@ -1,8 +1,7 @@
 // Path lookup in an entry tree, and the implicit directories it makes.
 
-#include <unistd.h>
-
 #include "GWZipFile.h"
+#include "foundation/GWFileManager.h"
 
 std::vector<std::string> GWZipFile::standardizedComponentsForPath(std::string_view path) {
     std::vector<std::string> components;
@@ -45,8 +44,8 @@ GWZipFilePtr GWZipFile::fileWithPathComponents(const std::vector<std::string>& c
 }
 
 GWZipFilePtr GWZipFile::makeImplicitDirectory(const std::string& name, const GWZipFilePtr& parent) {
-    return initWithName(name, parent, 0, 0, std::nullopt, 0, getuid(), getgid(), 040755,
-                        GWDate::now(), std::nullopt, 0, 0, 0, {});
+    return initWithName(name, parent, 0, 0, std::nullopt, 0, GWProcessUserID(), GWProcessGroupID(),
+                        040755, GWDate::now(), std::nullopt, 0, 0, 0, {});
 }
 
 GWZipFilePtr GWZipFile::fileWithPathComponents(const std::vector<std::string>& components,

@@ -2,12 +2,11 @@
 // resource forks under "XtraStuf.mac" or "Re$0urce.Fk", and "…r" / "…d"
 // pairs) to the entries they describe.
 
-#include <unistd.h>
-
 #include <algorithm>
 #include <unordered_set>
 
 #include "GWZipLoadOperation.h"
+#include "foundation/GWFileManager.h"
 
 namespace {
 
@@ -137,9 +136,9 @@ GWZipFilePtr GWZipLoadOperation::metadataTarget(const std::vector<std::string>& 
     }
     // A companion without its entry still shows up, as an empty file.
     GWZipFilePtr directory = lookup(components.size() - 1, true);
-    auto placeholder =
-        GWZipFile::initWithName(components.back(), directory, 0, 0, std::nullopt, 0, getuid(),
-                                getgid(), 0100644, GWDate::now(), std::nullopt, 0, 0, 0, {});
+    auto placeholder = GWZipFile::initWithName(components.back(), directory, 0, 0, std::nullopt, 0,
+                                               GWProcessUserID(), GWProcessGroupID(), 0100644,
+                                               GWDate::now(), std::nullopt, 0, 0, 0, {});
     if (directory) {
         directory->addChild(placeholder);
     } else {

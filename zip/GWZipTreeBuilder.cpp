@@ -1,10 +1,11 @@
 #include "GWZipTreeBuilder.h"
 
-#include <unistd.h>
+#include "foundation/GWFileManager.h"
 
 GWZipFilePtr GWZipMakeImplicitDirectory(const std::string& name, const GWZipFilePtr& parent) {
-    return GWZipFile::initWithName(name, parent, 0, 0, std::nullopt, 0, getuid(), getgid(), 040755,
-                                   GWDate::now(), std::nullopt, 0, 0, 0, {});
+    return GWZipFile::initWithName(name, parent, 0, 0, std::nullopt, 0, GWProcessUserID(),
+                                   GWProcessGroupID(), 040755, GWDate::now(), std::nullopt, 0, 0, 0,
+                                   {});
 }
 
 GWZipFilePtr GWZipTreeBuilder::childNamed(const GWZipFilePtr& parent, std::string_view name) const {

@@ -36,7 +36,7 @@ class ZipToolArchive final : public ToolArchive {
 public:
     explicit ZipToolArchive(GWZipArchivePtr archive) : archive_(std::move(archive)) {
         for (const GWZipFilePtr& file : archive_->files())
-            add(file);
+            add(file, "");
     }
 
     const char* formatName() const override { return "zip"; }
@@ -79,9 +79,15 @@ public:
                  const std::string& archiveName) override;
 
 private:
-    void add(const GWZipFilePtr& file) {
+    // Paths grow from the parent's, as GWZipFile::path() joins them, without
+    // climbing to the root for each of many thousand entries.
+    void add(const GWZipFilePtr& file, const std::string& parentPath) {
         EntryRecord record;
-        record.path = file->path();
+        std::string name = file->name();
+        record.path = parentPath;
+        if (!record.path.empty() && record.path.back() != '/' && !name.empty())
+            record.path += '/';
+        record.path += name;
         record.mode = file->permissionsMode();
         record.type = entryTypeFromMode(record.mode);
         record.size = file->storedUncompressedSize();
@@ -103,8 +109,9 @@ private:
         records_.push_back(std::move(record));
         files_.push_back(file);
         if (auto children = file->children()) {
+            const std::string path = records_.back().path;
             for (const GWZipFilePtr& child : *children)
-                add(child);
+                add(child, path);
         }
     }
 
