@@ -144,6 +144,14 @@ bool GWCreateEmptyFileAtomicallyAtURL(const GWURL& url, GWErrorPtr* error) {
         return false;
     }
     const std::string path = url.path();
+    // An empty file has no partial state to hide, so a free name is simply
+    // created; only replacing an item needs a temporary and a rename.
+    if (GWFileDescriptor::open(path.c_str(), O_WRONLY | O_CREAT | O_EXCL, 0666).isValid()) {
+        return true;
+    }
+    if (errno != EEXIST) {
+        return GWFail(error, posixError(errno, url, "writing"));
+    }
     // open() rather than mkstemp(), so that the umask gives the usual mode.
     // A short name of its own, beside the file: the file's name may already
     // be as long as names can be.
