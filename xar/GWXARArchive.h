@@ -165,6 +165,8 @@ public:
                                   const GWXARDataHandler& handler);
     // One stored stream of `file`. A missing reference stands for the data
     // fork of the item the file resolves to; none at all is an empty stream.
+    // Returns after the handler's last call. A stream that finds the archive
+    // cancelled by another extraction stops without a last call.
     void extractDataReference(const GWXARDataReferencePtr& reference, const GWXARFilePtr& file,
                               const GWOperationQueuePtr& queue, const GWXARDataHandler& handler);
     // The single place a data handler is called: a refusal cancels the

@@ -43,6 +43,7 @@ bool GWXARExtractOperation::writeDataForkOfFile(const GWXARFilePtr& file, int fd
     // Shared with the handler, which the reading machinery may outlive us with.
     struct State {
         std::atomic<bool> stop{false};
+        std::atomic<bool> ended{false};
         std::mutex mutex;
         GWErrorPtr error;
         std::uint64_t written = 0;
@@ -50,7 +51,12 @@ bool GWXARExtractOperation::writeDataForkOfFile(const GWXARFilePtr& file, int fd
     auto state = std::make_shared<State>();
     auto weakSelf = std::weak_ptr<GWXARExtractOperation>(
         std::static_pointer_cast<GWXARExtractOperation>(shared_from_this()));
-    auto fail = [state, semaphore](GWErrorPtr failure) {
+    auto end = [state, semaphore] {
+        if (!state->ended.exchange(true)) {
+            semaphore->signal();
+        }
+    };
+    auto fail = [state, end](GWErrorPtr failure) {
         state->stop.store(true);
         {
             std::lock_guard lock(state->mutex);
@@ -58,14 +64,14 @@ bool GWXARExtractOperation::writeDataForkOfFile(const GWXARFilePtr& file, int fd
                 state->error = std::move(failure);
             }
         }
-        semaphore->signal();
+        end();
         return false;
     };
     archive->extractDataForkOfFile(
         file, queue,
-        [state, semaphore, weakSelf, fail, fd, url](
-            std::optional<std::span<const std::uint8_t>> data, bool isDone, bool checksumFailed,
-            const GWErrorPtr& streamError) {
+        [state, end, weakSelf, fail, fd, url](std::optional<std::span<const std::uint8_t>> data,
+                                              bool isDone, bool checksumFailed,
+                                              const GWErrorPtr& streamError) {
             if (state->stop.load()) {
                 return false;
             }
@@ -84,10 +90,15 @@ bool GWXARExtractOperation::writeDataForkOfFile(const GWXARFilePtr& file, int fd
                 state->written += data->size();
             }
             if (isDone) {
-                semaphore->signal();
+                end();
             }
             return true;
         });
+    // Another extraction on the archive failed or was cancelled meanwhile:
+    // the stream stopped without its last call, and nothing else will come.
+    if (!state->ended.load()) {
+        fail(cancelledError());
+    }
     semaphore->wait();
     std::lock_guard lock(state->mutex);
     if (state->error) {
@@ -104,6 +115,10 @@ bool GWXARExtractOperation::extractDirectory(const GWXARFilePtr& file, const GWU
     }
     std::vector<DeferredHardLink> hardLinks;
     if (!extractChildrenOfDirectory(file, url, hardLinks, error)) {
+        return false;
+    }
+    // Links find their targets on disk: the files written so far must be there.
+    if (!hardLinks.empty() && !finishWorkers(error)) {
         return false;
     }
     for (const auto& link : hardLinks) {
@@ -125,6 +140,9 @@ bool GWXARExtractOperation::extractChildrenOfDirectory(const GWXARFilePtr& direc
         if (isCancelled()) {
             return GWFail(error, cancelledError());
         }
+        if (workerFailed()) {
+            return finishWorkers(error);
+        }
         auto destination = childURL(url, *child, error);
         if (!destination) {
             return false;
@@ -133,6 +151,8 @@ bool GWXARExtractOperation::extractChildrenOfDirectory(const GWXARFilePtr& direc
         // targets among the siblings and their subtrees exist.
         if (child->type() == GWXARFileTypeHardLink) {
             hardLinks.push_back({child, *destination});
+        } else if (child->type() == GWXARFileTypeRegular) {
+            extractFileOnWorker(child, *destination);
         } else if (!extractFile(child, *destination, error)) {
             return false;
         }

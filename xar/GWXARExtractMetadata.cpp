@@ -152,6 +152,12 @@ bool GWXARExtractOperation::applyExtendedAttributesForFile(const GWXARFilePtr& f
         const bool isResourceFork = name == kResourceForkName;
         auto buffer = std::make_shared<GWData>();
         auto position = std::make_shared<std::uint32_t>(0);
+        auto left = std::make_shared<std::atomic<bool>>(false);
+        auto leave = [group, left] {
+            if (!left->exchange(true)) {
+                group->leave();
+            }
+        };
         group->enter();
         archive->extractDataReference(
             attribute, file, queue,
@@ -200,14 +206,20 @@ bool GWXARExtractOperation::applyExtendedAttributesForFile(const GWXARFilePtr& f
                 }
                 if (!failure) {
                     if (isDone) {
-                        group->leave();
+                        leave();
                     }
                     return true;
                 }
                 keepFirst(failure);
-                group->leave();
+                leave();
                 return false;
             });
+        // A stream stopped without its last call (the archive was cancelled
+        // by another extraction, or an earlier attribute failed) has ended all the same.
+        if (!left->load()) {
+            keepFirst(cancelledError());
+            leave();
+        }
     }
     group->wait();
     std::lock_guard lock(shared->mutex);

@@ -73,9 +73,22 @@ bool GWXARExtractOperation::performExtractionOperationWithFile(const GWXARFilePt
                               .value_or(temporaryURL.URLByAppendingPathComponent("item"));
     temporaryItemURL_ = itemURL;
     deferTopLevelFlags_ = false;
-    if (!extractFile(file, itemURL, error)) {
-        return false;
+    walking_ = true;
+    GWErrorPtr walkError;
+    const bool walked = extractFile(file, itemURL, &walkError);
+    walking_ = false;
+    // A worker's failure lies before the point where the walk stopped.
+    GWErrorPtr workerError;
+    if (!finishWorkers(&workerError)) {
+        return GWFail(error, workerError);
     }
+    if (!walked) {
+        return GWFail(error, walkError);
+    }
+    for (const auto& [directory, directoryURL] : pendingDirectories_) {
+        applyMetadataOrNote(directory, directoryURL);
+    }
+    pendingDirectories_.clear();
     // Moving a directory updates its "..", which needs write permission on
     // it; without privileges a read-only one gets that for the move only.
     struct stat itemInfo;
@@ -125,14 +138,31 @@ bool GWXARExtractOperation::extractFile(const GWXARFilePtr& file, const GWURL& u
                                      file->path().c_str(),
                                      GWXARFile::stringFromFileType(file->type()).c_str()));
     }
+    if (file->type() == GWXARFileTypeDirectory) {
+        if (walking_ && created) {
+            // Applied once the workers have written everything below it.
+            pendingDirectories_.emplace_back(file, url);
+            return true;
+        }
+        if (!walking_) {
+            GWErrorPtr workerError;
+            if (!finishWorkers(&workerError) && created) {
+                return GWFail(error, workerError);
+            }
+        }
+    }
     if (!created) {
         return false;
     }
+    applyMetadataOrNote(file, url);
+    return true;
+}
+
+void GWXARExtractOperation::applyMetadataOrNote(const GWXARFilePtr& file, const GWURL& url) {
     GWErrorPtr metadataError;
     if (!applyMetadataToFile(file, url, &metadataError)) {
         GWLog("Failed to apply metadata for %s: %s", url.path().c_str(),
               metadataError ? metadataError->localizedDescription().c_str() : "(null)");
         markChecksumInvalid();
     }
-    return true;
 }

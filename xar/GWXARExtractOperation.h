@@ -6,6 +6,7 @@
 #include <mutex>
 #include <optional>
 #include <span>
+#include <utility>
 #include <vector>
 
 #include "GWXARFile.h"
@@ -79,6 +80,19 @@ public:
 
     GWErrorPtr cancelledError() const;
 
+    // --- Workers (GWXARExtractWorkers.cpp) -----------------------------------
+    // The regular files of a directory are written by workers, twice the
+    // processor count of them, while the tree is walked; directories get
+    // their metadata once everything below them is written.
+    void extractFileOnWorker(const GWXARFilePtr& file, const GWURL& url);
+    // Waits for the workers; false with the first failure in tree order.
+    bool finishWorkers(GWErrorPtr* error);
+    // A metadata failure leaves the item in place: logged, and reported
+    // through checksumIsInvalid().
+    void applyMetadataOrNote(const GWXARFilePtr& file, const GWURL& url);
+    // True once a worker has failed: the walk stops there.
+    bool workerFailed() const;
+
     // Whole attributes other than the resource fork are gathered in memory
     // before they are set; one larger than this is refused (E2BIG).
     static constexpr std::size_t kMaxBufferedAttributeSize = 16 * 1024 * 1024;
@@ -113,4 +127,11 @@ private:
     // wait for the move.
     std::optional<GWURL> temporaryItemURL_;
     bool deferTopLevelFlags_ = false;
+
+    struct Workers;
+    std::shared_ptr<Workers> workers_;
+    // While the private-directory wrapper walks the item's tree.
+    bool walking_ = false;
+    // Directories whose metadata waits for their files, deepest first.
+    std::vector<std::pair<GWXARFilePtr, GWURL>> pendingDirectories_;
 };

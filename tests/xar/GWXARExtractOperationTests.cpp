@@ -534,3 +534,89 @@ TEST_F(XarExtraction, AsynchronousExtractionReportsThroughTheHandler) {
 }
 
 }  // namespace
+
+TEST_F(XarExtraction, ManyFilesAreWrittenInParallelWithDirectoryMetadataLast) {
+    // Enough files per directory that several workers write at once, and
+    // read-only directories that must still receive every file first.
+    std::string tree;
+    int id = 2;
+    for (int folder = 0; folder < 3; ++folder) {
+        std::string files;
+        for (int index = 0; index < 12; ++index) {
+            const XarEncoding encoding = XarEncoding(index % 3);
+            files += xarFileElement(
+                id++, "f" + std::to_string(index), "file", index % 2 ? "0600" : "0644",
+                "<mtime>2011-01-01T00:00:00Z</mtime>" +
+                    xar.dataElement("data", gwtest::textBytes(100 + 5000 * index, index + folder),
+                                    encoding));
+        }
+        tree += xarFileElement(id++, "d" + std::to_string(folder), "directory", "0555",
+                               "<mtime>2012-01-01T00:00:00Z</mtime>" + files);
+    }
+    auto archive = open(xarFileElement(1, "top", "directory", "0755", tree));
+    ASSERT_TRUE(archive);
+    bool invalid = true;
+    GWErrorPtr error;
+    ASSERT_TRUE(extract(archive, "top", "top", &invalid, &error)) << error->localizedDescription();
+    EXPECT_FALSE(invalid);
+
+    const auto snapshot = gwtest::snapshotTree(outputPath("top"));
+    ASSERT_EQ(snapshot.size(), 1u + 3 * 13);
+    for (int folder = 0; folder < 3; ++folder) {
+        const std::string name = "d" + std::to_string(folder);
+        EXPECT_EQ(snapshot.at(name).mode, S_IFDIR | 0555);
+        EXPECT_EQ(snapshot.at(name).modificationSeconds, 1325376000) << "set after its files";
+        for (int index = 0; index < 12; ++index) {
+            const auto& entry = snapshot.at(name + "/f" + std::to_string(index));
+            EXPECT_EQ(entry.mode, S_IFREG | (index % 2 ? 0600u : 0644u));
+            EXPECT_EQ(entry.modificationSeconds, 1293840000);
+            EXPECT_EQ(entry.digest, GWChecksum::checksumForData(
+                                        gwtest::textBytes(100 + 5000 * index, index + folder), 5));
+        }
+    }
+    EXPECT_TRUE(temporaryLeftovers().empty());
+    for (int folder = 0; folder < 3; ++folder) {
+        chmod(directory.file("out/top/d" + std::to_string(folder)).c_str(), 0755);
+    }
+}
+
+TEST_F(XarExtraction, FirstFailingFileInTreeOrderIsReported) {
+    std::string files;
+    for (int index = 0; index < 20; ++index) {
+        files += xarFileElement(
+            index + 2, "f" + std::to_string(index), "file", "0644",
+            xar.dataElement("data", gwtest::textBytes(30000, index), XarEncoding::gzip));
+    }
+    auto archive = open(xarFileElement(1, "d", "directory", "0755", files));
+    ASSERT_TRUE(archive);
+    // Both fail with code 13; the unknown entity tells which one was reported.
+    archive->fileWithPath("d/f5")->dataFork()->setCompressionType(GWXARCompressionTypeLZMA);
+    archive->fileWithPath("d/f9")->dataFork()->setCompressionType(7);
+    GWErrorPtr error;
+    EXPECT_FALSE(extract(archive, "d", "d", nullptr, &error));
+    ASSERT_TRUE(error);
+    EXPECT_TRUE(error->is(kGWXARArchiveErrorDomain, 13));
+    EXPECT_EQ(error->detailString(kGWXARArchiveUnknownEntityErrorKey), "LZMA");
+    EXPECT_TRUE(directoryNames(directory.file("out")).empty());
+    EXPECT_TRUE(temporaryLeftovers().empty());
+}
+
+TEST_F(XarExtraction, FailedAttributeDoesNotKeepTheNextOneWaiting) {
+    const std::string inner = xar.dataElement("data", gwtest::bytesOf("data"), XarEncoding::none) +
+                              xar.dataElement("ea", gwtest::bytesOf("first"), XarEncoding::gzip,
+                                              "sha1", "<name>user.first</name>") +
+                              xar.dataElement("ea", gwtest::bytesOf("second"), XarEncoding::gzip,
+                                              "sha1", "<name>user.second</name>");
+    auto archive = open(xarFileElement(1, "f", "file", "0644", inner));
+    ASSERT_TRUE(archive);
+    archive->fileWithPath("f")->extendedAttributes().front()->setCompressionType(
+        GWXARCompressionTypeLZMA);
+    gwtest::LogCapture log;
+    bool invalid = false;
+    GWErrorPtr error;
+    // The second attribute's stream finds the archive cancelled by the first
+    // one's failure and stops at once; the extraction must still end.
+    ASSERT_TRUE(extract(archive, "f", "f", &invalid, &error));
+    EXPECT_TRUE(invalid);
+    EXPECT_EQ(gwtest::readFile(outputPath("f")), gwtest::bytesOf("data"));
+}
