@@ -227,10 +227,16 @@ void GWZipFile::addChild(const GWZipFilePtr& child) {
         return;
     }
     children_->push_back(child);
-    std::lock_guard lock(indexMutex_);
-    if (index_.valid && index_.childrenGeneration == childrenGeneration_ && child) {
-        index_.first.emplace(child->name(), children_->size() - 1);
+    NameIndex& index = nameIndex();
+    std::lock_guard lock(index.mutex);
+    if (index.valid && index.childrenGeneration == childrenGeneration_ && child) {
+        index.first.emplace(child->name(), children_->size() - 1);
     }
+}
+
+GWZipFile::NameIndex& GWZipFile::nameIndex() const {
+    std::call_once(indexOnce_, [this] { index_ = std::make_unique<NameIndex>(); });
+    return *index_;
 }
 
 void GWZipFile::removeChild(const GWZipFilePtr& child) {
@@ -252,23 +258,24 @@ std::optional<std::size_t> GWZipFile::indexOfChildNamed(std::string_view name) c
     if (!children_) {
         return std::nullopt;
     }
-    std::lock_guard lock(indexMutex_);
+    NameIndex& index = nameIndex();
+    std::lock_guard lock(index.mutex);
     const std::uint64_t epoch = gRenameEpoch.load(std::memory_order_relaxed);
-    if (!index_.valid || index_.childrenGeneration != childrenGeneration_ ||
-        index_.renameEpoch != epoch) {
-        index_.first.clear();
-        index_.first.reserve(children_->size());
+    if (!index.valid || index.childrenGeneration != childrenGeneration_ ||
+        index.renameEpoch != epoch) {
+        index.first.clear();
+        index.first.reserve(children_->size());
         for (std::size_t i = 0; i < children_->size(); ++i) {
             if (const auto& child = (*children_)[i]) {
-                index_.first.emplace(child->name(), i);
+                index.first.emplace(child->name(), i);
             }
         }
-        index_.childrenGeneration = childrenGeneration_;
-        index_.renameEpoch = epoch;
-        index_.valid = true;
+        index.childrenGeneration = childrenGeneration_;
+        index.renameEpoch = epoch;
+        index.valid = true;
     }
-    auto found = index_.first.find(std::string(name));
-    if (found == index_.first.end()) {
+    auto found = index.first.find(std::string(name));
+    if (found == index.first.end()) {
         return std::nullopt;
     }
     return found->second;

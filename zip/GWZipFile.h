@@ -220,12 +220,16 @@ private:
     // children are replaced or any entry anywhere is renamed. Lookups may run
     // on several threads over a finished tree, hence the lock.
     struct NameIndex {
+        std::mutex mutex;
         std::unordered_map<std::string, std::size_t> first;
         std::uint64_t childrenGeneration = 0;
         std::uint64_t renameEpoch = 0;
         bool valid = false;
     };
-    mutable std::mutex indexMutex_;
-    mutable NameIndex index_;
+    // Made when first needed, by directories only: an archive of 200,000
+    // entries would otherwise carry 200,000 empty indexes.
+    NameIndex& nameIndex() const;
+    mutable std::once_flag indexOnce_;
+    mutable std::unique_ptr<NameIndex> index_;
     std::uint64_t childrenGeneration_ = 0;
 };

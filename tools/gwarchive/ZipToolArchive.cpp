@@ -35,6 +35,13 @@ std::string compressionName(std::uint16_t method) {
 class ZipToolArchive final : public ToolArchive {
 public:
     explicit ZipToolArchive(GWZipArchivePtr archive) : archive_(std::move(archive)) {
+        // Sized once: growing by doubling would hold two copies of the
+        // records of a large archive for a moment.
+        std::size_t count = 0;
+        for (const GWZipFilePtr& file : archive_->files())
+            count += countEntries(*file);
+        records_.reserve(count);
+        files_.reserve(count);
         for (const GWZipFilePtr& file : archive_->files())
             add(file, "");
     }
@@ -79,6 +86,15 @@ public:
                  const std::string& archiveName) override;
 
 private:
+    static std::size_t countEntries(const GWZipFile& file) {
+        std::size_t count = 1;
+        if (auto children = file.children()) {
+            for (const GWZipFilePtr& child : *children)
+                count += countEntries(*child);
+        }
+        return count;
+    }
+
     // Paths grow from the parent's, as GWZipFile::path() joins them, without
     // climbing to the root for each of many thousand entries.
     void add(const GWZipFilePtr& file, const std::string& parentPath) {
