@@ -13,6 +13,7 @@ struct GWXARExtractOperation::Workers {
     // The failure of the file submitted first among those that failed.
     std::optional<std::size_t> failedAt;
     GWErrorPtr failure;
+    bool failureIsCancellation = false;
     std::atomic<bool> failed{false};
 
     Workers() {
@@ -33,8 +34,14 @@ void GWXARExtractOperation::extractFileOnWorker(const GWXARFilePtr& file, const 
     }
     // The queue is waited for before this operation ends, so `this` outlives the block.
     workers->queue->addOperationWithBlock([this, workers, order, file, url] {
-        if (workers->failed.load()) {
-            return;  // the walk ends at the failure already recorded
+        {
+            // Files before the first failure still run, so the one reported is the
+            // first in tree order whatever order the workers reach them in.
+            std::lock_guard lock(workers->mutex);
+            if (workers->failedAt && *workers->failedAt < order &&
+                !workers->failureIsCancellation) {
+                return;
+            }
         }
         GWErrorPtr error;
         if (isCancelled()) {
@@ -42,10 +49,21 @@ void GWXARExtractOperation::extractFileOnWorker(const GWXARFilePtr& file, const 
         } else if (extractFile(file, url, &error)) {
             return;
         }
+        if (!error) {
+            error = GWCocoaError(GWFileWriteUnknownError, url);
+        }
+        // A stream stopped by another file's failure reports a cancellation; the
+        // failure that caused it is the one to report.
+        const bool cancellation = error->is(kGWCocoaErrorDomain, GWUserCancelledError);
         std::lock_guard lock(workers->mutex);
-        if (!workers->failedAt || order < *workers->failedAt) {
+        const bool replaces =
+            !workers->failedAt ||
+            (cancellation ? workers->failureIsCancellation && order < *workers->failedAt
+                          : workers->failureIsCancellation || order < *workers->failedAt);
+        if (replaces) {
             workers->failedAt = order;
-            workers->failure = error ? error : GWCocoaError(GWFileWriteUnknownError, url);
+            workers->failure = error;
+            workers->failureIsCancellation = cancellation;
         }
         workers->failed.store(true);
     });
