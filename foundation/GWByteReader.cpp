@@ -41,16 +41,6 @@ std::uint64_t GWByteReader::read(std::size_t width, bool bigEndian) {
     return value;
 }
 
-std::span<const std::uint8_t> GWByteReader::bytes(std::size_t count) {
-    if (failed_ || count > remaining()) {
-        fail(offset_, count);
-        return {};
-    }
-    auto piece = bytes_.subspan(offset_, count);
-    offset_ += count;
-    return piece;
-}
-
 std::string GWByteReader::string(std::size_t count) {
     auto piece = bytes(count);
     return std::string(piece.begin(), piece.end());

@@ -78,7 +78,7 @@ std::optional<std::uint64_t> infoNumber(const GWDictionary& info, const char* ke
 }
 
 // The parent path as NSString's stringByDeletingLastPathComponent gives it.
-std::string parentPath(std::string_view path) {
+std::string_view parentPath(std::string_view path) {
     while (path.size() > 1 && path.back() == '/') {
         path.remove_suffix(1);
     }
@@ -86,7 +86,7 @@ std::string parentPath(std::string_view path) {
     if (slash == std::string_view::npos) {
         return {};
     }
-    return std::string(path.substr(0, slash == 0 ? 1 : slash));
+    return path.substr(0, slash == 0 ? 1 : slash);
 }
 
 }  // namespace
@@ -223,8 +223,8 @@ std::optional<std::string> GWZipLoadOperation::filenameFromData(
 
 bool GWZipLoadOperation::addItemFromCentralDirectoryRecord(
     const GWZipCentralDirectoryRecord& record, GWZipReadWindow& file, std::string filename,
-    const std::optional<GWData>& extraFieldData, const std::optional<std::string>& comment,
-    GWZipTreeBuilder& rootItems, GWErrorPtr* error) {
+    std::span<const std::uint8_t> centralNameBytes, const std::optional<GWData>& extraFieldData,
+    const std::optional<std::string>& comment, GWZipTreeBuilder& rootItems, GWErrorPtr* error) {
     GWDictionary extraInfo;
     if (extraFieldData) {
         extraInfo =
@@ -279,8 +279,10 @@ bool GWZipLoadOperation::addItemFromCentralDirectoryRecord(
                                               "cut short by the end of the file",
                                               filename.c_str(), (unsigned long long)headerOffset));
         }
-        if (local.filenameLength) {
-            auto localName = filenameFromData(variable->first(local.filenameLength), record, error);
+        const auto localNameBytes = variable->first(local.filenameLength);
+        // Archivers write the same name twice; decoding it once is enough.
+        if (local.filenameLength && !std::ranges::equal(localNameBytes, centralNameBytes)) {
+            auto localName = filenameFromData(localNameBytes, record, error);
             if (!localName) {
                 return false;
             }
@@ -364,7 +366,7 @@ bool GWZipLoadOperation::addItemWithFilename(
     // Missing directories on the way are made; "." and ".." are resolved.
     // Entries of one directory usually follow each other, so the last
     // parent is reused until a replacement could change what a path finds.
-    std::string directoryPath = parentPath(filename);
+    const std::string_view directoryPath = parentPath(filename);
     GWZipFilePtr parent;
     if (lastParent_ && directoryPath == lastParentPath_) {
         parent = lastParent_;
@@ -372,7 +374,7 @@ bool GWZipLoadOperation::addItemWithFilename(
         parent = rootItems.fileWithPathComponents(
             GWZipFile::standardizedComponentsForPath(directoryPath), true);
         lastParent_ = parent;
-        lastParentPath_ = std::move(directoryPath);
+        lastParentPath_ = directoryPath;
     }
     // "/" is its own last component, as the platform's paths have it.
     std::string name = filename == "/" ? filename : GWZipLastPOSIXPathComponent(filename);

@@ -171,18 +171,22 @@ std::optional<GWZipFileArray> GWZipLoadOperation::loadFilesFromZipArchiveAtHandl
         std::optional<GWData> extraFieldData;
         std::optional<std::string> comment;
         GWErrorPtr recordError;
+        const std::size_t recordStart = pointer;
         if (!readCentralDirRecord(&record, *directory, &pointer, &filename, &extraFieldData,
                                   &comment, &recordError)) {
             GWLog("Couldn't read central directory record!");
             GWFail(error, recordError);
             return std::nullopt;
         }
-        std::string name = filename.value_or(std::string());
+        std::string name = filename ? std::move(*filename) : std::string();
         if (GWZipLastPOSIXPathComponent(name) == "..") {
             continue;
         }
-        if (!addItemFromCentralDirectoryRecord(record, window, std::move(name), extraFieldData,
-                                               comment, tree, error)) {
+        const auto nameBytes =
+            std::span<const std::uint8_t>(*directory)
+                .subspan(recordStart + GWZipCentralDirectoryRecord::kLength, record.filenameLength);
+        if (!addItemFromCentralDirectoryRecord(record, window, std::move(name), nameBytes,
+                                               extraFieldData, comment, tree, error)) {
             return std::nullopt;
         }
     }

@@ -112,8 +112,10 @@ public:
     static std::string convertBackslashesInFilename(std::string filename);
     // Consults the local header where needed, derives mode and date, and adds
     // the entry to the tree.
+    // `filename` was decoded from `centralNameBytes`.
     bool addItemFromCentralDirectoryRecord(const GWZipCentralDirectoryRecord& record,
                                            GWZipReadWindow& file, std::string filename,
+                                           std::span<const std::uint8_t> centralNameBytes,
                                            const std::optional<GWData>& extraFieldData,
                                            const std::optional<std::string>& comment,
                                            GWZipTreeBuilder& rootItems, GWErrorPtr* error);
