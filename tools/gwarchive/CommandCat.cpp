@@ -23,7 +23,7 @@ int runCat(const ParsedArguments& arguments) {
         return kExitFailure;
     }
     std::size_t index = selected->front();
-    if (archive->entries()[index].type == EntryType::directory) {
+    if (archive->entryType(index) == EntryType::directory) {
         reportError(operand, path, GWPOSIXError(EISDIR));
         return kExitFailure;
     }

@@ -38,7 +38,7 @@ int runExtract(const ParsedArguments& arguments) {
     if (wantsProgressBar(arguments)) {
         std::uint64_t total = 0;
         for (std::size_t index : selected)
-            total += archive->entries()[index].size;
+            total += archive->entry(index).size;
         bar = std::make_unique<ProgressBar>(stderr, total);
         options.progress = [&bar](std::uint64_t bytes) {
             bar->advance(bytes);

@@ -18,7 +18,8 @@ int runInfo(const ParsedArguments& arguments) {
     std::uint64_t compressed = 0;
     std::size_t files = 0;
     std::size_t directories = 0;
-    for (const EntryRecord& entry : archive->entries()) {
+    for (std::size_t index = 0; index < archive->entryCount(); ++index) {
+        const EntryRecord entry = archive->entry(index);
         bytes += entry.size;
         compressed += entry.compressedSize;
         if (entry.type == EntryType::directory) {
@@ -31,8 +32,8 @@ int runInfo(const ParsedArguments& arguments) {
     std::printf("format: %s\n", archive->formatName());
     for (const std::string& line : archive->infoLines())
         std::printf("%s\n", line.c_str());
-    std::printf("entries: %zu (%zu directories, %zu others)\n", archive->entries().size(),
-                directories, files);
+    std::printf("entries: %zu (%zu directories, %zu others)\n", archive->entryCount(), directories,
+                files);
     std::printf("bytes: %llu (%llu compressed)\n", static_cast<unsigned long long>(bytes),
                 static_cast<unsigned long long>(compressed));
     return kExitSuccess;

@@ -102,17 +102,23 @@ std::string macNotes(const EntryRecord& entry) {
     return notes.empty() ? notes : notes + "]";
 }
 
-void printEntry(const EntryRecord& entry, bool longFormat) {
-    std::string name = entry.path + (entry.type == EntryType::directory ? "/" : "");
-    if (!longFormat) {
-        std::printf("%s\n", name.c_str());
-        return;
-    }
+std::string displayName(const std::string& path, EntryType type) {
+    return type == EntryType::directory ? path + "/" : path;
+}
+
+void printName(const std::string& path, EntryType type) {
+    std::fwrite(path.data(), 1, path.size(), stdout);
+    if (type == EntryType::directory)
+        std::putchar('/');
+    std::putchar('\n');
+}
+
+void printLongEntry(const EntryRecord& entry) {
     std::string link = entry.linkTarget ? " -> " + *entry.linkTarget : "";
     std::printf("%s %5u/%-5u %12llu %s %s%s%s\n", modeString(entry).c_str(), entry.uid, entry.gid,
                 static_cast<unsigned long long>(entry.size),
-                shortDate(entry.modificationDate).c_str(), name.c_str(), link.c_str(),
-                macNotes(entry).c_str());
+                shortDate(entry.modificationDate).c_str(),
+                displayName(entry.path, entry.type).c_str(), link.c_str(), macNotes(entry).c_str());
 }
 
 int runList(const ParsedArguments& arguments) {
@@ -123,7 +129,12 @@ int runList(const ParsedArguments& arguments) {
     bool allFound = true;
     std::vector<std::string> paths(arguments.operands.begin() + 1, arguments.operands.end());
     std::vector<std::size_t> selected = selectEntries(*archive, operand, paths, &allFound);
-    archive->loadLinkTargets();
+    auto describe = [&](std::size_t index) {
+        EntryRecord entry = archive->entry(index);
+        if (entry.type == EntryType::symlink && !entry.linkTarget)
+            entry.linkTarget = archive->readLinkTarget(index);
+        return entry;
+    };
     if (arguments.has("json")) {
         JsonWriter json;
         json.beginObject();
@@ -133,14 +144,18 @@ int runList(const ParsedArguments& arguments) {
         json.key("entries");
         json.beginArray();
         for (std::size_t index : selected)
-            writeEntry(json, archive->entries()[index]);
+            writeEntry(json, describe(index));
         json.endArray();
         json.endObject();
         std::printf("%s\n", json.text().c_str());
+    } else if (arguments.has("long")) {
+        for (std::size_t index : selected)
+            printLongEntry(describe(index));
     } else {
         for (std::size_t index : selected)
-            printEntry(archive->entries()[index], arguments.has("long"));
+            printName(archive->entryPath(index), archive->entryType(index));
     }
+    keepUntilExit(std::move(archive));
     return allFound ? kExitSuccess : kExitFailure;
 }
 

@@ -18,7 +18,7 @@ int runTest(const ParsedArguments& arguments) {
     for (const EntryProblem& problem : problems) {
         std::printf("%s: %s\n", problem.path.c_str(), problem.message.c_str());
     }
-    std::printf("%s: %zu entries, %zu bad\n", operand.c_str(), archive->entries().size(),
+    std::printf("%s: %zu entries, %zu bad\n", operand.c_str(), archive->entryCount(),
                 problems.size());
     return problems.empty() ? kExitSuccess : kExitFailure;
 }

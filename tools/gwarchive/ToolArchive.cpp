@@ -1,6 +1,7 @@
 #include "ToolArchive.h"
 
 #include <cerrno>
+#include <numeric>
 #include <set>
 
 #include "Diagnostics.h"
@@ -46,12 +47,11 @@ std::unique_ptr<ToolArchive> ToolArchive::open(const GWURL& url, GWErrorPtr* err
 }
 
 std::vector<std::size_t> ToolArchive::subtree(std::size_t index) const {
-    const auto& all = entries();
     std::vector<std::size_t> indexes{index};
     // Depth-first order keeps a subtree contiguous right after its root.
-    std::string prefix = all[index].path + "/";
+    std::string prefix = entryPath(index) + "/";
     for (std::size_t next = index + 1;
-         next < all.size() && all[next].path.compare(0, prefix.size(), prefix) == 0; ++next) {
+         next < entryCount() && entryPath(next).compare(0, prefix.size(), prefix) == 0; ++next) {
         indexes.push_back(next);
     }
     return indexes;
@@ -61,12 +61,17 @@ std::optional<std::vector<std::size_t>> ToolArchive::selectPath(const std::strin
     std::string wanted = path;
     while (wanted.size() > 1 && wanted.back() == '/')
         wanted.pop_back();
-    const auto& all = entries();
-    for (std::size_t index = 0; index < all.size(); ++index) {
-        if (all[index].path == wanted)
+    for (std::size_t index = 0; index < entryCount(); ++index) {
+        if (entryPath(index) == wanted)
             return subtree(index);
     }
     return std::nullopt;
+}
+
+void keepUntilExit(std::unique_ptr<ToolArchive> archive) {
+    // In static storage the archive stays reachable, so leak checkers are quiet.
+    static ToolArchive* kept = nullptr;
+    delete std::exchange(kept, archive.release());
 }
 
 std::unique_ptr<ToolArchive> openArchiveOperand(const std::string& operand) {
@@ -81,9 +86,8 @@ std::vector<std::size_t> selectEntries(const ToolArchive& archive, const std::st
                                        const std::vector<std::string>& paths, bool* allFound) {
     std::vector<std::size_t> selected;
     if (paths.empty()) {
-        for (std::size_t index = 0; index < archive.entries().size(); ++index) {
-            selected.push_back(index);
-        }
+        selected.resize(archive.entryCount());
+        std::iota(selected.begin(), selected.end(), std::size_t(0));
         return selected;
     }
     std::set<std::size_t> seen;

@@ -66,7 +66,7 @@ struct EntryProblem {
 };
 
 // One opened archive of either format, as the subcommands need it. Entries
-// are addressed by their index in entries().
+// are addressed by their index.
 class ToolArchive {
 public:
     virtual ~ToolArchive() = default;
@@ -75,10 +75,15 @@ public:
     static std::unique_ptr<ToolArchive> open(const GWURL& url, GWErrorPtr* error);
 
     virtual const char* formatName() const = 0;
-    // Every entry, depth-first in tree order, parents before children.
-    virtual const std::vector<EntryRecord>& entries() const = 0;
-    // Fills in link targets that only the entries' data can tell.
-    virtual void loadLinkTargets() {}
+    // Entries are numbered depth-first in tree order, parents before children.
+    virtual std::size_t entryCount() const = 0;
+    virtual const std::string& entryPath(std::size_t index) const = 0;
+    virtual EntryType entryType(std::size_t index) const = 0;
+    // Everything else is gathered when asked: listing 200,000 names should
+    // not first build 200,000 full records.
+    virtual EntryRecord entry(std::size_t index) const = 0;
+    // A link target that only the entry's data can tell; none for others.
+    virtual std::optional<std::string> readLinkTarget(std::size_t) { return std::nullopt; }
     // The indexes of `path` and everything below it; none when it is not in the archive.
     std::optional<std::vector<std::size_t>> selectPath(const std::string& path) const;
 
@@ -101,6 +106,10 @@ public:
 protected:
     std::vector<std::size_t> subtree(std::size_t index) const;
 };
+
+// Keeps the archive until the process ends, which is right after a command:
+// freeing a tree of 200,000 entries node by node costs a tenth of a listing.
+void keepUntilExit(std::unique_ptr<ToolArchive> archive);
 
 // Opens an ARCHIVE operand, or says why not on standard error and returns none.
 std::unique_ptr<ToolArchive> openArchiveOperand(const std::string& operand);

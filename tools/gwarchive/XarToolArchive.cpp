@@ -45,7 +45,10 @@ public:
     }
 
     const char* formatName() const override { return "xar"; }
-    const std::vector<EntryRecord>& entries() const override { return records_; }
+    std::size_t entryCount() const override { return records_.size(); }
+    const std::string& entryPath(std::size_t index) const override { return records_[index].path; }
+    EntryType entryType(std::size_t index) const override { return records_[index].type; }
+    EntryRecord entry(std::size_t index) const override { return records_[index]; }
 
     void writeArchiveFields(JsonWriter& json) const override {
         json.key("checksumIsValid");

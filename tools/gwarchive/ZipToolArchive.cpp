@@ -40,14 +40,60 @@ public:
         std::size_t count = 0;
         for (const GWZipFilePtr& file : archive_->files())
             count += countEntries(*file);
-        records_.reserve(count);
+        paths_.reserve(count);
+        types_.reserve(count);
         files_.reserve(count);
         for (const GWZipFilePtr& file : archive_->files())
             add(file, "");
     }
 
     const char* formatName() const override { return "zip"; }
-    const std::vector<EntryRecord>& entries() const override { return records_; }
+    std::size_t entryCount() const override { return files_.size(); }
+    const std::string& entryPath(std::size_t index) const override { return paths_[index]; }
+    EntryType entryType(std::size_t index) const override { return types_[index]; }
+
+    EntryRecord entry(std::size_t index) const override {
+        const GWZipFile& file = *files_[index];
+        EntryRecord record;
+        record.path = paths_[index];
+        record.mode = file.permissionsMode();
+        record.type = types_[index];
+        record.size = file.storedUncompressedSize();
+        record.compressedSize = file.compressedSize();
+        record.modificationDate = file.modificationDate();
+        record.uid = file.owner();
+        record.gid = file.groupOwner();
+        record.linkTarget = file.symlinkDestination();
+        if (file.typeCode() != 0)
+            record.typeCode = file.type();
+        if (file.creatorCode() != 0)
+            record.creatorCode = file.creator();
+        if (file.resourceFork())
+            record.resourceForkSize = file.resourceFork()->storedUncompressedSize();
+        record.appleDouble = file.appleDoubleFile() != nullptr;
+        record.macBinary = file.isMacBinaryEncoded();
+        if (!file.isDirectory())
+            record.compression = compressionName(file.compressionMethod());
+        return record;
+    }
+
+    // A ZIP link's text is its data.
+    std::optional<std::string> readLinkTarget(std::size_t index) override {
+        if (types_[index] != EntryType::symlink)
+            return std::nullopt;
+        std::string text;
+        GWErrorPtr ignored;
+        bool read = streamFile(
+            files_[index],
+            [&](const std::uint8_t* bytes, std::size_t length) {
+                text.append(reinterpret_cast<const char*>(bytes), length);
+                return text.size() <= 4096;
+            },
+            &ignored, nullptr);
+        if (!read)
+            return std::nullopt;
+        return text;
+    }
 
     void writeArchiveFields(JsonWriter& json) const override {
         json.key("startOffset");
@@ -69,14 +115,12 @@ public:
             const GWZipFilePtr& file = files_[index];
             if (file->isDirectory())
                 continue;
-            checkFile(file, records_[index].path, problems);
+            checkFile(file, paths_[index], problems);
             if (file->resourceFork()) {
-                checkFile(file->resourceFork(), records_[index].path + " (resource fork)",
-                          problems);
+                checkFile(file->resourceFork(), paths_[index] + " (resource fork)", problems);
             }
             if (file->appleDoubleFile()) {
-                checkFile(file->appleDoubleFile(), records_[index].path + " (AppleDouble)",
-                          problems);
+                checkFile(file->appleDoubleFile(), paths_[index] + " (AppleDouble)", problems);
             }
         }
         return problems;
@@ -98,63 +142,19 @@ private:
     // Paths grow from the parent's, as GWZipFile::path() joins them, without
     // climbing to the root for each of many thousand entries.
     void add(const GWZipFilePtr& file, const std::string& parentPath) {
-        EntryRecord record;
-        std::string name = file->name();
-        record.path = parentPath;
-        if (!record.path.empty() && record.path.back() != '/' && !name.empty())
-            record.path += '/';
-        record.path += name;
-        record.mode = file->permissionsMode();
-        record.type = entryTypeFromMode(record.mode);
-        record.size = file->storedUncompressedSize();
-        record.compressedSize = file->compressedSize();
-        record.modificationDate = file->modificationDate();
-        record.uid = file->owner();
-        record.gid = file->groupOwner();
-        record.linkTarget = file->symlinkDestination();
-        if (file->typeCode() != 0)
-            record.typeCode = file->type();
-        if (file->creatorCode() != 0)
-            record.creatorCode = file->creator();
-        if (file->resourceFork())
-            record.resourceForkSize = file->resourceFork()->storedUncompressedSize();
-        record.appleDouble = file->appleDoubleFile() != nullptr;
-        record.macBinary = file->isMacBinaryEncoded();
-        if (!file->isDirectory())
-            record.compression = compressionName(file->compressionMethod());
-        records_.push_back(std::move(record));
+        std::string path = parentPath;
+        const std::string name = file->name();
+        if (!path.empty() && path.back() != '/' && !name.empty())
+            path += '/';
+        path += name;
+        paths_.push_back(std::move(path));
+        types_.push_back(entryTypeFromMode(file->permissionsMode()));
         files_.push_back(file);
         if (auto children = file->children()) {
-            const std::string path = records_.back().path;
+            const std::string parent = paths_.back();
             for (const GWZipFilePtr& child : *children)
-                add(child, path);
+                add(child, parent);
         }
-    }
-
-    // A ZIP link's text is its data: read only when a listing shows it, not
-    // on every open.
-    void loadLinkTargets() override {
-        for (std::size_t index = 0; index < records_.size(); ++index) {
-            EntryRecord& record = records_[index];
-            if (record.type == EntryType::symlink && !record.linkTarget) {
-                record.linkTarget = readLinkText(files_[index]);
-            }
-        }
-    }
-
-    std::optional<std::string> readLinkText(const GWZipFilePtr& file) {
-        std::string text;
-        GWErrorPtr ignored;
-        bool read = streamFile(
-            file,
-            [&](const std::uint8_t* bytes, std::size_t length) {
-                text.append(reinterpret_cast<const char*>(bytes), length);
-                return text.size() <= 4096;
-            },
-            &ignored, nullptr);
-        if (!read)
-            return std::nullopt;
-        return text;
     }
 
     // The library leaves checking to the caller: CRC-32 and size are checked
@@ -212,29 +212,29 @@ private:
     }
 
     // Makes room for an entry at `url`: fails for an existing item unless overwriting.
-    bool prepare(const GWURL& url, const EntryRecord& record, const ExtractOptions& options,
-                 const std::string& archiveName) {
+    bool prepare(const GWURL& url, const std::string& path, EntryType type,
+                 const ExtractOptions& options, const std::string& archiveName) {
         std::error_code ignored;
         auto status = std::filesystem::symlink_status(url.path(), ignored);
         if (std::filesystem::exists(status)) {
-            if (record.type == EntryType::directory && std::filesystem::is_directory(status)) {
+            if (type == EntryType::directory && std::filesystem::is_directory(status)) {
                 return true;  // merged into
             }
             if (!options.overwrite) {
-                reportError(archiveName, record.path, GWPOSIXError(EEXIST, url));
+                reportError(archiveName, path, GWPOSIXError(EEXIST, url));
                 return false;
             }
             std::filesystem::remove_all(url.path(), ignored);
         }
-        std::filesystem::create_directories(record.type == EntryType::directory
-                                                ? url.path()
-                                                : url.URLByDeletingLastPathComponent().path(),
-                                            ignored);
+        std::filesystem::create_directories(
+            type == EntryType::directory ? url.path() : url.URLByDeletingLastPathComponent().path(),
+            ignored);
         return true;
     }
 
     GWZipArchivePtr archive_;
-    std::vector<EntryRecord> records_;
+    std::vector<std::string> paths_;
+    std::vector<EntryType> types_;
     std::vector<GWZipFilePtr> files_;
 };
 
@@ -246,21 +246,22 @@ bool ZipToolArchive::extract(const std::vector<std::size_t>& indexes, const Extr
     std::atomic<bool> allGood{true};
     std::vector<std::pair<GWZipFilePtr, GWURL>> directories;
     for (std::size_t index : indexes) {
-        const EntryRecord& record = records_[index];
-        GWURL url = options.directory.URLByAppendingPathComponent(record.path);
+        const std::string& path = paths_[index];
+        const EntryType type = types_[index];
+        GWURL url = options.directory.URLByAppendingPathComponent(path);
         // Checked before anything is made for the entry, and again by its
         // operation, when links extracted meanwhile are on disk.
         if (auto refusal = GWZipExtractOperation::containmentErrorForFile(files_[index],
                                                                           options.directory, url)) {
-            reportError(archiveName, record.path, refusal);
+            reportError(archiveName, path, refusal);
             allGood = false;
             continue;
         }
-        if (!prepare(url, record, options, archiveName)) {
+        if (!prepare(url, path, type, options, archiveName)) {
             allGood = false;
             continue;
         }
-        if (record.type == EntryType::directory) {
+        if (type == EntryType::directory) {
             directories.emplace_back(files_[index], url);
             continue;
         }
@@ -273,13 +274,12 @@ bool ZipToolArchive::extract(const std::vector<std::size_t>& indexes, const Extr
         auto operation = GWZipExtractOperation::initForExtractingFile(
             files_[index], archive_, temporary, false, options.progress, &error);
         if (!operation) {
-            reportError(archiveName, record.path, error);
+            reportError(archiveName, path, error);
             allGood = false;
             continue;
         }
         operation->setContainmentRoot(options.directory);
         std::weak_ptr<GWZipExtractOperation> weak = operation;
-        std::string path = record.path;
         operation->setCompletionBlock([weak, path, temporary, url, archiveName, &allGood] {
             auto finished = weak.lock();
             GWErrorPtr failure = finished ? finished->error() : nullptr;
