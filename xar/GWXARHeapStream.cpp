@@ -13,6 +13,15 @@ bool digestsMatch(const std::optional<GWData>& computed, const std::optional<GWD
     return computed && stored && *computed == *stored;
 }
 
+// A few hundred bytes of bzip2 can decode to tens of megabytes; a stream is
+// never allowed to grow past the size its table of contents states.
+GWErrorPtr oversizedStreamError(std::uint64_t statedSize, const GWURL& url) {
+    return GWGenerateError(kGWCocoaErrorDomain, GWFileReadCorruptFileError, url, nullptr, {},
+                           "An item of %s decodes to more than the %llu bytes its table of "
+                           "contents states.",
+                           url.path().c_str(), (unsigned long long)statedSize);
+}
+
 GWErrorPtr unsupportedCompressionError(std::uint64_t type, const GWURL& url) {
     const std::string entity =
         type == GWXARCompressionTypeLZMA ? std::string("LZMA") : std::to_string(type);
@@ -74,6 +83,7 @@ void GWXARHeapStream::streamDataReference(const GWXARDataReference& reference,
 
     context.setCancelled(false);
     bool checksumFailed = false;
+    std::uint64_t decodedLength = 0;
     bool handleClosed = false;
     auto closeHandle = [&] {
         if (!handleClosed) {
@@ -86,7 +96,11 @@ void GWXARHeapStream::streamDataReference(const GWXARDataReference& reference,
         int(reference.compressedChecksumType()), int(reference.uncompressedChecksumType()),
         [&](std::span<const std::uint8_t> piece, std::uint64_t, std::uint64_t, bool done,
             const std::optional<GWData>& storedDigest, const std::optional<GWData>& decodedDigest,
-            const GWErrorPtr& error) {
+            GWErrorPtr error) {
+            decodedLength += piece.size();
+            if (!error && decodedLength > reference.uncompressedSize()) {
+                error = oversizedStreamError(reference.uncompressedSize(), url);
+            }
             if (done || error || context.isCancelled()) {
                 closeHandle();
             }
