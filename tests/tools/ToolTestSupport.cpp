@@ -1,9 +1,10 @@
 #include "ToolTestSupport.h"
 
 #include <fcntl.h>
-#include <sys/resource.h>
 #include <sys/wait.h>
 #include <unistd.h>
+
+#include <cstdlib>
 
 namespace gwtest {
 
@@ -22,7 +23,11 @@ ToolRun runTool(const std::string& arguments) {
 MeasuredToolRun runToolMeasured(const std::vector<std::string>& arguments) {
     TemporaryDirectory directory;
     const std::string errorPath = directory.file("stderr");
-    std::vector<std::string> words{GW_TOOL_PATH};
+    const std::string residentPath = directory.file("resident");
+    // A child forked from this test process starts with its resident pages,
+    // and exec keeps that high-water mark: /usr/bin/time, small itself,
+    // reports the tool's own.
+    std::vector<std::string> words{"/usr/bin/time", "-f", "%M", "-o", residentPath, GW_TOOL_PATH};
     words.insert(words.end(), arguments.begin(), arguments.end());
     std::vector<char*> argv;
     for (auto& word : words)
@@ -42,10 +47,14 @@ MeasuredToolRun runToolMeasured(const std::vector<std::string>& arguments) {
     if (child < 0)
         return run;
     int status = 0;
-    struct rusage usage {};
-    if (wait4(child, &status, 0, &usage) == child && WIFEXITED(status))
+    if (waitpid(child, &status, 0) == child && WIFEXITED(status))
         run.status = WEXITSTATUS(status);
-    run.maxResidentKiB = usage.ru_maxrss;
+    // The figure is the last line; a failing tool adds one about its status before it.
+    const GWData resident = readFile(residentPath);
+    std::string text(resident.begin(), resident.end());
+    while (!text.empty() && text.back() == '\n')
+        text.pop_back();
+    run.maxResidentKiB = std::atol(text.substr(text.rfind('\n') + 1).c_str());
     const GWData error = readFile(errorPath);
     run.err.assign(error.begin(), error.end());
     return run;
