@@ -22,50 +22,118 @@ GWZipFilePtr GWZipEntryList::append(const GWZipFilePtr& file) {
     const std::size_t position = items_.size();
     items_.push_back(file);
     ++count_;
-    auto previous = index(file->name(), position);
+    auto previous = index(file->name_, position);
     return previous ? items_[*previous] : nullptr;
 }
 
+std::string_view GWZipEntryList::nameAt(std::size_t position) const {
+    // Lists live while a tree is built, on one thread: no rename races this.
+    return items_[position]->name_;
+}
+
+std::size_t GWZipEntryList::findSlot(std::string_view name, std::size_t hash) const {
+    if (slots_.empty()) {
+        return kNoPosition;
+    }
+    const std::size_t mask = slots_.size() - 1;
+    for (std::size_t slot = hash & mask;; slot = (slot + 1) & mask) {
+        const Slot& candidate = slots_[slot];
+        if (candidate.position == kNoPosition) {
+            return kNoPosition;
+        }
+        if (candidate.hash == hash && nameAt(candidate.position) == name) {
+            return slot;
+        }
+    }
+}
+
+void GWZipEntryList::insertSlot(Slot slot) {
+    if ((usedSlots_ + 1) * 2 > slots_.size()) {
+        growSlots();
+    }
+    const std::size_t mask = slots_.size() - 1;
+    std::size_t at = slot.hash & mask;
+    while (slots_[at].position != kNoPosition) {
+        at = (at + 1) & mask;
+    }
+    slots_[at] = slot;
+    ++usedSlots_;
+}
+
+void GWZipEntryList::growSlots() {
+    std::vector<Slot> old = std::move(slots_);
+    slots_.assign(old.empty() ? 16 : old.size() * 2, Slot());
+    usedSlots_ = 0;
+    for (const Slot& slot : old) {
+        if (slot.position != kNoPosition) {
+            insertSlot(slot);
+        }
+    }
+}
+
+void GWZipEntryList::eraseSlot(std::size_t slot) {
+    // Backward shift: later members of the probe run move up so that no
+    // lookup stops early at the hole.
+    const std::size_t mask = slots_.size() - 1;
+    std::size_t hole = slot;
+    for (std::size_t next = (hole + 1) & mask; slots_[next].position != kNoPosition;
+         next = (next + 1) & mask) {
+        const std::size_t home = slots_[next].hash & mask;
+        const bool reachable =
+            hole <= next ? (home <= hole || home > next) : (home <= hole && home > next);
+        if (reachable) {
+            slots_[hole] = slots_[next];
+            hole = next;
+        }
+    }
+    slots_[hole] = Slot();
+    --usedSlots_;
+}
+
 std::optional<std::size_t> GWZipEntryList::index(const std::string& name, std::size_t position) {
-    auto [found, inserted] = positions_.try_emplace(name);
-    Positions& positions = found->second;
-    if (inserted) {
-        positions.first = position;
+    const std::size_t hash = hashOf(name);
+    const std::size_t slot = findSlot(name, hash);
+    if (slot == kNoPosition) {
+        insertSlot({hash, position});
         return std::nullopt;
     }
-    const std::size_t previousFirst = positions.first;
-    if (position < positions.first) {
-        std::swap(position, positions.first);
+    const std::size_t previousFirst = slots_[slot].position;
+    if (position < previousFirst) {
+        slots_[slot].position = position;
+        position = previousFirst;
     }
-    positions.more.insert(std::lower_bound(positions.more.begin(), positions.more.end(), position),
-                          position);
+    auto& later = laterPositions_[name];
+    later.insert(std::lower_bound(later.begin(), later.end(), position), position);
     return previousFirst;
 }
 
 void GWZipEntryList::unindex(const std::string& name, std::size_t position) {
-    auto found = positions_.find(name);
-    if (found == positions_.end()) {
+    const std::size_t slot = findSlot(name, hashOf(name));
+    if (slot == kNoPosition) {
         return;
     }
-    Positions& positions = found->second;
-    if (positions.first == position) {
-        if (positions.more.empty()) {
-            positions_.erase(found);
+    auto later = laterPositions_.find(name);
+    if (slots_[slot].position == position) {
+        if (later == laterPositions_.end()) {
+            eraseSlot(slot);
             return;
         }
-        positions.first = positions.more.front();
-        positions.more.erase(positions.more.begin());
-        return;
+        slots_[slot].position = later->second.front();
+        later->second.erase(later->second.begin());
+    } else if (later != laterPositions_.end()) {
+        auto at = std::lower_bound(later->second.begin(), later->second.end(), position);
+        if (at != later->second.end() && *at == position) {
+            later->second.erase(at);
+        }
     }
-    auto at = std::lower_bound(positions.more.begin(), positions.more.end(), position);
-    if (at != positions.more.end() && *at == position) {
-        positions.more.erase(at);
+    if (later != laterPositions_.end() && later->second.empty()) {
+        laterPositions_.erase(later);
     }
 }
 
 GWZipFilePtr GWZipEntryList::firstNamed(std::string_view name) const {
-    auto found = positions_.find(name);
-    return found == positions_.end() ? nullptr : items_[found->second.first];
+    const std::size_t slot = findSlot(name, hashOf(name));
+    return slot == kNoPosition ? nullptr : items_[slots_[slot].position];
 }
 
 std::optional<std::size_t> GWZipEntryList::positionOf(const GWZipFile* file) const {
@@ -91,7 +159,7 @@ bool GWZipEntryList::remove(const GWZipFilePtr& file) {
         return false;
     }
     positionOfFile_.erase(file.get());
-    unindex(file->name(), *position);
+    unindex(file->name_, *position);
     items_[*position] = nullptr;
     --count_;
     return true;
@@ -100,11 +168,11 @@ bool GWZipEntryList::remove(const GWZipFilePtr& file) {
 void GWZipEntryList::rename(const GWZipFilePtr& file, std::string name) {
     auto position = positionOf(file.get());
     if (position) {
-        unindex(file->name(), *position);
+        unindex(file->name_, *position);
     }
     file->setName(std::move(name));
     if (position) {
-        index(file->name(), *position);
+        index(file->name_, *position);
     }
 }
 
@@ -116,5 +184,11 @@ GWZipFileArray GWZipEntryList::entries() const {
             live.push_back(item);
         }
     }
+    return live;
+}
+
+GWZipFileArray GWZipEntryList::takeEntries() {
+    GWZipFileArray live = count_ == items_.size() ? std::move(items_) : entries();
+    *this = GWZipEntryList();
     return live;
 }

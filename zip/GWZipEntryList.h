@@ -1,6 +1,7 @@
 #pragma once
 
 #include <cstddef>
+#include <cstdint>
 #include <functional>
 #include <optional>
 #include <string>
@@ -32,28 +33,38 @@ public:
 
     // The entries in order.
     GWZipFileArray entries() const;
+    // The entries in order, leaving the list empty; no copy when nothing
+    // was removed.
+    GWZipFileArray takeEntries();
     bool empty() const { return count_ == 0; }
 
 private:
-    struct NameHash {
-        using is_transparent = void;
-        std::size_t operator()(std::string_view name) const {
-            return std::hash<std::string_view>()(name);
-        }
+    static constexpr std::size_t kNoPosition = SIZE_MAX;
+    // Open addressing with linear probing: a slot holds a name's hash and
+    // the position of its first entry; the name itself is read from that
+    // entry, so an index of 200,000 names costs no allocation per name.
+    struct Slot {
+        std::size_t hash = 0;
+        std::size_t position = kNoPosition;
     };
-    // Positions of one name, ascending. Duplicate names are rare, so the
-    // first position needs no allocation of its own.
-    struct Positions {
-        std::size_t first = 0;
-        std::vector<std::size_t> more;
-    };
+
+    static std::size_t hashOf(std::string_view name) { return std::hash<std::string_view>()(name); }
+    std::string_view nameAt(std::size_t position) const;
+    // The slot of that name, or kNoPosition.
+    std::size_t findSlot(std::string_view name, std::size_t hash) const;
+    void insertSlot(Slot slot);
+    void eraseSlot(std::size_t slot);
+    void growSlots();
 
     // The name's first position before this one was added, if any.
     std::optional<std::size_t> index(const std::string& name, std::size_t position);
     void unindex(const std::string& name, std::size_t position);
 
     GWZipFileArray items_;  // null where an entry was removed
-    std::unordered_map<std::string, Positions, NameHash, std::equal_to<>> positions_;
+    std::vector<Slot> slots_;
+    std::size_t usedSlots_ = 0;
+    // Positions of a name after its first, ascending; duplicates are rare.
+    std::unordered_map<std::string, std::vector<std::size_t>> laterPositions_;
     // Built on the first removal or rename: most lists never need it.
     mutable std::unordered_map<const GWZipFile*, std::size_t> positionOfFile_;
     mutable bool positionOfFileBuilt_ = false;

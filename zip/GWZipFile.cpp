@@ -65,17 +65,21 @@ GWZipFilePtr GWZipFile::initWithName(
     file->parent_ = parent;
     file->compressedSize_ = compressedSize;
     file->uncompressedSize_ = uncompressedSize;
-    file->checksum_ = std::move(checksum);
+    file->checksum_.set(std::move(checksum));
     file->checksumAlgorithm_ = checksumAlgorithm;
     file->owner_ = owner;
     file->groupOwner_ = groupOwner;
     file->permissionsMode_ = permissionsMode;
     file->modificationDate_ = modificationDate;
-    file->symlinkDestination_ = std::move(symlinkDestination);
+    if (symlinkDestination) {
+        file->symlinkDestination_ = std::make_unique<std::string>(std::move(*symlinkDestination));
+    }
     file->localHeaderOffset_ = localHeaderOffset;
     file->generalPurposeFlags_ = generalPurposeFlags;
     file->compressionMethod_ = compressionMethod;
-    file->extraInfo_ = std::move(extraInfo);
+    if (!extraInfo.empty()) {
+        file->extraInfo_ = std::make_unique<GWDictionary>(std::move(extraInfo));
+    }
     return file;
 }
 
@@ -90,8 +94,10 @@ GWZipFile::~GWZipFile() {
             }
         }
         node.children_.reset();
-        pending.push_back(std::move(node.resourceFork_));
-        pending.push_back(std::move(node.appleDoubleFile_));
+        if (node.companions_) {
+            pending.push_back(std::move(node.companions_->resourceFork));
+            pending.push_back(std::move(node.companions_->appleDoubleFile));
+        }
     };
     detach(*this);
     while (!pending.empty()) {
@@ -103,25 +109,93 @@ GWZipFile::~GWZipFile() {
     }
 }
 
+// --- Storage -----------------------------------------------------------------
+
+std::mutex& GWZipFile::stateMutex() const {
+    static std::mutex stripes[64];
+    return stripes[(reinterpret_cast<std::uintptr_t>(this) / alignof(GWZipFile)) % 64];
+}
+
+const GWDictionary& GWZipFile::storedExtraInfo() const {
+    static const GWDictionary kEmpty;
+    return extraInfo_ ? *extraInfo_ : kEmpty;
+}
+
+std::optional<GWData> GWZipFile::Checksum::get() const {
+    if (!present_) {
+        return std::nullopt;
+    }
+    if (longBytes_) {
+        return *longBytes_;
+    }
+    return GWData(inlineBytes_, inlineBytes_ + inlineLength_);
+}
+
+void GWZipFile::Checksum::set(std::optional<GWData> value) {
+    present_ = value.has_value();
+    longBytes_.reset();
+    inlineLength_ = 0;
+    if (!value) {
+        return;
+    }
+    if (value->size() > kInlineCapacity) {
+        longBytes_ = std::make_unique<GWData>(std::move(*value));
+        return;
+    }
+    std::copy(value->begin(), value->end(), inlineBytes_);
+    inlineLength_ = std::uint8_t(value->size());
+}
+
+GWZipFile::Companions& GWZipFile::companions() {
+    if (!companions_) {
+        companions_ = std::make_unique<Companions>();
+    }
+    return *companions_;
+}
+
+namespace {
+const GWZipFilePtr kNoFile;
+}
+
+const GWZipFilePtr& GWZipFile::resourceFork() const {
+    return companions_ ? companions_->resourceFork : kNoFile;
+}
+
+void GWZipFile::setResourceFork(GWZipFilePtr file) {
+    if (file || companions_) {
+        companions().resourceFork = std::move(file);
+    }
+}
+
+const GWZipFilePtr& GWZipFile::appleDoubleFile() const {
+    return companions_ ? companions_->appleDoubleFile : kNoFile;
+}
+
+void GWZipFile::setAppleDoubleFile(GWZipFilePtr file) {
+    if (file || companions_) {
+        companions().appleDoubleFile = std::move(file);
+    }
+}
+
 // --- Fields under the state lock ----------------------------------------------
 
 std::uint64_t GWZipFile::storedUncompressedSize() const {
-    std::lock_guard lock(stateMutex_);
+    std::lock_guard lock(stateMutex());
     return uncompressedSize_;
 }
 
 void GWZipFile::setUncompressedSize(std::uint64_t size) {
-    std::lock_guard lock(stateMutex_);
+    std::lock_guard lock(stateMutex());
     uncompressedSize_ = size;
 }
 
 std::string GWZipFile::name() const {
-    std::lock_guard lock(stateMutex_);
+    std::lock_guard lock(stateMutex());
     return name_;
 }
 
 void GWZipFile::setName(std::string name) {
-    std::lock_guard lock(stateMutex_);
+    std::lock_guard lock(stateMutex());
     if (name != name_) {
         name_ = std::move(name);
         gRenameEpoch.fetch_add(1, std::memory_order_relaxed);
@@ -129,58 +203,68 @@ void GWZipFile::setName(std::string name) {
 }
 
 std::uint64_t GWZipFile::compressedSize() const {
-    std::lock_guard lock(stateMutex_);
+    std::lock_guard lock(stateMutex());
     return compressedSize_;
 }
 
 void GWZipFile::setCompressedSize(std::uint64_t size) {
-    std::lock_guard lock(stateMutex_);
+    std::lock_guard lock(stateMutex());
     compressedSize_ = size;
 }
 
 std::optional<std::string> GWZipFile::symlinkDestination() const {
-    std::lock_guard lock(stateMutex_);
-    return symlinkDestination_;
+    std::lock_guard lock(stateMutex());
+    if (!symlinkDestination_) {
+        return std::nullopt;
+    }
+    return *symlinkDestination_;
 }
 
 void GWZipFile::setSymlinkDestination(std::optional<std::string> destination) {
-    std::lock_guard lock(stateMutex_);
-    symlinkDestination_ = std::move(destination);
+    auto stored = destination ? std::make_unique<std::string>(std::move(*destination)) : nullptr;
+    std::lock_guard lock(stateMutex());
+    symlinkDestination_.swap(stored);
 }
 
 std::optional<GWData> GWZipFile::privateUncompressedChecksum() const {
-    std::lock_guard lock(stateMutex_);
-    return checksum_;
+    std::lock_guard lock(stateMutex());
+    return checksum_.get();
 }
 
 void GWZipFile::setPrivateUncompressedChecksum(std::optional<GWData> checksum) {
-    std::lock_guard lock(stateMutex_);
-    checksum_ = std::move(checksum);
+    std::lock_guard lock(stateMutex());
+    checksum_.set(std::move(checksum));
 }
 
 std::uint64_t GWZipFile::privateUncompressedChecksumAlgorithm() const {
-    std::lock_guard lock(stateMutex_);
+    std::lock_guard lock(stateMutex());
     return checksumAlgorithm_;
 }
 
 void GWZipFile::setPrivateUncompressedChecksumAlgorithm(std::uint64_t algorithm) {
-    std::lock_guard lock(stateMutex_);
+    std::lock_guard lock(stateMutex());
     checksumAlgorithm_ = algorithm;
 }
 
 GWDictionary GWZipFile::extraInfo() const {
-    std::lock_guard lock(stateMutex_);
-    return extraInfo_;
+    std::lock_guard lock(stateMutex());
+    return storedExtraInfo();
 }
 
 void GWZipFile::setExtraInfo(GWDictionary extraInfo) {
     auto filename = filenameFromExtraInfo(extraInfo);
-    std::lock_guard lock(stateMutex_);
+    std::lock_guard lock(stateMutex());
     if (filename && *filename != name_) {
         name_ = std::move(*filename);
         gRenameEpoch.fetch_add(1, std::memory_order_relaxed);
     }
-    extraInfo_ = std::move(extraInfo);
+    if (extraInfo.empty()) {
+        extraInfo_.reset();
+    } else if (extraInfo_) {
+        *extraInfo_ = std::move(extraInfo);
+    } else {
+        extraInfo_ = std::make_unique<GWDictionary>(std::move(extraInfo));
+    }
 }
 
 std::optional<std::string> GWZipFile::filenameFromExtraInfo(const GWDictionary& extraInfo) const {
@@ -305,29 +389,29 @@ std::string GWZipFile::path() const {
 
 std::uint64_t GWZipFile::uncompressedSize() const {
     std::uint64_t total = storedUncompressedSize();
-    std::vector<const GWZipFile*> pending{resourceFork_.get(), appleDoubleFile_.get()};
+    std::vector<const GWZipFile*> pending{resourceFork().get(), appleDoubleFile().get()};
     while (!pending.empty()) {
         const GWZipFile* companion = pending.back();
         pending.pop_back();
         if (companion) {
             total += companion->storedUncompressedSize();
-            pending.push_back(companion->resourceFork_.get());
-            pending.push_back(companion->appleDoubleFile_.get());
+            pending.push_back(companion->resourceFork().get());
+            pending.push_back(companion->appleDoubleFile().get());
         }
     }
     return total;
 }
 
 std::optional<std::string> GWZipFile::type() const {
-    std::lock_guard lock(stateMutex_);
+    std::lock_guard lock(stateMutex());
     return isDirectory() ? std::optional<std::string>("fold")
-                         : stringInfo(extraInfo_, kGWZipTypeCodeKey);
+                         : stringInfo(storedExtraInfo(), kGWZipTypeCodeKey);
 }
 
 std::optional<std::string> GWZipFile::creator() const {
-    std::lock_guard lock(stateMutex_);
+    std::lock_guard lock(stateMutex());
     return isDirectory() ? std::optional<std::string>("MACS")
-                         : stringInfo(extraInfo_, kGWZipCreatorCodeKey);
+                         : stringInfo(storedExtraInfo(), kGWZipCreatorCodeKey);
 }
 
 std::uint32_t GWZipFile::typeCode() const {
@@ -341,87 +425,87 @@ std::uint32_t GWZipFile::creatorCode() const {
 }
 
 std::int16_t GWZipFile::iconLocationV() const {
-    std::lock_guard lock(stateMutex_);
-    return std::int16_t(numberInfo(extraInfo_, kGWZipVerticalIconLocationKey));
+    std::lock_guard lock(stateMutex());
+    return std::int16_t(numberInfo(storedExtraInfo(), kGWZipVerticalIconLocationKey));
 }
 
 std::int16_t GWZipFile::iconLocationH() const {
-    std::lock_guard lock(stateMutex_);
-    return std::int16_t(numberInfo(extraInfo_, kGWZipHorizontalIconLocationKey));
+    std::lock_guard lock(stateMutex());
+    return std::int16_t(numberInfo(storedExtraInfo(), kGWZipHorizontalIconLocationKey));
 }
 
 std::optional<GWDate> GWZipFile::creationDate() const {
-    std::lock_guard lock(stateMutex_);
-    return preferredDate(extraInfo_, kGWZipUTCCreationDateKey, kGWZipCreationDateKey);
+    std::lock_guard lock(stateMutex());
+    return preferredDate(storedExtraInfo(), kGWZipUTCCreationDateKey, kGWZipCreationDateKey);
 }
 
 std::optional<GWDate> GWZipFile::modificationDate() const {
-    std::lock_guard lock(stateMutex_);
-    if (auto date =
-            preferredDate(extraInfo_, kGWZipUTCModificationDateKey, kGWZipModificationDateKey)) {
+    std::lock_guard lock(stateMutex());
+    if (auto date = preferredDate(storedExtraInfo(), kGWZipUTCModificationDateKey,
+                                  kGWZipModificationDateKey)) {
         return date;
     }
     return modificationDate_;
 }
 
 std::optional<GWDate> GWZipFile::backupDate() const {
-    std::lock_guard lock(stateMutex_);
-    return preferredDate(extraInfo_, kGWZipUTCBackupDateKey, kGWZipBackupDateKey);
+    std::lock_guard lock(stateMutex());
+    return preferredDate(storedExtraInfo(), kGWZipUTCBackupDateKey, kGWZipBackupDateKey);
 }
 
 std::optional<GWDate> GWZipFile::accessDate() const {
-    std::lock_guard lock(stateMutex_);
-    return preferredDate(extraInfo_, kGWZipUTCAccessDateKey, kGWZipAccessDateKey);
+    std::lock_guard lock(stateMutex());
+    return preferredDate(storedExtraInfo(), kGWZipUTCAccessDateKey, kGWZipAccessDateKey);
 }
 
 std::uint16_t GWZipFile::finderFlags() const {
-    std::lock_guard lock(stateMutex_);
-    return std::uint16_t(numberInfo(extraInfo_, kGWZipFinderFlagsKey));
+    std::lock_guard lock(stateMutex());
+    return std::uint16_t(numberInfo(storedExtraInfo(), kGWZipFinderFlagsKey));
 }
 
 std::uint16_t GWZipFile::extendedFinderFlags() const {
-    std::lock_guard lock(stateMutex_);
-    return std::uint16_t(numberInfo(extraInfo_, kGWZipExtendedFinderFlagsKey));
+    std::lock_guard lock(stateMutex());
+    return std::uint16_t(numberInfo(storedExtraInfo(), kGWZipExtendedFinderFlagsKey));
 }
 
 std::uint8_t GWZipFile::versionNumber() const {
-    std::lock_guard lock(stateMutex_);
-    return std::uint8_t(numberInfo(extraInfo_, kGWZipVersionNumberKey));
+    std::lock_guard lock(stateMutex());
+    return std::uint8_t(numberInfo(storedExtraInfo(), kGWZipVersionNumberKey));
 }
 
 std::uint8_t GWZipFile::accessRights() const {
-    std::lock_guard lock(stateMutex_);
-    return std::uint8_t(numberInfo(extraInfo_, kGWZipAccessRightsKey));
+    std::lock_guard lock(stateMutex());
+    return std::uint8_t(numberInfo(storedExtraInfo(), kGWZipAccessRightsKey));
 }
 
 std::uint16_t GWZipFile::putAwayFolderID() const {
-    std::lock_guard lock(stateMutex_);
-    return std::uint16_t(numberInfo(extraInfo_, kGWZipPutAwayFolderKey));
+    std::lock_guard lock(stateMutex());
+    return std::uint16_t(numberInfo(storedExtraInfo(), kGWZipPutAwayFolderKey));
 }
 
 std::optional<std::string> GWZipFile::comment() const {
-    std::lock_guard lock(stateMutex_);
-    return stringInfo(extraInfo_, kGWZipCommentKey);
+    std::lock_guard lock(stateMutex());
+    return stringInfo(storedExtraInfo(), kGWZipCommentKey);
 }
 
 bool GWZipFile::isMacBinaryEncoded() const {
-    std::lock_guard lock(stateMutex_);
-    return !isDirectory() && boolInfo(extraInfo_, kGWZipIsMacBinaryEncodedKey);
+    std::lock_guard lock(stateMutex());
+    return !isDirectory() && boolInfo(storedExtraInfo(), kGWZipIsMacBinaryEncodedKey);
 }
 
 bool GWZipFile::moreInfoAvailableInLocalHeader() const {
-    std::lock_guard lock(stateMutex_);
-    return boolInfo(extraInfo_, kGWZipMoreInfoAvailableInLocalHeaderKey);
+    std::lock_guard lock(stateMutex());
+    return boolInfo(storedExtraInfo(), kGWZipMoreInfoAvailableInLocalHeaderKey);
 }
 
 std::optional<GWData> GWZipFile::uncompressedChecksum() const {
     const bool macBinary = isMacBinaryEncoded();
-    std::lock_guard lock(stateMutex_);
-    return macBinary ? std::nullopt : checksum_;
+    std::lock_guard lock(stateMutex());
+    return macBinary ? std::nullopt : checksum_.get();
 }
 
 std::uint64_t GWZipFile::uncompressedChecksumAlgorithm() const {
     const bool macBinary = isMacBinaryEncoded();
-    std::lock_guard lock(stateMutex_);
+    std::lock_guard lock(stateMutex());
     return macBinary ? 0 : checksumAlgorithm_;
 }

@@ -73,10 +73,10 @@ public:
     void setCompressedSize(std::uint64_t size);
     std::optional<std::string> symlinkDestination() const;
     void setSymlinkDestination(std::optional<std::string> destination);
-    const GWZipFilePtr& resourceFork() const { return resourceFork_; }
-    void setResourceFork(GWZipFilePtr file) { resourceFork_ = std::move(file); }
-    const GWZipFilePtr& appleDoubleFile() const { return appleDoubleFile_; }
-    void setAppleDoubleFile(GWZipFilePtr file) { appleDoubleFile_ = std::move(file); }
+    const GWZipFilePtr& resourceFork() const;
+    void setResourceFork(GWZipFilePtr file);
+    const GWZipFilePtr& appleDoubleFile() const;
+    void setAppleDoubleFile(GWZipFilePtr file);
     // The containing directory; none for a root entry.
     GWZipFilePtr parent() const { return parent_.lock(); }
     void setParent(const GWZipFilePtr& parent) { parent_ = parent; }
@@ -180,6 +180,9 @@ public:
     GWZipFilePtr copy() const;
 
 protected:
+    // Reads names without the state lock while a tree is being built.
+    friend class GWZipEntryList;
+
     // The plain new instance copy() fills; a subclass answers its own class.
     virtual GWZipFilePtr newInstance() const;
 
@@ -193,8 +196,35 @@ private:
     // Extraction refreshes the name, sizes, checksum, link target and extra
     // info from the local header on a worker thread while other threads may
     // read the entry, so those fields are read and written under this lock
-    // and handed out as copies.
-    mutable std::mutex stateMutex_;
+    // and handed out as copies. The lock is one of a shared stripe: archives
+    // hold hundreds of thousands of entries, and no accessor holds it while
+    // taking another entry's.
+    std::mutex& stateMutex() const;
+    // The extra info, or an empty one; under the state lock.
+    const GWDictionary& storedExtraInfo() const;
+
+    // A CRC-32 is kept inline; longer checksums (decoded from a coder) on
+    // the heap.
+    class Checksum {
+    public:
+        std::optional<GWData> get() const;
+        void set(std::optional<GWData> value);
+
+    private:
+        static constexpr std::size_t kInlineCapacity = 8;
+        std::uint8_t inlineBytes_[kInlineCapacity] = {};
+        std::uint8_t inlineLength_ = 0;
+        bool present_ = false;
+        std::unique_ptr<GWData> longBytes_;
+    };
+
+    // Companions are set while a tree is built, on one thread; few entries
+    // have any.
+    struct Companions {
+        GWZipFilePtr resourceFork;
+        GWZipFilePtr appleDoubleFile;
+    };
+    Companions& companions();
 
     std::uint16_t permissionsMode_ = 0;
     std::uint16_t generalPurposeFlags_ = 0;
@@ -207,14 +237,13 @@ private:
     // Copy-on-write: appended to in place while no snapshot is out.
     std::shared_ptr<GWZipFileArray> children_;
     std::uint64_t compressedSize_ = 0;
-    std::optional<std::string> symlinkDestination_;
-    GWZipFilePtr resourceFork_;
-    GWZipFilePtr appleDoubleFile_;
+    std::unique_ptr<std::string> symlinkDestination_;  // null: not a link
+    std::unique_ptr<Companions> companions_;
     std::weak_ptr<GWZipFile> parent_;
     std::uint64_t localHeaderOffset_ = 0;
-    std::optional<GWData> checksum_;
+    Checksum checksum_;
     std::uint64_t checksumAlgorithm_ = 0;
-    GWDictionary extraInfo_;
+    std::unique_ptr<GWDictionary> extraInfo_;  // null: empty
 
     // Name -> position of its first occurrence in children_, rebuilt when the
     // children are replaced or any entry anywhere is renamed. Lookups may run

@@ -28,7 +28,7 @@ void GWZipFile::encodeWithCoder(GWCoder& coder) const {
     if (!coder.allowsKeyedCoding()) {
         return;
     }
-    std::unique_lock lock(stateMutex_);
+    std::unique_lock lock(stateMutex());
     coder.encodeValue(GWValue(name_), kNameKey);
     lock.unlock();
     if (children_) {
@@ -37,18 +37,19 @@ void GWZipFile::encodeWithCoder(GWCoder& coder) const {
     lock.lock();
     coder.encodeUInt64(compressedSize_, kCompressedSizeKey);
     coder.encodeUInt64(uncompressedSize_, kUncompressedSizeKey);
-    coder.encodeValue(checksum_, kUncompressedChecksumKey);
+    coder.encodeValue(checksum_.get(), kUncompressedChecksumKey);
     coder.encodeInteger(std::int64_t(checksumAlgorithm_), kUncompressedChecksumAlgorithmKey);
-    const auto symlinkDestination = symlinkDestination_;
-    const auto extraInfo = extraInfo_;
+    const auto symlinkDestination =
+        symlinkDestination_ ? std::optional<std::string>(*symlinkDestination_) : std::nullopt;
+    const GWDictionary extraInfo = storedExtraInfo();
     lock.unlock();
     coder.encodeInt32(std::int32_t(owner_), kOwnerKey);
     coder.encodeInt32(std::int32_t(groupOwner_), kGroupOwnerKey);
     coder.encodeInteger(permissionsMode_, kPermissionsModeKey);
     coder.encodeValue(modificationDate_, kModificationDateKey);
     coder.encodeValue(symlinkDestination, kSymlinkDestinationKey);
-    coder.encodeObject(resourceFork_, kResourceForkKey);
-    coder.encodeObject(appleDoubleFile_, kAppleDoubleFileKey);
+    coder.encodeObject(resourceFork(), kResourceForkKey);
+    coder.encodeObject(appleDoubleFile(), kAppleDoubleFileKey);
     coder.encodeUInt64(localHeaderOffset_, kLocalHeaderOffsetKey);
     coder.encodeInt32(generalPurposeFlags_, kGeneralPurposeFlagsKey);
     coder.encodeInt32(compressionMethod_, kCompressionMethodKey);
@@ -74,8 +75,8 @@ GWZipFilePtr GWZipFile::initWithCoder(GWCoder& coder) {
         std::uint16_t(coder.decodeInt32(kCompressionMethodKey)),
         coder.decodeDictionary(kExtraInfoKey).value_or(GWDictionary()));
     file->setChildren(std::move(children));
-    file->resourceFork_ = coder.decodeObjectOfClass<GWZipFile>(kResourceForkKey);
-    file->appleDoubleFile_ = coder.decodeObjectOfClass<GWZipFile>(kAppleDoubleFileKey);
+    file->setResourceFork(coder.decodeObjectOfClass<GWZipFile>(kResourceForkKey));
+    file->setAppleDoubleFile(coder.decodeObjectOfClass<GWZipFile>(kAppleDoubleFileKey));
     if (file->children_) {
         for (const auto& child : *file->children_) {
             child->parent_ = file;
@@ -89,21 +90,33 @@ GWZipFilePtr GWZipFile::newInstance() const {
 }
 
 void GWZipFile::copyFieldsTo(GWZipFile& target) const {
-    std::scoped_lock lock(stateMutex_, target.stateMutex_);
+    // One lock at a time: both entries may share a stripe.
+    std::unique_lock lock(stateMutex());
+    std::string name = name_;
+    const std::uint64_t compressedSize = compressedSize_;
+    const std::uint64_t uncompressedSize = uncompressedSize_;
+    auto symlinkDestination =
+        symlinkDestination_ ? std::make_unique<std::string>(*symlinkDestination_) : nullptr;
+    std::optional<GWData> checksum = checksum_.get();
+    const std::uint64_t checksumAlgorithm = checksumAlgorithm_;
+    auto extraInfo = extraInfo_ ? std::make_unique<GWDictionary>(*extraInfo_) : nullptr;
+    lock.unlock();
+
+    std::lock_guard targetLock(target.stateMutex());
     target.permissionsMode_ = permissionsMode_;
     target.generalPurposeFlags_ = generalPurposeFlags_;
     target.compressionMethod_ = compressionMethod_;
     target.owner_ = owner_;
     target.groupOwner_ = groupOwner_;
     target.modificationDate_ = modificationDate_;
-    target.uncompressedSize_ = uncompressedSize_;
-    target.name_ = name_;
-    target.compressedSize_ = compressedSize_;
-    target.symlinkDestination_ = symlinkDestination_;
+    target.uncompressedSize_ = uncompressedSize;
+    target.name_ = std::move(name);
+    target.compressedSize_ = compressedSize;
+    target.symlinkDestination_ = std::move(symlinkDestination);
     target.localHeaderOffset_ = localHeaderOffset_;
-    target.checksum_ = checksum_;
-    target.checksumAlgorithm_ = checksumAlgorithm_;
-    target.extraInfo_ = extraInfo_;
+    target.checksum_.set(std::move(checksum));
+    target.checksumAlgorithm_ = checksumAlgorithm;
+    target.extraInfo_ = std::move(extraInfo);
 }
 
 GWZipFilePtr GWZipFile::copy() const {
@@ -118,13 +131,13 @@ GWZipFilePtr GWZipFile::copy() const {
     while (!pending.empty()) {
         auto [source, target] = std::move(pending.back());
         pending.pop_back();
-        if (source->resourceFork_) {
-            target->resourceFork_ = shallowCopy(*source->resourceFork_);
-            pending.emplace_back(source->resourceFork_.get(), target->resourceFork_);
+        if (const GWZipFilePtr& fork = source->resourceFork()) {
+            target->setResourceFork(shallowCopy(*fork));
+            pending.emplace_back(fork.get(), target->resourceFork());
         }
-        if (source->appleDoubleFile_) {
-            target->appleDoubleFile_ = shallowCopy(*source->appleDoubleFile_);
-            pending.emplace_back(source->appleDoubleFile_.get(), target->appleDoubleFile_);
+        if (const GWZipFilePtr& appleDouble = source->appleDoubleFile()) {
+            target->setAppleDoubleFile(shallowCopy(*appleDouble));
+            pending.emplace_back(appleDouble.get(), target->appleDoubleFile());
         }
         if (!source->children_) {
             continue;

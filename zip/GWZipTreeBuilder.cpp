@@ -77,10 +77,8 @@ GWZipFilePtr GWZipTreeBuilder::fileWithPathComponents(const std::vector<std::str
 
 GWZipFileArray GWZipTreeBuilder::finish() {
     for (auto& [key, children] : children_) {
-        children.owner->setChildren(children.list.entries());
+        children.owner->setChildren(children.list.takeEntries());
     }
     children_.clear();
-    GWZipFileArray roots = roots_.entries();
-    roots_ = GWZipEntryList();
-    return roots;
+    return roots_.takeEntries();
 }
