@@ -106,7 +106,7 @@ std::string displayName(const std::string& path, EntryType type) {
     return type == EntryType::directory ? path + "/" : path;
 }
 
-void printName(const std::string& path, EntryType type) {
+void printName(std::string_view path, EntryType type) {
     std::fwrite(path.data(), 1, path.size(), stdout);
     if (type == EntryType::directory)
         std::putchar('/');

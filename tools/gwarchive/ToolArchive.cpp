@@ -49,7 +49,7 @@ std::unique_ptr<ToolArchive> ToolArchive::open(const GWURL& url, GWErrorPtr* err
 std::vector<std::size_t> ToolArchive::subtree(std::size_t index) const {
     std::vector<std::size_t> indexes{index};
     // Depth-first order keeps a subtree contiguous right after its root.
-    std::string prefix = entryPath(index) + "/";
+    const std::string prefix = std::string(entryPath(index)) + "/";
     for (std::size_t next = index + 1;
          next < entryCount() && entryPath(next).compare(0, prefix.size(), prefix) == 0; ++next) {
         indexes.push_back(next);

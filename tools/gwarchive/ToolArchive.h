@@ -5,6 +5,7 @@
 #include <memory>
 #include <optional>
 #include <string>
+#include <string_view>
 #include <vector>
 
 #include "GWArchiveSupport/GWArchiveSupport.h"
@@ -77,7 +78,7 @@ public:
     virtual const char* formatName() const = 0;
     // Entries are numbered depth-first in tree order, parents before children.
     virtual std::size_t entryCount() const = 0;
-    virtual const std::string& entryPath(std::size_t index) const = 0;
+    virtual std::string_view entryPath(std::size_t index) const = 0;
     virtual EntryType entryType(std::size_t index) const = 0;
     // Everything else is gathered when asked: listing 200,000 names should
     // not first build 200,000 full records.

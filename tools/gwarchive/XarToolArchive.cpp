@@ -46,7 +46,7 @@ public:
 
     const char* formatName() const override { return "xar"; }
     std::size_t entryCount() const override { return records_.size(); }
-    const std::string& entryPath(std::size_t index) const override { return records_[index].path; }
+    std::string_view entryPath(std::size_t index) const override { return records_[index].path; }
     EntryType entryType(std::size_t index) const override { return records_[index].type; }
     EntryRecord entry(std::size_t index) const override { return records_[index]; }
 

@@ -10,6 +10,7 @@
 #include "Diagnostics.h"
 #include "FormatAdapters.h"
 #include "JsonWriter.h"
+#include "PathTable.h"
 
 namespace gwarchive {
 
@@ -35,27 +36,18 @@ std::string compressionName(std::uint16_t method) {
 class ZipToolArchive final : public ToolArchive {
 public:
     explicit ZipToolArchive(GWZipArchivePtr archive) : archive_(std::move(archive)) {
-        // Sized once: growing by doubling would hold two copies of the
-        // records of a large archive for a moment.
-        std::size_t count = 0;
-        for (const GWZipFilePtr& file : archive_->files())
-            count += countEntries(*file);
-        paths_.reserve(count);
-        types_.reserve(count);
-        files_.reserve(count);
-        for (const GWZipFilePtr& file : archive_->files())
-            add(file, "");
+        addTree(archive_->files());
     }
 
     const char* formatName() const override { return "zip"; }
     std::size_t entryCount() const override { return files_.size(); }
-    const std::string& entryPath(std::size_t index) const override { return paths_[index]; }
+    std::string_view entryPath(std::size_t index) const override { return paths_[index]; }
     EntryType entryType(std::size_t index) const override { return types_[index]; }
 
     EntryRecord entry(std::size_t index) const override {
         const GWZipFile& file = *files_[index];
         EntryRecord record;
-        record.path = paths_[index];
+        record.path = std::string(paths_[index]);
         record.mode = file.permissionsMode();
         record.type = types_[index];
         record.size = file.storedUncompressedSize();
@@ -115,12 +107,13 @@ public:
             const GWZipFilePtr& file = files_[index];
             if (file->isDirectory())
                 continue;
-            checkFile(file, paths_[index], problems);
+            const std::string path(paths_[index]);
+            checkFile(file, path, problems);
             if (file->resourceFork()) {
-                checkFile(file->resourceFork(), paths_[index] + " (resource fork)", problems);
+                checkFile(file->resourceFork(), path + " (resource fork)", problems);
             }
             if (file->appleDoubleFile()) {
-                checkFile(file->appleDoubleFile(), paths_[index] + " (AppleDouble)", problems);
+                checkFile(file->appleDoubleFile(), path + " (AppleDouble)", problems);
             }
         }
         return problems;
@@ -130,30 +123,29 @@ public:
                  const std::string& archiveName) override;
 
 private:
-    static std::size_t countEntries(const GWZipFile& file) {
-        std::size_t count = 1;
-        if (auto children = file.children()) {
-            for (const GWZipFilePtr& child : *children)
-                count += countEntries(*child);
-        }
-        return count;
-    }
-
-    // Paths grow from the parent's, as GWZipFile::path() joins them, without
-    // climbing to the root for each of many thousand entries.
-    void add(const GWZipFilePtr& file, const std::string& parentPath) {
-        std::string path = parentPath;
-        const std::string name = file->name();
-        if (!path.empty() && path.back() != '/' && !name.empty())
-            path += '/';
-        path += name;
-        paths_.push_back(std::move(path));
-        types_.push_back(entryTypeFromMode(file->permissionsMode()));
-        files_.push_back(file);
-        if (auto children = file->children()) {
-            const std::string parent = paths_.back();
-            for (const GWZipFilePtr& child : *children)
-                add(child, parent);
+    // Depth-first, parents before children; paths grow from the parent's, as
+    // GWZipFile::path() joins them, without climbing to the root for each of
+    // many thousand entries. A work list: trees may be very deep.
+    void addTree(const GWZipFileArray& roots) {
+        struct Pending {
+            GWZipFileArrayPtr siblings;
+            std::size_t next;
+            std::size_t parent;
+        };
+        std::vector<Pending> pending;
+        pending.push_back({std::make_shared<const GWZipFileArray>(roots), 0, PathTable::kNoParent});
+        while (!pending.empty()) {
+            Pending& top = pending.back();
+            if (top.next == top.siblings->size()) {
+                pending.pop_back();
+                continue;
+            }
+            const GWZipFilePtr& file = (*top.siblings)[top.next++];
+            const std::size_t index = paths_.add(top.parent, file->name());
+            types_.push_back(entryTypeFromMode(file->permissionsMode()));
+            files_.push_back(file);
+            if (auto children = file->children())
+                pending.push_back({std::move(children), 0, index});
         }
     }
 
@@ -233,7 +225,7 @@ private:
     }
 
     GWZipArchivePtr archive_;
-    std::vector<std::string> paths_;
+    PathTable paths_;
     std::vector<EntryType> types_;
     std::vector<GWZipFilePtr> files_;
 };
@@ -246,7 +238,7 @@ bool ZipToolArchive::extract(const std::vector<std::size_t>& indexes, const Extr
     std::atomic<bool> allGood{true};
     std::vector<std::pair<GWZipFilePtr, GWURL>> directories;
     for (std::size_t index : indexes) {
-        const std::string& path = paths_[index];
+        const std::string path(paths_[index]);
         const EntryType type = types_[index];
         GWURL url = options.directory.URLByAppendingPathComponent(path);
         // Checked before anything is made for the entry, and again by its
