@@ -117,15 +117,16 @@ bool GWZipLoadOperation::readLocalHeaderRecord(GWZipLocalFileHeader* record,
 bool GWZipLoadOperation::readCentralDirRecord(
     GWZipCentralDirectoryRecord* record, std::span<const std::uint8_t> buffer, std::size_t* pointer,
     std::optional<std::string>* filename, std::optional<GWData>* extraFieldData,
-    std::optional<std::string>* comment, GWErrorPtr* error) const {
+    std::optional<std::string>* comment, GWErrorPtr* error, std::uint64_t bufferOffset) const {
     const std::size_t start = *pointer;
+    const auto directoryOffset = (unsigned long long)(bufferOffset + start);
     GWZipCentralDirectoryRecord parsed;
     GWByteReader reader(buffer);
     reader.seek(start);
     parsed.signature = reader.u32le();
     if (!reader.ok() || parsed.signature != GWZipCentralDirectoryRecord::kSignature) {
-        return GWFail(error,
-                      corruptError("No central directory record at directory offset %zu", start));
+        return GWFail(error, corruptError("No central directory record at directory offset %llu",
+                                          directoryOffset));
     }
     parsed.versionMadeBy = reader.u16le();
     parsed.versionNeeded = reader.u16le();
@@ -147,9 +148,9 @@ bool GWZipLoadOperation::readCentralDirRecord(
     auto extraBytes = reader.bytes(parsed.extraFieldLength);
     auto commentBytes = reader.bytes(parsed.commentLength);
     if (!reader.ok()) {
-        return GWFail(error, corruptError("The central directory record at directory offset %zu "
+        return GWFail(error, corruptError("The central directory record at directory offset %llu "
                                           "runs past the directory: %s",
-                                          start, reader.failureDescription().c_str()));
+                                          directoryOffset, reader.failureDescription().c_str()));
     }
     if (record) {
         *record = parsed;

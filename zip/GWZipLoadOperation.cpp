@@ -5,8 +5,24 @@
 #include <vector>
 
 #include "GWZipNames.h"
+#include "foundation/GWByteReader.h"
 #include "foundation/GWFormat.h"
 #include "foundation/GWLog.h"
+
+namespace {
+
+// A central record's whole length, which its fixed part gives: the lengths
+// of the name, extra field and comment follow the 28 bytes before them.
+std::uint64_t centralRecordLength(std::span<const std::uint8_t> fixed) {
+    GWByteReader reader(fixed);
+    reader.seek(28);
+    const std::uint64_t name = reader.u16le();
+    const std::uint64_t extra = reader.u16le();
+    const std::uint64_t comment = reader.u16le();
+    return GWZipCentralDirectoryRecord::kLength + name + extra + comment;
+}
+
+}  // namespace
 
 GWZipLoadOperationPtr GWZipLoadOperation::initWithURL(const GWURL& url) {
     return GWZipLoadOperationPtr(new GWZipLoadOperation(url));
@@ -150,41 +166,54 @@ std::optional<GWZipFileArray> GWZipLoadOperation::loadFilesFromZipArchiveAtHandl
         return std::nullopt;
     }
     const std::uint64_t directoryOffset = start + end.centralDirectoryOffset;
-    if (!file.seekToFileOffset(directoryOffset, error)) {
-        return std::nullopt;
-    }
-    auto directory = file.readDataOfLength(*endOffset - directoryOffset, error);
-    if (!directory) {
-        return std::nullopt;
-    }
+    const std::uint64_t directorySize = *endOffset - directoryOffset;
 
     GWZipTreeBuilder tree;
     GWZipReadWindow window(file);
-    std::size_t pointer = 0;
+    // The directory is read a window at a time: a huge one is never held whole.
+    GWZipReadWindow directory(file, 1024 * 1024);
+    std::uint64_t position = 0;
     for (std::uint64_t entry = 0; entry < end.totalEntries; ++entry) {
         if (isCancelled()) {
             GWFail(error, cancelledError());
             return std::nullopt;
+        }
+        auto bytes =
+            directory.read(directoryOffset + position,
+                           std::size_t(std::min<std::uint64_t>(GWZipCentralDirectoryRecord::kLength,
+                                                               directorySize - position)),
+                           error);
+        if (!bytes) {
+            return std::nullopt;
+        }
+        if (bytes->size() == GWZipCentralDirectoryRecord::kLength) {
+            const std::uint64_t recordLength = centralRecordLength(*bytes);
+            bytes = directory.read(directoryOffset + position,
+                                   std::size_t(std::min(recordLength, directorySize - position)),
+                                   error);
+            if (!bytes) {
+                return std::nullopt;
+            }
         }
         GWZipCentralDirectoryRecord record;
         std::optional<std::string> filename;
         std::optional<GWData> extraFieldData;
         std::optional<std::string> comment;
         GWErrorPtr recordError;
-        const std::size_t recordStart = pointer;
-        if (!readCentralDirRecord(&record, *directory, &pointer, &filename, &extraFieldData,
-                                  &comment, &recordError)) {
+        std::size_t pointer = 0;
+        if (!readCentralDirRecord(&record, *bytes, &pointer, &filename, &extraFieldData, &comment,
+                                  &recordError, position)) {
             GWLog("Couldn't read central directory record!");
             GWFail(error, recordError);
             return std::nullopt;
         }
+        position += pointer;
         std::string name = filename ? std::move(*filename) : std::string();
         if (GWZipLastPOSIXPathComponent(name) == "..") {
             continue;
         }
         const auto nameBytes =
-            std::span<const std::uint8_t>(*directory)
-                .subspan(recordStart + GWZipCentralDirectoryRecord::kLength, record.filenameLength);
+            bytes->subspan(GWZipCentralDirectoryRecord::kLength, record.filenameLength);
         if (!addItemFromCentralDirectoryRecord(record, window, std::move(name), nameBytes,
                                                extraFieldData, comment, tree, error)) {
             return std::nullopt;

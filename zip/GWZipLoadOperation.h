@@ -97,12 +97,14 @@ public:
     // Reads the record at `*pointer` in `buffer` with its name, extra field and
     // comment, and moves the pointer past them. Fails with 259 when the record
     // does not lie inside the buffer, and without an error when the name
-    // cannot be decoded.
+    // cannot be decoded. Messages count offsets from `bufferOffset`, where the
+    // buffer starts within the directory.
     bool readCentralDirRecord(GWZipCentralDirectoryRecord* record,
                               std::span<const std::uint8_t> buffer, std::size_t* pointer,
                               std::optional<std::string>* filename,
                               std::optional<GWData>* extraFieldData,
-                              std::optional<std::string>* comment, GWErrorPtr* error) const;
+                              std::optional<std::string>* comment, GWErrorPtr* error,
+                              std::uint64_t bufferOffset = 0) const;
     // UTF-8 when valid, else the legacy encodings of the record's host system.
     std::optional<std::string> filenameFromData(std::span<const std::uint8_t> data,
                                                 const GWZipCentralDirectoryRecord& record,
