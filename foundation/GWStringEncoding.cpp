@@ -1,6 +1,7 @@
 #include "GWStringEncoding.h"
 
 #include <iconv.h>
+#include <cstring>
 
 #include <cerrno>
 #include <map>
@@ -77,6 +78,16 @@ std::optional<std::string> convert(std::string_view input, const char* from, con
 bool GWIsValidUTF8(std::span<const std::uint8_t> bytes) {
     std::size_t i = 0;
     while (i < bytes.size()) {
+        // Names are mostly ASCII: eight bytes at a time while no high bit is set.
+        std::uint64_t word;
+        while (bytes.size() - i >= sizeof word &&
+               (std::memcpy(&word, bytes.data() + i, sizeof word), word & 0x8080808080808080u) ==
+                   0) {
+            i += sizeof word;
+        }
+        if (i == bytes.size()) {
+            break;
+        }
         const std::uint8_t lead = bytes[i];
         if (lead < 0x80) {
             ++i;

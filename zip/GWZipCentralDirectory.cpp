@@ -35,12 +35,12 @@ bool isMSDOSLikeHost(std::uint8_t host) {
 }
 
 std::string lowercasePathExtension(std::string_view name) {
-    const std::string last = GWZipLastPOSIXPathComponent(name);
+    const std::string_view last = GWZipLastPOSIXPathComponent(name);
     const auto dot = last.rfind('.');
     if (dot == std::string::npos || dot == 0) {
         return {};
     }
-    std::string extension = last.substr(dot + 1);
+    std::string extension(last.substr(dot + 1));
     std::transform(extension.begin(), extension.end(), extension.begin(),
                    [](unsigned char c) { return char(std::tolower(c)); });
     return extension;
@@ -70,6 +70,10 @@ std::uint16_t msdosMode(std::string_view name, std::uint32_t externalAttributes)
 }
 
 std::optional<std::uint64_t> infoNumber(const GWDictionary& info, const char* key) {
+    // Most entries carry no extra info; a key is not worth building for them.
+    if (info.empty()) {
+        return std::nullopt;
+    }
     const GWValue* value = GWDictionaryValue(info, key);
     if (value && value->isNumber()) {
         return value->unsignedValue();
@@ -222,10 +226,10 @@ std::optional<std::string> GWZipLoadOperation::filenameFromData(
     return std::nullopt;
 }
 
-bool GWZipLoadOperation::addItemFromCentralDirectoryRecord(
+bool GWZipLoadOperation::parseItemFromCentralDirectoryRecord(
     const GWZipCentralDirectoryRecord& record, GWZipReadWindow& file, std::string filename,
     std::span<const std::uint8_t> centralNameBytes, const std::optional<GWData>& extraFieldData,
-    const std::optional<std::string>& comment, GWZipTreeBuilder& rootItems, GWErrorPtr* error) {
+    const std::optional<std::string>& comment, GWZipParsedBatch& batch, GWErrorPtr* error) {
     GWDictionary extraInfo;
     if (extraFieldData) {
         extraInfo =
@@ -347,18 +351,29 @@ bool GWZipLoadOperation::addItemFromCentralDirectoryRecord(
             extraInfo.insert_or_assign(kGWZipCommentKey, GWValue(*comment));
         }
     }
-    return addItemWithFilename(std::move(filename), compressedSize, uncompressedSize, method, flags,
-                               crc32, localHeaderOffset, dateFromDOS(dosTime, dosDate), mode,
-                               std::move(extraInfo), rootItems, error);
+    GWZipParsedEntry& entry = batch.entries.emplace_back();
+    entry.nameStart = batch.names.size();
+    entry.nameLength = filename.size();
+    batch.names += filename;
+    entry.compressedSize = compressedSize;
+    entry.uncompressedSize = uncompressedSize;
+    entry.localHeaderOffset = localHeaderOffset;
+    entry.crc32 = crc32;
+    entry.compressionMethod = method;
+    entry.generalPurposeFlags = flags;
+    entry.permissionsMode = mode;
+    entry.modificationDate = dateFromDOS(dosTime, dosDate);
+    entry.extraInfo = std::move(extraInfo);
+    return true;
 }
 
 bool GWZipLoadOperation::addItemWithFilename(
-    std::string filename, std::uint64_t compressedSize, std::uint64_t uncompressedSize,
+    std::string_view filename, std::uint64_t compressedSize, std::uint64_t uncompressedSize,
     std::uint16_t compressionMethod, std::uint16_t generalPurposeFlags, std::uint32_t crc32,
     std::uint64_t localHeaderOffset, GWDate modificationDate, std::uint16_t permissionsMode,
     GWDictionary extraInfo, GWZipTreeBuilder& rootItems, GWErrorPtr*) {
     if (!filename.empty() && filename.back() == '/') {
-        filename.pop_back();
+        filename.remove_suffix(1);
         permissionsMode = std::uint16_t((permissionsMode & 07777) | 040000);
     }
     const auto owner = infoNumber(extraInfo, kGWZipUserIDKey);
@@ -378,19 +393,19 @@ bool GWZipLoadOperation::addItemWithFilename(
         lastParentPath_ = directoryPath;
     }
     // "/" is its own last component, as the platform's paths have it.
-    std::string name = filename == "/" ? filename : GWZipLastPOSIXPathComponent(filename);
+    std::string name(filename == "/" ? filename : GWZipLastPOSIXPathComponent(filename));
 
     std::optional<std::string> linkTarget;
-    if (const GWValue* link = GWDictionaryValue(extraInfo, kGWZipSymbolicLinkFilenameKey)) {
-        if (link->string()) {
-            linkTarget = *link->string();
-        }
+    const GWValue* link =
+        extraInfo.empty() ? nullptr : GWDictionaryValue(extraInfo, kGWZipSymbolicLinkFilenameKey);
+    if (link && link->string()) {
+        linkTarget = *link->string();
     }
-    const GWData checksum = {std::uint8_t(crc32), std::uint8_t(crc32 >> 8),
-                             std::uint8_t(crc32 >> 16), std::uint8_t(crc32 >> 24)};
+    GWData checksum = {std::uint8_t(crc32), std::uint8_t(crc32 >> 8), std::uint8_t(crc32 >> 16),
+                       std::uint8_t(crc32 >> 24)};
     auto node = GWZipFile::initWithName(
-        name, parent, compressedSize, uncompressedSize, checksum, GWChecksumAlgorithmCRC32,
-        owner ? std::uint32_t(*owner) : GWProcessUserID(),
+        std::move(name), parent, compressedSize, uncompressedSize, std::move(checksum),
+        GWChecksumAlgorithmCRC32, owner ? std::uint32_t(*owner) : GWProcessUserID(),
         group ? std::uint32_t(*group) : GWProcessGroupID(), permissionsMode, modificationDate,
         std::move(linkTarget), localHeaderOffset, generalPurposeFlags, compressionMethod,
         std::move(extraInfo));

@@ -276,7 +276,7 @@ bool GWZipExtractOperation::loadExtraInfoFromLocalHeader(const GWZipLocalFileHea
         const std::string path(nameBytes.begin(),
                                std::find(nameBytes.begin(), nameBytes.end(), std::uint8_t(0)));
         // A name that is not one component would move the entry elsewhere.
-        std::string name = GWZipLastPOSIXPathComponent(path);
+        std::string name(GWZipLastPOSIXPathComponent(path));
         if (GWZipIsSafeFilename(name)) {
             file->setName(std::move(name));
         }

@@ -2,6 +2,8 @@
 
 #include <algorithm>
 #include <cstdarg>
+#include <system_error>
+#include <thread>
 #include <vector>
 
 #include "GWZipNames.h"
@@ -169,43 +171,92 @@ std::optional<GWZipFileArray> GWZipLoadOperation::loadFilesFromZipArchiveAtHandl
     const std::uint64_t directorySize = *endOffset - directoryOffset;
 
     GWZipTreeBuilder tree;
+    if (!buildTreeFromDirectory(end, directoryOffset, directorySize, file, tree, error)) {
+        return std::nullopt;
+    }
+    lastParent_ = nullptr;
+    GWZipFileArray roots = tree.finish();
+    if (!setUpMetadataItemsForFiles(roots, error)) {
+        return std::nullopt;
+    }
+    return roots;
+}
+
+bool GWZipLoadOperation::buildTreeFromDirectory(const GWZipEndOfCentralDirectoryRecord& end,
+                                                std::uint64_t directoryOffset,
+                                                std::uint64_t directorySize,
+                                                GWRemoteFileHandle& file, GWZipTreeBuilder& tree,
+                                                GWErrorPtr* error) {
+    // Reading and decoding the records takes about as long as building the
+    // tree from them; a large directory does both at once, on two threads.
+    static constexpr std::uint64_t kThreadedEntryCount = 4096;
+    if (end.totalEntries >= kThreadedEntryCount && std::thread::hardware_concurrency() > 1) {
+        GWZipEntryPipe pipe(4);
+        std::optional<std::thread> walker;
+        try {
+            walker.emplace(
+                [&] { walkCentralDirectory(end, directoryOffset, directorySize, file, pipe); });
+        } catch (const std::system_error&) {
+            // No thread to be had: the walk runs first, below.
+        }
+        if (walker) {
+            struct Join {
+                GWZipEntryPipe& pipe;
+                std::thread& thread;
+                ~Join() {
+                    pipe.abandon();
+                    thread.join();
+                }
+            } join{pipe, *walker};
+            return buildTree(pipe, tree, error);
+        }
+    }
+    GWZipEntryPipe pipe(GWZipEntryPipe::kUnbounded);
+    walkCentralDirectory(end, directoryOffset, directorySize, file, pipe);
+    return buildTree(pipe, tree, error);
+}
+
+void GWZipLoadOperation::walkCentralDirectory(const GWZipEndOfCentralDirectoryRecord& end,
+                                              std::uint64_t directoryOffset,
+                                              std::uint64_t directorySize, GWRemoteFileHandle& file,
+                                              GWZipEntryPipe& pipe) {
+    static constexpr std::size_t kBatchSize = 1024;
     GWZipReadWindow window(file);
     // The directory is read a window at a time: a huge one is never held whole.
     GWZipReadWindow directory(file, 1024 * 1024);
+    GWZipParsedBatch batch;
     std::uint64_t position = 0;
+    GWErrorPtr error;
     for (std::uint64_t entry = 0; entry < end.totalEntries; ++entry) {
         if (isCancelled()) {
-            GWFail(error, cancelledError());
-            return std::nullopt;
+            pipe.close(false, cancelledError());
+            return;
         }
         auto bytes =
             directory.read(directoryOffset + position,
                            std::size_t(std::min<std::uint64_t>(GWZipCentralDirectoryRecord::kLength,
                                                                directorySize - position)),
-                           error);
-        if (!bytes) {
-            return std::nullopt;
-        }
-        if (bytes->size() == GWZipCentralDirectoryRecord::kLength) {
+                           &error);
+        if (bytes && bytes->size() == GWZipCentralDirectoryRecord::kLength) {
             const std::uint64_t recordLength = centralRecordLength(*bytes);
             bytes = directory.read(directoryOffset + position,
                                    std::size_t(std::min(recordLength, directorySize - position)),
-                                   error);
-            if (!bytes) {
-                return std::nullopt;
-            }
+                                   &error);
+        }
+        if (!bytes) {
+            pipe.close(false, error);
+            return;
         }
         GWZipCentralDirectoryRecord record;
         std::optional<std::string> filename;
         std::optional<GWData> extraFieldData;
         std::optional<std::string> comment;
-        GWErrorPtr recordError;
         std::size_t pointer = 0;
         if (!readCentralDirRecord(&record, *bytes, &pointer, &filename, &extraFieldData, &comment,
-                                  &recordError, position)) {
+                                  &error, position)) {
             GWLog("Couldn't read central directory record!");
-            GWFail(error, recordError);
-            return std::nullopt;
+            pipe.close(false, error);
+            return;
         }
         position += pointer;
         std::string name = filename ? std::move(*filename) : std::string();
@@ -214,15 +265,39 @@ std::optional<GWZipFileArray> GWZipLoadOperation::loadFilesFromZipArchiveAtHandl
         }
         const auto nameBytes =
             bytes->subspan(GWZipCentralDirectoryRecord::kLength, record.filenameLength);
-        if (!addItemFromCentralDirectoryRecord(record, window, std::move(name), nameBytes,
-                                               extraFieldData, comment, tree, error)) {
-            return std::nullopt;
+        if (!parseItemFromCentralDirectoryRecord(record, window, std::move(name), nameBytes,
+                                                 extraFieldData, comment, batch, &error)) {
+            pipe.close(false, error);
+            return;
+        }
+        if (batch.entries.size() == kBatchSize) {
+            if (!pipe.push(std::move(batch))) {
+                return;
+            }
+            batch = GWZipParsedBatch();
         }
     }
-    lastParent_ = nullptr;
-    GWZipFileArray roots = tree.finish();
-    if (!setUpMetadataItemsForFiles(roots, error)) {
-        return std::nullopt;
+    if (!batch.entries.empty() && !pipe.push(std::move(batch))) {
+        return;
     }
-    return roots;
+    pipe.close(true);
+}
+
+bool GWZipLoadOperation::buildTree(GWZipEntryPipe& pipe, GWZipTreeBuilder& tree,
+                                   GWErrorPtr* error) {
+    while (auto batch = pipe.pop()) {
+        for (GWZipParsedEntry& entry : batch->entries) {
+            if (!addItemWithFilename(
+                    batch->name(entry), entry.compressedSize, entry.uncompressedSize,
+                    entry.compressionMethod, entry.generalPurposeFlags, entry.crc32,
+                    entry.localHeaderOffset, entry.modificationDate, entry.permissionsMode,
+                    std::move(entry.extraInfo), tree, error)) {
+                return false;
+            }
+        }
+    }
+    if (!pipe.succeeded()) {
+        return GWFail(error, pipe.error());
+    }
+    return true;
 }

@@ -12,6 +12,7 @@
 #include <unordered_map>
 
 #include "GWZipEntryList.h"
+#include "GWZipEntryPipe.h"
 #include "GWZipFile.h"
 #include "GWZipReadWindow.h"
 #include "GWZipRecords.h"
@@ -112,16 +113,17 @@ public:
     static std::uint8_t operatingSystemFromCentralDirectoryRecord(
         const GWZipCentralDirectoryRecord& record);
     static std::string convertBackslashesInFilename(std::string filename);
-    // Consults the local header where needed, derives mode and date, and adds
-    // the entry to the tree.
-    // `filename` was decoded from `centralNameBytes`.
-    bool addItemFromCentralDirectoryRecord(const GWZipCentralDirectoryRecord& record,
-                                           GWZipReadWindow& file, std::string filename,
-                                           std::span<const std::uint8_t> centralNameBytes,
-                                           const std::optional<GWData>& extraFieldData,
-                                           const std::optional<std::string>& comment,
-                                           GWZipTreeBuilder& rootItems, GWErrorPtr* error);
-    bool addItemWithFilename(std::string filename, std::uint64_t compressedSize,
+    // Consults the local header where needed and derives mode and date; the
+    // entry is appended to `batch`. `filename` was decoded from
+    // `centralNameBytes`.
+    bool parseItemFromCentralDirectoryRecord(const GWZipCentralDirectoryRecord& record,
+                                             GWZipReadWindow& file, std::string filename,
+                                             std::span<const std::uint8_t> centralNameBytes,
+                                             const std::optional<GWData>& extraFieldData,
+                                             const std::optional<std::string>& comment,
+                                             GWZipParsedBatch& batch, GWErrorPtr* error);
+    // Adds the entry to the tree, making the directories on its path.
+    bool addItemWithFilename(std::string_view filename, std::uint64_t compressedSize,
                              std::uint64_t uncompressedSize, std::uint16_t compressionMethod,
                              std::uint16_t generalPurposeFlags, std::uint32_t crc32,
                              std::uint64_t localHeaderOffset, GWDate modificationDate,
@@ -155,6 +157,18 @@ private:
     // elsewhere (a prefix whose length a tool added to every offset).
     bool chooseStartOffset(const GWZipEndOfCentralDirectoryRecord& end, std::uint64_t endOffset,
                            GWRemoteFileHandle& file, GWErrorPtr* error);
+    // Walks the directory and builds the tree from its records.
+    bool buildTreeFromDirectory(const GWZipEndOfCentralDirectoryRecord& end,
+                                std::uint64_t directoryOffset, std::uint64_t directorySize,
+                                GWRemoteFileHandle& file, GWZipTreeBuilder& tree,
+                                GWErrorPtr* error);
+    // Reads `end.totalEntries` records of the directory at `directoryOffset`
+    // into batches for the pipe, and closes it.
+    void walkCentralDirectory(const GWZipEndOfCentralDirectoryRecord& end,
+                              std::uint64_t directoryOffset, std::uint64_t directorySize,
+                              GWRemoteFileHandle& file, GWZipEntryPipe& pipe);
+    // Adds the pipe's entries to the tree until the walk closes it.
+    bool buildTree(GWZipEntryPipe& pipe, GWZipTreeBuilder& tree, GWErrorPtr* error);
     // A DOS date and time in the system's zone. Converting costs a time-zone
     // lookup, and archives repeat a few stamps thousands of times.
     GWDate dateFromDOS(std::uint16_t time, std::uint16_t date);
@@ -167,6 +181,8 @@ private:
 
     GWURL url_;
     std::uint64_t startOffset_ = 0;
+    // The walk's (dateFromDOS) and the tree builder's own, when they run on
+    // two threads.
     std::unordered_map<std::uint32_t, GWDate> dosDates_;
     GWZipFilePtr lastParent_;
     std::string lastParentPath_;

@@ -10,12 +10,12 @@ std::string GWZipFilenameFromMacName(std::string_view name) {
     return converted;
 }
 
-std::string GWZipLastPOSIXPathComponent(std::string_view path) {
+std::string_view GWZipLastPOSIXPathComponent(std::string_view path) {
     while (!path.empty() && path.back() == '/') {
         path.remove_suffix(1);
     }
     const auto slash = path.rfind('/');
-    return std::string(slash == std::string_view::npos ? path : path.substr(slash + 1));
+    return slash == std::string_view::npos ? path : path.substr(slash + 1);
 }
 
 std::string GWZipLastHFSPathComponent(std::string_view path) {

@@ -8,8 +8,9 @@
 
 // A classic Mac name may hold "/", which the Mac shows as ":" to POSIX callers.
 std::string GWZipFilenameFromMacName(std::string_view name);
-// The last component of a "/"-separated path, trailing slashes ignored.
-std::string GWZipLastPOSIXPathComponent(std::string_view path);
+// The last component of a "/"-separated path, trailing slashes ignored: a
+// view into `path`.
+std::string_view GWZipLastPOSIXPathComponent(std::string_view path);
 // The last component of an HFS path ("Disk:Folder:File", a folder may end in
 // ":"), as the POSIX name of that item.
 std::string GWZipLastHFSPathComponent(std::string_view path);

@@ -69,6 +69,14 @@ TEST(GWStringEncoding, UTF8MustBeWellFormed) {
          {"\xC3", "\xC0\xAF", "\xED\xA0\x80", "\xF4\x90\x80\x80", "\xFF", "a\x80"}) {
         EXPECT_FALSE(GWStringFromBytes(std::string_view(bad), GWStringEncoding::UTF8)) << bad;
     }
+    // ASCII runs are skipped several bytes at a time: what follows a run of
+    // any length is still checked.
+    for (std::size_t run = 0; run < 20; ++run) {
+        const std::string ascii(run, 'a');
+        EXPECT_TRUE(GWStringFromBytes(ascii + "\xC3\xA9" + ascii, GWStringEncoding::UTF8)) << run;
+        EXPECT_FALSE(GWStringFromBytes(ascii + "\xC3", GWStringEncoding::UTF8)) << run;
+        EXPECT_FALSE(GWStringFromBytes(ascii + "\xFF" + ascii, GWStringEncoding::UTF8)) << run;
+    }
 }
 
 TEST(GWStringEncoding, LegacyCodePagesDecodeToUTF8) {

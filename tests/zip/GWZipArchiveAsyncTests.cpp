@@ -3,6 +3,9 @@
 
 #include <gtest/gtest.h>
 
+#include <chrono>
+#include <thread>
+
 #include <atomic>
 #include <chrono>
 #include <future>
@@ -131,6 +134,30 @@ TEST(GWZipLoadOperationCancel, ACancelledLoadStopsInTheSearch) {
     EXPECT_TRUE(operation->error()->is(kGWCocoaErrorDomain, GWUserCancelledError));
     EXPECT_FALSE(operation->files());
     EXPECT_EQ(operation->compressedSize(), 0u);
+}
+
+// A large directory is walked on a second thread; cancelling at any moment
+// ends the load either way, with no thread left waiting.
+TEST(GWZipLoadOperationCancel, CancellingALargeLoadAtAnyMomentEndsIt) {
+    TemporaryDirectory directory;
+    ZipBuilder zip;
+    for (int i = 0; i < 30000; ++i) {
+        zip.addFile("d" + std::to_string(i % 7) + "/f" + std::to_string(i), {});
+    }
+    zip.write(directory.file("large.zip"));
+    for (int delay = 0; delay < 12; ++delay) {
+        auto operation = GWZipLoadOperation::initWithURL(directory.url("large.zip"));
+        std::thread loader([&] { operation->main(); });
+        std::this_thread::sleep_for(std::chrono::milliseconds(delay * 3));
+        operation->cancel();
+        loader.join();
+        if (operation->error()) {
+            EXPECT_TRUE(operation->error()->is(kGWCocoaErrorDomain, GWUserCancelledError));
+        } else {
+            ASSERT_TRUE(operation->files());
+            EXPECT_EQ(operation->files()->size(), 7u);
+        }
+    }
 }
 
 TEST(GWZipLoadOperationCancel, SearchFindsPatternsAcrossChunksAndHonoursItsRange) {

@@ -229,6 +229,51 @@ TEST(GWZipArchiveTruncation, RandomDamageEndsInAnArchiveOrAnError) {
     }
 }
 
+// Directories this large are read on one thread and built into a tree on
+// another: damage anywhere still ends in an archive or an error.
+TEST(GWZipArchiveTruncation, DamageInALargeDirectoryEndsInAnArchiveOrAnError) {
+    ZipBuilder zip;
+    for (int i = 0; i < 6000; ++i) {
+        zip.addFile("d" + std::to_string(i % 9) + "/f" + std::to_string(i), bytesOf("x"));
+    }
+    const GWData whole = zip.bytes();
+    TemporaryDirectory directory;
+    ZipLogCapture log;
+
+    // The 4,501st central record loses its signature: the error names it.
+    GWData bad = whole;
+    const std::size_t directoryStart = find(bad, {'P', 'K', 1, 2});
+    const std::uint8_t signature[] = {'P', 'K', 1, 2};
+    auto record = bad.begin() + std::ptrdiff_t(directoryStart);
+    for (int i = 0; i < 4500; ++i) {
+        record = std::search(record + 1, bad.end(), std::begin(signature), std::end(signature));
+    }
+    const std::size_t recordOffset = std::size_t(record - bad.begin());
+    bad[recordOffset + 3] = 9;
+    writeFile(directory.file("bad.zip"), bad);
+    GWErrorPtr error;
+    EXPECT_FALSE(GWZipArchive::initWithURL(directory.url("bad.zip"), &error));
+    ASSERT_TRUE(error);
+    EXPECT_TRUE(error->is(kGWCocoaErrorDomain, GWFileReadCorruptFileError));
+    EXPECT_NE(error->localizedDescription().find("directory offset " +
+                                                 std::to_string(recordOffset - directoryStart)),
+              std::string::npos)
+        << error->localizedDescription();
+
+    std::uint32_t state = 99;
+    for (int round = 0; round < 30; ++round) {
+        GWData damaged = whole;
+        for (int i = 0; i < 8; ++i) {
+            state = state * 1103515245u + 12345u;
+            damaged[(state >> 4) % damaged.size()] = std::uint8_t(state >> 24);
+        }
+        writeFile(directory.file("damaged.zip"), damaged);
+        error = nullptr;
+        auto archive = GWZipArchive::initWithURL(directory.url("damaged.zip"), &error);
+        EXPECT_NE(bool(archive), bool(error)) << "round " << round;
+    }
+}
+
 TEST(GWZipArchiveTruncation, MissingFilesAndRefusedURLsReportTheirOwnErrors) {
     TemporaryDirectory directory;
     GWErrorPtr error;

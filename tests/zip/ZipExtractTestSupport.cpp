@@ -18,7 +18,7 @@ GWZipFilePtr zipEntryFromBuilder(const ZipBuilder& zip, std::size_t index,
     auto info = decoder.infoFromExtraFieldData(entry.centralExtra, false, nullptr);
     const std::uint64_t prefix = zip.offsetsIncludePrefix ? 0 : zip.prefix.size();
     auto file = GWZipFile::initWithName(
-        GWZipLastPOSIXPathComponent(path), parent,
+        std::string(GWZipLastPOSIXPathComponent(path)), parent,
         entry.compressedSize.value_or(entry.storedBytes().size()),
         entry.uncompressedSize.value_or(entry.content.size()), checksum, 1, 0, 0,
         std::uint16_t(entry.externalAttributes >> 16), GWDate(1577880000), std::nullopt,
@@ -36,7 +36,7 @@ GWZipFilePtr zipEntryFromRecord(const ZipRecord& record) {
                     std::uint8_t(crc >> 24)};
     GWZipWorkOperation decoder;
     auto info = decoder.infoFromExtraFieldData(record.centralExtra, false, nullptr);
-    return GWZipFile::initWithName(GWZipLastPOSIXPathComponent(record.name), nullptr,
+    return GWZipFile::initWithName(std::string(GWZipLastPOSIXPathComponent(record.name)), nullptr,
                                    record.compressedSize, record.uncompressedSize, checksum, 1, 0,
                                    0, std::uint16_t(record.externalAttributes >> 16),
                                    GWDate(1577880000), std::nullopt, record.localHeaderOffset,
