@@ -1,5 +1,8 @@
+#include <malloc.h>
+#include <sys/mman.h>
 #include <unistd.h>
 
+#include <cstdint>
 #include <cstdio>
 #include <cstdlib>
 #include <cstring>
@@ -71,23 +74,28 @@ int runCommand(const Command& command, const std::vector<std::string>& words) {
 
 // An archive's entry tree is hundreds of thousands of small allocations; on
 // transparent huge pages the kernel faults them in far less often (listing
-// 200,000 entries: 0.44 s -> 0.32 s). glibc reads this switch only when a
-// process starts, hence one re-execution; without /proc the tool runs as it is.
-void runWithHugePageHeap(char** argv) {
-    const char* tunables = std::getenv("GLIBC_TUNABLES");
-    std::string value = tunables ? tunables : "";
-    if (value.find("glibc.malloc.hugetlb") != std::string::npos)
+// 200,000 entries: 0.44 s -> 0.32 s). The heap is grown once by a stretch
+// of address space that is advised for huge pages; touching it is what
+// costs, so the stretch itself is free. Big arrays come from the heap too.
+void adviseHugePageHeap() {
+    constexpr std::size_t kHugePage = 2u << 20;
+    constexpr std::size_t kStretch = 256u << 20;
+    mallopt(M_MMAP_THRESHOLD, 32 << 20);
+    mallopt(M_TRIM_THRESHOLD, 2 * kStretch);
+    mallopt(M_TOP_PAD, kStretch);
+    void* probe = std::malloc(kHugePage);
+    if (!probe)
         return;
-    value += (value.empty() ? "" : ":") + std::string("glibc.malloc.hugetlb=1");
-    if (setenv("GLIBC_TUNABLES", value.c_str(), 1) != 0)
-        return;
-    execv("/proc/self/exe", argv);
+    const auto start = (reinterpret_cast<std::uintptr_t>(probe) + kHugePage - 1) & ~(kHugePage - 1);
+    const auto end = reinterpret_cast<std::uintptr_t>(sbrk(0));
+    if (end > start)
+        madvise(reinterpret_cast<void*>(start), end - start, MADV_HUGEPAGE);
+    std::free(probe);
 }
-
 }  // namespace
 
 int main(int argc, char** argv) {
-    runWithHugePageHeap(argv);
+    adviseHugePageHeap();
     if (argc < 2) {
         printToolHelp(stderr);
         return kExitUsage;
