@@ -86,9 +86,12 @@ void adviseHugePageHeap() {
     void* probe = std::malloc(kHugePage);
     if (!probe)
         return;
-    const auto start = (reinterpret_cast<std::uintptr_t>(probe) + kHugePage - 1) & ~(kHugePage - 1);
+    const auto address = reinterpret_cast<std::uintptr_t>(probe);
+    const auto start = (address + kHugePage - 1) & ~(kHugePage - 1);
     const auto end = reinterpret_cast<std::uintptr_t>(sbrk(0));
-    if (end > start)
+    // Only when the probe came from the stretch just added to the heap (an
+    // instrumented build's allocator keeps its own).
+    if (end > start && end - address <= kStretch + 2 * kHugePage)
         madvise(reinterpret_cast<void*>(start), end - start, MADV_HUGEPAGE);
     std::free(probe);
 }
