@@ -31,14 +31,14 @@ std::string_view GWZipEntryList::nameAt(std::size_t position) const {
     return items_[position]->name_;
 }
 
-std::size_t GWZipEntryList::findSlot(std::string_view name, std::size_t hash) const {
+std::size_t GWZipEntryList::findSlot(std::string_view name, std::uint32_t hash) const {
     if (slots_.empty()) {
         return kNoPosition;
     }
     const std::size_t mask = slots_.size() - 1;
     for (std::size_t slot = hash & mask;; slot = (slot + 1) & mask) {
         const Slot& candidate = slots_[slot];
-        if (candidate.position == kNoPosition) {
+        if (candidate.position == kEmptySlot) {
             return kNoPosition;
         }
         if (candidate.hash == hash && nameAt(candidate.position) == name) {
@@ -48,12 +48,12 @@ std::size_t GWZipEntryList::findSlot(std::string_view name, std::size_t hash) co
 }
 
 void GWZipEntryList::insertSlot(Slot slot) {
-    if ((usedSlots_ + 1) * 2 > slots_.size()) {
+    if ((usedSlots_ + 1) * 4 > slots_.size() * 3) {
         growSlots();
     }
     const std::size_t mask = slots_.size() - 1;
     std::size_t at = slot.hash & mask;
-    while (slots_[at].position != kNoPosition) {
+    while (slots_[at].position != kEmptySlot) {
         at = (at + 1) & mask;
     }
     slots_[at] = slot;
@@ -65,7 +65,7 @@ void GWZipEntryList::growSlots() {
     slots_.assign(old.empty() ? 16 : old.size() * 2, Slot());
     usedSlots_ = 0;
     for (const Slot& slot : old) {
-        if (slot.position != kNoPosition) {
+        if (slot.position != kEmptySlot) {
             insertSlot(slot);
         }
     }
@@ -76,7 +76,7 @@ void GWZipEntryList::eraseSlot(std::size_t slot) {
     // lookup stops early at the hole.
     const std::size_t mask = slots_.size() - 1;
     std::size_t hole = slot;
-    for (std::size_t next = (hole + 1) & mask; slots_[next].position != kNoPosition;
+    for (std::size_t next = (hole + 1) & mask; slots_[next].position != kEmptySlot;
          next = (next + 1) & mask) {
         const std::size_t home = slots_[next].hash & mask;
         const bool reachable =
@@ -91,15 +91,15 @@ void GWZipEntryList::eraseSlot(std::size_t slot) {
 }
 
 std::optional<std::size_t> GWZipEntryList::index(const std::string& name, std::size_t position) {
-    const std::size_t hash = hashOf(name);
+    const std::uint32_t hash = hashOf(name);
     const std::size_t slot = findSlot(name, hash);
     if (slot == kNoPosition) {
-        insertSlot({hash, position});
+        insertSlot({hash, std::uint32_t(position)});
         return std::nullopt;
     }
     const std::size_t previousFirst = slots_[slot].position;
     if (position < previousFirst) {
-        slots_[slot].position = position;
+        slots_[slot].position = std::uint32_t(position);
         position = previousFirst;
     }
     auto& later = laterPositions_[name];
@@ -118,7 +118,7 @@ void GWZipEntryList::unindex(const std::string& name, std::size_t position) {
             eraseSlot(slot);
             return;
         }
-        slots_[slot].position = later->second.front();
+        slots_[slot].position = std::uint32_t(later->second.front());
         later->second.erase(later->second.begin());
     } else if (later != laterPositions_.end()) {
         auto at = std::lower_bound(later->second.begin(), later->second.end(), position);

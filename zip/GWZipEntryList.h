@@ -43,15 +43,19 @@ private:
     // Open addressing with linear probing: a slot holds a name's hash and
     // the position of its first entry; the name itself is read from that
     // entry, so an index of 200,000 names costs no allocation per name.
+    // Positions fit 32 bits: four billion entries would need a terabyte.
+    static constexpr std::uint32_t kEmptySlot = UINT32_MAX;
     struct Slot {
-        std::size_t hash = 0;
-        std::size_t position = kNoPosition;
+        std::uint32_t hash = 0;
+        std::uint32_t position = kEmptySlot;
     };
 
-    static std::size_t hashOf(std::string_view name) { return std::hash<std::string_view>()(name); }
+    static std::uint32_t hashOf(std::string_view name) {
+        return std::uint32_t(std::hash<std::string_view>()(name));
+    }
     std::string_view nameAt(std::size_t position) const;
     // The slot of that name, or kNoPosition.
-    std::size_t findSlot(std::string_view name, std::size_t hash) const;
+    std::size_t findSlot(std::string_view name, std::uint32_t hash) const;
     void insertSlot(Slot slot);
     void eraseSlot(std::size_t slot);
     void growSlots();
