@@ -13,7 +13,10 @@ class PathTable {
 public:
     static constexpr std::size_t kNoParent = static_cast<std::size_t>(-1);
 
-    void reserve(std::size_t count) { ends_.reserve(count); }
+    void reserve(std::size_t count, std::size_t textBytes) {
+        ends_.reserve(count);
+        text_.reserve(textBytes);
+    }
     std::size_t size() const { return ends_.size(); }
     std::string_view operator[](std::size_t index) const {
         const std::size_t start = index == 0 ? 0 : ends_[index - 1];

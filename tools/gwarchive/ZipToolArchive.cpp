@@ -36,7 +36,14 @@ std::string compressionName(std::uint16_t method) {
 class ZipToolArchive final : public ToolArchive {
 public:
     explicit ZipToolArchive(GWZipArchivePtr archive) : archive_(std::move(archive)) {
-        addTree(archive_->files());
+        const GWZipFileArray roots = archive_->files();
+        // Sized once: arrays that grow by doubling leave their old copies
+        // behind, and fresh memory is what listing pays for most.
+        const std::size_t count = countEntries(roots);
+        paths_.reserve(count, count * kReservedPathBytes);
+        types_.reserve(count);
+        files_.reserve(count);
+        addTree(roots);
     }
 
     const char* formatName() const override { return "zip"; }
@@ -123,6 +130,30 @@ public:
                  const std::string& archiveName) override;
 
 private:
+    // Room reserved per path; a longer average only makes the buffer grow,
+    // and reserved room that stays unused is never touched.
+    static constexpr std::size_t kReservedPathBytes = 64;
+
+    static std::size_t countEntries(const GWZipFileArray& roots) {
+        std::size_t count = roots.size();
+        std::vector<GWZipFileArrayPtr> pending;
+        auto queueChildren = [&pending, &count](const GWZipFileArray& files) {
+            for (const GWZipFilePtr& file : files) {
+                if (auto children = file->children()) {
+                    count += children->size();
+                    pending.push_back(std::move(children));
+                }
+            }
+        };
+        queueChildren(roots);
+        while (!pending.empty()) {
+            GWZipFileArrayPtr level = std::move(pending.back());
+            pending.pop_back();
+            queueChildren(*level);
+        }
+        return count;
+    }
+
     // Depth-first, parents before children; paths grow from the parent's, as
     // GWZipFile::path() joins them, without climbing to the root for each of
     // many thousand entries. A work list: trees may be very deep.
