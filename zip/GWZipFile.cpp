@@ -65,20 +65,20 @@ GWZipFilePtr GWZipFile::initWithName(
     file->parent_ = parent;
     file->compressedSize_ = compressedSize;
     file->uncompressedSize_ = uncompressedSize;
-    file->checksum_.set(std::move(checksum));
+    file->storeChecksum(std::move(checksum));
     file->checksumAlgorithm_ = checksumAlgorithm;
     file->owner_ = owner;
     file->groupOwner_ = groupOwner;
     file->permissionsMode_ = permissionsMode;
     file->modificationDate_ = modificationDate;
     if (symlinkDestination) {
-        file->symlinkDestination_ = std::make_unique<std::string>(std::move(*symlinkDestination));
+        file->extras().symlinkDestination = std::move(symlinkDestination);
     }
     file->localHeaderOffset_ = localHeaderOffset;
     file->generalPurposeFlags_ = generalPurposeFlags;
     file->compressionMethod_ = compressionMethod;
     if (!extraInfo.empty()) {
-        file->extraInfo_ = std::make_unique<GWDictionary>(std::move(extraInfo));
+        file->extras().extraInfo = std::move(extraInfo);
     }
     return file;
 }
@@ -118,32 +118,37 @@ std::mutex& GWZipFile::stateMutex() const {
 
 const GWDictionary& GWZipFile::storedExtraInfo() const {
     static const GWDictionary kEmpty;
-    return extraInfo_ ? *extraInfo_ : kEmpty;
+    return extras_ ? extras_->extraInfo : kEmpty;
 }
 
-std::optional<GWData> GWZipFile::Checksum::get() const {
-    if (!present_) {
-        return std::nullopt;
+GWZipFile::Extras& GWZipFile::extras() {
+    if (!extras_) {
+        extras_ = std::make_unique<Extras>();
     }
-    if (longBytes_) {
-        return *longBytes_;
-    }
-    return GWData(inlineBytes_, inlineBytes_ + inlineLength_);
+    return *extras_;
 }
 
-void GWZipFile::Checksum::set(std::optional<GWData> value) {
-    present_ = value.has_value();
-    longBytes_.reset();
-    inlineLength_ = 0;
-    if (!value) {
-        return;
+std::optional<GWData> GWZipFile::storedChecksum() const {
+    switch (checksumState_) {
+        case kNoChecksum: return std::nullopt;
+        case kLongChecksum: return extras_->longChecksum;
+        default: return GWData(checksumBytes_, checksumBytes_ + checksumState_);
     }
-    if (value->size() > kInlineCapacity) {
-        longBytes_ = std::make_unique<GWData>(std::move(*value));
-        return;
+}
+
+void GWZipFile::storeChecksum(std::optional<GWData> checksum) {
+    if (checksumState_ == kLongChecksum && extras_) {
+        extras_->longChecksum = GWData();
     }
-    std::copy(value->begin(), value->end(), inlineBytes_);
-    inlineLength_ = std::uint8_t(value->size());
+    if (!checksum) {
+        checksumState_ = kNoChecksum;
+    } else if (checksum->size() > kInlineChecksumCapacity) {
+        extras().longChecksum = std::move(*checksum);
+        checksumState_ = kLongChecksum;
+    } else {
+        std::copy(checksum->begin(), checksum->end(), checksumBytes_);
+        checksumState_ = std::uint8_t(checksum->size());
+    }
 }
 
 GWZipFile::Companions& GWZipFile::companions() {
@@ -214,26 +219,24 @@ void GWZipFile::setCompressedSize(std::uint64_t size) {
 
 std::optional<std::string> GWZipFile::symlinkDestination() const {
     std::lock_guard lock(stateMutex());
-    if (!symlinkDestination_) {
-        return std::nullopt;
-    }
-    return *symlinkDestination_;
+    return extras_ ? extras_->symlinkDestination : std::nullopt;
 }
 
 void GWZipFile::setSymlinkDestination(std::optional<std::string> destination) {
-    auto stored = destination ? std::make_unique<std::string>(std::move(*destination)) : nullptr;
     std::lock_guard lock(stateMutex());
-    symlinkDestination_.swap(stored);
+    if (destination || extras_) {
+        extras().symlinkDestination.swap(destination);
+    }
 }
 
 std::optional<GWData> GWZipFile::privateUncompressedChecksum() const {
     std::lock_guard lock(stateMutex());
-    return checksum_.get();
+    return storedChecksum();
 }
 
 void GWZipFile::setPrivateUncompressedChecksum(std::optional<GWData> checksum) {
     std::lock_guard lock(stateMutex());
-    checksum_.set(std::move(checksum));
+    storeChecksum(std::move(checksum));
 }
 
 std::uint64_t GWZipFile::privateUncompressedChecksumAlgorithm() const {
@@ -258,12 +261,8 @@ void GWZipFile::setExtraInfo(GWDictionary extraInfo) {
         name_ = std::move(*filename);
         gRenameEpoch.fetch_add(1, std::memory_order_relaxed);
     }
-    if (extraInfo.empty()) {
-        extraInfo_.reset();
-    } else if (extraInfo_) {
-        *extraInfo_ = std::move(extraInfo);
-    } else {
-        extraInfo_ = std::make_unique<GWDictionary>(std::move(extraInfo));
+    if (!extraInfo.empty() || extras_) {
+        extras().extraInfo.swap(extraInfo);
     }
 }
 
@@ -319,7 +318,10 @@ void GWZipFile::addChild(const GWZipFilePtr& child) {
 }
 
 GWZipFile::NameIndex& GWZipFile::nameIndex() const {
-    std::call_once(indexOnce_, [this] { index_ = std::make_unique<NameIndex>(); });
+    std::lock_guard lock(stateMutex());
+    if (!index_) {
+        index_ = std::make_unique<NameIndex>();
+    }
     return *index_;
 }
 
@@ -501,7 +503,7 @@ bool GWZipFile::moreInfoAvailableInLocalHeader() const {
 std::optional<GWData> GWZipFile::uncompressedChecksum() const {
     const bool macBinary = isMacBinaryEncoded();
     std::lock_guard lock(stateMutex());
-    return macBinary ? std::nullopt : checksum_.get();
+    return macBinary ? std::nullopt : storedChecksum();
 }
 
 std::uint64_t GWZipFile::uncompressedChecksumAlgorithm() const {

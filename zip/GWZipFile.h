@@ -203,20 +203,16 @@ private:
     // The extra info, or an empty one; under the state lock.
     const GWDictionary& storedExtraInfo() const;
 
-    // A CRC-32 is kept inline; longer checksums (decoded from a coder) on
-    // the heap.
-    class Checksum {
-    public:
-        std::optional<GWData> get() const;
-        void set(std::optional<GWData> value);
-
-    private:
-        static constexpr std::size_t kInlineCapacity = 8;
-        std::uint8_t inlineBytes_[kInlineCapacity] = {};
-        std::uint8_t inlineLength_ = 0;
-        bool present_ = false;
-        std::unique_ptr<GWData> longBytes_;
+    // What few entries carry and extraction may replace; under the state lock.
+    struct Extras {
+        std::optional<std::string> symlinkDestination;
+        GWDictionary extraInfo;
+        GWData longChecksum;  // one longer than fits inline
     };
+    Extras& extras();
+    // The checksum, or none; under the state lock.
+    std::optional<GWData> storedChecksum() const;
+    void storeChecksum(std::optional<GWData> checksum);
 
     // Companions are set while a tree is built, on one thread; few entries
     // have any.
@@ -226,24 +222,30 @@ private:
     };
     Companions& companions();
 
+    // checksumState_: a CRC-32 is kept inline; longer checksums (decoded
+    // from a coder) in the extras.
+    static constexpr std::size_t kInlineChecksumCapacity = 8;
+    static constexpr std::uint8_t kNoChecksum = 0xFF;
+    static constexpr std::uint8_t kLongChecksum = 0xFE;
+
     std::uint16_t permissionsMode_ = 0;
     std::uint16_t generalPurposeFlags_ = 0;
     std::uint16_t compressionMethod_ = 0;
+    std::uint8_t checksumState_ = kNoChecksum;  // else the inline length
     std::uint32_t owner_ = 0;
     std::uint32_t groupOwner_ = 0;
+    std::uint8_t checksumBytes_[kInlineChecksumCapacity] = {};
     std::optional<GWDate> modificationDate_;
     std::uint64_t uncompressedSize_ = 0;
     std::string name_;
     // Copy-on-write: appended to in place while no snapshot is out.
     std::shared_ptr<GWZipFileArray> children_;
     std::uint64_t compressedSize_ = 0;
-    std::unique_ptr<std::string> symlinkDestination_;  // null: not a link
+    std::unique_ptr<Extras> extras_;  // null: none of them
     std::unique_ptr<Companions> companions_;
     std::weak_ptr<GWZipFile> parent_;
     std::uint64_t localHeaderOffset_ = 0;
-    Checksum checksum_;
     std::uint64_t checksumAlgorithm_ = 0;
-    std::unique_ptr<GWDictionary> extraInfo_;  // null: empty
 
     // Name -> position of its first occurrence in children_, rebuilt when the
     // children are replaced or any entry anywhere is renamed. Lookups may run
@@ -255,10 +257,9 @@ private:
         std::uint64_t renameEpoch = 0;
         bool valid = false;
     };
-    // Made when first needed, by directories only: an archive of 200,000
-    // entries would otherwise carry 200,000 empty indexes.
+    // Made when first needed (under the state lock), by directories only: an
+    // archive of 200,000 entries would otherwise carry 200,000 empty indexes.
     NameIndex& nameIndex() const;
-    mutable std::once_flag indexOnce_;
     mutable std::unique_ptr<NameIndex> index_;
     std::uint64_t childrenGeneration_ = 0;
 };

@@ -37,10 +37,10 @@ void GWZipFile::encodeWithCoder(GWCoder& coder) const {
     lock.lock();
     coder.encodeUInt64(compressedSize_, kCompressedSizeKey);
     coder.encodeUInt64(uncompressedSize_, kUncompressedSizeKey);
-    coder.encodeValue(checksum_.get(), kUncompressedChecksumKey);
+    coder.encodeValue(storedChecksum(), kUncompressedChecksumKey);
     coder.encodeInteger(std::int64_t(checksumAlgorithm_), kUncompressedChecksumAlgorithmKey);
     const auto symlinkDestination =
-        symlinkDestination_ ? std::optional<std::string>(*symlinkDestination_) : std::nullopt;
+        extras_ ? extras_->symlinkDestination : std::optional<std::string>();
     const GWDictionary extraInfo = storedExtraInfo();
     lock.unlock();
     coder.encodeInt32(std::int32_t(owner_), kOwnerKey);
@@ -95,11 +95,14 @@ void GWZipFile::copyFieldsTo(GWZipFile& target) const {
     std::string name = name_;
     const std::uint64_t compressedSize = compressedSize_;
     const std::uint64_t uncompressedSize = uncompressedSize_;
-    auto symlinkDestination =
-        symlinkDestination_ ? std::make_unique<std::string>(*symlinkDestination_) : nullptr;
-    std::optional<GWData> checksum = checksum_.get();
+    std::optional<std::string> symlinkDestination;
+    GWDictionary extraInfo;
+    if (extras_) {
+        symlinkDestination = extras_->symlinkDestination;
+        extraInfo = extras_->extraInfo;
+    }
+    std::optional<GWData> checksum = storedChecksum();
     const std::uint64_t checksumAlgorithm = checksumAlgorithm_;
-    auto extraInfo = extraInfo_ ? std::make_unique<GWDictionary>(*extraInfo_) : nullptr;
     lock.unlock();
 
     std::lock_guard targetLock(target.stateMutex());
@@ -112,11 +115,15 @@ void GWZipFile::copyFieldsTo(GWZipFile& target) const {
     target.uncompressedSize_ = uncompressedSize;
     target.name_ = std::move(name);
     target.compressedSize_ = compressedSize;
-    target.symlinkDestination_ = std::move(symlinkDestination);
+    target.extras_.reset();
+    target.checksumState_ = kNoChecksum;
+    if (symlinkDestination || !extraInfo.empty()) {
+        target.extras().symlinkDestination = std::move(symlinkDestination);
+        target.extras().extraInfo = std::move(extraInfo);
+    }
     target.localHeaderOffset_ = localHeaderOffset_;
-    target.checksum_.set(std::move(checksum));
+    target.storeChecksum(std::move(checksum));
     target.checksumAlgorithm_ = checksumAlgorithm;
-    target.extraInfo_ = std::move(extraInfo);
 }
 
 GWZipFilePtr GWZipFile::copy() const {
