@@ -151,6 +151,13 @@ TEST(GWRemoteFileHandle, WritesLandAtThePositionAndAHandleWithoutURLDiscards) {
     EXPECT_TRUE(writer->closeFileAndReturnError(nullptr));
     EXPECT_EQ(gwtest::readFile(directory.file("out")), gwtest::bytesOf("hello there"));
 
+    // Writing to an existing file starts from nothing, as O_TRUNC would.
+    auto again = GWRemoteFileHandle::initForWritingToURL(directory.url("out"), nullptr);
+    ASSERT_TRUE(again);
+    ASSERT_TRUE(again->writeData(gwtest::bytesOf("hi"), nullptr));
+    EXPECT_TRUE(again->closeFileAndReturnError(nullptr));
+    EXPECT_EQ(gwtest::readFile(directory.file("out")), gwtest::bytesOf("hi"));
+
     auto sink = GWRemoteFileHandle::initForWritingToURL(std::nullopt, nullptr);
     ASSERT_TRUE(sink);
     EXPECT_TRUE(sink->writeData(gwtest::randomBytes(1000, 1), nullptr));
