@@ -17,7 +17,6 @@ public:
         ends_.reserve(count);
         text_.reserve(textBytes);
     }
-    std::size_t size() const { return ends_.size(); }
     std::string_view operator[](std::size_t index) const {
         const std::size_t start = index == 0 ? 0 : ends_[index - 1];
         return std::string_view(text_).substr(start, ends_[index] - start);
