@@ -21,6 +21,16 @@ enum GWZipArchiveErrorCode : long {
     // the caller named: through a symbolic link, or by a name that climbs out.
     // kGWZipArchiveUnknownEntityErrorKey holds the entry's path.
     GWZipArchiveEntryOutsideDestinationError = 4,
+    // The decoded data does not match the entry's stored CRC-32. Nothing of
+    // it is left on disk. kGWZipArchiveUnknownEntityErrorKey holds the path.
+    GWZipArchiveChecksumMismatchError = 5,
+    // The entry decodes to more or fewer bytes than its declared size;
+    // decoding stops at the declared size. The detail holds the path.
+    GWZipArchiveSizeMismatchError = 6,
+    // The entry's data overlaps another entry's (several records sharing one
+    // local header, or ranges that cross): the shape of a zip bomb, refused
+    // when the archive is opened. The detail holds the path.
+    GWZipArchiveOverlappingEntriesError = 7,
 };
 
 // Codes of kGWXARArchiveErrorDomain. 0, 8, 9 and 18 are never raised.
@@ -52,4 +62,7 @@ enum GWXARArchiveErrorCode : long {
     // device nodes on purpose. kGWXARArchiveUnknownEntityErrorKey holds the
     // item's path.
     GWXARArchiveDeviceNotPermittedError = 22,
+    // A stored stream decodes to more or fewer bytes than its <size> element
+    // says; decoding stops at that size. The detail holds the size.
+    GWXARArchiveSizeMismatchError = 23,
 };
