@@ -2,8 +2,8 @@
 
 #include <algorithm>
 
-#include "GWChecksum.h"
 #include "GWRemoteFileHandle.h"
+#include "GWStreamPipeline.h"
 #include "decoders/GWStreamDecoder.h"
 
 namespace {
@@ -249,65 +249,23 @@ void GWDecompressor::decompressRemoteFileHandle(const std::shared_ptr<GWRemoteFi
         handler({}, 0, 0, true, std::nullopt, std::nullopt, error);
         return;
     }
-    auto storedDigest = GWChecksum::checksumWithAlgorithm(compressedChecksumAlgorithm);
-    auto decodedDigest = GWChecksum::checksumWithAlgorithm(decompressedChecksumAlgorithm);
-    std::uint64_t storedBytes = 0, decodedBytes = 0;
-
-    // Hands one decoded piece on; on the last one, with both digests.
-    auto deliver = [&](std::span<const std::uint8_t> piece, bool done) {
-        decodedBytes += piece.size();
-        if (decodedDigest) {
-            decodedDigest->update(piece);
-        }
-        std::optional<GWData> stored, decoded;
-        if (done) {
-            if (storedDigest) {
-                stored = storedDigest->finish();
-            }
-            if (decodedDigest) {
-                decoded = decodedDigest->finish();
-            }
-        }
-        return handler(piece, storedBytes, decodedBytes, done, stored, decoded, nullptr);
-    };
-    // An empty range is an empty stream whatever its nominal compression.
-    if (length == 0) {
-        deliver({}, true);
-        return;
+    GWStreamCheck check;
+    check.storedAlgorithm = compressedChecksumAlgorithm;
+    check.decodedAlgorithm = decompressedChecksumAlgorithm;
+    const GWStreamPipeline* running = nullptr;
+    GWStreamPipeline pipeline(decompressor, check, [&](std::span<const std::uint8_t> piece) {
+        const GWStreamOutcome& sofar = running->outcome();
+        return handler(piece, sofar.storedBytes, sofar.decodedBytes, false, std::nullopt,
+                       std::nullopt, nullptr);
+    });
+    running = &pipeline;
+    const GWStreamOutcome& outcome = pipeline.run(*handle, offset, length);
+    const std::uint64_t storedBytes = outcome.storedBytes, decodedBytes = outcome.decodedBytes;
+    if (outcome.end == GWStreamEnd::failed) {
+        handler({}, storedBytes, decodedBytes, true, std::nullopt, std::nullopt, outcome.error);
+    } else if (outcome.end == GWStreamEnd::complete) {
+        // The end is known only after the last piece, so the digests come with an empty one.
+        handler({}, storedBytes, decodedBytes, true, outcome.storedDigest, outcome.decodedDigest,
+                nullptr);
     }
-
-    handle->readDataAtOffset(offset, length, UINT64_MAX,
-                             [&](GWRemoteFileHandle&, std::span<const std::uint8_t> chunk,
-                                 bool isLast, const GWErrorPtr& readError) {
-                                 if (readError) {
-                                     handler({}, storedBytes, decodedBytes, true, std::nullopt,
-                                             std::nullopt, readError);
-                                     return false;
-                                 }
-                                 storedBytes += chunk.size();
-                                 if (storedDigest) {
-                                     storedDigest->update(chunk);
-                                 }
-                                 GWErrorPtr decodeError;
-                                 bool delivered = true;
-                                 // Pieces go on as they are decoded, without a copy; the end is
-                                 // known only afterwards, so the digests come with an empty piece.
-                                 if (!decompressor->decompressStreamWithInputData(
-                                         chunk, isLast,
-                                         [&](std::span<const std::uint8_t> piece) {
-                                             delivered = deliver(piece, false);
-                                             return delivered;
-                                         },
-                                         &decodeError)) {
-                                     if (delivered) {
-                                         handler({}, storedBytes, decodedBytes, true, std::nullopt,
-                                                 std::nullopt, decodeError);
-                                     }
-                                     return false;
-                                 }
-                                 if (isLast && !deliver({}, true)) {
-                                     return false;
-                                 }
-                                 return true;
-                             });
 }

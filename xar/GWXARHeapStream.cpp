@@ -5,21 +5,19 @@
 #include "GWArchiveSupport/GWArchiveConstants.h"
 #include "foundation/GWDecompressor.h"
 #include "foundation/GWRemoteFileHandle.h"
+#include "foundation/GWStreamPipeline.h"
 
 namespace {
 
-// A digest missing on either side never matches.
-bool digestsMatch(const std::optional<GWData>& computed, const std::optional<GWData>& stored) {
-    return computed && stored && *computed == *stored;
-}
-
 // A few hundred bytes of bzip2 can decode to tens of megabytes; a stream is
 // never allowed to grow past the size its table of contents states.
-GWErrorPtr oversizedStreamError(std::uint64_t statedSize, const GWURL& url) {
-    return GWGenerateError(kGWCocoaErrorDomain, GWFileReadCorruptFileError, url, nullptr, {},
-                           "An item of %s decodes to more than the %llu bytes its table of "
+GWErrorPtr sizeMismatchError(std::uint64_t statedSize, GWStreamEnd end, const GWURL& url) {
+    return GWGenerateError(kGWXARArchiveErrorDomain, GWXARArchiveSizeMismatchError, url, nullptr,
+                           {{kGWXARArchiveUnknownEntityErrorKey, GWValue(statedSize)}},
+                           "An item of %s decodes to %s than the %llu bytes its table of "
                            "contents states.",
-                           url.path().c_str(), (unsigned long long)statedSize);
+                           url.path().c_str(), end == GWStreamEnd::tooLong ? "more" : "fewer",
+                           (unsigned long long)statedSize);
 }
 
 GWErrorPtr unsupportedCompressionError(std::uint64_t type, const GWURL& url) {
@@ -82,44 +80,39 @@ void GWXARHeapStream::streamDataReference(const GWXARDataReference& reference,
     }
 
     context.setCancelled(false);
-    bool checksumFailed = false;
-    std::uint64_t decodedLength = 0;
-    bool handleClosed = false;
-    auto closeHandle = [&] {
-        if (!handleClosed) {
-            handle->closeFileAndReturnError(nullptr);
-            handleClosed = true;
+    auto decoder = GWDecompressor::initForStreamingWithAlgorithm(*algorithm, &openError);
+    if (!decoder) {
+        invokeDataHandler(handler, context, std::nullopt, true, false, openError);
+        return;
+    }
+    GWStreamCheck check{reference.uncompressedSize(), int(reference.compressedChecksumType()),
+                        reference.compressedChecksum(), int(reference.uncompressedChecksumType()),
+                        reference.uncompressedChecksum()};
+    GWStreamPipeline pipeline(decoder, check, [&](std::span<const std::uint8_t> piece) {
+        if (context.isCancelled()) {
+            return false;
         }
-    };
-    GWDecompressor::decompressRemoteFileHandle(
-        handle, reference.offset(), reference.compressedSize(), *algorithm,
-        int(reference.compressedChecksumType()), int(reference.uncompressedChecksumType()),
-        [&](std::span<const std::uint8_t> piece, std::uint64_t, std::uint64_t, bool done,
-            const std::optional<GWData>& storedDigest, const std::optional<GWData>& decodedDigest,
-            GWErrorPtr error) {
-            decodedLength += piece.size();
-            if (!error && decodedLength > reference.uncompressedSize()) {
-                error = oversizedStreamError(reference.uncompressedSize(), url);
-            }
-            if (done || error || context.isCancelled()) {
-                closeHandle();
-            }
-            if (context.isCancelled()) {
-                return false;
-            }
-            if (done && !error &&
-                (!digestsMatch(storedDigest, reference.compressedChecksum()) ||
-                 !digestsMatch(decodedDigest, reference.uncompressedChecksum()))) {
-                checksumFailed = true;
-            }
-            if (error) {
-                context.setCancelled(true);
-                invokeDataHandler(handler, context, std::nullopt, true, checksumFailed, error);
-                return false;
-            }
-            invokeDataHandler(handler, context, piece, done, checksumFailed, nullptr);
-            return true;
-        });
-    // The decompressor stops calling once told to stop; the handle is ours to close.
-    closeHandle();
+        invokeDataHandler(handler, context, piece, false, false, nullptr);
+        return !context.isCancelled();
+    });
+    const GWStreamOutcome& outcome =
+        pipeline.run(*handle, reference.offset(), reference.compressedSize(), context.isCancelled);
+    handle->closeFileAndReturnError(nullptr);
+    if (context.isCancelled() || outcome.end == GWStreamEnd::stopped) {
+        return;  // whoever cancelled has had the handler's last call
+    }
+    GWErrorPtr error = outcome.error;
+    if (outcome.end == GWStreamEnd::tooLong || outcome.end == GWStreamEnd::tooShort) {
+        error = sizeMismatchError(reference.uncompressedSize(), outcome.end, url);
+    }
+    const bool checksumFailed =
+        outcome.end == GWStreamEnd::complete &&
+        !(outcome.storedDigestMatches(check) && outcome.decodedDigestMatches(check));
+    if (error) {
+        context.setCancelled(true);
+        invokeDataHandler(handler, context, std::nullopt, true, false, error);
+        return;
+    }
+    invokeDataHandler(handler, context, std::span<const std::uint8_t>(), true, checksumFailed,
+                      nullptr);
 }

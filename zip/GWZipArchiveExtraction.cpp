@@ -3,6 +3,7 @@
 #include "GWZipArchive.h"
 #include "GWZipExtractDestination.h"
 #include "foundation/GWDispatch.h"
+#include "foundation/GWFreeSpace.h"
 
 namespace {
 
@@ -13,6 +14,19 @@ struct BatchState {
     GWErrorPtr firstError;
     std::vector<std::weak_ptr<GWZipExtractOperation>> operations;
 };
+
+// What a batch will write: each regular entry's data and its companions'.
+std::uint64_t declaredSize(const std::vector<GWZipExtractOperationPtr>& operations) {
+    std::uint64_t total = 0;
+    for (const auto& operation : operations) {
+        const GWZipFilePtr& file = operation->file();
+        if (!file->isDirectory()) {
+            const std::uint64_t size = file->uncompressedSize();
+            total = size > UINT64_MAX - total ? UINT64_MAX : total + size;
+        }
+    }
+    return total;
+}
 
 GWOperationQueuePtr extractionQueue() {
     auto queue = std::make_shared<GWOperationQueue>();
@@ -77,6 +91,14 @@ void GWZipArchive::extractFiles(const GWZipFileArray& files, const GWURL& direct
         operationsToExtractFiles(files, directory, atomically, std::move(progressHandler), &error);
     if (!operations) {
         // The completion handler is deliberately never called here.
+        return;
+    }
+    // Refused before anything is written: a hostile archive fills no disk.
+    if (!GWCheckFreeSpace(directory, declaredSize(*operations), &error)) {
+        if (completionHandler) {
+            runQueue->addOperationWithBlock(
+                [error, completion = std::move(completionHandler)] { completion(error); });
+        }
         return;
     }
     auto state = std::make_shared<BatchState>();

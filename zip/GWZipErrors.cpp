@@ -15,6 +15,16 @@ GWErrorPtr GWZipUnknownEntityError(long code, std::uint64_t entity, const char* 
                            std::move(details), "%s", description.c_str());
 }
 
+GWErrorPtr GWZipEntryError(long code, const std::string& path, const char* format, ...) {
+    va_list arguments;
+    va_start(arguments, format);
+    std::string description = GWFormatV(format, arguments);
+    va_end(arguments);
+    GWDictionary details{{kGWZipArchiveUnknownEntityErrorKey, GWValue(path)}};
+    return GWGenerateError(kGWZipArchiveErrorDomain, code, std::nullopt, nullptr,
+                           std::move(details), "%s", description.c_str());
+}
+
 std::string GWZipErrorLogDescription(const GWErrorPtr& error) {
     if (!error) {
         return "(null)";

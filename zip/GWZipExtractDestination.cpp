@@ -61,10 +61,9 @@ std::optional<GWURL> GWZipExtractOperation::prepareTarget(bool isDirectory, bool
     return target;
 }
 
-GWURL GWZipExtractTemporaryURL() {
-    return GWURL::fileURLWithPath(GWTemporaryDirectoryPath() + "/" +
-                                  GWZipExtractOperation::kBundleIdentifier + ".temp." +
-                                  GWUniqueID());
+GWURL GWZipExtractTemporaryURL(const GWURL& target) {
+    return target.URLByDeletingLastPathComponent().URLByAppendingPathComponent(
+        std::string(".") + GWZipExtractOperation::kBundleIdentifier + ".temp." + GWUniqueID());
 }
 
 GWURL GWZipEntryDestinationURL(const GWURL& base, std::string_view relativePath) {

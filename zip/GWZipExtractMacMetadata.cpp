@@ -97,7 +97,7 @@ void GWZipExtractOperation::applyAppleDoubleMetadataForFile(const GWZipFilePtr& 
                                                             const GWRemoteFileHandlePtr& handle,
                                                             const GWURL& url,
                                                             Completion completion) {
-    const GWURL temporary = GWZipExtractTemporaryURL();
+    const GWURL temporary = GWZipExtractTemporaryURL(url);
     GWErrorPtr error;
     if (!GWCreateEmptyFileAtomicallyAtURL(temporary, &error)) {
         completion(error);
@@ -105,6 +105,7 @@ void GWZipExtractOperation::applyAppleDoubleMetadataForFile(const GWZipFilePtr& 
     }
     auto writer = GWRemoteFileHandle::initForWritingToURL(temporary, &error);
     if (!writer) {
+        GWRemoveItemAtURL(temporary, nullptr);
         completion(error);
         return;
     }
@@ -120,18 +121,17 @@ void GWZipExtractOperation::applyAppleDoubleMetadataForFile(const GWZipFilePtr& 
                        return;
                    }
                    // A companion that does not merge is no reason to fail the
-                   // entry. After a merge the copy stays behind: known and kept.
-                   const auto& decoder = GWAppleFileDecoder::sharedInstance();
-                   if (!decoder->mergeAppleDoubleFileAtURL(temporary, url, nullptr)) {
-                       GWRemoveItemAtURL(temporary, nullptr);
-                   }
+                   // entry. The copy lives beside the file, so it goes either way.
+                   GWAppleFileDecoder::sharedInstance()->mergeAppleDoubleFileAtURL(temporary, url,
+                                                                                   nullptr);
+                   GWRemoveItemAtURL(temporary, nullptr);
                    completion(nullptr);
                });
 }
 
 void GWZipExtractOperation::decodeMacBinaryFileAtURL(const GWURL& url, Completion completion) {
     GWDispatchQueue::globalQueue()->async([url, completion = std::move(completion)] {
-        const GWURL temporary = GWZipExtractTemporaryURL();
+        const GWURL temporary = GWZipExtractTemporaryURL(url);
         GWErrorPtr error;
         if (!GWAppleFileDecoder::sharedInstance()->decodeMacBinaryFileAtURL(url, temporary,
                                                                             &error)) {

@@ -158,7 +158,11 @@ void GWZipExtractOperation::unpackWithHandler(ChunkHandler handler, Completion c
         }
     }
     unpackFile(file_, handle, target, std::move(handler),
-               [this, target, finalStep](const GWErrorPtr& error) {
+               [this, target, isDirectory, isSymbolicLink, finalStep](const GWErrorPtr& error) {
+                   if (error && target && !isDirectory && !isSymbolicLink) {
+                       // Nothing that failed a check may stay on disk as if whole.
+                       GWRemoveItemAtURL(*target, nullptr);
+                   }
                    if (error || !destURL_) {
                        finalStep(error);
                        return;

@@ -163,6 +163,7 @@ private:
     std::atomic<bool> done_{false};
 };
 
-// A temporary location in the process's temporary directory, named after the
-// library's bundle identifier.
-GWURL GWZipExtractTemporaryURL();
+// A temporary location beside `target`, named after the library's bundle
+// identifier: inside the extraction's replacement folder when it has one, and
+// on the destination's file system in any case, never loose in $TMPDIR.
+GWURL GWZipExtractTemporaryURL(const GWURL& target);

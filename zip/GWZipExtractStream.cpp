@@ -3,10 +3,14 @@
 #include <cstring>
 
 #include "GWZipExtractOperation.h"
+#include "GWZipErrors.h"
 #include "GWZipNames.h"
+#include "GWArchiveSupport/GWArchiveConstants.h"
 #include "foundation/GWFileManager.h"
 #include "foundation/GWLog.h"
+#include "foundation/GWFormat.h"
 #include "foundation/GWRemoteFileHandle.h"
+#include "foundation/GWStreamPipeline.h"
 
 namespace {
 
@@ -34,6 +38,70 @@ bool readLocalHeader(const GWZipWorkOperation& operation, const GWZipFilePtr& fi
         return false;
     }
     return true;
+}
+
+// What an entry's decoded data must come to: its declared size and, where
+// the directory has one, its CRC-32. A MacBinary member is checked as
+// stored, before it is decoded.
+GWStreamCheck streamCheckForFile(const GWZipFile& file) {
+    GWStreamCheck check;
+    check.size = file.storedUncompressedSize();
+    if (file.privateUncompressedChecksumAlgorithm() == GWChecksumAlgorithmCRC32) {
+        if (auto crc = file.privateUncompressedChecksum(); crc && crc->size() == 4) {
+            check.decodedAlgorithm = GWChecksumAlgorithmCRC32;
+            check.decodedDigest = std::move(crc);
+        }
+    }
+    return check;
+}
+
+GWErrorPtr sizeMismatchError(const GWZipFile& file, std::uint64_t decoded, bool tooLong) {
+    return GWZipEntryError(GWZipArchiveSizeMismatchError, file.path(),
+                           "entry %s decodes to %s than its declared %llu bytes%s",
+                           file.path().c_str(), tooLong ? "more" : "fewer",
+                           (unsigned long long)file.storedUncompressedSize(),
+                           tooLong ? "" : GWFormat(" (%llu)", (unsigned long long)decoded).c_str());
+}
+
+GWErrorPtr checksumMismatchError(const GWZipFile& file) {
+    return GWZipEntryError(GWZipArchiveChecksumMismatchError, file.path(),
+                           "entry %s does not match its CRC-32", file.path().c_str());
+}
+
+// Why the stream of `file` failed, or none when every byte checked out.
+GWErrorPtr streamError(const GWZipFile& file, const GWStreamPipeline& pipeline,
+                       const GWErrorPtr& handlerError) {
+    const GWStreamOutcome& outcome = pipeline.outcome();
+    switch (outcome.end) {
+        case GWStreamEnd::stopped:
+            // A handler that stops without saying why was stopped by its caller.
+            return handlerError ? handlerError : GWCocoaError(GWUserCancelledError);
+        case GWStreamEnd::failed:
+            return outcome.error ? outcome.error : GWCocoaError(GWFileReadCorruptFileError);
+        case GWStreamEnd::tooLong:
+        case GWStreamEnd::tooShort:
+            return sizeMismatchError(file, outcome.decodedBytes,
+                                     outcome.end == GWStreamEnd::tooLong);
+        case GWStreamEnd::complete:
+            if (pipeline.check().decodedDigest && !outcome.decodedDigestMatches(pipeline.check())) {
+                return checksumMismatchError(file);
+            }
+            return nullptr;
+    }
+    return nullptr;
+}
+
+// An entry without stored bytes decodes to nothing: its declared size and
+// CRC-32 must say so too.
+GWErrorPtr emptyStreamError(const GWZipFile& file) {
+    const GWStreamCheck check = streamCheckForFile(file);
+    if (check.size && *check.size != 0) {
+        return sizeMismatchError(file, 0, false);
+    }
+    if (check.decodedDigest && *check.decodedDigest != GWData(4, 0)) {
+        return checksumMismatchError(file);
+    }
+    return nullptr;
 }
 
 // A link's text as the file system takes it: up to the first zero byte.
@@ -151,7 +219,7 @@ void GWZipExtractOperation::unpackFile(const GWZipFilePtr& file,
         return;
     }
     if (compressedSize == 0) {
-        completion(nullptr);
+        completion(emptyStreamError(*file));
         return;
     }
     const std::uint64_t skip =
@@ -175,63 +243,23 @@ void GWZipExtractOperation::extractFile(const GWZipFilePtr& file, std::uint64_t 
         completion(error);
         return;
     }
-    if (!data && !handle->seekToFileOffset(offset, &error)) {
-        completion(error);
-        return;
-    }
-    // A handler that stops without saying why was stopped by its caller.
-    auto stopError = [](GWErrorPtr error) {
-        return error ? error : GWCocoaError(GWUserCancelledError);
-    };
-    auto pass = [&](std::span<const std::uint8_t> output, bool isDone) {
-        GWErrorPtr handlerError;
-        if (!handler(output, isDone, &handlerError)) {
-            completion(stopError(handlerError));
-            return false;
-        }
-        return true;
-    };
-    auto decode = [&](std::span<const std::uint8_t> input, bool isFinal) {
-        bool passed = true;
-        GWErrorPtr decodeError;
-        if (decompressor->decompressStreamWithInputData(
-                input, isFinal,
-                [&](std::span<const std::uint8_t> output) { return passed = pass(output, false); },
-                &decodeError)) {
-            return true;
-        }
-        if (passed) {
-            completion(decodeError ? decodeError
-                                   : GWCocoaError(GWFileReadCorruptFileError, srcURL_));
-        }
-        return false;
-    };
-    auto read = [&](GWRemoteFileHandle&, std::span<const std::uint8_t> chunk, bool isFinal,
-                    const GWErrorPtr& readError) {
-        if (isCancelled()) {
-            completion(GWCocoaError(GWUserCancelledError));
-            return false;
-        }
-        if (readError) {
-            completion(readError);
-            return false;
-        }
-        if (!chunk.empty() && !decode(chunk, isFinal)) {
-            return false;
-        }
-        if (isFinal) {
-            if (!pass({}, true)) {
-                return false;
-            }
-            completion(nullptr);
-        }
-        return true;
-    };
+    GWErrorPtr handlerError;
+    GWStreamPipeline pipeline(decompressor, streamCheckForFile(*file),
+                              [&](std::span<const std::uint8_t> piece) {
+                                  return handler(piece, false, &handlerError);
+                              });
     if (data) {
-        read(*handle, *data, true, nullptr);
+        pipeline.feed(*data, true);
+    } else {
+        pipeline.run(*handle, offset, length, [this] { return isCancelled(); });
+    }
+    if (auto failure = streamError(*file, pipeline, handlerError)) {
+        completion(failure);
         return;
     }
-    handle->readDataAtOffset(offset, length, UINT64_MAX, read);
+    completion(handler({}, true, &handlerError) ? nullptr
+                                                : handlerError ? handlerError
+                                                               : GWCocoaError(GWUserCancelledError));
 }
 
 bool GWZipExtractOperation::loadExtraInfoFromLocalHeader(const GWZipLocalFileHeader& header,

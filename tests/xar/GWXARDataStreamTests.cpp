@@ -187,22 +187,25 @@ TEST_F(DataStreamContract, DamagedStreamReportsTheDecoderErrorOnce) {
 }
 
 // A fuzzed archive: 155 bytes of bzip2 stated to hold 300 bytes decoded to
-// 12 MB, digested with MD2 for half a minute.
-TEST_F(DataStreamContract, StreamLongerThanItsStatedSizeStopsThere) {
+// 12 MB, digested with MD2 for half a minute. A stream short of its stated
+// size is as wrong.
+TEST_F(DataStreamContract, StreamsEndAtTheirStatedSizeOrFail) {
     const GWData zeros(8 * 1024 * 1024, 0);
-    std::string element = xar.dataElement("data", zeros, XarEncoding::bzip2, "md2");
-    const std::string stated = "<size>" + std::to_string(zeros.size()) + "</size>";
-    element.replace(element.find(stated), stated.size(), "<size>300</size>");
-    auto archive = openWithFile({}, "", element);
-    ASSERT_TRUE(archive);
+    for (const std::string stated : {"300", "8388609"}) {
+        std::string element = xar.dataElement("data", zeros, XarEncoding::bzip2, "md2");
+        const std::string real = "<size>" + std::to_string(zeros.size()) + "</size>";
+        element.replace(element.find(real), real.size(), "<size>" + stated + "</size>");
+        auto archive = openWithFile({}, "", element);
+        ASSERT_TRUE(archive);
 
-    const auto calls = dataFork(archive, "f");
-    ASSERT_FALSE(calls.calls.empty());
-    EXPECT_LE(calls.bytes().size(), 300u);
-    EXPECT_TRUE(calls.last().isDone);
-    ASSERT_TRUE(calls.last().error);
-    EXPECT_EQ(calls.last().error->domain(), kGWCocoaErrorDomain);
-    EXPECT_EQ(calls.last().error->code(), GWFileReadCorruptFileError);
+        const auto calls = dataFork(archive, "f");
+        ASSERT_FALSE(calls.calls.empty());
+        EXPECT_LE(calls.bytes().size(), std::stoull(stated));
+        EXPECT_TRUE(calls.last().isDone);
+        ASSERT_TRUE(calls.last().error);
+        EXPECT_TRUE(calls.last().error->is(kGWXARArchiveErrorDomain, 23)) << stated;
+        EXPECT_EQ(calls.last().error->detailString(kGWXARArchiveUnknownEntityErrorKey), stated);
+    }
 }
 
 TEST_F(DataStreamContract, StreamPastTheEndOfTheFileFails) {

@@ -5,6 +5,7 @@
 
 #include "Command.h"
 #include "Diagnostics.h"
+#include "foundation/GWFreeSpace.h"
 #include "Locations.h"
 #include "ProgressBar.h"
 #include "ToolArchive.h"
@@ -21,6 +22,23 @@ bool wantsProgressBar(const ParsedArguments& arguments) {
     return isatty(STDERR_FILENO) == 1;
 }
 
+// What the selected entries will write: the data of each regular file and its
+// resource fork; hard links share their target's.
+std::uint64_t declaredSize(const ToolArchive& archive, const std::vector<std::size_t>& selected) {
+    std::uint64_t total = 0;
+    auto add = [&total](std::uint64_t size) {
+        total = size > UINT64_MAX - total ? UINT64_MAX : total + size;
+    };
+    for (std::size_t index : selected) {
+        if (archive.entryType(index) != EntryType::file)
+            continue;
+        const EntryRecord record = archive.entry(index);
+        add(record.size);
+        add(record.resourceForkSize.value_or(0));
+    }
+    return total;
+}
+
 int runExtract(const ParsedArguments& arguments) {
     const std::string& operand = arguments.operands[0];
     auto archive = openArchiveOperand(operand);
@@ -34,6 +52,12 @@ int runExtract(const ParsedArguments& arguments) {
 
     ExtractOptions options{localURL(arguments.value("directory").value_or(".")),
                            arguments.has("overwrite"), nullptr};
+    // Refused before anything is written: a hostile archive fills no disk.
+    GWErrorPtr spaceError;
+    if (!GWCheckFreeSpace(options.directory, declaredSize(*archive, selected), &spaceError)) {
+        reportError(operand, std::nullopt, spaceError);
+        return kExitFailure;
+    }
     std::unique_ptr<ProgressBar> bar;
     if (wantsProgressBar(arguments)) {
         std::uint64_t total = 0;
