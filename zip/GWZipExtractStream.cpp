@@ -2,13 +2,13 @@
 #include <cerrno>
 #include <cstring>
 
-#include "GWZipExtractOperation.h"
-#include "GWZipErrors.h"
-#include "GWZipNames.h"
 #include "GWArchiveSupport/GWArchiveConstants.h"
+#include "GWZipErrors.h"
+#include "GWZipExtractOperation.h"
+#include "GWZipNames.h"
 #include "foundation/GWFileManager.h"
-#include "foundation/GWLog.h"
 #include "foundation/GWFormat.h"
+#include "foundation/GWLog.h"
 #include "foundation/GWRemoteFileHandle.h"
 #include "foundation/GWStreamPipeline.h"
 
@@ -244,10 +244,9 @@ void GWZipExtractOperation::extractFile(const GWZipFilePtr& file, std::uint64_t 
         return;
     }
     GWErrorPtr handlerError;
-    GWStreamPipeline pipeline(decompressor, streamCheckForFile(*file),
-                              [&](std::span<const std::uint8_t> piece) {
-                                  return handler(piece, false, &handlerError);
-                              });
+    GWStreamPipeline pipeline(
+        decompressor, streamCheckForFile(*file),
+        [&](std::span<const std::uint8_t> piece) { return handler(piece, false, &handlerError); });
     if (data) {
         pipeline.feed(*data, true);
     } else {
@@ -258,8 +257,8 @@ void GWZipExtractOperation::extractFile(const GWZipFilePtr& file, std::uint64_t 
         return;
     }
     completion(handler({}, true, &handlerError) ? nullptr
-                                                : handlerError ? handlerError
-                                                               : GWCocoaError(GWUserCancelledError));
+               : handlerError                   ? handlerError
+                                                : GWCocoaError(GWUserCancelledError));
 }
 
 bool GWZipExtractOperation::loadExtraInfoFromLocalHeader(const GWZipLocalFileHeader& header,

@@ -1,5 +1,6 @@
 #include "TestSupport.h"
 
+#include <sys/mount.h>
 #include <sys/wait.h>
 
 #include <cstdio>
@@ -23,6 +24,17 @@ TemporaryDirectory::TemporaryDirectory() {
 TemporaryDirectory::~TemporaryDirectory() {
     std::error_code ignored;
     std::filesystem::remove_all(path_, ignored);
+}
+
+SmallFileSystem::SmallFileSystem(std::uint64_t bytes) {
+    const std::string size = "size=" + std::to_string(bytes);
+    mounted_ = ::mount("tmpfs", directory_.path().c_str(), "tmpfs", 0, size.c_str()) == 0;
+}
+
+SmallFileSystem::~SmallFileSystem() {
+    if (mounted_) {
+        ::umount2(directory_.path().c_str(), MNT_DETACH);
+    }
 }
 
 void writeFile(const std::string& path, const GWData& bytes) {

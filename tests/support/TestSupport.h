@@ -25,6 +25,20 @@ private:
     std::string path_;
 };
 
+// A file system of `bytes` (tmpfs) mounted on a fresh directory, unmounted at
+// the end; mounted() is false where this process may not mount.
+class SmallFileSystem {
+public:
+    explicit SmallFileSystem(std::uint64_t bytes);
+    ~SmallFileSystem();
+    bool mounted() const { return mounted_; }
+    const std::string& path() const { return directory_.path(); }
+
+private:
+    TemporaryDirectory directory_;
+    bool mounted_ = false;
+};
+
 void writeFile(const std::string& path, const GWData& bytes);
 GWData readFile(const std::string& path);
 

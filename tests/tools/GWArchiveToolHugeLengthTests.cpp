@@ -1,11 +1,13 @@
-// Length fields are claims: archives that claim enormous tables, counts or
-// forks fail with the documented error without the memory they claim.
+// Length fields are claims: archives that claim enormous tables, counts,
+// forks or sizes fail with the documented error without the memory they
+// claim, and write no more than they declare.
 // Measured in the tool's own process, so the test binary's footprint does
 // not count.
 
 #include <gtest/gtest.h>
 
 #include <algorithm>
+#include <filesystem>
 #include <functional>
 
 #include "ToolTestSupport.h"
@@ -34,10 +36,43 @@ struct HugeCase {
     const char* name;
     const char* fileName;
     std::function<GWData()> build;
-    std::vector<std::string> command;  // before the input path
+    std::vector<std::string> command;  // before the input path; "OUT" is a fresh folder
     bool withOutput;                   // an output path follows the input
     const char* error;                 // as the tool prints it
+    std::uint64_t maxWritten = 0;      // bytes the run may leave in the folder
 };
+
+// A stream that decodes to 16 MiB while its headers claim 100 bytes.
+GWData zipBomb(std::uint16_t method) {
+    ZipBuilder zip;
+    zip.addFile("bomb", GWData(16 << 20, 0), method).uncompressedSize = 100;
+    return zip.bytes();
+}
+
+// Many files whose data references all point at one heap range, each
+// claiming `size` bytes.
+GWData xarSharingOneRange(std::size_t count, const std::string& size) {
+    XarBuilder xar;
+    std::string data = xar.dataElement("data", GWData(16 << 20, 0), XarEncoding::bzip2);
+    const auto at = data.find("<size>");
+    data.replace(at, data.find("</size>") - at, "<size>" + size);
+    std::string files;
+    for (std::size_t i = 1; i <= count; ++i)
+        files += "<file id=\"" + std::to_string(i) + "\"><name>f" + std::to_string(i) +
+                 "</name><type>file</type>" + data + "</file>";
+    xar.setFiles(files);
+    return xar.bytes();
+}
+
+std::uint64_t bytesBelow(const std::string& root) {
+    std::uint64_t total = 0;
+    std::error_code ignored;
+    for (auto it = std::filesystem::recursive_directory_iterator(root, ignored);
+         it != std::filesystem::recursive_directory_iterator(); it.increment(ignored))
+        if (it->is_regular_file(ignored))
+            total += it->file_size(ignored);
+    return total;
+}
 
 void PrintTo(const HugeCase& test, std::ostream* out) {
     *out << test.name;
@@ -100,6 +135,31 @@ const HugeCase kHugeCases[] = {
      {"macbinary"},
      true,
      "NSCocoaErrorDomain 256"},
+    {"ZipDeflateBombLyingAboutItsSize",
+     "deflate.zip",
+     [] { return zipBomb(8); },
+     {"extract", "-C", "OUT"},
+     false,
+     "GWZipArchiveErrorDomain 6"},
+    {"ZipBzip2BombLyingAboutItsSize",
+     "bzip2.zip",
+     [] { return zipBomb(12); },
+     {"extract", "-C", "OUT"},
+     false,
+     "GWZipArchiveErrorDomain 6"},
+    {"XARFilesSharingOneHeapRangeClaimingATerabyte",
+     "shared.xar",
+     [] { return xarSharingOneRange(1000, std::to_string(1ull << 30)); },
+     {"extract", "-C", "OUT"},
+     false,
+     "NSPOSIXErrorDomain 28"},
+    {"XARFilesSharingOneHeapRangeEachStoppedAtItsSize",
+     "stopped.xar",
+     [] { return xarSharingOneRange(1000, "1000"); },
+     {"extract", "-C", "OUT"},
+     false,
+     "GWXARArchiveErrorDomain 23",
+     1000 * 1000},
 };
 
 class GWArchiveToolHugeLength : public ::testing::TestWithParam<HugeCase> {};
@@ -108,7 +168,9 @@ TEST_P(GWArchiveToolHugeLength, FailsInBoundedMemory) {
     TemporaryDirectory directory;
     const std::string input = directory.file(GetParam().fileName);
     writeFile(input, GetParam().build());
+    const std::string out = directory.file("out");
     std::vector<std::string> arguments = GetParam().command;
+    std::replace(arguments.begin(), arguments.end(), std::string("OUT"), out);
     arguments.push_back(input);
     if (GetParam().withOutput)
         arguments.push_back(directory.file("out"));
@@ -117,6 +179,7 @@ TEST_P(GWArchiveToolHugeLength, FailsInBoundedMemory) {
     EXPECT_NE(run.err.find(GetParam().error), std::string::npos) << run.err;
     EXPECT_GT(run.maxResidentKiB, 0);
     EXPECT_LT(run.maxResidentKiB, kResidentLimitKiB);
+    EXPECT_LE(bytesBelow(out), GetParam().maxWritten);
     RecordProperty("maxResidentKiB", std::to_string(run.maxResidentKiB));
 }
 

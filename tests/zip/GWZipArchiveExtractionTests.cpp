@@ -5,6 +5,7 @@
 #include <sys/stat.h>
 
 #include <atomic>
+#include <cerrno>
 
 #include "GWArchiveSupport/GWArchiveConstants.h"
 #include "foundation/GWDispatch.h"
@@ -13,6 +14,7 @@
 #include "support/MetadataTestSupport.h"
 #include "support/TestSupport.h"
 #include "support/ZipBuilder.h"
+#include "tools/ToolTestSupport.h"
 #include "zip/GWZipArchive.h"
 #include "zip/ZipExtractTestSupport.h"
 
@@ -155,6 +157,30 @@ TEST_F(GWZipArchiveExtraction, TheFirstErrorIsTheBatchsResult) {
     done.wait();
     ASSERT_TRUE(reported);
     EXPECT_TRUE(reported->is(kGWZipArchiveErrorDomain, 1));
+}
+
+TEST_F(GWZipArchiveExtraction, ABatchThatCannotFitIsRefusedBeforeAnythingIsWritten) {
+    SmallFileSystem small(1 << 20);
+    if (!small.mounted()) {
+        GTEST_SKIP() << "cannot mount a small file system here";
+    }
+    ZipBuilder zip;
+    zip.addFile("first", bytesOf("fits"));
+    zip.addFile("zeros", GWData(4 << 20, 0), 8);  // 4 MiB declared, a few KiB stored
+    auto archive = open(zip);
+    const GWURL out = GWURL::fileURLWithPath(small.path() + "/out");
+    EXPECT_FALSE(archive->extractFiles(archive->files(), out, true, nullptr, &error));
+    ASSERT_TRUE(error);
+    EXPECT_TRUE(error->is(kGWPOSIXErrorDomain, ENOSPC)) << error->localizedDescription();
+    EXPECT_NE(error->localizedDescription().find("4194308 bytes are needed"), std::string::npos)
+        << error->localizedDescription();
+    EXPECT_FALSE(fileExists(small.path() + "/out"));
+
+    ToolRun run = runTool("extract -C " + shellQuote(out.path()) + " " +
+                          shellQuote(directory.file("archive.zip")));
+    EXPECT_EQ(run.status, 1);
+    EXPECT_NE(run.err.find("(NSPOSIXErrorDomain 28)"), std::string::npos) << run.err;
+    EXPECT_FALSE(fileExists(small.path() + "/out/first"));
 }
 
 TEST_F(GWZipArchiveExtraction, TheDataForkStreamsToTheHandlerOnTheQueue) {

@@ -6,8 +6,10 @@
 #include <unistd.h>
 
 #include <cerrno>
+#include <functional>
 
 #include "GWArchiveSupport/GWArchiveConstants.h"
+#include "foundation/GWFileManager.h"
 #include "support/MetadataTestSupport.h"
 #include "support/TestSupport.h"
 #include "support/ZipBuilder.h"
@@ -107,19 +109,103 @@ TEST_F(GWZipExtractOperationTest, Deflate64IsRefusedWithItsMethodNumber) {
     EXPECT_EQ(log.errors[0], operation->error());
 }
 
-TEST_F(GWZipExtractOperationTest, ACorruptStreamFailsAndTellsTheHandlerLast) {
-    ZipBuilder zip;
-    ZipEntry& entry = zip.addFile("bad.txt", textBytes(5000, 1), 8);
-    entry.stored = GWData{0xFF, 0xFF, 0xFF, 0xFF, 0xFF, 0xFF};
-    write(zip);
+// --- Integrity: what is written is what the archive holds, or an error --------
+
+struct IntegrityCase {
+    const char* label;
+    std::uint16_t method;
+    GWData content;
+    std::function<void(ZipEntry&)> damage;
+    const char* domain;
+    long code;
+    // The most bytes a data handler may see before the error.
+    std::size_t maxDelivered;
+};
+
+void encodeLegacy(ZipEntry& entry) {
+    if (entry.method == 1) {
+        entry.stored = shrinkBytes(entry.content);
+    } else if (entry.method == 6) {
+        entry.stored = implodeBytes(entry.content, ImplodeSettings{});
+    }
+}
+
+const std::vector<IntegrityCase>& integrityCases() {
+    const auto wrongCRC = [](ZipEntry& entry) {
+        encodeLegacy(entry);
+        entry.crc32 = entry.effectiveCRC32() ^ 0x00010000u;
+    };
+    // A small declared size over a large stream: the shape of a zip bomb.
+    const auto lyingSize = [](ZipEntry& entry) { entry.uncompressedSize = 100; };
+    static const std::vector<IntegrityCase> cases = {
+        {"StoredBadCRC", 0, textBytes(70000, 3), wrongCRC, kGWZipArchiveErrorDomain, 5, 70000},
+        {"DeflatedBadCRC", 8, textBytes(70000, 3), wrongCRC, kGWZipArchiveErrorDomain, 5, 70000},
+        {"Bzip2BadCRC", 12, textBytes(70000, 3), wrongCRC, kGWZipArchiveErrorDomain, 5, 70000},
+        {"ShrunkBadCRC", 1, textBytes(70000, 3), wrongCRC, kGWZipArchiveErrorDomain, 5, 70000},
+        {"ImplodedBadCRC", 6, textBytes(70000, 3), wrongCRC, kGWZipArchiveErrorDomain, 5, 70000},
+        {"EmptyWithACRC", 0, {}, [](ZipEntry& e) { e.crc32 = 1; }, kGWZipArchiveErrorDomain, 5, 0},
+        {"ShortStored", 0, textBytes(5000, 4), [](ZipEntry& e) { e.uncompressedSize = 6000; },
+         kGWZipArchiveErrorDomain, 6, 5000},
+        {"EmptyWithASize",
+         0,
+         {},
+         [](ZipEntry& e) { e.uncompressedSize = 10; },
+         kGWZipArchiveErrorDomain,
+         6,
+         0},
+        {"DeflateBomb", 8, GWData(8 << 20, 0), lyingSize, kGWZipArchiveErrorDomain, 6, 100},
+        {"Bzip2Bomb", 12, GWData(8 << 20, 0), lyingSize, kGWZipArchiveErrorDomain, 6, 100},
+        {"CorruptDeflate", 8, textBytes(5000, 1),
+         [](ZipEntry& e) { e.stored = GWData{0xFF, 0xFF, 0xFF, 0xFF, 0xFF, 0xFF}; },
+         kGWCocoaErrorDomain, GWFileReadCorruptFileError, 0},
+    };
+    return cases;
+}
+
+class GWZipExtractIntegrity : public GWZipExtractOperationTest,
+                              public ::testing::WithParamInterface<IntegrityCase> {
+protected:
+    GWZipFilePtr build() {
+        const IntegrityCase& c = GetParam();
+        ZipBuilder zip;
+        ZipEntry& entry = zip.addFile("member", c.content, c.method);
+        c.damage(entry);
+        write(zip);
+        return zipEntryFromBuilder(zip, 0);
+    }
+    void expectFailure(const GWErrorPtr& error) {
+        const IntegrityCase& c = GetParam();
+        ASSERT_TRUE(error);
+        EXPECT_TRUE(error->is(c.domain, c.code)) << error->localizedDescription();
+        if (c.domain == std::string(kGWZipArchiveErrorDomain)) {
+            EXPECT_EQ(error->detailString(kGWZipArchiveUnknownEntityErrorKey), "member");
+        }
+    }
+};
+
+TEST_P(GWZipExtractIntegrity, TheHandlerHearsTheErrorLastAndNoMoreThanTheDeclaredSize) {
     DataHandlerLog log;
-    auto operation = toHandler(zipEntryFromBuilder(zip, 0), log);
+    auto operation = toHandler(build(), log);
     runToEnd(operation);
-    ASSERT_TRUE(operation->error());
+    expectFailure(operation->error());
+    EXPECT_LE(log.bytes.size(), GetParam().maxDelivered);
     ASSERT_FALSE(log.doneFlags.empty());
     EXPECT_TRUE(log.doneFlags.back());
     EXPECT_EQ(log.errors.back(), operation->error());
 }
+
+TEST_P(GWZipExtractIntegrity, NothingIsLeftOnDiskAtomicallyOrInPlace) {
+    const GWZipFilePtr file = build();
+    for (bool atomically : {true, false}) {
+        auto operation = toDisk(file, "out", atomically);
+        runToEnd(operation);
+        expectFailure(operation->error());
+        EXPECT_FALSE(GWItemExistsAtURL(directory.url("out"))) << "atomically " << atomically;
+    }
+}
+
+INSTANTIATE_TEST_SUITE_P(EveryCheck, GWZipExtractIntegrity, ::testing::ValuesIn(integrityCases()),
+                         [](const auto& info) { return std::string(info.param.label); });
 
 // --- Kinds of entry ------------------------------------------------------------
 

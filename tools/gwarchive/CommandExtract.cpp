@@ -5,10 +5,10 @@
 
 #include "Command.h"
 #include "Diagnostics.h"
-#include "foundation/GWFreeSpace.h"
 #include "Locations.h"
 #include "ProgressBar.h"
 #include "ToolArchive.h"
+#include "foundation/GWFreeSpace.h"
 
 namespace gwarchive {
 
