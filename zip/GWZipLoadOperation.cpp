@@ -27,28 +27,36 @@ std::uint64_t centralRecordLength(std::span<const std::uint8_t> fixed) {
 
 // Where each entry's bytes lie, to refuse archives in which two entries share
 // some: extracting them would write the same bytes over and over (a zip
-// bomb's trick). Directories are written in offset order, so overlaps show
-// as the records come; any other order is sorted once at the end.
+// bomb's trick). Directories are written in offset order, where an overlap
+// shows as the records come and nothing need be kept; a directory out of
+// order has every extent kept and sorted once at the end.
 class DataSpans {
 public:
-    explicit DataSpans(std::size_t expected) { spans_.reserve(expected); }
+    // True the first time `start` is lower than the one before: from then
+    // on every extent is kept, and the earlier ones must be added again.
+    bool breaksOrder(std::uint64_t start) {
+        if (!inOrder_ || start >= lastStart_) {
+            return false;
+        }
+        inOrder_ = false;
+        return true;
+    }
 
-    // True when [start, end) overlaps a span added before, as far as that
-    // can be told while the starts ascend.
+    // True when, in order, [start, end) overlaps an earlier extent.
     bool addOverlaps(std::uint64_t start, std::uint64_t end, std::uint64_t record) {
-        ascending_ = ascending_ && (spans_.empty() || start >= spans_.back().start);
-        const bool overlaps = ascending_ && start < furthestEnd_;
+        if (!inOrder_) {
+            spans_.push_back({start, end, record});
+            return false;
+        }
+        const bool overlaps = start < furthestEnd_;
+        lastStart_ = start;
         furthestEnd_ = std::max(furthestEnd_, end);
-        spans_.push_back({start, end, record});
         return overlaps;
     }
 
-    // After the last record: the record of a span that starts inside another,
-    // the later one in the directory when two start together.
+    // After the last record: the record of an extent that starts inside
+    // another, the later one in the directory when two start together.
     std::optional<std::uint64_t> overlappingRecord() {
-        if (ascending_) {
-            return std::nullopt;
-        }
         std::ranges::sort(spans_, [](const Span& a, const Span& b) {
             return a.start != b.start ? a.start < b.start : a.record < b.record;
         });
@@ -69,8 +77,9 @@ private:
         std::uint64_t record;  // its position in the directory
     };
     std::vector<Span> spans_;
+    std::uint64_t lastStart_ = 0;
     std::uint64_t furthestEnd_ = 0;
-    bool ascending_ = true;
+    bool inOrder_ = true;
 };
 
 }  // namespace
@@ -313,8 +322,7 @@ void GWZipLoadOperation::walkCentralDirectory(const GWZipEndOfCentralDirectoryRe
                                                    extraFieldData, comment, batch, &error);
     };
 
-    DataSpans spans(std::size_t(std::min<std::uint64_t>(
-        end.totalEntries, directorySize / GWZipCentralDirectoryRecord::kLength)));
+    DataSpans spans;
     GWZipParsedBatch batch;
     std::uint64_t position = 0;
     for (std::uint64_t entry = 0; entry < end.totalEntries; ++entry) {
@@ -330,6 +338,21 @@ void GWZipLoadOperation::walkCentralDirectory(const GWZipEndOfCentralDirectoryRe
         }
         if (batch.entries.size() > parsed) {
             const GWZipParsedEntry& added = batch.entries.back();
+            if (spans.breaksOrder(added.localHeaderOffset)) {
+                // Rare enough that reading the earlier records again costs
+                // less than keeping every extent of every directory.
+                for (std::uint64_t earlier = 0, skip = 0; earlier < position; earlier += skip) {
+                    GWZipParsedBatch again;
+                    if (!readRecord(earlier, again, &skip)) {
+                        pipe.close(false, error);
+                        return;
+                    }
+                    if (!again.entries.empty()) {
+                        const GWZipParsedEntry& entry = again.entries.back();
+                        spans.addOverlaps(entry.localHeaderOffset, entry.dataEnd, earlier);
+                    }
+                }
+            }
             if (spans.addOverlaps(added.localHeaderOffset, added.dataEnd, position)) {
                 pipe.close(false, overlappingEntriesError(std::string(batch.name(added))));
                 return;
