@@ -118,6 +118,18 @@ Seeds zipSeeds() {
         zip.addFile("after-prefix.txt", textBytes(100, 5), 8).comment = bytesOf("entry comment");
         seeds.push_back(zip.bytes());
     }
+    {
+        // Records out of offset order, the last sharing a local header.
+        ZipBuilder zip;
+        zip.addFile("first.txt", textBytes(100, 6), 8);
+        zip.addFile("second.txt", bytesOf("second"));
+        zip.addFile("shared.txt", bytesOf("second")).omitLocalHeader = true;
+        zip.bytes();
+        zip.entries()[0].centralLocalHeaderOffset = zip.localHeaderOffsets()[1];
+        zip.entries()[1].centralLocalHeaderOffset = zip.localHeaderOffsets()[0];
+        zip.entries()[2].centralLocalHeaderOffset = zip.localHeaderOffsets()[1];
+        seeds.push_back(zip.bytes());
+    }
     return seeds;
 }
 

@@ -81,6 +81,34 @@ std::optional<std::uint64_t> infoNumber(const GWDictionary& info, const char* ke
     return std::nullopt;
 }
 
+// The compressed size a central record escapes into its Zip64 field, which
+// the extra-info decoder does not take from central records.
+std::optional<std::uint64_t> centralZip64CompressedSize(std::span<const std::uint8_t> extra,
+                                                        const GWZipCentralDirectoryRecord& record) {
+    static constexpr std::uint16_t kZip64FieldID = 0x0001;
+    GWByteReader reader(extra);
+    while (reader.remaining() >= 4) {
+        const std::uint16_t identifier = reader.u16le();
+        auto field = reader.bytes(reader.u16le());
+        if (!reader.ok()) {
+            break;
+        }
+        if (identifier == kZip64FieldID) {
+            GWByteReader values(field);
+            if (record.uncompressedSize == kGWZip32BitSentinel) {
+                values.u64le();
+            }
+            const std::uint64_t size = values.u64le();
+            return values.ok() ? std::optional(size) : std::nullopt;
+        }
+    }
+    return std::nullopt;
+}
+
+std::uint64_t saturatingSum(std::uint64_t a, std::uint64_t b) {
+    return b > UINT64_MAX - a ? UINT64_MAX : a + b;
+}
+
 // The parent path as NSString's stringByDeletingLastPathComponent gives it.
 std::string_view parentPath(std::string_view path) {
     while (path.size() > 1 && path.back() == '/') {
@@ -252,6 +280,11 @@ bool GWZipLoadOperation::parseItemFromCentralDirectoryRecord(
     const bool consultLocalHeader =
         (record.uncompressedSize == kGWZip32BitSentinel || url_.isFileURL()) &&
         localHeaderOffset != kGWZip32BitSentinel;
+    // Without the local header its name and extra field are left out of the
+    // entry's extent: an estimate that never reaches past the true end
+    // refuses no honest archive, and still catches shared local headers and
+    // any entry that starts inside another's data.
+    std::uint64_t headerLength = GWZipLocalFileHeader::kLength;
     if (consultLocalHeader) {
         if (localHeaderOffset > UINT64_MAX - startOffset_) {
             return GWFail(error,
@@ -275,6 +308,7 @@ bool GWZipLoadOperation::parseItemFromCentralDirectoryRecord(
         const std::uint64_t variableOffset = headerOffset + GWZipLocalFileHeader::kLength;
         const std::size_t variableLength =
             std::size_t(local.filenameLength) + local.extraFieldLength;
+        headerLength += variableLength;
         auto variable = file.read(variableOffset, variableLength, error);
         if (!variable) {
             return false;
@@ -331,6 +365,20 @@ bool GWZipLoadOperation::parseItemFromCentralDirectoryRecord(
             zip64Size(uncompressedSize, kGWZipUncompressedSizeKey, record.uncompressedSize);
     }
 
+    std::uint64_t dataLength = compressedSize;
+    if (dataLength == kGWZip32BitSentinel) {
+        // Escaped with no Zip64 value where it was taken from: the central
+        // record's, and failing that the value as it stands.
+        dataLength = record.compressedSize;
+        if (dataLength == kGWZip32BitSentinel && extraFieldData) {
+            dataLength = centralZip64CompressedSize(*extraFieldData, record).value_or(dataLength);
+        }
+    }
+    if (consultLocalHeader && (flags & kDataDescriptorFlag)) {
+        // The shortest descriptor: no signature, 32-bit sizes.
+        dataLength = saturatingSum(dataLength, 12);
+    }
+
     std::uint16_t mode;
     const std::uint8_t host = operatingSystemFromCentralDirectoryRecord(record);
     if (isMSDOSLikeHost(host)) {
@@ -358,6 +406,7 @@ bool GWZipLoadOperation::parseItemFromCentralDirectoryRecord(
     entry.compressedSize = compressedSize;
     entry.uncompressedSize = uncompressedSize;
     entry.localHeaderOffset = localHeaderOffset;
+    entry.dataEnd = saturatingSum(localHeaderOffset, saturatingSum(headerLength, dataLength));
     entry.crc32 = crc32;
     entry.compressionMethod = method;
     entry.generalPurposeFlags = flags;

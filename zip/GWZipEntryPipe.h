@@ -22,6 +22,9 @@ struct GWZipParsedEntry {
     std::uint64_t compressedSize = 0;
     std::uint64_t uncompressedSize = 0;
     std::uint64_t localHeaderOffset = 0;
+    // Where the entry's bytes (local header, data, descriptor) end, counted
+    // like localHeaderOffset.
+    std::uint64_t dataEnd = 0;
     std::uint32_t crc32 = 0;
     std::uint16_t compressionMethod = 0;
     std::uint16_t generalPurposeFlags = 0;

@@ -6,6 +6,7 @@
 #include <thread>
 #include <vector>
 
+#include "GWArchiveSupport/GWArchiveConstants.h"
 #include "GWZipNames.h"
 #include "foundation/GWByteReader.h"
 #include "foundation/GWFormat.h"
@@ -23,6 +24,63 @@ std::uint64_t centralRecordLength(std::span<const std::uint8_t> fixed) {
     const std::uint64_t comment = reader.u16le();
     return GWZipCentralDirectoryRecord::kLength + name + extra + comment;
 }
+
+// Where each entry's bytes lie, to refuse archives in which two entries share
+// some: extracting them would write the same bytes over and over (a zip
+// bomb's trick). Directories are written in offset order, where an overlap
+// shows as the records come and nothing need be kept; a directory out of
+// order has every extent kept and sorted once at the end.
+class DataSpans {
+public:
+    // True the first time `start` is lower than the one before: from then
+    // on every extent is kept, and the earlier ones must be added again.
+    bool breaksOrder(std::uint64_t start) {
+        if (!inOrder_ || start >= lastStart_) {
+            return false;
+        }
+        inOrder_ = false;
+        return true;
+    }
+
+    // True when, in order, [start, end) overlaps an earlier extent.
+    bool addOverlaps(std::uint64_t start, std::uint64_t end, std::uint64_t record) {
+        if (!inOrder_) {
+            spans_.push_back({start, end, record});
+            return false;
+        }
+        const bool overlaps = start < furthestEnd_;
+        lastStart_ = start;
+        furthestEnd_ = std::max(furthestEnd_, end);
+        return overlaps;
+    }
+
+    // After the last record: the record of an extent that starts inside
+    // another, the later one in the directory when two start together.
+    std::optional<std::uint64_t> overlappingRecord() {
+        std::ranges::sort(spans_, [](const Span& a, const Span& b) {
+            return a.start != b.start ? a.start < b.start : a.record < b.record;
+        });
+        std::uint64_t furthestEnd = 0;
+        for (const Span& span : spans_) {
+            if (span.start < furthestEnd) {
+                return span.record;
+            }
+            furthestEnd = std::max(furthestEnd, span.end);
+        }
+        return std::nullopt;
+    }
+
+private:
+    struct Span {
+        std::uint64_t start;
+        std::uint64_t end;
+        std::uint64_t record;  // its position in the directory
+    };
+    std::vector<Span> spans_;
+    std::uint64_t lastStart_ = 0;
+    std::uint64_t furthestEnd_ = 0;
+    bool inOrder_ = true;
+};
 
 }  // namespace
 
@@ -224,14 +282,11 @@ void GWZipLoadOperation::walkCentralDirectory(const GWZipEndOfCentralDirectoryRe
     GWZipReadWindow window(file);
     // The directory is read a window at a time: a huge one is never held whole.
     GWZipReadWindow directory(file, 1024 * 1024);
-    GWZipParsedBatch batch;
-    std::uint64_t position = 0;
     GWErrorPtr error;
-    for (std::uint64_t entry = 0; entry < end.totalEntries; ++entry) {
-        if (isCancelled()) {
-            pipe.close(false, cancelledError());
-            return;
-        }
+    // Parses the record at `position` into `batch`, unless its name ends in
+    // "..", and gives its length.
+    auto readRecord = [&](std::uint64_t position, GWZipParsedBatch& batch,
+                          std::uint64_t* length) -> bool {
         auto bytes =
             directory.read(directoryOffset + position,
                            std::size_t(std::min<std::uint64_t>(GWZipCentralDirectoryRecord::kLength,
@@ -244,8 +299,7 @@ void GWZipLoadOperation::walkCentralDirectory(const GWZipEndOfCentralDirectoryRe
                                    &error);
         }
         if (!bytes) {
-            pipe.close(false, error);
-            return;
+            return false;
         }
         GWZipCentralDirectoryRecord record;
         std::optional<std::string> filename;
@@ -255,21 +309,56 @@ void GWZipLoadOperation::walkCentralDirectory(const GWZipEndOfCentralDirectoryRe
         if (!readCentralDirRecord(&record, *bytes, &pointer, &filename, &extraFieldData, &comment,
                                   &error, position)) {
             GWLog("Couldn't read central directory record!");
-            pipe.close(false, error);
-            return;
+            return false;
         }
-        position += pointer;
+        *length = pointer;
         std::string name = filename ? std::move(*filename) : std::string();
         if (GWZipLastPOSIXPathComponent(name) == "..") {
-            continue;
+            return true;
         }
         const auto nameBytes =
             bytes->subspan(GWZipCentralDirectoryRecord::kLength, record.filenameLength);
-        if (!parseItemFromCentralDirectoryRecord(record, window, std::move(name), nameBytes,
-                                                 extraFieldData, comment, batch, &error)) {
+        return parseItemFromCentralDirectoryRecord(record, window, std::move(name), nameBytes,
+                                                   extraFieldData, comment, batch, &error);
+    };
+
+    DataSpans spans;
+    GWZipParsedBatch batch;
+    std::uint64_t position = 0;
+    for (std::uint64_t entry = 0; entry < end.totalEntries; ++entry) {
+        if (isCancelled()) {
+            pipe.close(false, cancelledError());
+            return;
+        }
+        const std::size_t parsed = batch.entries.size();
+        std::uint64_t length = 0;
+        if (!readRecord(position, batch, &length)) {
             pipe.close(false, error);
             return;
         }
+        if (batch.entries.size() > parsed) {
+            const GWZipParsedEntry& added = batch.entries.back();
+            if (spans.breaksOrder(added.localHeaderOffset)) {
+                // Rare enough that reading the earlier records again costs
+                // less than keeping every extent of every directory.
+                for (std::uint64_t earlier = 0, skip = 0; earlier < position; earlier += skip) {
+                    GWZipParsedBatch again;
+                    if (!readRecord(earlier, again, &skip)) {
+                        pipe.close(false, error);
+                        return;
+                    }
+                    if (!again.entries.empty()) {
+                        const GWZipParsedEntry& entry = again.entries.back();
+                        spans.addOverlaps(entry.localHeaderOffset, entry.dataEnd, earlier);
+                    }
+                }
+            }
+            if (spans.addOverlaps(added.localHeaderOffset, added.dataEnd, position)) {
+                pipe.close(false, overlappingEntriesError(std::string(batch.name(added))));
+                return;
+            }
+        }
+        position += length;
         if (batch.entries.size() == kBatchSize) {
             if (!pipe.push(std::move(batch))) {
                 return;
@@ -277,10 +366,31 @@ void GWZipLoadOperation::walkCentralDirectory(const GWZipEndOfCentralDirectoryRe
             batch = GWZipParsedBatch();
         }
     }
+    if (auto record = spans.overlappingRecord()) {
+        // Read again for its name: keeping every name for this rare case
+        // would cost more than the walk.
+        GWZipParsedBatch named;
+        std::uint64_t length = 0;
+        std::string name;
+        if (readRecord(*record, named, &length) && !named.entries.empty()) {
+            name = named.name(named.entries.back());
+        }
+        pipe.close(false, overlappingEntriesError(std::move(name)));
+        return;
+    }
     if (!batch.entries.empty() && !pipe.push(std::move(batch))) {
         return;
     }
     pipe.close(true);
+}
+
+GWErrorPtr GWZipLoadOperation::overlappingEntriesError(std::string path) const {
+    if (path.size() > 1 && path.back() == '/') {
+        path.pop_back();
+    }
+    return GWGenerateError(kGWZipArchiveErrorDomain, GWZipArchiveOverlappingEntriesError, url_,
+                           nullptr, {{kGWZipArchiveUnknownEntityErrorKey, GWValue(path)}},
+                           "Entry \"%s\": overlapping entries (possible zip bomb)", path.c_str());
 }
 
 bool GWZipLoadOperation::buildTree(GWZipEntryPipe& pipe, GWZipTreeBuilder& tree,

@@ -174,6 +174,8 @@ private:
     GWDate dateFromDOS(std::uint16_t time, std::uint16_t date);
     GWErrorPtr corruptError(const char* format, ...) const __attribute__((format(printf, 2, 3)));
     GWErrorPtr cancelledError() const;
+    // Code 7 of the ZIP domain, naming the entry.
+    GWErrorPtr overlappingEntriesError(std::string path) const;
     // Looks the path up in the roots, or makes the placeholder entry a lone
     // companion is attached to.
     GWZipFilePtr metadataTarget(const std::vector<std::string>& components,

@@ -1,10 +1,14 @@
 // Malformed and hostile archives: every broken structure is
-// GWFileReadCorruptFileError, never a crash, a hang or a huge allocation.
+// GWFileReadCorruptFileError, and entries sharing bytes are
+// GWZipArchiveOverlappingEntriesError; never a crash, a hang or a huge
+// allocation.
 
 #include <gtest/gtest.h>
 
+#include <chrono>
 #include <functional>
 
+#include "GWArchiveSupport/GWArchiveConstants.h"
 #include "support/TestSupport.h"
 #include "support/ZipBuilder.h"
 #include "support/ZipExtraFields.h"
@@ -42,18 +46,32 @@ GWData sampleArchive() {
 struct HostileCase {
     const char* name;
     std::function<GWData()> bytes;
+    // The entry refused for sharing bytes with another; none for corrupt ones.
+    const char* overlappingEntry = nullptr;
 };
 
 class GWZipArchiveHostile : public ::testing::TestWithParam<HostileCase> {};
 
-TEST_P(GWZipArchiveHostile, FailsWithCorruptFileError) {
+TEST_P(GWZipArchiveHostile, FailsQuicklyWithItsError) {
     TemporaryDirectory directory;
     writeFile(directory.file("bad.zip"), GetParam().bytes());
     GWErrorPtr error;
     ZipLogCapture log;
+    const auto started = std::chrono::steady_clock::now();
     auto archive = GWZipArchive::initWithURL(directory.url("bad.zip"), &error);
+    EXPECT_LT(std::chrono::steady_clock::now() - started, std::chrono::seconds(5));
     EXPECT_FALSE(archive);
     ASSERT_TRUE(error);
+    if (const char* entry = GetParam().overlappingEntry) {
+        EXPECT_TRUE(error->is(kGWZipArchiveErrorDomain, GWZipArchiveOverlappingEntriesError))
+            << error->localizedDescription();
+        const GWValue* path =
+            GWDictionaryValue(error->userInfo(), kGWZipArchiveUnknownEntityErrorKey);
+        ASSERT_TRUE(path && path->string());
+        EXPECT_EQ(*path->string(), entry);
+        EXPECT_NE(error->localizedDescription().find("overlapping entries"), std::string::npos);
+        return;
+    }
     EXPECT_EQ(error->domain(), kGWCocoaErrorDomain);
     EXPECT_EQ(error->code(), GWFileReadCorruptFileError) << error->localizedDescription();
 }
@@ -171,6 +189,39 @@ const HostileCase kHostileCases[] = {
          put16(bytes, find(bytes, {'P', 'K', 1, 2}) + 30, 0xFFF0);
          return bytes;
      }},
+    {"TenThousandRecordsShareOneLocalHeader",
+     [] {
+         ZipBuilder zip;
+         const GWData content = textBytes(4000, 3);
+         zip.addFile("bomb", content, 8);
+         for (int i = 0; i < 10000; ++i) {
+             ZipEntry& copy = zip.addFile("copy" + std::to_string(i), content, 8);
+             copy.omitLocalHeader = true;
+             copy.centralLocalHeaderOffset = 0;
+         }
+         return zip.bytes();
+     },
+     "bomb"},
+    {"RangesCrossInADirectoryOutOfOrder",
+     [] {
+         // The records name q first, then p, whose data runs over q's.
+         ZipBuilder zip;
+         zip.addFile("p", bytesOf("p's data")).compressedSize = 100;
+         zip.addFile("q", bytesOf("q's data"));
+         zip.bytes();
+         zip.entries()[0].centralLocalHeaderOffset = zip.localHeaderOffsets()[1];
+         zip.entries()[1].centralLocalHeaderOffset = 0;
+         return zip.bytes();
+     },
+     "q"},
+    {"MacCompanionStartsInsideItsFilesData",
+     [] {
+         ZipBuilder zip;
+         zip.addFile("a.txt", bytesOf("a")).compressedSize = 1 + 30 + 16 + 82;
+         zip.addFile("__MACOSX/._a.txt", GWData(82, 1));
+         return zip.bytes();
+     },
+     "__MACOSX/._a.txt"},
     {"NameNoEncodingDecodes",
      [] {
          ZipBuilder zip;
