@@ -30,8 +30,8 @@ bool GWCheckFreeSpace(const GWURL& directory, std::uint64_t bytesNeeded, GWError
         path = slash == 0 ? "/" : path.substr(0, slash);
     }
     const std::uint64_t available = std::uint64_t(info.f_bavail) * info.f_frsize;
-    const std::uint64_t needed = bytesNeeded > UINT64_MAX - kMargin ? UINT64_MAX
-                                                                     : bytesNeeded + kMargin;
+    const std::uint64_t needed =
+        bytesNeeded > UINT64_MAX - kMargin ? UINT64_MAX : bytesNeeded + kMargin;
     if (needed <= available) {
         return true;
     }
