@@ -197,6 +197,16 @@ Seeds xarSeeds() {
     stored.compressTOC = false;
     stored.setFiles(xarFiles(stored));
     seeds.push_back(stored.bytes());
+    // Signatures and a digest that name one heap range between them.
+    XarBuilder shared;
+    const std::string range =
+        "<offset>" + std::to_string(shared.addHeapBytes(GWData(64, 0x11))) + "</offset>";
+    shared.setFiles("<signature style=\"RSA\">" + range +
+                    "<size>64</size><KeyInfo/></signature><x-signature style=\"CMS\">" + range +
+                    "<size>64</size></x-signature><file id=\"1\"><name>f</name><data>"
+                    "<archived-checksum style=\"sha1\">" +
+                    range + "<size>20</size></archived-checksum></data></file>");
+    seeds.push_back(shared.bytes());
     return seeds;
 }
 

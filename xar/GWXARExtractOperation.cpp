@@ -4,8 +4,10 @@
 #include <unistd.h>
 
 #include <exception>
+#include <unordered_set>
 
 #include "GWArchiveSupport/GWArchiveConstants.h"
+#include "foundation/GWFreeSpace.h"
 #include "foundation/GWItemReplacement.h"
 #include "foundation/GWLog.h"
 #include "foundation/GWMetadataStore.h"
@@ -19,6 +21,37 @@ GWXARExtractOperationPtr GWXARExtractOperation::initWithFile(
     return GWXARExtractOperationPtr(
         new GWXARExtractOperation(std::move(file), std::move(destinationURL), archive));
 }
+
+namespace {
+
+// The data bytes extracting `item` writes by the sizes the archive states:
+// every regular file once, a hard link only when its file is not otherwise
+// written (it may become a copy).
+std::uint64_t declaredDataSize(const GWXARFilePtr& item) {
+    std::uint64_t total = 0;
+    std::unordered_set<const GWXARFile*> counted;
+    std::vector<GWXARFilePtr> pending{item};
+    while (!pending.empty()) {
+        GWXARFilePtr file = std::move(pending.back());
+        pending.pop_back();
+        for (const auto& child : file->children()) {
+            pending.push_back(child);
+        }
+        GWXARFilePtr holder = file;
+        for (int hops = 0; holder && holder->type() == GWXARFileTypeHardLink && hops < 64; ++hops) {
+            holder = holder->hardlinkDestination();
+        }
+        if (!holder || holder->type() != GWXARFileTypeRegular || !holder->dataFork() ||
+            !counted.insert(holder.get()).second) {
+            continue;
+        }
+        const std::uint64_t size = holder->dataFork()->uncompressedSize();
+        total = size > UINT64_MAX - total ? UINT64_MAX : total + size;
+    }
+    return total;
+}
+
+}  // namespace
 
 GWErrorPtr GWXARExtractOperation::error() const {
     std::lock_guard lock(errorMutex_);
@@ -59,6 +92,11 @@ bool GWXARExtractOperation::performExtractionOperationWithFile(const GWXARFilePt
     }
     if (!file) {
         return GWFail(error, GWCocoaError(GWFileWriteUnknownError, destinationURL));
+    }
+    // Refusing before the first byte beats filling the disk and undoing it.
+    if (!GWCheckFreeSpace(destinationURL.URLByDeletingLastPathComponent(), declaredDataSize(file),
+                          error)) {
+        return false;
     }
     const std::string destinationPath = destinationURL.path();
     auto temporary = GWItemReplacementDirectory::createForDestination(destinationPath, error);

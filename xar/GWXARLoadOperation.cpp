@@ -92,3 +92,15 @@ GWErrorPtr GWXARLoadOperation::errorWithCode(long code,
 GWErrorPtr GWXARLoadOperation::cancelledError() const {
     return GWGenerateError(kGWCocoaErrorDomain, GWUserCancelledError, archiveURL_, nullptr, {});
 }
+
+bool GWXARLoadOperation::chargeTOCMemory(std::uint64_t bytes, GWErrorPtr* error) {
+    if (bytes > kMaxTOCMemory - tocMemoryUsed_) {
+        return GWFail(error, GWGenerateError(kGWCocoaErrorDomain, GWFileReadCorruptFileError,
+                                             archiveURL_, nullptr, {},
+                                             "The XAR table of contents describes more entries "
+                                             "than fit in the %llu MiB allowed for them",
+                                             (unsigned long long)(kMaxTOCMemory >> 20)));
+    }
+    tocMemoryUsed_ += bytes;
+    return true;
+}

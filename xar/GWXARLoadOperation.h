@@ -64,8 +64,15 @@ public:
     // --- Opening (GWXARLoadOperationHeader.cpp) --------------------------------
 
     // Largest table of contents accepted, stored or inflated, whatever the
-    // header claims: real ones are a few megabytes even for huge archives.
-    static constexpr std::uint64_t kMaxTOCLength = 256ull * 1024 * 1024;
+    // header claims. Installer packages hold a few megabytes; 64 MiB is some
+    // 90,000 fully described files.
+    static constexpr std::uint64_t kMaxTOCLength = 64ull * 1024 * 1024;
+    // What the parsed table of contents may cost besides its text: the XML
+    // tree as allocated, plus a charge per entry, stored stream, path byte
+    // and certificate. With the text this keeps a load below 512 MiB.
+    static constexpr std::uint64_t kMaxTOCMemory = 384ull * 1024 * 1024;
+    static constexpr std::uint64_t kEntryMemoryCharge = 1536;
+    static constexpr std::uint64_t kReferenceMemoryCharge = 384;
 
     // Opens the archive's file, loads it, and leaves either files() or error() set.
     void main() override;
@@ -114,6 +121,11 @@ public:
     // The digest of the stored table of contents, computed by readTOC.
     const GWData& computedTOCChecksum() const { return computedTOCChecksum_; }
 
+    // Counts `bytes` against kMaxTOCMemory; past it, a corrupt-file error
+    // naming the bound.
+    bool chargeTOCMemory(std::uint64_t bytes, GWErrorPtr* error);
+    std::uint64_t tocMemoryUsed() const { return tocMemoryUsed_; }
+
     // --- Entries (GWXARTOCEntryParser.cpp) ------------------------------------
 
     // The top-level entries, sorted by name, with hard links resolved. Entries
@@ -144,7 +156,17 @@ public:
     static int checksumTypeFromName(std::string_view name);
     bool getCompressionType(std::uint64_t* compressionType, const pugi::xml_node& element,
                             GWErrorPtr* error);
-    // Inline hex, or (with "offset" and "size" children) bytes read from the heap.
+    // Longest digest a checksum element may point at (SHA-512's).
+    static constexpr std::uint64_t kMaxDigestLength = 64;
+    // Longest signature read from the heap; CMS ones with their chains are a few KiB.
+    static constexpr std::uint64_t kMaxSignatureLength = 16 * 1024;
+    // The heap bytes at `offset` (from the heap's start), at most `size` of
+    // them when the file ends first. Each distinct range is read and charged
+    // once per load; repeats share it.
+    std::shared_ptr<const GWData> heapBytes(std::uint64_t offset, std::uint64_t size,
+                                            GWErrorPtr* error);
+    // Inline hex, or (with "offset" and "size" children) bytes read from the
+    // heap; more than kMaxDigestLength of them is a malformed size.
     std::optional<GWData> checksumFromElement(const pugi::xml_node& element, int* checksumType,
                                               GWErrorPtr* error);
     std::optional<GWData> decodeHexString(std::string_view text, const pugi::xml_node& node,
@@ -220,6 +242,11 @@ private:
     std::optional<GWURL> archiveURL_;
     std::shared_ptr<GWRemoteFileHandle> fileHandle_;
     std::uint64_t heapStart_ = 0;
+    std::uint64_t tocMemoryUsed_ = 0;
+    // Certificates already made, by their base64 text.
+    std::unordered_map<std::string, GWCertificatePtr> certificatesByText_;
+    // Heap bytes already read, by (offset, size): repeated references are free.
+    std::map<std::pair<std::uint64_t, std::uint64_t>, std::shared_ptr<const GWData>> heapRanges_;
     std::optional<GWXARSignatureArray> signatures_;
 
     std::optional<GWXARFileArray> files_;

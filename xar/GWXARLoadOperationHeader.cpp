@@ -2,6 +2,7 @@
 // inflation, bounded by what the file actually holds.
 
 #include <cerrno>
+#include <cstdlib>
 #include <exception>
 #include <string>
 
@@ -16,6 +17,41 @@ namespace {
 constexpr std::size_t kFixedHeaderLength = 6;  // magic and header length
 constexpr std::uint16_t kMinimumHeaderLength = 28;
 constexpr std::uint16_t kSupportedVersion = 1;
+
+// pugixml allocates through global hooks. While a table of contents is
+// parsed on this thread, its allocations are counted and refused past the
+// limit, so a tree of millions of tiny elements fails early instead of
+// taking gigabytes. Other threads and other parses allocate as usual.
+struct TreeBudget {
+    bool active = false;
+    bool exceeded = false;
+    std::uint64_t used = 0;
+    std::uint64_t limit = 0;
+};
+thread_local TreeBudget tTreeBudget;
+
+void* budgetedAllocate(std::size_t size) {
+    TreeBudget& budget = tTreeBudget;
+    if (budget.active) {
+        if (size > budget.limit - budget.used) {
+            budget.exceeded = true;
+            return nullptr;
+        }
+        budget.used += size;
+    }
+    return std::malloc(size);
+}
+
+void budgetedDeallocate(void* pointer) {
+    std::free(pointer);
+}
+
+// The defaults are malloc and free too, so memory from before the hooks
+// were set is freed correctly after.
+const bool kTreeBudgetInstalled = [] {
+    pugi::set_memory_management_functions(budgetedAllocate, budgetedDeallocate);
+    return true;
+}();
 
 // Closes the handle however main() is left.
 class FileHandleCloser {
@@ -178,9 +214,9 @@ std::shared_ptr<pugi::xml_document> GWXARLoadOperation::readTOC(std::uint64_t co
                                                                 int checksumAlgorithm,
                                                                 GWData* checksum,
                                                                 GWErrorPtr* error) {
-    auto corrupt = [&](const char* why) {
+    auto corrupt = [&](const std::string& why) {
         GWFail(error, GWGenerateError(kGWCocoaErrorDomain, GWFileReadCorruptFileError, archiveURL_,
-                                      nullptr, {}, "%s", why));
+                                      nullptr, {}, "%s", why.c_str()));
         return nullptr;
     };
     if (isCancelled()) {
@@ -189,7 +225,8 @@ std::shared_ptr<pugi::xml_document> GWXARLoadOperation::readTOC(std::uint64_t co
     }
     // Lengths are claims: refuse absurd ones before reading or inflating anything.
     if (compressedLength > kMaxTOCLength || decompressedLength > kMaxTOCLength) {
-        return corrupt("The XAR table of contents is larger than any archive needs");
+        return corrupt("The XAR table of contents is larger than the " +
+                       std::to_string(kMaxTOCLength >> 20) + " MiB allowed");
     }
     if (!fileHandle_) {
         GWFail(error, GWPOSIXError(EBADF, archiveURL_));
@@ -207,6 +244,9 @@ std::shared_ptr<pugi::xml_document> GWXARLoadOperation::readTOC(std::uint64_t co
         GWFail(error, cancelledError());
         return nullptr;
     }
+    if (checksum) {
+        *checksum = GWChecksum::checksumForData(*stored, checksumAlgorithm);
+    }
     std::optional<GWData> inflated;
     if (GWDecompressor::isDataCompressed(*stored)) {
         // One byte more than claimed is enough to tell a wrong length.
@@ -223,8 +263,9 @@ std::shared_ptr<pugi::xml_document> GWXARLoadOperation::readTOC(std::uint64_t co
             return nullptr;
         }
     } else {
-        inflated = *stored;
+        inflated = std::move(*stored);
     }
+    stored.reset();
 
     if (isCancelled()) {
         GWFail(error, cancelledError());
@@ -233,15 +274,32 @@ std::shared_ptr<pugi::xml_document> GWXARLoadOperation::readTOC(std::uint64_t co
     if (inflated->size() != decompressedLength) {
         return corrupt("The XAR table of contents does not inflate to its stated length");
     }
-    if (checksum) {
-        *checksum = GWChecksum::checksumForData(*stored, checksumAlgorithm);
-    }
 
     // pugixml never fetches DTDs or external entities; it only knows the
     // predefined and numeric character references.
-    auto document = std::make_shared<pugi::xml_document>();
-    const pugi::xml_parse_result parsed =
-        document->load_buffer(inflated->data(), inflated->size(), kTOCParseOptions);
+    // Parsed in place: the tree points into the text, which lives as long as it.
+    struct ParsedTOC {
+        GWData text;
+        pugi::xml_document document;
+    };
+    if (!chargeTOCMemory(inflated->size(), error)) {
+        return nullptr;
+    }
+    auto parsedTOC = std::make_shared<ParsedTOC>();
+    parsedTOC->text = std::move(*inflated);
+    inflated.reset();
+    std::shared_ptr<pugi::xml_document> document(parsedTOC, &parsedTOC->document);
+    (void)kTreeBudgetInstalled;
+    tTreeBudget = {true, false, tocMemoryUsed_, kMaxTOCMemory};
+    const pugi::xml_parse_result parsed = document->load_buffer_inplace(
+        parsedTOC->text.data(), parsedTOC->text.size(), kTOCParseOptions);
+    const TreeBudget budget = tTreeBudget;
+    tTreeBudget = {};
+    if (budget.exceeded) {
+        return corrupt("The XAR table of contents has more elements than fit in the " +
+                       std::to_string(kMaxTOCMemory >> 20) + " MiB allowed for parsing it");
+    }
+    tocMemoryUsed_ = budget.used;
     if (!parsed) {
         GWFail(error, GWGenerateError(kGWCocoaErrorDomain, GWFileReadCorruptFileError, archiveURL_,
                                       nullptr, {},

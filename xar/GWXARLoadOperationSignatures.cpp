@@ -97,6 +97,9 @@ bool GWXARLoadOperation::loadSignaturesWithTOC(const pugi::xml_node& toc, GWErro
                 if (value && name == "offset" && *value > UINT64_MAX - heapStart_) {
                     value.reset();
                 }
+                if (value && name == "size" && *value > kMaxSignatureLength) {
+                    value.reset();
+                }
                 if (!value) {
                     return GWFail(error,
                                   errorWithCode(GWXARArchiveMalformedValueError, *text, child));
@@ -110,19 +113,13 @@ bool GWXARLoadOperation::loadSignaturesWithTOC(const pugi::xml_node& toc, GWErro
             }
         }
 
-        if (!fileHandle_) {
-            return GWFail(error, GWPOSIXError(EBADF, archiveURL_));
-        }
-        if (!fileHandle_->seekToFileOffset(heapStart_ + offset, error)) {
-            return false;
-        }
-        auto bytes = fileHandle_->readDataOfLength(size, error);
-        if (!bytes) {
+        auto bytes = heapBytes(offset, size, error);
+        if (!bytes || !chargeTOCMemory(kReferenceMemoryCharge, error)) {
             return false;
         }
         loaded.push_back(
-            GWXARSignature::initWithType(type, std::move(*bytes), std::move(certificates),
-                                         std::string_view(element.name()) == "x-signature"));
+            GWXARSignature::initSharingData(type, std::move(bytes), std::move(certificates),
+                                            std::string_view(element.name()) == "x-signature"));
     }
     signatures_ = std::move(loaded);
     return true;
@@ -138,9 +135,17 @@ std::optional<GWCertificateArray> GWXARLoadOperation::certificatesFromKeyInfo(
             return std::nullopt;
         }
         for (const pugi::xml_node& element : data.children("X509Certificate")) {
-            const std::string text = ownText(element);
+            std::string text = ownText(element);
+            if (auto known = certificatesByText_.find(text); known != certificatesByText_.end()) {
+                certificates.push_back(known->second);
+                continue;
+            }
             auto der = GWPropertyListSerialization::dataWithBase64String(text, error);
             if (!der) {
+                return std::nullopt;
+            }
+            // A parsed certificate takes a few times its encoding.
+            if (!chargeTOCMemory(kReferenceMemoryCharge + 4 * der->size(), error)) {
                 return std::nullopt;
             }
             auto certificate = GWCertificate::createWithData(*der);
@@ -148,6 +153,7 @@ std::optional<GWCertificateArray> GWXARLoadOperation::certificatesFromKeyInfo(
                 GWFail(error, errorWithCode(GWXARArchiveUntrustedCertificateError, text, element));
                 return std::nullopt;
             }
+            certificatesByText_.emplace(std::move(text), certificate);
             certificates.push_back(std::move(certificate));
         }
     }

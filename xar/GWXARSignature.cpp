@@ -22,16 +22,24 @@ const char* typeName(std::uint64_t type) {
 
 }  // namespace
 
-GWXARSignature::GWXARSignature(std::uint64_t type, GWData signatureData,
+GWXARSignature::GWXARSignature(std::uint64_t type, std::shared_ptr<const GWData> signatureData,
                                std::optional<GWCertificateArray> certificates, bool isExtended)
     : type_(type),
-      signatureData_(std::move(signatureData)),
+      signatureData_(signatureData ? std::move(signatureData) : std::make_shared<const GWData>()),
       certificates_(std::move(certificates)),
       isExtended_(isExtended) {}
 
 GWXARSignaturePtr GWXARSignature::initWithType(std::uint64_t type, GWData signatureData,
                                                std::optional<GWCertificateArray> certificates,
                                                bool isExtended) {
+    return initSharingData(type, std::make_shared<const GWData>(std::move(signatureData)),
+                           std::move(certificates), isExtended);
+}
+
+GWXARSignaturePtr GWXARSignature::initSharingData(std::uint64_t type,
+                                                  std::shared_ptr<const GWData> signatureData,
+                                                  std::optional<GWCertificateArray> certificates,
+                                                  bool isExtended) {
     return GWXARSignaturePtr(
         new GWXARSignature(type, std::move(signatureData), std::move(certificates), isExtended));
 }
@@ -63,7 +71,7 @@ std::string GWXARSignature::description() const {
     return GWFormat(
         "<%s %s\n\ttype=%s\n\tsignatureData=%zu bytes\n\tcertificates=%s\n\tisExtended=%s\n>",
         className().c_str(), GWXARDescribing::pointerText(this).c_str(), typeName(type_),
-        signatureData_.size(), names.c_str(), isExtended_ ? "YES" : "NO");
+        signatureData_->size(), names.c_str(), isExtended_ ? "YES" : "NO");
 }
 
 void GWXARSignature::encodeWithCoder(GWCoder& coder) const {
@@ -71,7 +79,7 @@ void GWXARSignature::encodeWithCoder(GWCoder& coder) const {
         return;
     }
     coder.encodeInteger(std::int64_t(type_), kTypeKey);
-    coder.encodeValue(signatureData_, kSignatureDataKey);
+    coder.encodeValue(*signatureData_, kSignatureDataKey);
     if (certificates_) {
         GWArray encodings;
         encodings.reserve(certificates_->size());
@@ -108,5 +116,5 @@ GWXARSignaturePtr GWXARSignature::initWithCoder(GWCoder& coder) {
 }
 
 GWXARSignaturePtr GWXARSignature::copy() const {
-    return initWithType(type_, signatureData_, certificates_, isExtended_);
+    return initSharingData(type_, signatureData_, certificates_, isExtended_);
 }

@@ -32,9 +32,14 @@ public:
     static GWXARSignaturePtr initWithType(std::uint64_t type, GWData signatureData,
                                           std::optional<GWCertificateArray> certificates,
                                           bool isExtended);
+    // Shares `signatureData`: signatures of one heap range hold its bytes once.
+    static GWXARSignaturePtr initSharingData(std::uint64_t type,
+                                             std::shared_ptr<const GWData> signatureData,
+                                             std::optional<GWCertificateArray> certificates,
+                                             bool isExtended);
 
     std::uint64_t type() const { return type_; }
-    const GWData& signatureData() const { return signatureData_; }
+    const GWData& signatureData() const { return *signatureData_; }
     const std::optional<GWCertificateArray>& certificates() const { return certificates_; }
     // True for an "x-signature" element.
     bool isExtended() const { return isExtended_; }
@@ -52,15 +57,15 @@ public:
     // None from a non-keyed coder, and when a stored certificate is not one.
     static GWXARSignaturePtr initWithCoder(GWCoder& coder);
 
-    // Certificates are immutable, so the copy's array shares them.
+    // Certificates and bytes are immutable, so the copy shares them.
     GWXARSignaturePtr copy() const;
 
 private:
-    GWXARSignature(std::uint64_t type, GWData signatureData,
+    GWXARSignature(std::uint64_t type, std::shared_ptr<const GWData> signatureData,
                    std::optional<GWCertificateArray> certificates, bool isExtended);
 
     std::uint64_t type_;
-    GWData signatureData_;
+    std::shared_ptr<const GWData> signatureData_;
     std::optional<GWCertificateArray> certificates_;
     bool isExtended_;
 };

@@ -29,6 +29,18 @@ std::optional<std::uint16_t> fileTypeBits(std::string_view type) {
     return std::nullopt;
 }
 
+// Adds to `bytes` what the full paths of `file` and everything below it
+// take, and returns how many entries that is. Every name counts once per
+// entry below it, so long names deep down cost what a listing will pay.
+std::uint64_t addPathBytes(const GWXARFile& file, std::uint64_t& bytes) {
+    std::uint64_t entries = 1;
+    for (const auto& child : file.children()) {
+        entries += addPathBytes(*child, bytes);
+    }
+    bytes += (file.name() ? file.name()->size() + 1 : 1) * entries;
+    return entries;
+}
+
 }  // namespace
 
 std::optional<GWXARFileArray> GWXARLoadOperation::filesFromTOCElement(const pugi::xml_node& toc,
@@ -61,6 +73,13 @@ std::optional<GWXARFileArray> GWXARLoadOperation::filesFromTOCElement(const pugi
     if (!resolveHardLinks(error)) {
         return std::nullopt;
     }
+    std::uint64_t pathBytes = 0;
+    for (const auto& file : files) {
+        addPathBytes(*file, pathBytes);
+    }
+    if (!chargeTOCMemory(pathBytes, error)) {
+        return std::nullopt;
+    }
     return GWXARFile::sortedByName(std::move(files));
 }
 
@@ -87,6 +106,9 @@ GWXARFilePtr GWXARLoadOperation::fileWithXMLElement(const pugi::xml_node& elemen
     if (depth > kMaxFileNestingDepth) {
         failure =
             errorWithDomain(kGWCocoaErrorDomain, GWFileReadCorruptFileError, std::nullopt, element);
+        return fail();
+    }
+    if (!chargeTOCMemory(kEntryMemoryCharge, &failure)) {
         return fail();
     }
 

@@ -68,6 +68,9 @@ std::optional<GWXARDataReferenceArray> GWXARLoadOperation::extendedAttributesFro
 
 GWXARDataReferencePtr GWXARLoadOperation::fileReferenceFromElement(const pugi::xml_node& element,
                                                                    GWErrorPtr* error) {
+    if (!chargeTOCMemory(kReferenceMemoryCharge, error)) {
+        return nullptr;
+    }
     auto reference = GWXARDataReference::init();
     for (const pugi::xml_node& child : element.children()) {
         if (child.type() != pugi::node_element) {
@@ -248,18 +251,38 @@ std::optional<GWData> GWXARLoadOperation::checksumFromElement(const pugi::xml_no
         return std::nullopt;
     }
     auto size = GWXARScanUnsigned(*sizeText);
-    if (!size) {
+    if (!size || *size > kMaxDigestLength) {
         GWFail(error, errorWithCode(GWXARArchiveMalformedValueError, *sizeText, element));
         return std::nullopt;
     }
+    auto bytes = heapBytes(*offset, *size, error);
+    if (!bytes) {
+        return std::nullopt;
+    }
+    return *bytes;
+}
+
+std::shared_ptr<const GWData> GWXARLoadOperation::heapBytes(std::uint64_t offset,
+                                                            std::uint64_t size, GWErrorPtr* error) {
+    const auto range = std::make_pair(offset, size);
+    if (auto known = heapRanges_.find(range); known != heapRanges_.end()) {
+        return known->second;
+    }
     if (!fileHandle_) {
         GWFail(error, GWPOSIXError(EBADF, archiveURL_));
-        return std::nullopt;
+        return nullptr;
     }
-    if (!fileHandle_->seekToFileOffset(heapStart_ + *offset, error)) {
-        return std::nullopt;
+    if (!chargeTOCMemory(kReferenceMemoryCharge + size, error) ||
+        !fileHandle_->seekToFileOffset(heapStart_ + offset, error)) {
+        return nullptr;
     }
-    return fileHandle_->readDataOfLength(*size, error);
+    auto bytes = fileHandle_->readDataOfLength(size, error);
+    if (!bytes) {
+        return nullptr;
+    }
+    auto shared = std::make_shared<const GWData>(std::move(*bytes));
+    heapRanges_.emplace(range, shared);
+    return shared;
 }
 
 std::optional<GWData> GWXARLoadOperation::decodeHexString(std::string_view text,

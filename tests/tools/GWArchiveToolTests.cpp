@@ -275,20 +275,88 @@ TEST(GWArchiveTool, TestFindsAFlippedByteInAStoredZipEntryAndInAXarFile) {
     EXPECT_NE(bad.out.find("bad.txt: "), std::string::npos) << bad.out;
     EXPECT_EQ(bad.out.find("good.txt: "), std::string::npos) << bad.out;
     EXPECT_NE(bad.out.find("2 entries, 1 bad"), std::string::npos) << bad.out;
-
-    XarBuilder xar;
-    std::string data = xar.dataElement("data", bytesOf("xar content to flip"), XarEncoding::none);
-    xar.setFiles("<file id=\"1\"><name>x.txt</name><type>file</type>" + data + "</file>");
-    GWData xarBytes = xar.bytes();
-    std::string xarText(xarBytes.begin(), xarBytes.end());
-    writeFile(directory.file("good.xar"), xarBytes);
-    xarBytes[xarText.find("to flip")] ^= 0x01;
-    writeFile(directory.file("bad.xar"), xarBytes);
-    EXPECT_EQ(runTool("test " + shellQuote(directory.file("good.xar"))).status, 0);
-    ToolRun badXar = runTool("test " + shellQuote(directory.file("bad.xar")));
-    EXPECT_EQ(badXar.status, 1);
-    EXPECT_NE(badXar.out.find("x.txt: "), std::string::npos) << badXar.out;
 }
+
+// How test, extract and info judge a XAR's checksums. `arguments` name the
+// archive as ARCHIVE and the output directory as OUT.
+enum class XarDamage { none, flippedData, tocChecksum, noChecksums };
+
+struct XarVerdict {
+    const char* name;
+    XarDamage damage;
+    std::string arguments;
+    int status;
+    const char* out;  // part of standard output
+    const char* err;  // the one error line's description and code; "" for none
+    bool writes;      // x.txt appears in OUT
+};
+
+void PrintTo(const XarVerdict& verdict, std::ostream* out) {
+    *out << verdict.name;
+}
+
+class GWArchiveToolXarVerdict : public ::testing::TestWithParam<XarVerdict> {};
+
+TEST_P(GWArchiveToolXarVerdict, FollowsTheChecksums) {
+    const XarVerdict& verdict = GetParam();
+    TemporaryDirectory directory;
+    const bool checksums = verdict.damage != XarDamage::noChecksums;
+    XarBuilder xar(checksums ? 1 : 0);
+    xar.includeChecksumElement = checksums;
+    xar.corruptStoredChecksum = verdict.damage == XarDamage::tocChecksum;
+    const std::string data = xar.dataElement("data", bytesOf("xar content to flip"),
+                                             XarEncoding::none, checksums ? "sha1" : "");
+    xar.setFiles("<file id=\"1\"><name>x.txt</name><type>file</type>" + data + "</file>");
+    GWData bytes = xar.bytes();
+    if (verdict.damage == XarDamage::flippedData) {
+        const std::string text(bytes.begin(), bytes.end());
+        bytes[text.find("to flip")] ^= 0x01;
+    }
+    const std::string archive = directory.file("a.xar");
+    writeFile(archive, bytes);
+    fs::create_directories(directory.file("out"));
+    std::string arguments = verdict.arguments;
+    arguments.replace(arguments.find("ARCHIVE"), 7, shellQuote(archive));
+    if (auto at = arguments.find("OUT"); at != std::string::npos)
+        arguments.replace(at, 3, shellQuote(directory.file("out")));
+
+    const ToolRun run = runTool(arguments);
+    EXPECT_EQ(run.status, verdict.status) << run.out << run.err;
+    EXPECT_NE(run.out.find(verdict.out), std::string::npos) << run.out;
+    if (*verdict.err) {
+        EXPECT_TRUE(isErrorLine(run.err, archive));
+        EXPECT_NE(run.err.find(verdict.err), std::string::npos) << run.err;
+    } else {
+        EXPECT_EQ(run.err, "");
+    }
+    EXPECT_EQ(fs::exists(directory.file("out/x.txt")), verdict.writes);
+}
+
+const char* const kTOCMismatch =
+    "The table of contents does not match its checksum (GWXARArchiveErrorDomain 5)";
+
+INSTANTIATE_TEST_SUITE_P(
+    Archives, GWArchiveToolXarVerdict,
+    ::testing::Values(
+        XarVerdict{"TestPassesAGoodArchive", XarDamage::none, "test ARCHIVE", 0,
+                   "1 entries, 0 bad\n", "", false},
+        XarVerdict{"TestNamesAFlippedByte", XarDamage::flippedData, "test ARCHIVE", 1,
+                   "x.txt: the data does not match its stored checksum", "", false},
+        XarVerdict{"TestFailsABadTableOfContents", XarDamage::tocChecksum, "test ARCHIVE", 1, "",
+                   kTOCMismatch, false},
+        XarVerdict{"ExtractWritesNothingFromABadTableOfContents", XarDamage::tocChecksum,
+                   "extract -C OUT ARCHIVE", 1, "", kTOCMismatch, false},
+        XarVerdict{"ExtractCanIgnoreTheChecksum", XarDamage::tocChecksum,
+                   "extract --ignore-checksum -C OUT ARCHIVE", 0, "", "", true},
+        XarVerdict{"InfoReportsABadTableOfContents", XarDamage::tocChecksum, "info ARCHIVE", 0,
+                   "checksum: INVALID\n", "", false},
+        XarVerdict{"InfoSaysNoneWithoutChecksums", XarDamage::noChecksums, "info ARCHIVE", 0,
+                   "checksum: none\n", "", false},
+        XarVerdict{"JsonSaysNoneWithoutChecksums", XarDamage::noChecksums, "list --json ARCHIVE", 0,
+                   "\"checksum\":\"none\"", "", false},
+        XarVerdict{"TestCannotVerifyWithoutChecksums", XarDamage::noChecksums, "test ARCHIVE", 0,
+                   "1 entries, 0 bad, 1 not verified (no stored checksum)\n", "", false}),
+    [](const auto& info) { return std::string(info.param.name); });
 
 // --- detect, macbinary, appledouble ---------------------------------------------
 

@@ -6,12 +6,15 @@
 #include <dirent.h>
 #include <linux/fs.h>
 #include <sys/ioctl.h>
+#include <sys/mount.h>
 #include <sys/stat.h>
 #include <sys/sysmacros.h>
 #include <sys/xattr.h>
 #include <unistd.h>
 
 #include <cstdlib>
+#include <cstring>
+#include <functional>
 
 #include "GWArchiveSupport/GWArchiveConstants.h"
 #include "XarExtractTestSupport.h"
@@ -452,38 +455,89 @@ TEST_F(XarExtraction, ExistingDestinationIsLeftUntouched) {
     EXPECT_TRUE(temporaryLeftovers().empty());
 }
 
-TEST_F(XarExtraction, FailureLeavesNothingBehind) {
-    // The socket deep inside fails the whole directory.
-    auto archive = open(xarFileElement(
-        1, "d", "directory", "0755",
-        xarFileElement(2, "a", "file", "0644",
-                       xar.dataElement("data", gwtest::bytesOf("a"), XarEncoding::none)) +
-            xarFileElement(3, "sub", "directory", "0755",
-                           xarFileElement(4, "sock", "socket", "0644"))));
-    ASSERT_TRUE(archive);
-    GWErrorPtr error;
-    EXPECT_FALSE(extract(archive, "d", "d", nullptr, &error));
-    ASSERT_TRUE(error);
-    EXPECT_TRUE(error->is(kGWXARArchiveErrorDomain, 11));
-    ASSERT_TRUE(error->URL());
-    EXPECT_EQ(error->URL()->lastPathComponent(), "sock");
-    EXPECT_TRUE(directoryNames(directory.file("out")).empty());
-    EXPECT_TRUE(temporaryLeftovers().empty());
+// Extractions that fail whole, leaving nothing at the destination or in the
+// temporary folder, and (without a domain) ones that succeed; `smallDisk`
+// puts the destination on a 1 MiB tmpfs.
+struct ExtractionOutcome {
+    const char* name;
+    std::function<std::string(XarBuilder&)> tree;  // an item "d"
+    bool smallDisk;
+    const char* domain;
+    long code;
+};
+
+void PrintTo(const ExtractionOutcome& outcome, std::ostream* out) {
+    *out << outcome.name;
 }
 
-TEST_F(XarExtraction, DamagedDataFailsTheExtraction) {
-    auto archive = open(
-        xarFileElement(1, "f", "file", "0644",
-                       xar.dataElement("data", gwtest::textBytes(9000, 1), XarEncoding::gzip)));
+class XarExtractionOutcome : public XarExtraction,
+                             public ::testing::WithParamInterface<ExtractionOutcome> {};
+
+TEST_P(XarExtractionOutcome, IsAllOrNothing) {
+    const ExtractionOutcome& outcome = GetParam();
+    auto archive = open(outcome.tree(xar));
     ASSERT_TRUE(archive);
-    archive->fileWithPath("f")->dataFork()->setCompressionType(GWXARCompressionTypeLZMA);
+    mkdir(directory.file("out").c_str(), 0755);
+    if (outcome.smallDisk &&
+        mount("tmpfs", directory.file("out").c_str(), "tmpfs", 0, "size=1m") != 0) {
+        GTEST_SKIP() << "cannot mount a tmpfs: " << strerror(errno);
+    }
     GWErrorPtr error;
-    EXPECT_FALSE(extract(archive, "f", "f", nullptr, &error));
-    ASSERT_TRUE(error);
-    EXPECT_TRUE(error->is(kGWXARArchiveErrorDomain, 13));
-    EXPECT_TRUE(directoryNames(directory.file("out")).empty());
+    const bool extracted = extract(archive, "d", "d", nullptr, &error);
+    const auto names = directoryNames(directory.file("out"));
+    if (outcome.smallDisk) {
+        umount2(directory.file("out").c_str(), MNT_DETACH);
+    }
     EXPECT_TRUE(temporaryLeftovers().empty());
+    if (!outcome.domain) {
+        EXPECT_TRUE(extracted) << (error ? error->localizedDescription() : "");
+        return;
+    }
+    EXPECT_FALSE(extracted);
+    ASSERT_TRUE(error);
+    EXPECT_TRUE(error->is(outcome.domain, outcome.code)) << error->localizedDescription();
+    EXPECT_TRUE(names.empty());
 }
+
+const GWData kSevenHundredKiB(700 * 1024, 0);
+
+INSTANTIATE_TEST_SUITE_P(
+    Trees, XarExtractionOutcome,
+    ::testing::Values(
+        ExtractionOutcome{"SocketDeepInside",
+                          [](XarBuilder& xar) {
+                              return xarFileElement(
+                                  1, "d", "directory", "0755",
+                                  xarFileElement(2, "a", "file", "0644",
+                                                 xar.dataElement("data", gwtest::bytesOf("a"),
+                                                                 XarEncoding::none)) +
+                                      xarFileElement(3, "sub", "directory", "0755",
+                                                     xarFileElement(4, "sock", "socket", "0644")));
+                          },
+                          false, kGWXARArchiveErrorDomain, GWXARArchiveUnsupportedFileTypeError},
+        ExtractionOutcome{"UnreadableCompression",
+                          [](XarBuilder& xar) {
+                              std::string data = xar.dataElement("data", gwtest::textBytes(9000, 1),
+                                                                 XarEncoding::gzip);
+                              data.replace(data.find("x-gzip"), 6, "x-lzma");
+                              return xarFileElement(1, "d", "file", "0644", data);
+                          },
+                          false, kGWXARArchiveErrorDomain, GWXARArchiveUnsupportedCompressionError},
+        ExtractionOutcome{"FilesLargerThanTheFreeSpace",
+                          [](XarBuilder& xar) {
+                              const std::string data =
+                                  xar.dataElement("data", kSevenHundredKiB, XarEncoding::gzip);
+                              return xarFileElement(
+                                  1, "d", "directory", "0755",
+                                  xarFileElement(2, "a", "file", "0644", data) +
+                                      xarFileElement(3, "b", "file", "0644", data));
+                          },
+                          true, kGWPOSIXErrorDomain, ENOSPC},
+        ExtractionOutcome{
+            "HardLinkedFileCountsOnce",
+            [](XarBuilder& xar) { return hardLinkTree(xar, kSevenHundredKiB, kSevenHundredKiB); },
+            true, nullptr, 0}),
+    [](const auto& info) { return std::string(info.param.name); });
 
 TEST_F(XarExtraction, NonFileDestinationIsRefused) {
     auto archive = open(xarFileElement(1, "f", "file", "0644"));

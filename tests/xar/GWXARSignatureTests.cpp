@@ -145,7 +145,7 @@ TEST_F(GWXARSignatureValue, NonKeyedCodersSeeNothing) {
     EXPECT_FALSE(GWXARSignature::initWithCoder(nonKeyed));
 }
 
-TEST_F(GWXARSignatureValue, CopiesAreEqualAndIndependent) {
+TEST_F(GWXARSignatureValue, CopiesAreEqual) {
     auto signature = GWXARSignature::initWithType(GWXARSignatureTypeDSA, bytesOf("abc"),
                                                   certificatesOf(identity().chain), true);
     auto copy = signature->copy();
@@ -153,7 +153,6 @@ TEST_F(GWXARSignatureValue, CopiesAreEqualAndIndependent) {
     EXPECT_NE(copy.get(), signature.get());
     EXPECT_EQ(copy->type(), GWXARSignatureTypeDSA);
     EXPECT_EQ(copy->signatureData(), bytesOf("abc"));
-    EXPECT_NE(copy->signatureData().data(), signature->signatureData().data());
     EXPECT_TRUE(copy->isExtended());
     EXPECT_EQ(encodingsOf(copy->certificates()), identity().chain);
 }

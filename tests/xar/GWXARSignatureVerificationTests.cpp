@@ -278,8 +278,10 @@ TEST_F(GWXARSignatureVerification, UnknownStylesAreRefusedWithTheStyleAsWritten)
 }
 
 TEST_F(GWXARSignatureVerification, MalformedNumbersAreRefused) {
-    for (const std::string child : {"<offset>twelve</offset>", "<size>-</size>",
-                                    "<offset>99999999999999999999999</offset>"}) {
+    // A signature larger than 16 KiB is no signature: nothing is read for it.
+    for (const std::string child :
+         {"<offset>twelve</offset>", "<size>-</size>", "<offset>99999999999999999999999</offset>",
+          "<size>16385</size>"}) {
         SignedTOCFixture fixture({}, checksum_,
                                  "<signature style=\"RSA\">" + child + "</signature>");
         GWErrorPtr error;
@@ -364,11 +366,9 @@ TEST_F(GWXARSignatureVerification, SignaturesReadFromTheHeapOffset) {
     EXPECT_EQ(signatures[0]->signatureData(), bytesOf("first"));
     EXPECT_EQ(signatures[1]->signatureData(), bytesOf("second!"));
 
-    // Without a file to read from, the load says so instead of reading anything.
+    // Ranges read once are not read again: no file is needed the second time.
     fixture.operation().setFileHandle(nullptr);
-    EXPECT_FALSE(fixture.operation().loadSignaturesWithTOC(fixture.toc(), &error));
-    ASSERT_TRUE(error);
-    EXPECT_EQ(error->domain(), kGWPOSIXErrorDomain);
+    EXPECT_TRUE(fixture.operation().loadSignaturesWithTOC(fixture.toc(), &error));
 }
 
 TEST(GWXARTrustedRootScope, RestoresTheEnvironment) {

@@ -29,6 +29,18 @@ std::string nested(std::size_t depth, const std::string& innermost = "") {
     return xml;
 }
 
+// Directories nested `depth` deep, each named with `nameLength` letters.
+std::string longNames(std::size_t depth, std::size_t nameLength) {
+    std::string xml;
+    for (std::size_t i = 0; i < depth; ++i) {
+        xml += "<file><name>" + std::string(nameLength, 'a' + i % 26) + "</name>";
+    }
+    for (std::size_t i = 0; i < depth; ++i) {
+        xml += "</file>";
+    }
+    return xml;
+}
+
 std::string withData(const std::string& dataBody) {
     return "<file id=\"1\"><name>f</name><data>" + dataBody + "</data></file>";
 }
@@ -62,6 +74,13 @@ INSTANTIATE_TEST_SUITE_P(
                    "NSCocoaErrorDomain", GWFileReadCorruptFileError, ""},
         HostileTOC{"FarTooDeep", nested(20000), "NSCocoaErrorDomain", GWFileReadCorruptFileError,
                    ""},
+        // Full paths of 255 levels of 20,000-byte names would take 650 MB.
+        HostileTOC{"PathsPastTheMemoryBound", longNames(255, 20000), "NSCocoaErrorDomain",
+                   GWFileReadCorruptFileError, ""},
+        HostileTOC{"HeapChecksumLongerThanADigest",
+                   withData("<archived-checksum style=\"sha1\"><offset>0</offset><size>65</size>"
+                            "</archived-checksum>"),
+                   kXAR, GWXARArchiveMalformedValueError, "65"},
         HostileTOC{"LengthPast64Bits", withData("<length>18446744073709551616</length>"), kXAR,
                    GWXARArchiveMalformedValueError, "18446744073709551616"},
         HostileTOC{"LengthNotANumber", withData("<length>twelve</length>"), kXAR,

@@ -44,6 +44,11 @@ int runExtract(const ParsedArguments& arguments) {
     auto archive = openArchiveOperand(operand);
     if (!archive)
         return kExitFailure;
+    if (GWErrorPtr integrity = archive->integrityError();
+        integrity && !arguments.has("ignore-checksum")) {
+        reportError(operand, std::nullopt, integrity);
+        return kExitFailure;
+    }
     bool allFound = true;
     std::vector<std::string> paths(arguments.operands.begin() + 1, arguments.operands.end());
     std::vector<std::size_t> selected = selectEntries(*archive, operand, paths, &allFound);
@@ -84,8 +89,8 @@ const Command kExtractCommand = {
     "    gwarchive extract - extract entries of a ZIP or XAR archive\n"
     "\n"
     "SYNOPSIS\n"
-    "    gwarchive extract [-C DIR] [--overwrite] [--progress|--no-progress] [-v]\n"
-    "                      ARCHIVE [PATH...]\n"
+    "    gwarchive extract [-C DIR] [--overwrite] [--ignore-checksum]\n"
+    "                      [--progress|--no-progress] [-v] ARCHIVE [PATH...]\n"
     "\n"
     "DESCRIPTION\n"
     "    Extracts every entry of ARCHIVE, or the named PATHs and everything below\n"
@@ -107,6 +112,8 @@ const Command kExtractCommand = {
     "OPTIONS\n"
     "    -C, --directory DIR  extract beneath DIR.\n"
     "    --overwrite          replace existing items instead of failing.\n"
+    "    --ignore-checksum    extract a XAR whose table of contents does not match\n"
+    "                         its checksum; without it nothing is written.\n"
     "    --progress           always show the progress bar on standard error.\n"
     "    --no-progress        never show it. By default it is shown when standard\n"
     "                         error is a terminal: bytes done and total, rate and\n"
@@ -114,14 +121,16 @@ const Command kExtractCommand = {
     "    -v, --verbose        show the library's log on standard error.\n"
     "\n"
     "EXIT STATUS\n"
-    "    0 when every entry was extracted; 1 when ARCHIVE cannot be opened, a PATH\n"
-    "    is not in it or any entry failed; 2 on wrong usage.\n"
+    "    0 when every entry was extracted; 1 when ARCHIVE cannot be opened, its\n"
+    "    table of contents is damaged, a PATH is not in it or any entry failed; 2\n"
+    "    on wrong usage.\n"
     "\n"
     "EXAMPLES\n"
     "    gwarchive extract -C ~/Restored Photos.zip\n"
     "    gwarchive extract --overwrite Installer.pkg Payload\n",
     {{'C', "directory", true},
      {0, "overwrite", false},
+     {0, "ignore-checksum", false},
      {0, "progress", false},
      {0, "no-progress", false}},
     1,

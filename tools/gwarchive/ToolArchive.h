@@ -99,6 +99,11 @@ public:
                         bool* checksumFailed) = 0;
     // Decodes every regular entry and checks its stored checksum.
     virtual std::vector<EntryProblem> test() = 0;
+    // How many streams the last test() read without a stored checksum to check.
+    virtual std::size_t unverifiedCount() const { return 0; }
+    // What makes every entry untrustworthy, such as a XAR table of contents
+    // that does not match its checksum; none when there is nothing.
+    virtual GWErrorPtr integrityError() const { return nullptr; }
     // Extracts the given entries (all when empty); each failure is reported
     // on standard error as it happens. Returns whether all succeeded.
     virtual bool extract(const std::vector<std::size_t>& indexes, const ExtractOptions& options,

@@ -51,6 +51,8 @@ public:
     EntryRecord entry(std::size_t index) const override { return records_[index]; }
 
     void writeArchiveFields(JsonWriter& json) const override {
+        json.key("checksum");
+        json.value(checksumVerdict());
         json.key("checksumIsValid");
         json.value(archive_->checksumIsValid());
         json.key("signatureIsValid");
@@ -80,8 +82,8 @@ public:
 
     std::vector<std::string> infoLines() const override {
         std::vector<std::string> lines;
-        lines.push_back(std::string("checksum: ") +
-                        (archive_->checksumIsValid() ? "valid" : "INVALID"));
+        const std::string checksum = checksumVerdict();
+        lines.push_back("checksum: " + (checksum == "invalid" ? "INVALID" : checksum));
         std::string verdict = archive_->signatures().empty() ? "none"
                               : archive_->signatureIsValid() ? "valid"
                                                              : "INVALID";
@@ -107,8 +109,19 @@ public:
         return streamReference(nullptr, files_[index], sink, error, checksumFailed);
     }
 
+    GWErrorPtr integrityError() const override {
+        if (archive_->checksumIsValid())
+            return nullptr;
+        return GWGenerateError(kGWXARArchiveErrorDomain, GWXARArchiveInvalidTOCChecksumError,
+                               archive_->URL(), nullptr, {},
+                               "The table of contents does not match its checksum");
+    }
+
+    std::size_t unverifiedCount() const override { return unverified_; }
+
     std::vector<EntryProblem> test() override {
         std::vector<EntryProblem> problems;
+        unverified_ = 0;
         auto check = [&](const GWXARDataReferencePtr& reference, const GWXARFilePtr& file,
                          const std::string& label) {
             GWErrorPtr error;
@@ -116,8 +129,13 @@ public:
             bool read = streamReference(
                 reference, file, [](const std::uint8_t*, std::size_t) { return true; }, &error,
                 &checksumFailed);
+            // The library counts a missing digest as a mismatch; here it is
+            // only something that could not be checked.
+            const GWXARDataReferencePtr stream = reference ? reference : dataForkOf(file);
             if (!read) {
                 problems.push_back({label, describe(error)});
+            } else if (stream && !stream->compressedChecksum() && !stream->uncompressedChecksum()) {
+                ++unverified_;
             } else if (checksumFailed) {
                 problems.push_back({label, "the data does not match its stored checksum"});
             }
@@ -160,6 +178,20 @@ public:
     }
 
 private:
+    // "none" when the header names no checksum and the table of contents has none.
+    const char* checksumVerdict() const {
+        if (!archive_->checksumIsValid())
+            return "invalid";
+        return archive_->tocChecksum().empty() ? "none" : "valid";
+    }
+
+    // The data fork that streaming `file` reads: a hard link's is its target's.
+    static GWXARDataReferencePtr dataForkOf(GWXARFilePtr file) {
+        for (int hops = 0; file && file->type() == GWXARFileTypeHardLink && hops < 64; ++hops)
+            file = file->hardlinkDestination();
+        return file ? file->dataFork() : nullptr;
+    }
+
     std::vector<std::string> subdocumentNames() const {
         std::vector<std::string> names;
         for (const auto& [name, document] : archive_->subdocuments())
@@ -315,6 +347,7 @@ private:
     }
 
     GWXARArchivePtr archive_;
+    std::size_t unverified_ = 0;
     std::vector<EntryRecord> records_;
     std::vector<GWXARFilePtr> files_;
     std::vector<std::optional<std::size_t>> parents_;
