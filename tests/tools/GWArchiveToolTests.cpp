@@ -149,6 +149,14 @@ TEST(GWArchiveTool, InfoZipArchiveListsExtractsAndCatsAsUnzipDoes) {
     ASSERT_EQ(extract.status, 0) << extract.err;
     EXPECT_TRUE(extract.err.empty()) << "no terminal, so no progress bar: " << extract.err;
     EXPECT_EQ(describeTree(directory.file("by-tool")), describeTree(directory.file("by-unzip")));
+    // Standard input, from a pipe (spooled) and from a file (read in place).
+    ASSERT_EQ(runCommand("cat " + shellQuote(archive) + " | " GW_TOOL_PATH " extract -C " +
+                         shellQuote(directory.file("by-pipe")) + " -")
+                  .status,
+              0);
+    EXPECT_EQ(describeTree(directory.file("by-pipe")), describeTree(directory.file("by-unzip")));
+    EXPECT_EQ(runTool("list - < " + shellQuote(archive)).out,
+              runTool("list " + shellQuote(archive)).out);
 
     ToolRun cat = runTool("cat " + shellQuote(archive) + " docs/deep/er/data.bin");
     ASSERT_EQ(cat.status, 0) << cat.err;
