@@ -79,6 +79,8 @@ std::unique_ptr<ToolArchive> openArchiveOperand(const std::string& operand) {
     auto archive = ToolArchive::open(archiveURL(operand), &error);
     if (!archive)
         reportError(operand, std::nullopt, error);
+    else if (auto note = archive->damageNote())
+        reportDamage(operand, *note);
     return archive;
 }
 

@@ -104,6 +104,9 @@ public:
     // What makes every entry untrustworthy, such as a XAR table of contents
     // that does not match its checksum; none when there is nothing.
     virtual GWErrorPtr integrityError() const { return nullptr; }
+    // What was lost before the archive could be read, such as a missing
+    // central directory whose entries were recovered; none for a whole archive.
+    virtual std::optional<std::string> damageNote() const { return std::nullopt; }
     // Extracts the given entries (all when empty); each failure is reported
     // on standard error as it happens. Returns whether all succeeded.
     virtual bool extract(const std::vector<std::size_t>& indexes, const ExtractOptions& options,
