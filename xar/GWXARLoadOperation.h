@@ -265,6 +265,9 @@ private:
     std::uint64_t tocMemoryUsed_ = 0;
     // Certificates already made, by their base64 text.
     std::unordered_map<std::string, GWCertificatePtr> certificatesByText_;
+    // Trust already evaluated, by the certificates (shared through their text):
+    // archives sign many times with one chain.
+    std::map<std::vector<const GWCertificate*>, GWXARTrustResult> trustByChain_;
     // Heap bytes already read, by (offset, size): repeated references are free.
     std::map<std::pair<std::uint64_t, std::uint64_t>, std::shared_ptr<const GWData>> heapRanges_;
     std::optional<GWXARSignatureArray> signatures_;

@@ -207,22 +207,35 @@ GWXARTrustResult GWXARLoadOperation::evaluateKeyInfo(const GWXARSignature& signa
                errorWithCode(GWXARArchiveMissingCertificateError, std::nullopt, pugi::xml_node()));
         return failed;
     }
-    const GWXARTrust* trust = effectiveTrust(error);
-    if (!trust) {
-        return failed;
+    std::vector<const GWCertificate*> key;
+    for (const auto& certificate : *certificates) {
+        key.push_back(certificate.get());
     }
-    GWBorrowedCertificateStack intermediates(sk_X509_new_null());
-    for (std::size_t i = 1; intermediates && i < certificates->size(); ++i) {
-        if ((*certificates)[i] && !sk_X509_push(intermediates.get(), (*certificates)[i]->x509())) {
-            intermediates.reset();
+    auto known = trustByChain_.find(key);
+    if (known == trustByChain_.end()) {
+        const GWXARTrust* trust = effectiveTrust(error);
+        if (!trust) {
+            return failed;
         }
+        GWBorrowedCertificateStack intermediates(sk_X509_new_null());
+        for (std::size_t i = 1; intermediates && i < certificates->size(); ++i) {
+            if ((*certificates)[i] &&
+                !sk_X509_push(intermediates.get(), (*certificates)[i]->x509())) {
+                intermediates.reset();
+            }
+        }
+        if (!intermediates) {
+            failed.status =
+                GWOpenSSLTakeErrorStatus(ERR_PACK(ERR_LIB_X509, 0, ERR_R_MALLOC_FAILURE));
+            GWFail(error, failed.securityError());
+            return failed;
+        }
+        known = trustByChain_
+                    .emplace(std::move(key),
+                             trust->evaluate(certificates->front()->x509(), intermediates.get()))
+                    .first;
     }
-    if (!intermediates) {
-        failed.status = GWOpenSSLTakeErrorStatus(ERR_PACK(ERR_LIB_X509, 0, ERR_R_MALLOC_FAILURE));
-        GWFail(error, failed.securityError());
-        return failed;
-    }
-    GWXARTrustResult result = trust->evaluate(certificates->front()->x509(), intermediates.get());
+    const GWXARTrustResult& result = known->second;
     if (result.kind == GWXARTrustResult::evaluationFailed) {
         GWFail(error, result.securityError());
     } else if (result.kind == GWXARTrustResult::notTrusted) {
