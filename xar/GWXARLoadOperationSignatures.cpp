@@ -165,30 +165,25 @@ bool GWXARLoadOperation::verifySignaturesWithTOC(const pugi::xml_node& toc, int 
     if (!loadSignaturesWithTOC(toc, error)) {
         return false;
     }
-    std::vector<SignatureCheck> checks;
-    checks.reserve(signatures_->size());
-    for (const auto& signature : *signatures_) {
-        if (checksumAlgorithm == 0) {
-            // Nothing was signed, so no signature can hold; callers report this
-            // without an error object on purpose.
-            checks.push_back({GWXARSignatureVerdictInvalid, "no checksum was signed", {}, nullptr});
-        } else {
-            checks.push_back(checkSignature(*signature));
+    // Every signature gets its verdict; the worst one decides, the first of
+    // equals. Only the deciding error is kept: there may be 100,000 signatures.
+    std::optional<SignatureCheck> deciding;
+    for (auto& signature : *signatures_) {
+        // Without a checksum nothing was signed, so no signature can hold;
+        // callers report this without an error object on purpose.
+        SignatureCheck check{GWXARSignatureVerdictInvalid, "no checksum was signed", {}, nullptr};
+        if (checksumAlgorithm != 0) {
+            check = checkSignature(*signature);
+        }
+        signature = signature->copyWithVerdict(check.verdict, check.reason, check.chain);
+        if (!deciding || check.verdict > deciding->verdict) {
+            deciding = std::move(check);
         }
     }
-    // Every signature gets its verdict; the worst one decides, the first of equals.
-    std::size_t deciding = 0;
-    for (std::size_t index = 0; index < checks.size(); ++index) {
-        (*signatures_)[index] = (*signatures_)[index]->copyWithVerdict(
-            checks[index].verdict, checks[index].reason, checks[index].chain);
-        if (checks[index].verdict > checks[deciding].verdict) {
-            deciding = index;
-        }
-    }
-    if (checks.empty() || checks[deciding].verdict == GWXARSignatureVerdictValid) {
+    if (!deciding || deciding->verdict == GWXARSignatureVerdictValid) {
         return true;
     }
-    return GWFail(error, checks[deciding].error);
+    return GWFail(error, deciding->error);
 }
 
 const GWXARTrust* GWXARLoadOperation::effectiveTrust(GWErrorPtr* error) {

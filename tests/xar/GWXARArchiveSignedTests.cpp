@@ -385,6 +385,11 @@ TEST_F(GWXARArchiveSigned, SignaturesSurvivePersistenceAndCopying) {
         EXPECT_EQ(signature->type(), original->type());
         EXPECT_EQ(signature->signatureData(), original->signatureData());
         EXPECT_EQ(signature->certificateCommonNames(), identity.commonNames);
+        // The verdict and the chain as evaluated are kept, not evaluated again.
+        EXPECT_EQ(other->signatureVerdict(), GWXARSignatureVerdictValid);
+        EXPECT_EQ(signature->verdict(), GWXARSignatureVerdictValid);
+        EXPECT_EQ(signature->chainCommonNames(), original->chainCommonNames());
+        EXPECT_EQ(signature->chainCommonNames().size(), 3u);
     }
 }
 
