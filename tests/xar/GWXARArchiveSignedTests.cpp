@@ -79,7 +79,7 @@ protected:
 };
 
 // Who signs, and what becomes of the archive afterwards.
-enum class Signer { rsa, dsa, ecdsa, expired, issuedByLeaf, selfSigned };
+enum class Signer { rsa, dsa, ecdsa, expired, issuedByLeaf, selfSigned, publicRoot };
 enum class Change { none, withoutIntermediate, withoutSigners, tamperedTOC, tamperedChecksum };
 
 struct VerdictCase {
@@ -192,6 +192,16 @@ const VerdictCase kVerdictCases[] = {
      {},
      GWXARSignatureVerdictInvalid,
      "no signers"},
+    // The forgery that needed no key: a root every Debian system trusts, and no signer.
+    {"CMSWithoutSignersUnderAPublicRoot",
+     Signer::publicRoot,
+     "CMS",
+     Change::withoutSigners,
+     GWXARSignatureVerdictInvalid,
+     "no signers",
+     {},
+     GWXARSignatureVerdictInvalid,
+     "no signers"},
     {"TamperedTOC",
      Signer::rsa,
      "RSA",
@@ -231,9 +241,31 @@ protected:
             case Signer::ecdsa: return signing().leaf(XarKeyType::ecdsa);
             case Signer::expired: return signing().expiredLeaf();
             case Signer::issuedByLeaf: return signing().leafIssuedByLeaf();
+            case Signer::publicRoot: return publicRoot();
             case Signer::selfSigned: break;
         }
         return signing().selfSignedLeaf();
+    }
+
+    // The first root of the system's bundle as an identity without a key; empty without a bundle.
+    static const gwtest::XarSigningIdentity& publicRoot() {
+        static gwtest::TemporaryDirectory folder;
+        static gwtest::XarSigningIdentity root = [] {
+            gwtest::XarSigningIdentity identity;
+            const std::string pem = folder.file("root.pem");
+            const std::string der = folder.file("root.der");
+            const std::string bundle = "/etc/ssl/certs/ca-certificates.crt";
+            if (gwtest::runCommand("openssl x509 -in " + bundle + " -out " + pem +
+                                   " && openssl "
+                                   "x509 -in " +
+                                   pem + " -outform DER -out " + der)
+                    .status == 0) {
+                identity.certificateFile = pem;
+                identity.chain = {gwtest::readFile(der)};
+            }
+            return identity;
+        }();
+        return root;
     }
 };
 
@@ -241,6 +273,9 @@ TEST_P(GWXARArchiveVerdict, IsGivenWithItsReasonAndChain) {
     const VerdictCase& test = GetParam();
     const auto& identity = identityOf(test.signer);
     ASSERT_TRUE(signing().ok()) << signing().problem();
+    if (identity.chain.empty()) {
+        GTEST_SKIP() << "no system certificate bundle";
+    }
     XarSigning::Request request(test.style, identity);
     request.withoutSigners = test.change == Change::withoutSigners;
     if (test.change == Change::withoutIntermediate) {
