@@ -220,10 +220,11 @@ private:
         GWErrorPtr error;
         if (!streamFile(
                 file, [](const std::uint8_t*, std::size_t) { return true; }, &error, nullptr)) {
-            problems.push_back({path, error
-                                          ? error->localizedDescription() + " (" + error->domain() +
-                                                " " + std::to_string(error->code()) + ")"
-                                          : "unknown error"});
+            problems.push_back({path,
+                                error ? error->localizedDescription() + " (" + error->domain() +
+                                            " " + std::to_string(error->code()) + ")"
+                                      : "unknown error",
+                                error ? error->domain() : "", error ? error->code() : 0});
         }
     }
 
