@@ -64,11 +64,6 @@ GWErrorPtr GWMetadataStore::attributeError(int number, const char* doing,
                            path_.c_str(), std::strerror(number));
 }
 
-bool GWMetadataStore::isSymbolicLink() const {
-    struct stat info {};
-    return fd_ < 0 && ::lstat(path_.c_str(), &info) == 0 && S_ISLNK(info.st_mode);
-}
-
 bool GWMetadataStore::isDirectory() const {
     struct stat info {};
     const int result = fd_ >= 0 ? ::fstat(fd_, &info) : ::lstat(path_.c_str(), &info);
@@ -158,11 +153,6 @@ bool GWMetadataStore::setAttribute(std::string_view name, std::span<const std::u
         return true;
     }
     const int result = setRaw(linuxName, value);
-    if (result == EPERM && isSymbolicLink()) {
-        GWLog("the extended attribute \"%s\" of the symbolic link %s is not kept: %s",
-              linuxName.c_str(), path_.c_str(), std::strerror(result));
-        return true;
-    }
     if (result == 0) {
         // An older copy in the side file would otherwise survive beside the
         // new value. Reads take the attribute first, so a side file that

@@ -26,9 +26,8 @@
 // Metadata that has nowhere to go is not kept, with one warning, and the call
 // still succeeds: a value the file system refuses whose side file cannot be
 // written (somebody else's "._name" is there, or the name would be too
-// long), and any value for a symbolic link, which Linux keeps no user
-// attributes on. Finder information that carries nothing (all zeros, or a
-// folder's "fold"/"MACS" codes alone) is not written at all.
+// long). Finder information that carries nothing (all zeros, or a folder's
+// "fold"/"MACS" codes alone) is not written at all.
 //
 // One writer per item at a time: the side file is rewritten without locking.
 class GWMetadataStore {
@@ -85,7 +84,6 @@ private:
     bool moveToSideFile(const std::string& macName, const std::string& linuxName,
                         std::span<const std::uint8_t> value, GWErrorPtr* error);
     GWErrorPtr attributeError(int number, const char* doing, const std::string& name) const;
-    bool isSymbolicLink() const;
     bool isDirectory() const;
     // Warns that `linuxName` is not kept and makes sure no part of it stays.
     bool dropValue(const std::string& linuxName, const GWErrorPtr& why);

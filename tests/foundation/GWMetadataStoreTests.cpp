@@ -5,7 +5,9 @@
 #include <unistd.h>
 
 #include "foundation/GWAppleDouble.h"
+#include "foundation/GWConversions.h"
 #include "foundation/GWFileDescriptor.h"
+#include "foundation/GWFileInfo.h"
 #include "foundation/GWLog.h"
 #include "foundation/GWMetadataStore.h"
 #include "support/MetadataTestSupport.h"
@@ -295,13 +297,15 @@ TEST_P(GWMetadataUnwritten, FinderInformationOnlyWhenItSaysSomething) {
     } else {
         gwtest::writeFile(item, bytesOf("x"));
     }
-    GWData finderInfo(kGWFinderInfoLength, 0);
-    std::copy_n(c.typeAndCreator, 8, finderInfo.begin());
+    const std::string codes(c.typeAndCreator, 8);
+    auto info = GWFileInfo::initWithURL(GWURL::fileURLWithPath(item), nullptr);
+    ASSERT_TRUE(info);
+    info->setTypeCode(GWFourCharCode(codes.substr(0, 4)));
+    info->setCreatorCode(GWFourCharCode(codes.substr(4)));
     std::vector<std::string> logged;
     auto previous = GWSetLogSink([&](const std::string& line) { logged.push_back(line); });
     GWErrorPtr error;
-    const bool set =
-        GWMetadataStore(item).setAttribute(kGWFinderInfoAttributeName, finderInfo, &error);
+    const bool set = info->applyToURL(GWURL::fileURLWithPath(item), &error);
     GWSetLogSink(previous);
     EXPECT_TRUE(set) << error->localizedDescription();
     EXPECT_EQ(rawAttribute(item, "user.com.apple.FinderInfo").has_value(), c.written);
