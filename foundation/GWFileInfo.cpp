@@ -7,6 +7,7 @@
 #include <algorithm>
 #include <cerrno>
 
+#include "GWLog.h"
 #include "GWMetadataStore.h"
 
 namespace {
@@ -159,8 +160,16 @@ bool GWFileInfo::apply(int fd, const GWURL& url, GWErrorPtr* error) const {
 
     // Attributes before the mode, which may take away the right to write them.
     GWErrorPtr finderError;
+    struct stat item {};
     if (!applyFinderInfo(fd, path, &finderError)) {
-        note(finderError);
+        // Linux keeps no user attributes on symbolic links: the link is still good.
+        if (fd < 0 && finderError && finderError->is(kGWPOSIXErrorDomain, EPERM) &&
+            lstat(path.c_str(), &item) == 0 && S_ISLNK(item.st_mode)) {
+            GWLog("the Finder information of the symbolic link %s is not kept: %s", path.c_str(),
+                  finderError->localizedDescription().c_str());
+        } else {
+            note(finderError);
+        }
     }
     const uid_t owner = ownerSet_ ? uid_t(ownerID_) : uid_t(-1);
     const gid_t group = groupSet_ ? gid_t(groupID_) : gid_t(-1);

@@ -1,12 +1,16 @@
 #include "GWMetadataStore.h"
 
 #include <linux/limits.h>
+#include <sys/stat.h>
 #include <sys/xattr.h>
 
 #include <algorithm>
 #include <atomic>
 #include <cerrno>
 #include <cstring>
+
+#include "GWAppleDouble.h"
+#include "GWLog.h"
 
 namespace {
 
@@ -20,6 +24,26 @@ bool isRefusal(int number) {
 
 bool isAbsence(int number) {
     return number == ENODATA || number == ENOTSUP;
+}
+
+bool readsAs(std::span<const std::uint8_t> bytes, const char (&code)[5]) {
+    return std::equal(bytes.begin(), bytes.end(), code) ||
+           std::all_of(bytes.begin(), bytes.end(), [](auto b) { return b == 0; });
+}
+
+// Zeros say nothing, and "fold"/"MACS" only that a folder is a folder.
+bool carriesNothing(std::span<const std::uint8_t> finderInfo, bool isDirectory) {
+    if (finderInfo.size() != kGWFinderInfoLength) {
+        return false;
+    }
+    const auto rest = finderInfo.subspan(8);
+    if (!std::all_of(rest.begin(), rest.end(), [](auto b) { return b == 0; })) {
+        return false;
+    }
+    if (isDirectory) {
+        return readsAs(finderInfo.first(4), "fold") && readsAs(finderInfo.subspan(4, 4), "MACS");
+    }
+    return std::all_of(finderInfo.begin(), finderInfo.end(), [](auto b) { return b == 0; });
 }
 
 }  // namespace
@@ -38,6 +62,20 @@ GWErrorPtr GWMetadataStore::attributeError(int number, const char* doing,
     return GWGenerateError(kGWPOSIXErrorDomain, number, std::nullopt, nullptr, {},
                            "%s extended attribute \"%s\" of %s failed: %s", doing, name.c_str(),
                            path_.c_str(), std::strerror(number));
+}
+
+bool GWMetadataStore::isDirectory() const {
+    struct stat info {};
+    const int result = fd_ >= 0 ? ::fstat(fd_, &info) : ::lstat(path_.c_str(), &info);
+    return result == 0 && S_ISDIR(info.st_mode);
+}
+
+bool GWMetadataStore::dropValue(const std::string& linuxName, const GWErrorPtr& why) {
+    GWLog("the extended attribute \"%s\" of %s is not kept: %s", linuxName.c_str(), path_.c_str(),
+          why->localizedDescription().c_str());
+    // An older value, or the part of a fork written so far, must not pass for the new one.
+    removeRaw(linuxName);
+    return true;
 }
 
 int GWMetadataStore::getRaw(const std::string& linuxName, GWData& value) const {
@@ -96,6 +134,10 @@ std::optional<GWData> GWMetadataStore::attribute(std::string_view name, GWErrorP
 
 bool GWMetadataStore::moveToSideFile(const std::string& macName, const std::string& linuxName,
                                      std::span<const std::uint8_t> value, GWErrorPtr* error) {
+    if (auto why = sideFile_.unavailability()) {
+        forkDropped_ = forkDropped_ || macName == kGWResourceForkAttributeName;
+        return dropValue(linuxName, why);
+    }
     if (!sideFile_.setValue(macName, value, error)) {
         return false;
     }
@@ -107,6 +149,9 @@ bool GWMetadataStore::setAttribute(std::string_view name, std::span<const std::u
                                    GWErrorPtr* error) {
     const std::string linuxName = GWLinuxAttributeName(name);
     const std::string macName = GWMacAttributeName(linuxName);
+    if (macName == kGWFinderInfoAttributeName && carriesNothing(value, isDirectory())) {
+        return true;
+    }
     const int result = setRaw(linuxName, value);
     if (result == 0) {
         // An older copy in the side file would otherwise survive beside the
@@ -180,6 +225,9 @@ std::optional<std::vector<std::string>> GWMetadataStore::attributeNames(GWErrorP
 
 bool GWMetadataStore::writeResourceFork(std::span<const std::uint8_t> bytes, std::uint32_t position,
                                         GWErrorPtr* error) {
+    if (forkDropped_) {
+        return true;
+    }
     const std::string macName(kGWResourceForkAttributeName);
     const std::string linuxName = GWLinuxAttributeName(macName);
     bool inSideFile = false;
@@ -201,6 +249,10 @@ bool GWMetadataStore::writeResourceFork(std::span<const std::uint8_t> bytes, std
         // Too long for any attribute: the fork moves to the side file as it
         // is, and the new bytes are written there in place, never assembled
         // in memory.
+        if (auto why = sideFile_.unavailability()) {
+            forkDropped_ = true;
+            return dropValue(linuxName, why);
+        }
         if (!fork.empty() && !sideFile_.setValue(macName, fork, error)) {
             return false;
         }
@@ -223,28 +275,10 @@ bool GWMetadataStore::writeResourceFork(std::span<const std::uint8_t> bytes, std
 }
 
 bool GWMetadataStore::moveMetadata(const std::string& fromItem, const std::string& toItem,
-                                   GWErrorPtr* error) {
-    const std::string from = GWMetadataSideFile::pathForItem(fromItem);
-    const std::string to = GWMetadataSideFile::pathForItem(toItem);
-    if (::rename(from.c_str(), to.c_str()) == 0) {
-        return true;
-    }
-    const int number = errno;
-    if (number != ENOENT) {
-        return GWFail(error, GWGenerateError(kGWPOSIXErrorDomain, number, std::nullopt, nullptr, {},
-                                             "moving the metadata side file %s to %s failed: %s",
-                                             from.c_str(), to.c_str(), std::strerror(number)));
-    }
-    return removeMetadata(toItem, error);
+                                   bool replaceExisting, GWErrorPtr* error) {
+    return GWMetadataSideFile::moveWithItem(fromItem, toItem, replaceExisting, error);
 }
 
 bool GWMetadataStore::removeMetadata(const std::string& item, GWErrorPtr* error) {
-    const std::string side = GWMetadataSideFile::pathForItem(item);
-    if (::unlink(side.c_str()) == 0 || errno == ENOENT) {
-        return true;
-    }
-    const int number = errno;
-    return GWFail(error, GWGenerateError(kGWPOSIXErrorDomain, number, std::nullopt, nullptr, {},
-                                         "removing the metadata side file %s failed: %s",
-                                         side.c_str(), std::strerror(number)));
+    return GWMetadataSideFile::removeForItem(item, error);
 }

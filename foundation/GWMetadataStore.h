@@ -23,6 +23,12 @@
 // ("user.xdg.comment"). Errors are POSIX errors with the system's number and
 // no location; their descriptions name the item and the attribute.
 //
+// Metadata that has nowhere to go is not kept, with one warning, and the call
+// still succeeds: a value the file system refuses whose side file cannot be
+// written (somebody else's "._name" is there, or the name would be too
+// long). Finder information that carries nothing (all zeros, or a folder's
+// "fold"/"MACS" codes alone) is not written at all.
+//
 // One writer per item at a time: the side file is rewritten without locking.
 class GWMetadataStore {
 public:
@@ -50,11 +56,20 @@ public:
     bool writeResourceFork(std::span<const std::uint8_t> bytes, std::uint32_t position,
                            GWErrorPtr* error);
 
-    // Keeps the side file with its item when the item is moved: it follows
-    // the item, and a stale one at the destination goes.
+    // Keeps the side file with its item once the item has been moved: a side
+    // file this process wrote follows the item, and a stale one of ours at
+    // the destination goes. An archive member or any other file named like a
+    // side file is never moved or removed; one at the destination is replaced
+    // only with `replaceExisting`, otherwise the metadata it would have held
+    // is dropped with a warning (see GWMetadataSideFile::moveWithItem).
     static bool moveMetadata(const std::string& fromItem, const std::string& toItem,
-                             GWErrorPtr* error);
-    // Removes the side file of an item that is being removed or replaced.
+                             bool replaceExisting, GWErrorPtr* error);
+    static bool moveMetadata(const std::string& fromItem, const std::string& toItem,
+                             GWErrorPtr* error) {
+        return moveMetadata(fromItem, toItem, false, error);
+    }
+    // Removes the side file of an item that is being removed or replaced,
+    // when this process wrote it.
     static bool removeMetadata(const std::string& item, GWErrorPtr* error);
 
     // Treats attribute values longer than `limit` as refused by the file
@@ -69,8 +84,13 @@ private:
     bool moveToSideFile(const std::string& macName, const std::string& linuxName,
                         std::span<const std::uint8_t> value, GWErrorPtr* error);
     GWErrorPtr attributeError(int number, const char* doing, const std::string& name) const;
+    bool isDirectory() const;
+    // Warns that `linuxName` is not kept and makes sure no part of it stays.
+    bool dropValue(const std::string& linuxName, const GWErrorPtr& why);
 
     int fd_ = -1;
     std::string path_;
     GWMetadataSideFile sideFile_;
+    // A resource fork that could not be kept ignores the rest of its pieces.
+    bool forkDropped_ = false;
 };

@@ -110,6 +110,9 @@ Seeds zipSeeds() {
             entry.stored = implodeBytes(text, settings);
             entry.flags = settings.flags();
         }
+        // Companions, whose sizes the entries' totals count but their decoders must not.
+        zip.addFile("XtraStuf.mac/shrunk.txt", bytesOf("fork"), 8);
+        zip.addFile("__MACOSX/._imploded.txt", appleDouble(), 8);
         seeds.push_back(zip.bytes());
     }
     {

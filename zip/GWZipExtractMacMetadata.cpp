@@ -5,6 +5,7 @@
 #include "foundation/GWFileDescriptor.h"
 #include "foundation/GWFileInfo.h"
 #include "foundation/GWFileManager.h"
+#include "foundation/GWLog.h"
 #include "foundation/GWMetadataNames.h"
 #include "foundation/GWMetadataStore.h"
 #include "foundation/GWRemoteFileHandle.h"
@@ -85,14 +86,18 @@ void GWZipExtractOperation::writeResourceForkForFile(const GWZipFilePtr& file,
         return;
     }
     auto store = std::make_shared<GWMetadataStore>(descriptor->get(), path);
-    // The position never advances: every piece lands at 0. Known and kept;
-    // a fork longer than one decoded piece keeps only what was written last.
-    const std::uint64_t position = 0;
-    ChunkHandler write = [store](std::span<const std::uint8_t> data, bool, GWErrorPtr* error) {
-        if (position > UINT32_MAX) {
+    // Each piece lands where the one before it ended.
+    auto position = std::make_shared<std::uint64_t>(0);
+    ChunkHandler write = [store, position](std::span<const std::uint8_t> data, bool,
+                                           GWErrorPtr* error) {
+        if (*position + data.size() > UINT32_MAX) {
             return GWFail(error, GWPOSIXError(EFBIG));
         }
-        return store->writeResourceFork(data, std::uint32_t(position), error);
+        if (!store->writeResourceFork(data, std::uint32_t(*position), error)) {
+            return false;
+        }
+        *position += data.size();
+        return true;
     };
     unpackFile(file->resourceFork(), handle, std::move(write),
                [descriptor, store, completion](const GWErrorPtr& error) {
@@ -130,8 +135,12 @@ void GWZipExtractOperation::applyAppleDoubleMetadataForFile(const GWZipFilePtr& 
                    }
                    // A companion that does not merge is no reason to fail the
                    // entry. The copy lives beside the file, so it goes either way.
-                   GWAppleFileDecoder::sharedInstance()->mergeAppleDoubleFileAtURL(temporary, url,
-                                                                                   nullptr);
+                   GWErrorPtr mergeError;
+                   if (!GWAppleFileDecoder::sharedInstance()->mergeAppleDoubleFileAtURL(
+                           temporary, url, &mergeError)) {
+                       GWLog("the AppleDouble companion of %s was not applied: %s",
+                             url.path().c_str(), mergeError->localizedDescription().c_str());
+                   }
                    GWRemoveItemAtURL(temporary, nullptr);
                    completion(nullptr);
                });

@@ -53,17 +53,17 @@ std::shared_ptr<GWDecompressor> GWZipWorkOperation::decompressorForFile(
                 GWFail(error, GWPOSIXError(EINVAL));
                 return nullptr;
             }
-            // The size counts attached companions too; the decoder only uses
-            // it as a limit.
+            // The data's own size: the one that counts companions would let
+            // the decoder read on past the end of its stream.
             return GWDecompressor::initForUnshrinkStreamingWithUncompressedSize(
-                file->uncompressedSize(), error);
+                file->storedUncompressedSize(), error);
         case 6:
             if (!file) {
                 GWFail(error, GWPOSIXError(EINVAL));
                 return nullptr;
             }
             return GWDecompressor::initForExplodeStreamingWithUncompressedSize(
-                file->uncompressedSize(), (file->generalPurposeFlags() & 0x0002) != 0,
+                file->storedUncompressedSize(), (file->generalPurposeFlags() & 0x0002) != 0,
                 (file->generalPurposeFlags() & 0x0004) != 0, error);
         case 8: return GWDecompressor::initForStreamingWithAlgorithm(1, error);
         case 12: return GWDecompressor::initForStreamingWithAlgorithm(5, error);

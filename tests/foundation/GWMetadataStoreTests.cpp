@@ -1,9 +1,14 @@
 #include <fcntl.h>
 #include <gtest/gtest.h>
+#include <linux/limits.h>
+#include <sys/stat.h>
 #include <unistd.h>
 
 #include "foundation/GWAppleDouble.h"
+#include "foundation/GWConversions.h"
 #include "foundation/GWFileDescriptor.h"
+#include "foundation/GWFileInfo.h"
+#include "foundation/GWLog.h"
 #include "foundation/GWMetadataStore.h"
 #include "support/MetadataTestSupport.h"
 #include "support/TestSupport.h"
@@ -160,29 +165,161 @@ TEST_F(GWMetadataStoreTest, DescriptorAndPathSeeTheSameMetadata) {
     EXPECT_EQ(gwtest::readFile(path_), bytesOf("data fork"));
 }
 
-TEST_F(GWMetadataStoreTest, SideFilesMoveAndGoWithTheirItems) {
+// --- Side files: only this library's own are read, written, moved or removed -
+
+enum class Planted { nothing, member, link, ours };
+enum class Step { writeInPlace, move, moveReplacing, moveWithout, remove };
+
+struct SideFileCase {
+    const char* label;
+    Planted planted;  // at "._dest" before the step
+    Step step;
+    bool plantedStays;
+    bool valueKept;
+    std::size_t warnings;
+    bool longName = false;  // "dest" as long as names go, so "._dest" is too long
+};
+
+class GWMetadataSideFiles : public GWMetadataStoreTest,
+                            public ::testing::WithParamInterface<SideFileCase> {};
+
+TEST_P(GWMetadataSideFiles, NobodyElsesFileIsTouched) {
+    const SideFileCase& c = GetParam();
+    const std::string dest = directory_.file(c.longName ? std::string(NAME_MAX - 1, 'd') : "dest");
+    const std::string side = GWMetadataSideFile::pathForItem(dest);
+    const std::string outside = directory_.file("outside");
+    gwtest::writeFile(outside, bytesOf("outside"));
+    const GWData member = bytesOf("an archive member, not AppleDouble");
+    const GWData value = gwtest::randomBytes(300, 3);
+    const GWData fork = gwtest::randomBytes(30000, 4);
     gwtest::ScopedAttributeLimit refuseEverything(0);
-    ASSERT_TRUE(GWMetadataStore(path_).setAttribute("com.example.a", bytesOf("a"), nullptr));
-    const std::string moved = directory_.file("moved");
-    gwtest::writeFile(directory_.file("._moved"), bytesOf("stale"));
-    ASSERT_EQ(::rename(path_.c_str(), moved.c_str()), 0);
-    ASSERT_TRUE(GWMetadataStore::moveMetadata(path_, moved, nullptr));
-    EXPECT_FALSE(fileExists(sidePath_));
-    EXPECT_EQ(GWMetadataStore(moved).attribute("com.example.a", nullptr), bytesOf("a"));
+    if (c.planted == Planted::member) {
+        gwtest::writeFile(side, member);
+    } else if (c.planted == Planted::link) {
+        ASSERT_EQ(::symlink(outside.c_str(), side.c_str()), 0);
+    } else if (c.planted == Planted::ours) {
+        gwtest::writeFile(dest, bytesOf("old"));
+        ASSERT_TRUE(GWMetadataStore(dest).setAttribute("com.example.v", value, nullptr));
+    }
+    std::vector<std::string> logged;
+    auto previous = GWSetLogSink([&](const std::string& line) { logged.push_back(line); });
+    auto write = [&](const std::string& item) {
+        GWMetadataStore store(item);
+        ASSERT_TRUE(store.setAttribute("com.example.v", value, nullptr));
+        for (std::uint32_t done = 0; done < fork.size(); done += 10000) {
+            ASSERT_TRUE(
+                store.writeResourceFork(std::span(fork).subspan(done, 10000), done, nullptr));
+        }
+    };
+    const bool moving = c.step != Step::writeInPlace && c.step != Step::remove;
+    if (c.step == Step::writeInPlace) {
+        gwtest::writeFile(dest, bytesOf("data"));
+        write(dest);
+    } else if (moving) {
+        if (c.step != Step::moveWithout) {
+            write(path_);
+        }
+        ASSERT_EQ(::rename(path_.c_str(), dest.c_str()), 0);
+        ASSERT_TRUE(
+            GWMetadataStore::moveMetadata(path_, dest, c.step == Step::moveReplacing, nullptr));
+        EXPECT_FALSE(fileExists(sidePath_));
+    } else {
+        gwtest::writeFile(dest, bytesOf("old"));
+        ASSERT_TRUE(GWMetadataStore::removeMetadata(dest, nullptr));
+    }
+    GWSetLogSink(previous);
 
-    // Moving an item without a side file removes a stale one at the destination.
-    gwtest::writeFile(path_, bytesOf("x"));
-    gwtest::writeFile(sidePath_, bytesOf("stale"));
-    ASSERT_TRUE(GWMetadataStore::moveMetadata(directory_.file("none"), path_, nullptr));
-    EXPECT_FALSE(fileExists(sidePath_));
-    ASSERT_TRUE(GWMetadataStore::removeMetadata(moved, nullptr));
-    EXPECT_FALSE(fileExists(directory_.file("._moved")));
-}
-
-TEST_F(GWMetadataStoreTest, AMalformedSideFileIsReportedNotIgnored) {
-    gwtest::writeFile(sidePath_, bytesOf("not AppleDouble at all, but long enough"));
+    EXPECT_EQ(logged.size(), c.warnings);
+    EXPECT_EQ(gwtest::readFile(outside), bytesOf("outside"));
+    if (c.planted == Planted::member) {
+        EXPECT_EQ(fileExists(side) && gwtest::readFile(side) == member, c.plantedStays);
+    } else if (c.planted == Planted::link) {
+        char target[PATH_MAX] = {};
+        EXPECT_GT(::readlink(side.c_str(), target, sizeof target), 0);
+    } else if (c.planted == Planted::ours) {
+        EXPECT_EQ(fileExists(side), c.plantedStays);
+    }
     GWErrorPtr error;
-    EXPECT_FALSE(GWMetadataStore(path_).attribute("com.example.a", &error));
-    ASSERT_TRUE(error);
-    EXPECT_TRUE(error->is(kGWPOSIXErrorDomain, EINVAL)) << error->localizedDescription();
+    const auto kept = GWMetadataStore(dest).attribute("com.example.v", &error);
+    EXPECT_FALSE(error) << error->localizedDescription();
+    EXPECT_EQ(kept == value, c.valueKept);
+    if (c.valueKept && c.step != Step::moveWithout) {
+        EXPECT_EQ(GWMetadataStore(dest).attribute(kGWResourceForkAttributeName, nullptr), fork);
+    }
 }
+
+INSTANTIATE_TEST_SUITE_P(
+    Cases, GWMetadataSideFiles,
+    ::testing::Values(
+        SideFileCase{"OursFollowsItsItem", Planted::nothing, Step::move, false, true, 0},
+        SideFileCase{"AMemberBesideAMovedItemStays", Planted::member, Step::moveWithout, true,
+                     false, 0},
+        SideFileCase{"AMemberInTheWayStaysAndTheMetadataIsDropped", Planted::member, Step::move,
+                     true, false, 1},
+        SideFileCase{"ReplacementReplacesAMemberInTheWay", Planted::member, Step::moveReplacing,
+                     false, true, 0},
+        SideFileCase{"AStaleOneOfOursGoes", Planted::ours, Step::moveWithout, false, false, 0},
+        SideFileCase{"AMemberIsNeitherReadNorWritten", Planted::member, Step::writeInPlace, true,
+                     false, 2},
+        SideFileCase{"APlantedLinkIsNotFollowed", Planted::link, Step::writeInPlace, true, false,
+                     2},
+        SideFileCase{"RemovingLeavesAMember", Planted::member, Step::remove, true, false, 0},
+        SideFileCase{"RemovingTakesOurs", Planted::ours, Step::remove, false, false, 0},
+        SideFileCase{"ATooLongNameDropsTheMetadataInPlace", Planted::nothing, Step::writeInPlace,
+                     false, false, 2, true},
+        SideFileCase{"ATooLongNameDropsTheMetadataOnAMove", Planted::nothing, Step::move, false,
+                     false, 1, true}),
+    [](const auto& info) { return std::string(info.param.label); });
+
+// --- What is not written -----------------------------------------------------
+
+struct UnwrittenCase {
+    const char* label;
+    const char* kind;  // "file", "folder" or "link"
+    const char* typeAndCreator;
+    bool written;
+};
+
+class GWMetadataUnwritten : public GWMetadataStoreTest,
+                            public ::testing::WithParamInterface<UnwrittenCase> {};
+
+TEST_P(GWMetadataUnwritten, FinderInformationOnlyWhenItSaysSomething) {
+    const UnwrittenCase& c = GetParam();
+    if (!gwtest::userAttributesSupported(directory_.path())) {
+        GTEST_SKIP() << "no user extended attributes here";
+    }
+    const std::string item = directory_.file("x");
+    const std::string kind = c.kind;
+    if (kind == "folder") {
+        ASSERT_EQ(::mkdir(item.c_str(), 0755), 0);
+    } else if (kind == "link") {
+        ASSERT_EQ(::symlink("item", item.c_str()), 0);
+    } else {
+        gwtest::writeFile(item, bytesOf("x"));
+    }
+    const std::string codes(c.typeAndCreator, 8);
+    auto info = GWFileInfo::initWithURL(GWURL::fileURLWithPath(item), nullptr);
+    ASSERT_TRUE(info);
+    info->setTypeCode(GWFourCharCode(codes.substr(0, 4)));
+    info->setCreatorCode(GWFourCharCode(codes.substr(4)));
+    std::vector<std::string> logged;
+    auto previous = GWSetLogSink([&](const std::string& line) { logged.push_back(line); });
+    GWErrorPtr error;
+    const bool set = info->applyToURL(GWURL::fileURLWithPath(item), &error);
+    GWSetLogSink(previous);
+    EXPECT_TRUE(set) << error->localizedDescription();
+    EXPECT_EQ(rawAttribute(item, "user.com.apple.FinderInfo").has_value(), c.written);
+    EXPECT_EQ(logged.size(), kind == "link" ? 1u : 0u);
+    EXPECT_FALSE(fileExists(directory_.file("._x")));
+    EXPECT_EQ(gwtest::readFile(path_), bytesOf("data fork"));
+}
+
+INSTANTIATE_TEST_SUITE_P(
+    Cases, GWMetadataUnwritten,
+    ::testing::Values(UnwrittenCase{"ZerosOnAFile", "file", "\0\0\0\0\0\0\0\0", false},
+                      UnwrittenCase{"CodesOnAFile", "file", "TEXTttxt", true},
+                      UnwrittenCase{"FoldMACSOnAFolder", "folder", "foldMACS", false},
+                      UnwrittenCase{"ZerosOnAFolder", "folder", "\0\0\0\0\0\0\0\0", false},
+                      UnwrittenCase{"OtherCodesOnAFolder", "folder", "foldCARO", true},
+                      UnwrittenCase{"CodesOnALinkWarn", "link", "TEXTttxt", false}),
+    [](const auto& info) { return std::string(info.param.label); });

@@ -255,15 +255,22 @@ TEST_F(GWZipArchiveExtraction, MacCompanionsListedByTheLoaderBecomeMetadata) {
     ZipBuilder zip;
     zip.addFile("docs/a.txt", bytesOf("a"), 8);
     zip.addFile("__MACOSX/docs/._a.txt", buildAppleDouble(companion), 8);
+    // Outside __MACOSX an "._" name is an entry like any other.
+    zip.addFile("docs/._a.txt", bytesOf("a member of its own"));
     zip.addFile("docs/Icon", bytesOf("i"));
     zip.addFile("XtraStuf.mac/docs/Icon", bytesOf("resource bytes"), 8);
     auto archive = open(zip);
     ASSERT_EQ(archive->files().size(), 1u);
-    ASSERT_TRUE(
-        archive->extractFiles(archive->files(), directory.url("out"), true, nullptr, &error))
+    // The member first, so that moving "a.txt" into place finds it there.
+    ASSERT_TRUE(archive->extractFile(archive->fileWithPath("docs/._a.txt"), directory.url("out"),
+                                     true, nullptr, &error));
+    ASSERT_TRUE(archive->extractFiles(
+        {archive->fileWithPath("docs/a.txt"), archive->fileWithPath("docs/Icon")},
+        directory.url("out"), true, nullptr, &error))
         << error->localizedDescription();
     const std::string a = directory.file("out/docs/a.txt");
     EXPECT_EQ(readFile(a), bytesOf("a"));
+    EXPECT_EQ(readFile(directory.file("out/docs/._a.txt")), bytesOf("a member of its own"));
     EXPECT_EQ(GWMetadataStore(a).attribute("com.example.tag", nullptr), bytesOf("red"));
     EXPECT_EQ(GWMetadataStore(a).attribute("com.apple.FinderInfo", nullptr), companion.finderInfo);
     EXPECT_EQ(GWMetadataStore(directory.file("out/docs/Icon"))

@@ -59,6 +59,8 @@ struct MethodCase {
     const char* label;
     std::uint16_t method;
     std::uint16_t flags;
+    // A resource-fork companion, whose size the entry's total counts too.
+    bool withCompanion = false;
 };
 
 class GWZipExtractMethods : public GWZipExtractOperationTest,
@@ -78,8 +80,15 @@ TEST_P(GWZipExtractMethods, WritesTheDecodedBytes) {
         settings.literalTree = (c.flags & 4) != 0;
         entry.stored = implodeBytes(content, settings);
     }
+    if (c.withCompanion) {
+        zip.addFile("XtraStuf.mac/member.txt", bytesOf("fork"));
+    }
     write(zip);
-    auto operation = toDisk(zipEntryFromBuilder(zip, 0), "out.txt", true);
+    auto file = zipEntryFromBuilder(zip, 0);
+    if (c.withCompanion) {
+        file->setResourceFork(zipEntryFromBuilder(zip, 1));
+    }
+    auto operation = toDisk(file, "out.txt", true);
     runToEnd(operation);
     ASSERT_FALSE(operation->error()) << operation->error()->localizedDescription();
     EXPECT_TRUE(operation->started());
@@ -89,7 +98,9 @@ TEST_P(GWZipExtractMethods, WritesTheDecodedBytes) {
 
 INSTANTIATE_TEST_SUITE_P(EveryDecoder, GWZipExtractMethods,
                          ::testing::Values(MethodCase{"Stored", 0, 0}, MethodCase{"Shrunk", 1, 0},
+                                           MethodCase{"ShrunkWithCompanion", 1, 0, true},
                                            MethodCase{"Imploded", 6, 0},
+                                           MethodCase{"ImplodedWithCompanion", 6, 0, true},
                                            MethodCase{"ImplodedLargeWithTree", 6, 6},
                                            MethodCase{"Deflated", 8, 0},
                                            MethodCase{"Bzip2", 12, 0}),
