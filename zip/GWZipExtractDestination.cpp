@@ -132,7 +132,8 @@ bool GWZipExtractOperation::moveIntoPlace(const GWURL& built, GWErrorPtr* error)
     } else {
         moved = GWMoveItemNoReplace(built.path(), destination, error);
     }
-    return moved && GWMetadataStore::moveMetadata(built.path(), destination, error);
+    return moved &&
+           GWMetadataStore::moveMetadata(built.path(), destination, replacesExistingItems(), error);
 }
 
 bool GWZipExtractOperation::setInfoForDirectory(const GWZipFilePtr& file, const GWURL& root,

@@ -12,10 +12,7 @@
 #include <cerrno>
 #include <functional>
 
-#include "foundation/GWFileManager.h"
 #include "foundation/GWFileSystem.h"
-#include "foundation/GWMetadataStore.h"
-#include "support/MetadataTestSupport.h"
 #include "support/TestSupport.h"
 
 namespace {
@@ -120,22 +117,6 @@ const MoveCase kMoveCases[] = {
 
 INSTANTIATE_TEST_SUITE_P(Cases, GWFileSystemMove, ::testing::ValuesIn(kMoveCases),
                          [](const auto& info) { return std::string(info.param.name); });
-
-TEST(GWFileSystem, RefusedMetadataMovesWithItsItem) {
-    TemporaryDirectory directory;
-    GWErrorPtr error;
-    writeFile(directory.file("item"), bytesOf("data"));
-    {
-        ScopedAttributeLimit limit(16);
-        ASSERT_TRUE(GWMetadataStore(directory.file("item"))
-                        .setAttribute("com.example.big", GWData(64, 7), &error));
-    }
-    ASSERT_TRUE(exists(directory.file("._item")));
-    ASSERT_TRUE(GWMoveItemAtURL(directory.url("item"), directory.url("renamed"), &error));
-    EXPECT_FALSE(exists(directory.file("._item")));
-    EXPECT_EQ(GWMetadataStore(directory.file("renamed")).attribute("com.example.big", nullptr),
-              GWData(64, 7));
-}
 
 TEST(GWFileSystem, RemovalClearsFlagsThatPinTheTree) {
     if (geteuid() != 0) {
