@@ -17,15 +17,33 @@ namespace gwtest {
 class ScriptedHTTPServer {
 public:
     enum class Behaviour {
-        honourRanges,  // 206 with the range asked for
-        ignoreRanges,  // 200 with the whole resource
-        notFound,      // 404
-        wrongRange,    // 206 for a range that starts one byte late
-        dropAt,        // honours ranges but closes the connection at `cutOffset`
-        stallAt,       // honours ranges but goes quiet at `cutOffset`
+        honourRanges,    // 206 with the range asked for
+        ignoreRanges,    // 200 with the whole resource
+        notFound,        // 404
+        wrongRange,      // 206 for a range that starts one byte late
+        dropAt,          // honours ranges but closes the connection at `cutOffset`
+        stallAt,         // honours ranges but goes quiet at `cutOffset`
+        silent,          // reads requests and never answers
+        trickle,         // honours ranges at one byte a second
+        chunkedTrailer,  // chunked 206 bodies with a bogus Content-Range in the trailer
+    };
+    // How the served file identifies itself.
+    enum class Validators { none, weakTagAndDate, strongTag, strongTagDroppedLater };
+
+    // Everything beyond the behaviour; requests are counted from 1.
+    struct Script {
+        Behaviour behaviour = Behaviour::honourRanges;
+        std::uint64_t cutOffset = 0;
+        Validators validators = Validators::none;
+        GWData replacement;  // served from request `replaceAt` on
+        int replaceAt = 0;
+        std::string location;  // request `redirectAt` (0: every one) answers 302 to it
+        int redirectAt = -1;
+        int busyRequests = 0;  // the first ones answer 503 with Retry-After: 1
     };
 
     ScriptedHTTPServer(GWData content, Behaviour behaviour, std::uint64_t cutOffset = 0);
+    ScriptedHTTPServer(GWData content, Script script);
     ~ScriptedHTTPServer();
     ScriptedHTTPServer(const ScriptedHTTPServer&) = delete;
     ScriptedHTTPServer& operator=(const ScriptedHTTPServer&) = delete;
@@ -38,9 +56,10 @@ public:
 private:
     void acceptLoop();
     void serve(int connection);
-    bool respond(int connection, const std::string& head);
+    bool respond(int connection, const std::string& head, int number);
 
     GWData content_;
+    Script script_;
     Behaviour behaviour_;
     std::uint64_t cutOffset_;
     int listener_ = -1;

@@ -4,6 +4,7 @@
 #include "Diagnostics.h"
 #include "Locations.h"
 #include "ToolArchive.h"
+#include "foundation/GWHTTPRangeReader.h"
 
 namespace gwarchive {
 
@@ -28,7 +29,7 @@ int runInfo(const ParsedArguments& arguments) {
             ++files;
         }
     }
-    std::printf("archive: %s\n", operand.c_str());
+    std::printf("archive: %s\n", GWRedactedURLString(operand).c_str());
     std::printf("format: %s\n", archive->formatName());
     for (const std::string& line : archive->infoLines())
         std::printf("%s\n", line.c_str());
