@@ -139,7 +139,7 @@ void GWZipLoadOperation::main() {
     auto cancelled = [this] { return isCancelled(); };
     // Self-extractor stubs are far smaller than this; a resource that holds
     // no local header this early is not read to its end to find one.
-    static constexpr std::uint64_t kLongestStub = 16 << 20;
+    static constexpr std::uint64_t kLongestStub = 4 << 20;
     if (!searchForData(kLocalHeaderSignature, *file, 0, kLongestStub, &found, cancelled, &error)) {
         setError(error);
         file->closeFileAndReturnError(nullptr);

@@ -8,6 +8,7 @@
 #include <chrono>
 #include <cstdlib>
 #include <filesystem>
+#include <fstream>
 #include <tuple>
 
 #include "ToolTestSupport.h"
@@ -114,6 +115,17 @@ TEST_F(GWArchiveToolRemote, ListingTwoHundredThousandEntriesCostsTheDirectoryAnd
     EXPECT_GE(sent, writer.centralDirectorySize());
     EXPECT_LE(sent, writer.centralDirectorySize() + kAllowance);
     EXPECT_LE(server_->requests().size(), 4u);
+}
+
+TEST_F(GWArchiveToolRemote, AHugeResourceThatIsNoArchiveIsNotReadToItsEnd) {
+    const std::string path = directory_.file("huge.bin");
+    fs::resize_file((std::ofstream(path), path), 2ull << 30);
+    server_->forgetRequests();
+    EXPECT_EQ(runTool("list " + shellQuote(server_->address("huge.bin"))).status, 1);
+    // The longest self-extractor stub searched, and the end record's window.
+    EXPECT_LE(server_->bodyBytesSent(), (4u << 20) + kAllowance);
+    EXPECT_LE(server_->requests().size(), 16u);
+    fs::remove(path);
 }
 
 TEST_F(GWArchiveToolRemote, CatOfOneEntryOfAHugeArchiveCostsThatEntryAndLittleMore) {
