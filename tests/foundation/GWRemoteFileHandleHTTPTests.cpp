@@ -297,7 +297,9 @@ TEST(GWRemoteFileHandleMisbehavingServerTest, EachEndsInItsErrorWithinTheTimeLim
          {.validators = Validators::strongTagDroppedLater, .replaceAt = 2},
          ESTALE},
         {"later request redirected", {.location = "/other", .redirectAt = 2}, ESTALE},
-        {"first request redirected", {.location = "/other", .redirectAt = 1}, 0},
+        {"first request redirected to another host",
+         {.location = "http://localhost:{port}/other", .redirectAt = 1},
+         0},
         {"redirect loop", {.location = "/archive", .redirectAt = 0}, ELOOP, true},
         {"redirect to file:",
          {.location = "file:///etc/passwd", .redirectAt = 0},
@@ -325,7 +327,7 @@ TEST(GWRemoteFileHandleMisbehavingServerTest, EachEndsInItsErrorWithinTheTimeLim
         script.replacement = gwtest::randomBytes(row.replacementSize, 5);
         ScriptedHTTPServer server(content, script);
         UnansweredPort unanswered;
-        std::string address = server.address();
+        std::string address = "http://user:secret@" + server.address().substr(7);
         if (row.target == std::string("refused")) {
             address = "http://127.0.0.1:" + std::to_string(gwtest::freeLocalPort()) + "/x";
         } else if (row.target == std::string("unanswered")) {
@@ -344,11 +346,15 @@ TEST(GWRemoteFileHandleMisbehavingServerTest, EachEndsInItsErrorWithinTheTimeLim
             ASSERT_TRUE(bytes) << error->localizedDescription();
             const GWData& served = script.redirectAt == 1 ? script.replacement : content;
             EXPECT_EQ(*bytes, GWData(served.begin() + 100000, served.end()));
+            // Credentials stay with the host they were given for.
+            EXPECT_EQ(server.requestsWithCredentials(),
+                      script.redirectAt == 1 ? 1 : server.requestCount());
             continue;
         }
         EXPECT_EQ(!handle, row.failsAtOpen);
         EXPECT_FALSE(bytes);
         expectPOSIXError(error, row.expected);
+        EXPECT_EQ(error->localizedDescription().find("secret"), std::string::npos);
         if (row.expected == ESTALE) {
             EXPECT_NE(
                 error->localizedDescription().find("the remote file changed while it was read"),

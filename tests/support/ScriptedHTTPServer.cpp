@@ -163,6 +163,10 @@ void ScriptedHTTPServer::serve(int connection) {
 }
 
 bool ScriptedHTTPServer::respond(int connection, const std::string& head, int number) {
+    std::string lower = head;
+    std::transform(lower.begin(), lower.end(), lower.begin(),
+                   [](unsigned char c) { return char(std::tolower(c)); });
+    authorized_ += lower.find("\r\nauthorization:") != std::string::npos;
     if (behaviour_ == Behaviour::silent) {
         return waitFor(connection, POLLIN, stopping_) && false;
     }
@@ -176,9 +180,13 @@ bool ScriptedHTTPServer::respond(int connection, const std::string& head, int nu
                         stopping_);
     }
     if (script_.redirectAt == 0 || script_.redirectAt == number) {
+        std::string location = script_.location;
+        if (const auto at = location.find("{port}"); at != std::string::npos) {
+            location.replace(at, 6, std::to_string(port_));
+        }
         return sendText(
             connection,
-            "HTTP/1.1 302 Found\r\nLocation: " + script_.location + "\r\nContent-Length: 0\r\n\r\n",
+            "HTTP/1.1 302 Found\r\nLocation: " + location + "\r\nContent-Length: 0\r\n\r\n",
             stopping_);
     }
     // The replacement is another file: a redirect elsewhere or a new version.

@@ -37,7 +37,8 @@ public:
         Validators validators = Validators::none;
         GWData replacement;  // served from request `replaceAt` on
         int replaceAt = 0;
-        std::string location;  // request `redirectAt` (0: every one) answers 302 to it
+        // Request `redirectAt` (0: every one) answers 302 to it; "{port}" is the server's.
+        std::string location;
         int redirectAt = -1;
         int busyRequests = 0;  // the first ones answer 503 with Retry-After: 1
     };
@@ -52,6 +53,7 @@ public:
     GWURL url(const std::string& name = "archive") const;
     std::string address(const std::string& name = "archive") const;
     int requestCount() const { return requests_; }
+    int requestsWithCredentials() const { return authorized_; }
 
 private:
     void acceptLoop();
@@ -66,6 +68,7 @@ private:
     int port_ = 0;
     std::atomic<bool> stopping_{false};
     std::atomic<int> requests_{0};
+    std::atomic<int> authorized_{0};
     std::thread acceptor_;
     std::mutex connectionsMutex_;
     std::vector<std::thread> connections_;
