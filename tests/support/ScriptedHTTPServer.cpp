@@ -184,10 +184,17 @@ bool ScriptedHTTPServer::respond(int connection, const std::string& head, int nu
         if (const auto at = location.find("{port}"); at != std::string::npos) {
             location.replace(at, 6, std::to_string(port_));
         }
-        return sendText(
-            connection,
-            "HTTP/1.1 302 Found\r\nLocation: " + location + "\r\nContent-Length: 0\r\n\r\n",
-            stopping_);
+        // With a body that never ends, which a client must not read.
+        if (!sendText(connection,
+                      "HTTP/1.1 302 Found\r\nLocation: " + location +
+                          "\r\nContent-Length: 1000000000000\r\n\r\n",
+                      stopping_)) {
+            return false;
+        }
+        const GWData filler(4096, 'r');
+        while (sendAll(connection, filler.data(), filler.size(), stopping_)) {
+        }
+        return false;
     }
     // The replacement is another file: a redirect elsewhere or a new version.
     const bool replaced = script_.replaceAt > 0 && number >= script_.replaceAt;
