@@ -11,8 +11,14 @@ GWRecentHTTPResources& GWRecentHTTPResources::shared() {
 std::optional<GWHTTPResource> GWRecentHTTPResources::find(const std::string& address) {
     std::lock_guard lock(mutex_);
     const auto now = std::chrono::steady_clock::now();
+    // A connection failure is repeated at once only within a pinned run; anyone
+    // else may try again.
     entries_.remove_if([&](const Entry& entry) {
-        return now - entry.lastOpened > kFreshness && !pinned(entry.address);
+        if (pinned(entry.address)) {
+            return false;
+        }
+        std::lock_guard failed(entry.resource.connectionFailure->mutex);
+        return now - entry.lastOpened > kFreshness || entry.resource.connectionFailure->error;
     });
     auto found = std::find_if(entries_.begin(), entries_.end(),
                               [&](const Entry& entry) { return entry.address == address; });
