@@ -1,8 +1,10 @@
+#include <algorithm>
 #include <cerrno>
 #include <mutex>
 
 #include "GWFileHandleBackend.h"
 #include "GWHTTPRangeReader.h"
+#include "GWLog.h"
 #include "GWRecentHTTPResources.h"
 
 namespace {
@@ -12,12 +14,18 @@ namespace {
 // round trip. The blocks of a resource are shared by all its handles.
 constexpr std::size_t kBlockSize = 32 * 1024;
 constexpr std::size_t kBlockCount = 16;
+// A large read (a central directory, a table of contents, a piece of an
+// entry) is one request, up to this much.
+constexpr std::size_t kLargestRequest = 16 << 20;
 
 class HTTPFileBackend final : public GWFileHandleBackend {
 public:
-    HTTPFileBackend(std::unique_ptr<GWHTTPRangeReader> reader, std::shared_ptr<GWBlockCache> blocks,
+    HTTPFileBackend(std::unique_ptr<GWHTTPRangeReader> reader, const GWHTTPResource& resource,
                     std::string address)
-        : reader_(std::move(reader)), blocks_(std::move(blocks)), address_(std::move(address)) {}
+        : reader_(std::move(reader)),
+          blocks_(resource.blocks),
+          connectionFailure_(resource.connectionFailure),
+          address_(std::move(address)) {}
 
     bool readAt(std::uint64_t offset, std::span<std::uint8_t> into, std::size_t& got,
                 GWErrorPtr* error) override {
@@ -27,13 +35,32 @@ public:
         if (!reader_) {
             return GWFail(error, GWPOSIXError(EBADF));
         }
+        {
+            std::lock_guard failed(connectionFailure_->mutex);
+            if (connectionFailure_->error) {
+                return GWFail(error, connectionFailure_->error);
+            }
+        }
         auto fetch = [this](std::uint64_t from, std::span<std::uint8_t> bytes,
-                            GWErrorPtr* failure) { return reader_->fetch(from, bytes, failure); };
+                            GWErrorPtr* failure) {
+            for (std::size_t done = 0; done < bytes.size(); done += kLargestRequest) {
+                const auto piece =
+                    bytes.subspan(done, std::min(kLargestRequest, bytes.size() - done));
+                if (!reader_->fetch(from + done, piece, failure)) {
+                    return false;
+                }
+            }
+            return true;
+        };
         GWErrorPtr failure;
         if (!blocks_->read(offset, into, reader_->size(), fetch, got, &failure)) {
             // What other handles know of it no longer holds.
             if (failure && failure->is(kGWPOSIXErrorDomain, ESTALE)) {
                 GWRecentHTTPResources::shared().forget(address_);
+            }
+            if (GWHTTPRangeReader::isConnectionFailure(failure)) {
+                std::lock_guard failed(connectionFailure_->mutex);
+                connectionFailure_->error = failure;
             }
             return GWFail(error, failure);
         }
@@ -61,6 +88,7 @@ private:
     mutable std::mutex mutex_;
     std::unique_ptr<GWHTTPRangeReader> reader_;
     std::shared_ptr<GWBlockCache> blocks_;
+    std::shared_ptr<GWHTTPConnectionFailure> connectionFailure_;
     std::string address_;
 };
 
@@ -70,19 +98,27 @@ std::unique_ptr<GWFileHandleBackend> GWOpenHTTPFileBackend(const GWURL& url, GWE
     const std::string address = url.absoluteString();
     auto& recent = GWRecentHTTPResources::shared();
     if (auto known = recent.find(address)) {
-        auto reader = GWHTTPRangeReader::attach(url, known->size, known->entityTag, error);
+        auto reader = GWHTTPRangeReader::attach(url, known->identity, error);
         if (!reader) {
             return nullptr;
         }
-        return std::make_unique<HTTPFileBackend>(std::move(reader), known->blocks, address);
+        return std::make_unique<HTTPFileBackend>(std::move(reader), *known, address);
     }
     GWData firstBlock;
     auto reader = GWHTTPRangeReader::open(url, kBlockSize, firstBlock, error);
     if (!reader) {
         return nullptr;
     }
-    auto blocks = std::make_shared<GWBlockCache>(kBlockSize, kBlockCount);
-    blocks->store(0, firstBlock, reader->size());
-    recent.remember(address, {reader->size(), reader->entityTag(), blocks});
-    return std::make_unique<HTTPFileBackend>(std::move(reader), std::move(blocks), address);
+    if (reader->identity().validator.empty() && reader->size() > 0) {
+        GWLog(
+            "%s has neither a strong entity tag nor a modification date: a change of the file "
+            "while it is read is noticed only when its size changes",
+            GWRedactedURLString(address).c_str());
+    }
+    GWHTTPResource resource{reader->identity(),
+                            std::make_shared<GWBlockCache>(kBlockSize, kBlockCount),
+                            std::make_shared<GWHTTPConnectionFailure>()};
+    resource.blocks->store(0, firstBlock, reader->size());
+    recent.remember(address, resource);
+    return std::make_unique<HTTPFileBackend>(std::move(reader), resource, address);
 }

@@ -6,59 +6,88 @@
 #include <memory>
 #include <span>
 #include <string>
+#include <string_view>
 
 #include "GWError.h"
 #include "GWURL.h"
 
-// How long a remote read may wait: for the connection, and for the next byte
-// of a response once it has begun. Process-wide; tools and tests may shorten
+// The address with any "user:password@" replaced by "***@", for messages.
+std::string GWRedactedURLString(std::string_view address);
+
+// How long a remote read may take. Process-wide; tools and tests may shorten
 // them before opening handles.
 struct GWHTTPTimeouts {
-    long connectSeconds = 30;
+    long connectSeconds = 15;
+    // A transfer slower than lowSpeedBytes per second for this long ends.
     long stallSeconds = 30;
+    long lowSpeedBytes = 1024;
+    // Every request must end within deadlineSeconds plus one second per
+    // deadlineBytesPerSecond bytes it asked for.
+    long deadlineSeconds = 60;
+    long deadlineBytesPerSecond = 16 * 1024;
+    // Back-off before the first retry of a 429, a 503 or a reset connection;
+    // it doubles for each further one. Retry-After is honoured up to retryAfterLimitSeconds.
+    long retryMilliseconds = 250;
+    long retryAfterLimitSeconds = 10;
+    int retries = 3;
 };
 void GWSetHTTPTimeouts(const GWHTTPTimeouts& timeouts);
 GWHTTPTimeouts GWCurrentHTTPTimeouts();
+// Applies "connect=S,stall=S,deadline=S,retry=MS,retries=N" (any subset) to
+// `timeouts`; false for anything else.
+bool GWParseHTTPTimeouts(std::string_view text, GWHTTPTimeouts& timeouts);
+
+// Which version of a resource a reader reads: fixed by its first response.
+struct GWHTTPIdentity {
+    std::string address;  // after redirects; every later request goes there
+    std::uint64_t size = 0;
+    std::string validator;  // a strong entity tag, or else Last-Modified; empty when neither
+    bool validatorIsEntityTag = false;
+};
 
 // Ranged GET requests for one http(s) resource over one kept-alive
-// connection. Every response is checked against the range asked for: a
-// server that ignores ranges, a body cut short or a resource whose size
-// changed is an error, never data. The errors are those documented with
-// GWRemoteFileHandle.
+// connection. Every response is checked against the range asked for and the
+// identity the first response fixed: a server that ignores ranges, a body
+// cut short or a resource that changed is an error, never data. The errors
+// are those documented with GWRemoteFileHandle.
 class GWHTTPRangeReader {
 public:
     // Opens the resource with a request for its first `probeLength` bytes,
-    // which learns the size and proves range support. `probe` receives what
-    // came back (fewer bytes only for a shorter resource).
+    // which learns its identity and proves range support. `probe` receives
+    // what came back (fewer bytes only for a shorter resource).
     static std::unique_ptr<GWHTTPRangeReader> open(const GWURL& url, std::size_t probeLength,
                                                    GWData& probe, GWErrorPtr* error);
     // A reader for a resource another reader opened: no request until the
-    // first fetch, which checks that size and entity tag still hold.
-    static std::unique_ptr<GWHTTPRangeReader> attach(const GWURL& url, std::uint64_t size,
-                                                     std::string entityTag, GWErrorPtr* error);
+    // first fetch, which checks that the identity still holds.
+    static std::unique_ptr<GWHTTPRangeReader> attach(const GWURL& url, GWHTTPIdentity identity,
+                                                     GWErrorPtr* error);
     ~GWHTTPRangeReader();
     GWHTTPRangeReader(const GWHTTPRangeReader&) = delete;
     GWHTTPRangeReader& operator=(const GWHTTPRangeReader&) = delete;
 
     // Exactly into.size() bytes at `offset`, which must lie inside the resource.
     bool fetch(std::uint64_t offset, std::span<std::uint8_t> into, GWErrorPtr* error);
-    std::uint64_t size() const { return size_; }
-    // The server's validator of this version of the resource, or empty.
-    const std::string& entityTag() const { return entityTag_; }
+    std::uint64_t size() const { return identity_.size; }
+    const GWHTTPIdentity& identity() const { return identity_; }
+
+    // Failures of the connection itself, which a later request would only repeat.
+    static bool isConnectionFailure(const GWErrorPtr& error);
 
 private:
     struct Transfer;
     explicit GWHTTPRangeReader(GWURL url);
     bool perform(Transfer& transfer, GWErrorPtr* error);
+    CURLcode performOnce(const std::string& address, Transfer& transfer);
+    bool nextHop(const std::string& from, Transfer& transfer, std::string& next, GWErrorPtr* error);
     static bool isEmptyResourceAnswer(CURL* curl, CURLcode code, const Transfer& transfer);
     GWErrorPtr failure(int number, const Transfer& transfer, const std::string& reason) const;
 
     GWURL url_;
-    std::string address_;
+    std::string shownAddress_;  // without credentials
     struct EasyDeleter {
         void operator()(CURL* curl) const { curl_easy_cleanup(curl); }
     };
     std::unique_ptr<CURL, EasyDeleter> curl_;  // kept for its connection
-    std::uint64_t size_ = 0;
-    std::string entityTag_;
+    GWHTTPIdentity identity_;
+    int originClass_ = -1;  // the address class of the host first asked, once known
 };

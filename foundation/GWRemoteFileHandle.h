@@ -17,18 +17,24 @@ class GWFileHandleBackend;
 //
 // http and https URLs are read with range requests over one kept-alive
 // connection, with a small read-ahead cache; they cannot be written
-// (NSCocoaErrorDomain 518). Opening asks for the first bytes, which gives the
-// size. Remote failures are NSPOSIXErrorDomain errors:
+// (NSCocoaErrorDomain 518). Opening asks for the first bytes, which fixes the
+// file's identity: the URL after redirects, the size and a validator (strong
+// entity tag, else Last-Modified). Remote failures are NSPOSIXErrorDomain errors:
 //   ENOENT        404 or 410
 //   EACCES        401, 403 or 407
 //   ENOTSUP       the server ignores range requests (a 200 answer)
-//   ESTALE        the resource changed size while it was read
+//   ESTALE        "the remote file changed while it was read": another size or
+//                 validator, or a redirect where the first request had none
 //   ECONNRESET    the connection ended before the whole range arrived
-//   ETIMEDOUT     no connection, or a response that stalled, within the timeouts
+//   ETIMEDOUT     no connection, a too slow response or a missed deadline
+//                 (GWHTTPTimeouts)
 //   ECONNREFUSED  nobody listens (or the errno of the failed connect)
 //   EHOSTUNREACH  the host name does not resolve
 //   EPROTO        a TLS failure, or an answer for another range than asked
-//   ELOOP         too many redirects
+//   EPERM         a refused redirect: https to http, or into a loopback,
+//                 link-local or private address from another kind of host
+//   EPROTONOSUPPORT  a redirect to another scheme than http(s)
+//   ELOOP         more than 5 redirects
 //   EIO           any other status or transfer failure
 // Bytes are handed on only once their whole range has arrived.
 class GWRemoteFileHandle {

@@ -277,6 +277,27 @@ Seeds sfxSeeds() {
     return seeds;
 }
 
+// Answers a server might give to a request for the first 64 bytes.
+Seeds httpResponseSeeds() {
+    const std::string body(64, 'x');
+    Seeds seeds;
+    for (const std::string& answer : {
+             "HTTP/1.1 206 Partial Content\r\nETag: \"v1\"\r\nContent-Range: bytes 0-63/5000\r\n"
+             "Content-Length: 64\r\n\r\n" +
+                 body,
+             "HTTP/1.1 100 Continue\r\n\r\nHTTP/1.1 206 Partial Content\r\nContent-Range: bytes "
+             "0-63/64\r\nTransfer-Encoding: chunked\r\n\r\n40\r\n" +
+                 body + "\r\n0\r\nContent-Range: bytes 1-2/3\r\n\r\n",
+             std::string("HTTP/1.1 416 Range Not Satisfiable\r\nContent-Range: bytes */0\r\n"
+                         "Content-Length: 0\r\n\r\n"),
+             std::string("HTTP/1.1 503 Busy\r\nRetry-After: 2\r\nContent-Length: 0\r\n\r\n"),
+             std::string("HTTP/1.1 302 Found\r\nContent-Length: 3\r\n\r\nabc"),
+         }) {
+        seeds.emplace_back(answer.begin(), answer.end());
+    }
+    return seeds;
+}
+
 Seeds decompressorSeeds() {
     const GWData text = textBytes(4000, 9);
     // Kind, expanded size in units of 64 (big-endian), piece length - 1.
@@ -328,6 +349,7 @@ int main(int argc, char** argv) {
                     writeSeeds(directory, "fuzz_macbinary", macBinarySeeds()) &&
                     writeSeeds(directory, "fuzz_appledouble", appleDoubleSeeds()) &&
                     writeSeeds(directory, "fuzz_sfx_detect", sfxSeeds()) &&
-                    writeSeeds(directory, "fuzz_decompressors", decompressorSeeds());
+                    writeSeeds(directory, "fuzz_decompressors", decompressorSeeds()) &&
+                    writeSeeds(directory, "fuzz_http_response", httpResponseSeeds());
     return ok ? 0 : 1;
 }

@@ -11,6 +11,7 @@
 namespace {
 
 constexpr std::size_t kSearchChunkSize = 16384;
+constexpr std::size_t kLargestSearchChunk = 1 << 20;
 // The classic end record plus the longest archive comment, with some slack.
 constexpr std::uint64_t kEndRecordSearchWindow = 66000;
 
@@ -33,13 +34,18 @@ bool GWZipLoadOperation::searchForData(std::span<const std::uint8_t> pattern,
     }
     GWData buffer;
     std::uint64_t position = startOffset;
+    std::uint64_t reads = 0;
     while (true) {
         if (cancelBlock && cancelBlock()) {
             return GWFail(
                 error, GWGenerateError(kGWCocoaErrorDomain, GWUserCancelledError, file.URL(),
                                        nullptr, {}, "The search for the ZIP data was cancelled"));
         }
-        const std::uint64_t want = std::min<std::uint64_t>(kSearchChunkSize, end - position);
+        // Reads grow as the search goes on, so a long one costs few round trips.
+        const std::uint64_t want = std::min<std::uint64_t>(
+            std::min<std::uint64_t>(kSearchChunkSize << std::min<std::uint64_t>(reads++, 6),
+                                    kLargestSearchChunk),
+            end - position);
         auto chunk = file.readDataOfLength(want, error);
         if (!chunk) {
             return false;

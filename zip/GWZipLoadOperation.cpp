@@ -137,12 +137,18 @@ void GWZipLoadOperation::main() {
     static constexpr std::uint8_t kLocalHeaderSignature[] = {'P', 'K', 3, 4};
     std::uint64_t found = kNotFound;
     auto cancelled = [this] { return isCancelled(); };
-    if (!searchForData(kLocalHeaderSignature, *file, 0, UINT64_MAX, &found, cancelled, &error)) {
+    // Self-extractor stubs are far smaller than this; a resource that holds
+    // no local header this early is not read to its end to find one.
+    static constexpr std::uint64_t kLongestStub = 4 << 20;
+    if (!searchForData(kLocalHeaderSignature, *file, 0, kLongestStub, &found, cancelled, &error)) {
         setError(error);
         file->closeFileAndReturnError(nullptr);
         return;
     }
-    if (found == kNotFound) {
+    if (found == kNotFound && file->fileSize() > kLongestStub) {
+        // The end record tells where the data begins, if it is there at all.
+        found = 0;
+    } else if (found == kNotFound) {
         // Without a local header only an end record that counts no entries
         // makes an archive: an empty one.
         GWZipEndOfCentralDirectoryRecord end;
@@ -299,7 +305,11 @@ void GWZipLoadOperation::walkCentralDirectory(const GWZipEndOfCentralDirectoryRe
     static constexpr std::size_t kBatchSize = 1024;
     GWZipReadWindow window(file);
     // The directory is read a window at a time: a huge one is never held whole.
-    GWZipReadWindow directory(file, 1024 * 1024);
+    // Remotely every window is a round trip: a large directory comes in one.
+    const bool remote = file.URL() && !file.URL()->isFileURL();
+    GWZipReadWindow directory(
+        file, std::size_t(remote ? std::clamp<std::uint64_t>(directorySize, 1 << 20, 16 << 20)
+                                 : 1 << 20));
     GWErrorPtr error;
     // Parses the record at `position` into `batch`, unless its name ends in
     // "..", and gives its length.

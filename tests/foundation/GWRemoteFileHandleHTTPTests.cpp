@@ -1,6 +1,12 @@
 #include <gtest/gtest.h>
 
+#include <arpa/inet.h>
+#include <netinet/in.h>
+#include <sys/socket.h>
 #include <sys/stat.h>
+#include <unistd.h>
+
+#include <chrono>
 
 #include <cerrno>
 
@@ -195,31 +201,13 @@ TEST_F(GWRemoteFileHandleHTTPTest, AResourceThatChangesSizeUnderneathIsAnError) 
     expectPOSIXError(error, ESTALE);
 }
 
-TEST(GWRemoteFileHandleMisbehavingServerTest, AServerWithoutRangeSupportIsRefusedAtOnce) {
-    ScriptedHTTPServer server(gwtest::randomBytes(4 << 20, 1),
-                              ScriptedHTTPServer::Behaviour::ignoreRanges);
-    ASSERT_TRUE(server.running());
-    GWErrorPtr error;
-    EXPECT_FALSE(GWRemoteFileHandle::initForReadingFromURL(server.url(), &error));
-    expectPOSIXError(error, ENOTSUP);
-}
-
-TEST(GWRemoteFileHandleMisbehavingServerTest, NotFoundAndAnotherRangeAreErrors) {
-    ScriptedHTTPServer missing({}, ScriptedHTTPServer::Behaviour::notFound);
-    GWErrorPtr error;
-    EXPECT_FALSE(GWRemoteFileHandle::initForReadingFromURL(missing.url(), &error));
-    expectPOSIXError(error, ENOENT);
-
-    ScriptedHTTPServer shifted(gwtest::randomBytes(1000, 2),
-                               ScriptedHTTPServer::Behaviour::wrongRange);
-    error = nullptr;
-    EXPECT_FALSE(GWRemoteFileHandle::initForReadingFromURL(shifted.url(), &error));
-    expectPOSIXError(error, EPROTO);
-}
-
 TEST(GWRemoteFileHandleMisbehavingServerTest, ADroppedConnectionFailsTheRangeWithoutShortData) {
     const GWData content = gwtest::randomBytes(600000, 3);
     ScriptedHTTPServer server(content, ScriptedHTTPServer::Behaviour::dropAt, 400000);
+    const GWHTTPTimeouts saved = GWCurrentHTTPTimeouts();
+    GWHTTPTimeouts quick = saved;
+    quick.retryMilliseconds = 1;
+    GWSetHTTPTimeouts(quick);
     GWErrorPtr error;
     auto handle = GWRemoteFileHandle::initForReadingFromURL(server.url(), &error);
     ASSERT_TRUE(handle) << error->localizedDescription();
@@ -236,29 +224,144 @@ TEST(GWRemoteFileHandleMisbehavingServerTest, ADroppedConnectionFailsTheRangeWit
     auto before = handle->readDataOfLength(50000, &error);
     ASSERT_TRUE(before);
     EXPECT_EQ(*before, GWData(content.begin() + 300000, content.begin() + 350000));
-}
-
-TEST(GWRemoteFileHandleMisbehavingServerTest, AStalledResponseTimesOut) {
-    const GWHTTPTimeouts saved = GWCurrentHTTPTimeouts();
-    GWSetHTTPTimeouts({2, 1});
-    ScriptedHTTPServer server(gwtest::randomBytes(200000, 4),
-                              ScriptedHTTPServer::Behaviour::stallAt, 150000);
-    GWErrorPtr error;
-    auto handle = GWRemoteFileHandle::initForReadingFromURL(server.url(), &error);
-    ASSERT_TRUE(handle);
-    ASSERT_TRUE(handle->seekToFileOffset(100000, nullptr));
-    EXPECT_FALSE(handle->readDataOfLength(100000, &error));
     GWSetHTTPTimeouts(saved);
-    expectPOSIXError(error, ETIMEDOUT);
 }
 
-TEST(GWRemoteFileHandleMisbehavingServerTest, NobodyListeningIsConnectionRefused) {
-    const int port = gwtest::freeLocalPort();
-    auto url = GWURL::URLWithString("http://127.0.0.1:" + std::to_string(port) + "/x.zip");
-    ASSERT_TRUE(url);
-    GWErrorPtr error;
-    EXPECT_FALSE(GWRemoteFileHandle::initForReadingFromURL(*url, &error));
-    expectPOSIXError(error, ECONNREFUSED);
+// Rows name only what differs from a well-behaved server.
+#pragma GCC diagnostic ignored "-Wmissing-field-initializers"
+
+namespace {
+
+// A port on 127.0.0.1 that never completes a connection: its listener takes
+// no connection off a queue that is already full.
+struct UnansweredPort {
+    int listener = ::socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0);
+    std::vector<int> fillers;
+    int port = 0;
+
+    UnansweredPort() {
+        sockaddr_in address{};
+        address.sin_family = AF_INET;
+        address.sin_addr.s_addr = htonl(INADDR_LOOPBACK);
+        socklen_t length = sizeof address;
+        if (::bind(listener, reinterpret_cast<sockaddr*>(&address), sizeof address) != 0 ||
+            ::listen(listener, 0) != 0 ||
+            ::getsockname(listener, reinterpret_cast<sockaddr*>(&address), &length) != 0) {
+            return;
+        }
+        port = ntohs(address.sin_port);
+        for (int index = 0; index < 3; ++index) {
+            fillers.push_back(::socket(AF_INET, SOCK_STREAM | SOCK_NONBLOCK | SOCK_CLOEXEC, 0));
+            ::connect(fillers.back(), reinterpret_cast<sockaddr*>(&address), sizeof address);
+        }
+        ::usleep(100000);
+    }
+    ~UnansweredPort() {
+        for (int socket : fillers) {
+            ::close(socket);
+        }
+        ::close(listener);
+    }
+};
+
+using Script = ScriptedHTTPServer::Script;
+using Behaviour = ScriptedHTTPServer::Behaviour;
+using Validators = ScriptedHTTPServer::Validators;
+
+struct ServerCase {
+    const char* label;
+    Script script;
+    int expected;  // 0: the bytes of the file (the replacement, when redirected to it)
+    bool failsAtOpen = false;
+    std::size_t replacementSize = 200000;
+    const char* target = "archive";  // "refused": nobody listens; "unanswered": connect never ends
+};
+
+}  // namespace
+
+TEST(GWRemoteFileHandleMisbehavingServerTest, EachEndsInItsErrorWithinTheTimeLimits) {
+    const ServerCase cases[] = {
+        {"no range support", {Behaviour::ignoreRanges}, ENOTSUP, true},
+        {"not found", {Behaviour::notFound}, ENOENT, true},
+        {"another range", {Behaviour::wrongRange}, EPROTO, true},
+        {"silent after accept", {Behaviour::silent}, ETIMEDOUT, true},
+        {"stall after headers", {Behaviour::stallAt, 0}, ETIMEDOUT, true},
+        {"one byte a second", {Behaviour::trickle}, ETIMEDOUT, true},
+        {"declares more than it sends", {Behaviour::stallAt, 150000}, ETIMEDOUT},
+        {"nobody listens", {}, ECONNREFUSED, true, 0, "refused"},
+        {"connect never answered", {}, ETIMEDOUT, true, 0, "unanswered"},
+        {"replaced, no validator", {.replaceAt = 2}, ESTALE, false, 190000},
+        {"replaced, weak tag", {.validators = Validators::weakTagAndDate, .replaceAt = 2}, ESTALE},
+        {"replaced, strong tag", {.validators = Validators::strongTag, .replaceAt = 2}, ESTALE},
+        {"strong tag dropped",
+         {.validators = Validators::strongTagDroppedLater, .replaceAt = 2},
+         ESTALE},
+        {"later request redirected", {.location = "/other", .redirectAt = 2}, ESTALE},
+        {"first request redirected to another host",
+         {.location = "http://localhost:{port}/other", .redirectAt = 1},
+         0},
+        {"redirect loop", {.location = "/archive", .redirectAt = 0}, ELOOP, true},
+        {"redirect to file:",
+         {.location = "file:///etc/passwd", .redirectAt = 0},
+         EPROTONOSUPPORT,
+         true},
+        {"redirect to link-local",
+         {.location = "http://169.254.169.254/x", .redirectAt = 0},
+         EPERM,
+         true},
+        {"redirect to private", {.location = "http://10.1.2.3/x", .redirectAt = 0}, EPERM, true},
+        {"busy twice, then served", {.busyRequests = 2}, 0},
+        {"range in a chunked trailer", {Behaviour::chunkedTrailer}, 0},
+    };
+    const GWHTTPTimeouts saved = GWCurrentHTTPTimeouts();
+    GWHTTPTimeouts quick;
+    quick.connectSeconds = quick.stallSeconds = 1;
+    quick.deadlineSeconds = 3;
+    quick.retryMilliseconds = 20;
+    quick.retryAfterLimitSeconds = 0;
+    GWSetHTTPTimeouts(quick);
+    for (const ServerCase& row : cases) {
+        SCOPED_TRACE(row.label);
+        const GWData content = gwtest::randomBytes(200000, 4);
+        Script script = row.script;
+        script.replacement = gwtest::randomBytes(row.replacementSize, 5);
+        ScriptedHTTPServer server(content, script);
+        UnansweredPort unanswered;
+        std::string address = "http://user:secret@" + server.address().substr(7);
+        if (row.target == std::string("refused")) {
+            address = "http://127.0.0.1:" + std::to_string(gwtest::freeLocalPort()) + "/x";
+        } else if (row.target == std::string("unanswered")) {
+            address = "http://127.0.0.1:" + std::to_string(unanswered.port) + "/x";
+        }
+        const auto started = std::chrono::steady_clock::now();
+        GWErrorPtr error;
+        auto handle = GWRemoteFileHandle::initForReadingFromURL(
+            GWURL::URLWithString(address).value_or(GWURL()), &error);
+        std::optional<GWData> bytes;
+        if (handle && handle->seekToFileOffset(100000, nullptr)) {
+            bytes = handle->readDataOfLength(100000, &error);
+        }
+        EXPECT_LT(std::chrono::steady_clock::now() - started, std::chrono::seconds(8));
+        if (row.expected == 0) {
+            ASSERT_TRUE(bytes) << error->localizedDescription();
+            const GWData& served = script.redirectAt == 1 ? script.replacement : content;
+            EXPECT_EQ(*bytes, GWData(served.begin() + 100000, served.end()));
+            // Credentials stay with the host they were given for.
+            EXPECT_EQ(server.requestsWithCredentials(),
+                      script.redirectAt == 1 ? 1 : server.requestCount());
+            continue;
+        }
+        EXPECT_EQ(!handle, row.failsAtOpen);
+        EXPECT_FALSE(bytes);
+        expectPOSIXError(error, row.expected);
+        EXPECT_EQ(error->localizedDescription().find("secret"), std::string::npos);
+        if (row.expected == ESTALE) {
+            EXPECT_NE(
+                error->localizedDescription().find("the remote file changed while it was read"),
+                std::string::npos);
+        }
+    }
+    GWSetHTTPTimeouts(saved);
 }
 
 TEST(GWRemoteFileHandleHTTPSTest, TheServerMustBeTrustedAndThenReadsAsOverHTTP) {
@@ -275,7 +378,8 @@ TEST(GWRemoteFileHandleHTTPSTest, TheServerMustBeTrustedAndThenReadsAsOverHTTP) 
     ASSERT_EQ(mkdir(directory.file("www").c_str(), 0755), 0);
     const GWData contents = gwtest::randomBytes(100000, 9);
     gwtest::writeFile(directory.file("www/data.bin"), contents);
-    gwtest::NginxServer server(directory.file("www"), {{certificate, key}});
+    gwtest::NginxServer server(directory.file("www"), {{certificate, key}},
+                               "    location = /down { return 302 http://127.0.0.1:9/x; }\n");
     ASSERT_TRUE(server.running()) << server.failure();
 
     GWErrorPtr error;
@@ -288,4 +392,7 @@ TEST(GWRemoteFileHandleHTTPSTest, TheServerMustBeTrustedAndThenReadsAsOverHTTP) 
     ASSERT_TRUE(handle->seekToFileOffset(60000, nullptr));
     EXPECT_EQ(handle->readDataOfLength(40000, nullptr),
               GWData(contents.begin() + 60000, contents.end()));
+    // Never from https down to http.
+    EXPECT_FALSE(GWRemoteFileHandle::initForReadingFromURL(server.url("down"), &error));
+    expectPOSIXError(error, EPERM);
 }

@@ -29,7 +29,8 @@ sockaddr_in loopback(int port) {
 }
 
 std::string configuration(const std::string& folder, const std::string& root, int port,
-                          const std::optional<NginxServer::TLSFiles>& tls) {
+                          const std::optional<NginxServer::TLSFiles>& tls,
+                          const std::string& serverLines) {
     std::ostringstream text;
     text << "daemon off;\nmaster_process off;\nworker_processes 1;\n"
          << "pid " << folder << "/nginx.pid;\n"
@@ -50,7 +51,7 @@ std::string configuration(const std::string& folder, const std::string& root, in
         text << "    ssl_certificate " << tls->certificate << ";\n"
              << "    ssl_certificate_key " << tls->key << ";\n";
     }
-    text << "    location / { }\n  }\n}\n";
+    text << serverLines << "    location / { }\n  }\n}\n";
     return text.str();
 }
 
@@ -87,8 +88,9 @@ bool NginxServer::available() {
     return ::access(kNginx, X_OK) == 0;
 }
 
-NginxServer::NginxServer(const std::string& documentRoot, std::optional<TLSFiles> tls)
-    : tls_(std::move(tls)) {
+NginxServer::NginxServer(const std::string& documentRoot, std::optional<TLSFiles> tls,
+                         const std::string& serverLines)
+    : tls_(std::move(tls)), serverLines_(serverLines) {
     if (!available()) {
         failure_ = "nginx is not installed";
         return;
@@ -107,7 +109,7 @@ bool NginxServer::start(const std::string& documentRoot, int port) {
     const std::string folder = directory_.path();
     {
         std::ofstream conf(folder + "/nginx.conf", std::ios::trunc);
-        conf << configuration(folder, documentRoot, port, tls_);
+        conf << configuration(folder, documentRoot, port, tls_, serverLines_);
     }
     const std::string errorLog = folder + "/error.log", conf = folder + "/nginx.conf";
     const std::string output = folder + "/output.log";

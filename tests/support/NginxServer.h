@@ -24,8 +24,10 @@ public:
         std::string key;
     };
 
+    // `serverLines` are more directives for the server, such as a redirect.
     explicit NginxServer(const std::string& documentRoot,
-                         std::optional<TLSFiles> tls = std::nullopt);
+                         std::optional<TLSFiles> tls = std::nullopt,
+                         const std::string& serverLines = "");
     ~NginxServer();
     NginxServer(const NginxServer&) = delete;
     NginxServer& operator=(const NginxServer&) = delete;
@@ -55,6 +57,7 @@ private:
     bool start(const std::string& documentRoot, int port);
 
     std::optional<TLSFiles> tls_;
+    std::string serverLines_;
     void stop();
 
     TemporaryDirectory directory_;

@@ -72,7 +72,18 @@ std::optional<std::pair<std::uint64_t, std::uint64_t>> requestedRange(std::strin
 }  // namespace
 
 ScriptedHTTPServer::ScriptedHTTPServer(GWData content, Behaviour behaviour, std::uint64_t cutOffset)
-    : content_(std::move(content)), behaviour_(behaviour), cutOffset_(cutOffset) {
+    : ScriptedHTTPServer(std::move(content), [&] {
+          Script script;
+          script.behaviour = behaviour;
+          script.cutOffset = cutOffset;
+          return script;
+      }()) {}
+
+ScriptedHTTPServer::ScriptedHTTPServer(GWData content, Script script)
+    : content_(std::move(content)),
+      script_(std::move(script)),
+      behaviour_(script_.behaviour),
+      cutOffset_(script_.cutOffset) {
     listener_ = ::socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0);
     sockaddr_in address{};
     address.sin_family = AF_INET;
@@ -135,8 +146,7 @@ void ScriptedHTTPServer::serve(int connection) {
         if (end != std::string::npos) {
             const std::string head = buffer.substr(0, end + 2);
             buffer.erase(0, end + 4);
-            ++requests_;
-            if (!respond(connection, head)) {
+            if (!respond(connection, head, ++requests_)) {
                 return;
             }
             continue;
@@ -152,18 +162,67 @@ void ScriptedHTTPServer::serve(int connection) {
     }
 }
 
-bool ScriptedHTTPServer::respond(int connection, const std::string& head) {
-    const std::uint64_t size = content_.size();
+bool ScriptedHTTPServer::respond(int connection, const std::string& head, int number) {
+    std::string lower = head;
+    std::transform(lower.begin(), lower.end(), lower.begin(),
+                   [](unsigned char c) { return char(std::tolower(c)); });
+    authorized_ += lower.find("\r\nauthorization:") != std::string::npos;
+    if (behaviour_ == Behaviour::silent) {
+        return waitFor(connection, POLLIN, stopping_) && false;
+    }
     if (behaviour_ == Behaviour::notFound) {
         return sendText(connection, "HTTP/1.1 404 Not Found\r\nContent-Length: 9\r\n\r\nnot found",
                         stopping_);
+    }
+    if (number <= script_.busyRequests) {
+        return sendText(connection,
+                        "HTTP/1.1 503 Busy\r\nRetry-After: 1\r\nContent-Length: 0\r\n\r\n",
+                        stopping_);
+    }
+    if (script_.redirectAt == 0 || script_.redirectAt == number) {
+        std::string location = script_.location;
+        if (const auto at = location.find("{port}"); at != std::string::npos) {
+            location.replace(at, 6, std::to_string(port_));
+        }
+        // With a body that never ends, which a client must not read.
+        if (!sendText(connection,
+                      "HTTP/1.1 302 Found\r\nLocation: " + location +
+                          "\r\nContent-Length: 1000000000000\r\n\r\n",
+                      stopping_)) {
+            return false;
+        }
+        const GWData filler(4096, 'r');
+        while (sendAll(connection, filler.data(), filler.size(), stopping_)) {
+        }
+        return false;
+    }
+    // The replacement is another file: a redirect elsewhere or a new version.
+    const bool replaced = script_.replaceAt > 0 && number >= script_.replaceAt;
+    const GWData& content =
+        replaced || head.find(" /other ") != std::string::npos ? script_.replacement : content_;
+    const std::uint64_t size = content.size();
+    std::string validators;
+    switch (script_.validators) {
+        case Validators::none: break;
+        case Validators::weakTagAndDate:
+            validators =
+                std::string("ETag: W/\"same\"\r\nLast-Modified: ") +
+                (replaced ? "Sat, 03 Feb 2001 04:05:07 GMT" : "Sat, 03 Feb 2001 04:05:06 GMT") +
+                "\r\n";
+            break;
+        case Validators::strongTag:
+            validators = replaced ? "ETag: \"v2\"\r\n" : "ETag: \"v1\"\r\n";
+            break;
+        case Validators::strongTagDroppedLater:
+            validators = replaced ? "" : "ETag: \"v1\"\r\n";
+            break;
     }
     const auto range = requestedRange(head);
     if (behaviour_ == Behaviour::ignoreRanges || !range) {
         return sendText(connection,
                         "HTTP/1.1 200 OK\r\nContent-Length: " + std::to_string(size) + "\r\n\r\n",
                         stopping_) &&
-               sendAll(connection, content_.data(), content_.size(), stopping_);
+               sendAll(connection, content.data(), content.size(), stopping_);
     }
     if (range->first >= size) {
         return sendText(connection,
@@ -176,15 +235,40 @@ bool ScriptedHTTPServer::respond(int connection, const std::string& head) {
     if (behaviour_ == Behaviour::wrongRange && first < last) {
         ++first;
     }
+    const std::string rangeLine = "HTTP/1.1 206 Partial Content\r\n" + validators +
+                                  "Content-Range: bytes " + std::to_string(first) + "-" +
+                                  std::to_string(last) + "/" + std::to_string(size) + "\r\n";
+    if (behaviour_ == Behaviour::chunkedTrailer) {
+        char length[32];
+        std::snprintf(length, sizeof length, "%llx\r\n", (unsigned long long)(last - first + 1));
+        return sendText(connection,
+                        rangeLine + "Transfer-Encoding: chunked\r\nTrailer: Content-Range\r\n\r\n" +
+                            length,
+                        stopping_) &&
+               sendAll(connection, content.data() + first, std::size_t(last - first + 1),
+                       stopping_) &&
+               sendText(connection, "\r\n0\r\nContent-Range: bytes 99-9/x\r\n\r\n", stopping_);
+    }
     const std::string headers =
-        "HTTP/1.1 206 Partial Content\r\nContent-Range: bytes " + std::to_string(first) + "-" +
-        std::to_string(last) + "/" + std::to_string(size) +
-        "\r\nContent-Length: " + std::to_string(last - first + 1) + "\r\n\r\n";
+        rangeLine + "Content-Length: " + std::to_string(last - first + 1) + "\r\n\r\n";
+    if (behaviour_ == Behaviour::trickle) {
+        if (!sendText(connection, headers, stopping_)) {
+            return false;
+        }
+        for (std::uint64_t at = first; at <= last && !stopping_; ++at) {
+            pollfd entry{connection, POLLIN, 0};
+            if (!sendAll(connection, content.data() + at, 1, stopping_) ||
+                ::poll(&entry, 1, 1000) != 0) {
+                return false;  // the client gave up
+            }
+        }
+        return true;
+    }
     const bool cut = (behaviour_ == Behaviour::dropAt || behaviour_ == Behaviour::stallAt) &&
                      cutOffset_ >= first && cutOffset_ <= last;
     const std::uint64_t stop = cut ? cutOffset_ : last + 1;
     if (!sendText(connection, headers, stopping_) ||
-        !sendAll(connection, content_.data() + first, std::size_t(stop - first), stopping_)) {
+        !sendAll(connection, content.data() + first, std::size_t(stop - first), stopping_)) {
         return false;
     }
     if (cut && behaviour_ == Behaviour::stallAt) {

@@ -5,7 +5,10 @@
 #include <gtest/gtest.h>
 
 #include <algorithm>
+#include <chrono>
+#include <cstdlib>
 #include <filesystem>
+#include <fstream>
 #include <tuple>
 
 #include "ToolTestSupport.h"
@@ -111,6 +114,18 @@ TEST_F(GWArchiveToolRemote, ListingTwoHundredThousandEntriesCostsTheDirectoryAnd
     RecordProperty("requests", std::to_string(server_->requests().size()));
     EXPECT_GE(sent, writer.centralDirectorySize());
     EXPECT_LE(sent, writer.centralDirectorySize() + kAllowance);
+    EXPECT_LE(server_->requests().size(), 4u);
+}
+
+TEST_F(GWArchiveToolRemote, AHugeResourceThatIsNoArchiveIsNotReadToItsEnd) {
+    const std::string path = directory_.file("huge.bin");
+    fs::resize_file((std::ofstream(path), path), 2ull << 30);
+    server_->forgetRequests();
+    EXPECT_EQ(runTool("list " + shellQuote(server_->address("huge.bin"))).status, 1);
+    // The longest self-extractor stub searched, and the end record's window.
+    EXPECT_LE(server_->bodyBytesSent(), (4u << 20) + kAllowance);
+    EXPECT_LE(server_->requests().size(), 16u);
+    fs::remove(path);
 }
 
 TEST_F(GWArchiveToolRemote, CatOfOneEntryOfAHugeArchiveCostsThatEntryAndLittleMore) {
@@ -187,6 +202,8 @@ TEST_P(GWArchiveToolDroppedConnection, AnEntryCutShortIsAnErrorNotAShortFile) {
     ScriptedHTTPServer server(archive.bytes, ScriptedHTTPServer::Behaviour::dropAt, archive.cut);
     ASSERT_TRUE(server.running());
     const std::string address = shellQuote(server.address("cut." + format));
+    // Each retry of the cut read meets the same cut.
+    setenv("GWARCHIVE_HTTP_TIMEOUTS", "retry=1", 1);
 
     ToolRun cat = runTool("cat " + address + " cut.bin");
     EXPECT_EQ(cat.status, 1);
@@ -211,6 +228,101 @@ TEST_P(GWArchiveToolDroppedConnection, AnEntryCutShortIsAnErrorNotAShortFile) {
         ++items;
     }
     EXPECT_EQ(items, 2u);
+    unsetenv("GWARCHIVE_HTTP_TIMEOUTS");
 }
 
 INSTANTIATE_TEST_SUITE_P(Formats, GWArchiveToolDroppedConnection, ::testing::Values("zip", "xar"));
+
+// Rows name only what differs from a well-behaved server.
+#pragma GCC diagnostic ignored "-Wmissing-field-initializers"
+
+namespace {
+
+using Script = ScriptedHTTPServer::Script;
+using Behaviour = ScriptedHTTPServer::Behaviour;
+using Validators = ScriptedHTTPServer::Validators;
+
+// Four stored members of 60,000 random bytes; another seed gives another
+// archive of the same size and layout.
+std::vector<GWData> members(int seed) {
+    std::vector<GWData> contents;
+    for (int index = 0; index < 4; ++index) {
+        contents.push_back(randomBytes(60000, seed * 10 + index));
+    }
+    return contents;
+}
+
+GWData storedZip(const std::vector<GWData>& contents) {
+    ZipBuilder zip;
+    for (std::size_t index = 0; index < contents.size(); ++index) {
+        zip.addFile("m" + std::to_string(index) + ".bin", contents[index]);
+    }
+    return zip.bytes();
+}
+
+struct ServerFailure {
+    const char* label;
+    Script script;
+    const char* command;
+    int expected;
+    int requestLimit = 100;
+};
+
+}  // namespace
+
+TEST(GWArchiveToolMisbehavingServer, EachEndsInItsErrorWithoutWrongBytesOrSecrets) {
+    const ServerFailure cases[] = {
+        {"silent after accept", {Behaviour::silent}, "list", ETIMEDOUT, 1},
+        {"stall after headers", {Behaviour::stallAt, 0}, "info", ETIMEDOUT, 1},
+        {"one byte a second", {Behaviour::trickle}, "list", ETIMEDOUT, 1},
+        // test gives up on the remaining members after the second one's time-out.
+        {"declares more than it sends", {Behaviour::stallAt, 90000}, "test", ETIMEDOUT, 5},
+        {"replaced, no validator", {.replaceAt = 3}, "extract", ESTALE},
+        {"replaced, weak tag",
+         {.validators = Validators::weakTagAndDate, .replaceAt = 3},
+         "extract",
+         ESTALE},
+        {"replaced, strong tag",
+         {.validators = Validators::strongTag, .replaceAt = 3},
+         "extract",
+         ESTALE},
+        {"redirected to another file on the third request",
+         {.location = "/other", .redirectAt = 3},
+         "extract",
+         ESTALE},
+        {"credentials and a 404", {Behaviour::notFound}, "info", ENOENT, 1},
+    };
+    setenv("GWARCHIVE_HTTP_TIMEOUTS", "connect=1,stall=1,deadline=3,retry=10", 1);
+    const std::vector<GWData> original = members(1);
+    for (const ServerFailure& row : cases) {
+        SCOPED_TRACE(row.label);
+        Script script = row.script;
+        // Without a validator only the size can tell.
+        script.replacement = storedZip(members(script.validators == Validators::none ? 3 : 2));
+        if (script.validators == Validators::none && script.replaceAt > 0) {
+            script.replacement.push_back(0);
+        }
+        ScriptedHTTPServer server(storedZip(original), script);
+        std::string address = server.address("a.zip");
+        address.insert(address.find("://") + 3, "user:secret@");
+        TemporaryDirectory directory;
+        const std::string destination =
+            row.command == std::string("extract") ? " -C " + shellQuote(directory.path()) : "";
+
+        const auto started = std::chrono::steady_clock::now();
+        ToolRun run = runTool(std::string(row.command) + destination + " " + shellQuote(address));
+        EXPECT_LT(std::chrono::steady_clock::now() - started, std::chrono::seconds(10));
+        EXPECT_EQ(run.status, 1) << run.out;
+        const std::string code = "NSPOSIXErrorDomain " + std::to_string(row.expected) + ")";
+        EXPECT_NE((run.out + run.err).find(code), std::string::npos) << run.out << run.err;
+        EXPECT_EQ((run.out + run.err).find("secret"), std::string::npos) << run.out << run.err;
+        EXPECT_LE(server.requestCount(), row.requestLimit) << run.out << run.err;
+        for (std::size_t index = 0; index < original.size(); ++index) {
+            const std::string member = directory.file("m" + std::to_string(index) + ".bin");
+            if (fs::exists(member)) {
+                EXPECT_EQ(readFile(member), original[index]) << member;
+            }
+        }
+    }
+    unsetenv("GWARCHIVE_HTTP_TIMEOUTS");
+}

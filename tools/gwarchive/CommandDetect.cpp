@@ -6,6 +6,7 @@
 #include "Command.h"
 #include "Diagnostics.h"
 #include "Locations.h"
+#include "foundation/GWHTTPRangeReader.h"
 
 namespace gwarchive {
 
@@ -32,7 +33,7 @@ int runDetect(const ParsedArguments& arguments) {
             status = kExitFailure;
             continue;
         }
-        std::printf("%s: %s\n", operand.c_str(), formatOf(url));
+        std::printf("%s: %s\n", GWRedactedURLString(operand).c_str(), formatOf(url));
     }
     return status;
 }

@@ -5,6 +5,7 @@
 #include "JsonWriter.h"
 #include "Locations.h"
 #include "ToolArchive.h"
+#include "foundation/GWHTTPRangeReader.h"
 
 namespace gwarchive {
 
@@ -35,7 +36,7 @@ int runInfo(const ParsedArguments& arguments) {
         JsonWriter json;
         json.beginObject();
         json.key("archive");
-        json.value(operand);
+        json.value(GWRedactedURLString(operand));
         json.key("format");
         json.value(archive->formatName());
         archive->writeArchiveFields(json);
@@ -53,7 +54,7 @@ int runInfo(const ParsedArguments& arguments) {
         std::printf("%s\n", json.text().c_str());
         return kExitSuccess;
     }
-    std::printf("archive: %s\n", operand.c_str());
+    std::printf("archive: %s\n", GWRedactedURLString(operand).c_str());
     std::printf("format: %s\n", archive->formatName());
     for (const std::string& line : archive->infoLines())
         std::printf("%s\n", line.c_str());

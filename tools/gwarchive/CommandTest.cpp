@@ -5,6 +5,7 @@
 #include "JsonWriter.h"
 #include "Locations.h"
 #include "ToolArchive.h"
+#include "foundation/GWHTTPRangeReader.h"
 
 namespace gwarchive {
 
@@ -87,8 +88,8 @@ int runTest(const ParsedArguments& arguments) {
     for (const EntryProblem& problem : problems) {
         std::printf("%s: %s\n", problem.path.c_str(), problem.message.c_str());
     }
-    std::printf("%s: %zu entries, %zu bad", operand.c_str(), archive->entryCount(),
-                problems.size());
+    std::printf("%s: %zu entries, %zu bad", GWRedactedURLString(operand).c_str(),
+                archive->entryCount(), problems.size());
     if (std::size_t unverified = archive->unverifiedCount())
         std::printf(", %zu not verified (no stored checksum)", unverified);
     std::printf("\n");

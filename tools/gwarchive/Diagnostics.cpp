@@ -1,4 +1,5 @@
 #include "Diagnostics.h"
+#include "foundation/GWHTTPRangeReader.h"
 
 #include <cstdio>
 
@@ -7,7 +8,7 @@ namespace gwarchive {
 namespace {
 
 std::string prefix(const std::string& archive, const std::optional<std::string>& path) {
-    std::string line = "gwarchive: " + archive;
+    std::string line = "gwarchive: " + GWRedactedURLString(archive);
     if (path)
         line += ": " + *path;
     return line;

@@ -1,12 +1,15 @@
 #include "ToolArchive.h"
 
 #include <cerrno>
+#include <cstdlib>
 #include <numeric>
 #include <set>
 
 #include "Diagnostics.h"
 #include "FormatAdapters.h"
 #include "Locations.h"
+#include "foundation/GWHTTPRangeReader.h"
+#include "foundation/GWRecentHTTPResources.h"
 
 namespace gwarchive {
 
@@ -41,6 +44,21 @@ EntryType entryTypeFromMode(std::uint32_t mode) {
 }
 
 std::unique_ptr<ToolArchive> ToolArchive::open(const GWURL& url, GWErrorPtr* error) {
+    if (!url.isFileURL()) {
+        // One request opens the URL, whatever the format turns out to be, and
+        // every later handle of the run reads the version it saw.
+        static std::shared_ptr<void> pin;
+        pin = GWRecentHTTPResources::shared().pin(url.absoluteString());
+        if (const char* timeouts = std::getenv("GWARCHIVE_HTTP_TIMEOUTS")) {
+            GWHTTPTimeouts parsed = GWCurrentHTTPTimeouts();
+            if (GWParseHTTPTimeouts(timeouts, parsed))
+                GWSetHTTPTimeouts(parsed);
+        }
+        auto handle = GWRemoteFileHandle::initForReadingFromURL(url, error);
+        if (!handle)
+            return nullptr;
+        handle->closeFileAndReturnError(nullptr);
+    }
     if (GWXARArchive::isXARArchiveAtURL(url))
         return openXARArchive(url, error);
     return openZipArchive(url, error);
