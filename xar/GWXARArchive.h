@@ -169,6 +169,11 @@ public:
     // cancelled by another extraction stops without a last call.
     void extractDataReference(const GWXARDataReferencePtr& reference, const GWXARFilePtr& file,
                               const GWOperationQueuePtr& queue, const GWXARDataHandler& handler);
+    // The same for one extraction: it stops when `isCancelled` says so, and a
+    // refusal or a damaged stream ends this stream alone, leaving the
+    // archive's cancellation and every other stream alone.
+    void extractDataReference(const GWXARDataReferencePtr& reference, const GWXARFilePtr& file,
+                              const GWXARDataHandler& handler, std::function<bool()> isCancelled);
     // The single place a data handler is called: a refusal cancels the
     // archive and earns one last call with the user-cancelled error.
     void invokeDataHandler(const GWXARDataHandler& handler, const GWOperationQueuePtr& queue,
@@ -187,6 +192,8 @@ public:
                      ExtractionCompletionHandler completionHandler);
 
 private:
+    void streamDataReference(const GWXARDataReferencePtr& reference, const GWXARFilePtr& file,
+                             const GWXARDataHandler& handler, GWXARStreamContext context);
     // Copies a finished load's results in.
     void takeResultsOfLoad(const GWXARLoadOperation& operation);
 

@@ -62,14 +62,18 @@ bool GWXARExtractOperation::applyMetadataToFile(const GWXARFilePtr& file, const 
                                                 GWErrorPtr* error) {
     const std::string path = url.path();
     const GWDate now = GWDate::now();
+    // Each step is tried whatever became of the one before: an attribute the
+    // file system refuses must not cost the item its mode or owner.
+    GWErrorPtr firstFailure;
     // Creation and status-change dates cannot be set on Linux.
     const timespec times[2] = {timespecFromDate(file->accessDate(), now),
                                timespecFromDate(file->modificationDate(), now)};
     if (::utimensat(AT_FDCWD, path.c_str(), times, AT_SYMLINK_NOFOLLOW) != 0) {
-        return GWFail(error, GWPOSIXError(errno, url));
+        firstFailure = GWPOSIXError(errno, url);
     }
-    if (!applyExtendedAttributesForFile(file, url, error)) {
-        return false;
+    GWErrorPtr attributesError;
+    if (!applyExtendedAttributesForFile(file, url, &attributesError) && !firstFailure) {
+        firstFailure = attributesError ? attributesError : cancelledError();
     }
 
     // Owner, group, mode and ACL are best effort, as a file-security object is:
@@ -77,15 +81,24 @@ bool GWXARExtractOperation::applyMetadataToFile(const GWXARFilePtr& file, const 
     const bool isLink = file->type() == GWXARFileTypeSymbolicLink;
     [[maybe_unused]] int ignored = ::lchown(path.c_str(), file->ownerID(), file->groupOwnerID());
     if (!isLink) {
-        ignored = ::chmod(path.c_str(), file->permissionsMode() & 07777);
-        // Only the extended ACL governs access; a POSIX one is the access ACL here.
-        const GWACL* acl = file->extendedACL();
+        // The access ACL is what Linux enforces; an extended one in POSIX form
+        // stands in for a missing one. Setting an ACL rewrites the group bits
+        // from its mask, so the mode comes after it and both end as archived.
+        const GWACL* acl = file->accessACL();
+        if (!acl || acl->isMacExtended()) {
+            acl = file->extendedACL();
+        }
         if (acl && !acl->isMacExtended()) {
             ignored = ::acl_set_file(path.c_str(), ACL_TYPE_ACCESS, acl->handle());
         }
+        const GWACL* inherited = file->defaultACL();
+        if (file->type() == GWXARFileTypeDirectory && inherited && !inherited->isMacExtended()) {
+            ignored = ::acl_set_file(path.c_str(), ACL_TYPE_DEFAULT, inherited->handle());
+        }
+        ignored = ::chmod(path.c_str(), file->permissionsMode() & 07777);
     }
     applyFlags(*file, url);
-    return true;
+    return !firstFailure || GWFail(error, firstFailure);
 }
 
 void GWXARExtractOperation::applyFlags(const GWXARFile& file, const GWURL& url) {
@@ -121,17 +134,16 @@ bool GWXARExtractOperation::applyExtendedAttributesForFile(const GWXARFilePtr& f
     if (!archive) {
         return false;
     }
-    auto queue = std::make_shared<GWOperationQueue>();
     auto group = std::make_shared<GWGroup>();
     auto setxattrQueue = GWDispatchQueue::serialQueue("GWXARArchive setxattr queue");
+    // Each attribute stops alone: one the file system refuses leaves the
+    // others to be set.
     struct Shared {
-        std::atomic<bool> stop{false};
         std::mutex mutex;
         GWErrorPtr error;
     };
     auto shared = std::make_shared<Shared>();
     auto keepFirst = [shared](GWErrorPtr failure) {
-        shared->stop.store(true);
         std::lock_guard lock(shared->mutex);
         if (!shared->error) {
             shared->error = std::move(failure);
@@ -153,6 +165,7 @@ bool GWXARExtractOperation::applyExtendedAttributesForFile(const GWXARFilePtr& f
         auto buffer = std::make_shared<GWData>();
         auto position = std::make_shared<std::uint32_t>(0);
         auto left = std::make_shared<std::atomic<bool>>(false);
+        auto stop = std::make_shared<std::atomic<bool>>(false);
         auto leave = [group, left] {
             if (!left->exchange(true)) {
                 group->leave();
@@ -160,10 +173,10 @@ bool GWXARExtractOperation::applyExtendedAttributesForFile(const GWXARFilePtr& f
         };
         group->enter();
         archive->extractDataReference(
-            attribute, file, queue,
+            attribute, file,
             [=](std::optional<std::span<const std::uint8_t>> data, bool isDone, bool checksumFailed,
                 const GWErrorPtr& streamError) {
-                if (shared->stop.load()) {
+                if (stop->load()) {
                     return false;
                 }
                 auto self = weakSelf.lock();
@@ -210,12 +223,17 @@ bool GWXARExtractOperation::applyExtendedAttributesForFile(const GWXARFilePtr& f
                     }
                     return true;
                 }
+                stop->store(true);
                 keepFirst(failure);
                 leave();
                 return false;
+            },
+            [weakSelf] {
+                auto self = weakSelf.lock();
+                return !self || self->isCancelled();
             });
-        // A stream stopped without its last call (the archive was cancelled
-        // by another extraction, or an earlier attribute failed) has ended all the same.
+        // A stream stopped without its last call (this extraction was
+        // cancelled) has ended all the same.
         if (!left->load()) {
             keepFirst(cancelledError());
             leave();

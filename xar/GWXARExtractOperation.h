@@ -2,6 +2,7 @@
 
 #include <atomic>
 #include <cstdint>
+#include <map>
 #include <memory>
 #include <mutex>
 #include <optional>
@@ -20,8 +21,10 @@ using GWXARExtractOperationPtr = std::shared_ptr<GWXARExtractOperation>;
 
 // Recreates one archive item, and for a directory its whole subtree, on disk
 // with its metadata. The item is built in a private directory on the
-// destination's file system and moved into place only when complete, never
-// over an existing item; a failed extraction leaves nothing at the destination.
+// destination's file system and moved into place once the walk is over, never
+// over an existing item. An entry that cannot be created is left out while
+// the rest is extracted, and the first such failure in tree order is the
+// result; a cancelled extraction leaves nothing at the destination.
 //
 // Data comes through the archive's streaming read path; this operation only
 // creates file-system objects and writes bytes. Results are published in
@@ -39,6 +42,17 @@ public:
     // Set when a stream's digests did not match, and also when metadata could
     // not be applied: the item is there, but not exactly as archived.
     bool checksumIsInvalid() const { return checksumIsInvalid_.load(); }
+    // Every entry that was left out, in tree order, each error naming where
+    // that entry was to appear.
+    struct EntryFailure {
+        GWXARFilePtr file;
+        GWErrorPtr error;
+    };
+    std::vector<EntryFailure> entryFailures() const;
+
+    // With replacement, an existing item at the destination that is not a
+    // directory gives way to the extracted one; a directory never does.
+    void setReplacesExistingItem(bool replaces) { replacesExistingItem_ = replaces; }
 
     void main() override;
 
@@ -60,6 +74,7 @@ public:
     struct DeferredHardLink {
         GWXARFilePtr file;
         GWURL url;
+        std::size_t order = 0;
     };
     // Extracts the children in order; hard links are only recorded, to be
     // made once everything else in the directory exists.
@@ -83,15 +98,13 @@ public:
     // --- Workers (GWXARExtractWorkers.cpp) -----------------------------------
     // The regular files of a directory are written by workers, twice the
     // processor count of them, while the tree is walked; directories get
-    // their metadata once everything below them is written.
-    void extractFileOnWorker(const GWXARFilePtr& file, const GWURL& url);
-    // Waits for the workers; false with the first failure in tree order.
-    bool finishWorkers(GWErrorPtr* error);
+    // their metadata once everything below them is written. `order` is the
+    // entry's place in the walk.
+    void extractFileOnWorker(const GWXARFilePtr& file, const GWURL& url, std::size_t order);
+    void finishWorkers();
     // A metadata failure leaves the item in place: logged, and reported
     // through checksumIsInvalid().
     void applyMetadataOrNote(const GWXARFilePtr& file, const GWURL& url);
-    // True once a worker has failed: the walk stops there.
-    bool workerFailed() const;
 
     // Whole attributes other than the resource fork are gathered in memory
     // before they are set; one larger than this is refused (E2BIG).
@@ -102,6 +115,15 @@ private:
                           const std::shared_ptr<GWXARArchive>& archive);
 
     void setError(GWErrorPtr error);
+    // extractFile for one entry of the walk: a failure removes what was made
+    // for the entry and is recorded under `order`, and the walk goes on.
+    bool extractEntry(const GWXARFilePtr& file, const GWURL& url, std::size_t order);
+    void recordFailure(std::size_t order, const GWXARFilePtr& file, const GWURL& url,
+                       GWErrorPtr error);
+    bool moveIntoPlace(const std::string& item, const std::string& destination, bool isDirectory,
+                       GWErrorPtr* error);
+    // Where `url` in the private directory is to appear.
+    GWURL finalURL(const GWURL& url) const;
     void markChecksumInvalid() { checksumIsInvalid_.store(true); }
     // Where a child of the directory at `directory` goes; refuses names that
     // would leave the directory.
@@ -123,15 +145,20 @@ private:
     mutable std::mutex errorMutex_;
     GWErrorPtr error_;
     std::atomic<bool> checksumIsInvalid_{false};
+    std::atomic<bool> ran_{false};
     // The top-level item in the private directory, and whether its flags
     // wait for the move.
     std::optional<GWURL> temporaryItemURL_;
     bool deferTopLevelFlags_ = false;
+    bool replacesExistingItem_ = false;
 
     struct Workers;
     std::shared_ptr<Workers> workers_;
     // While the private-directory wrapper walks the item's tree.
     bool walking_ = false;
+    std::size_t nextOrder_ = 0;
+    mutable std::mutex failuresMutex_;
+    std::map<std::size_t, EntryFailure> failures_;
     // Directories whose metadata waits for their files, deepest first.
     std::vector<std::pair<GWXARFilePtr, GWURL>> pendingDirectories_;
 };

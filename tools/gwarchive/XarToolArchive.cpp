@@ -1,5 +1,6 @@
 #include <cerrno>
 #include <filesystem>
+#include <unordered_map>
 
 #include "Diagnostics.h"
 #include "FormatAdapters.h"
@@ -42,6 +43,14 @@ public:
     explicit XARToolArchive(GWXARArchivePtr archive) : archive_(std::move(archive)) {
         for (const GWXARFilePtr& file : archive_->files())
             add(file);
+        // Of several entries with one path the last wins, as the library
+        // does among siblings.
+        std::unordered_map<std::string_view, std::size_t> last;
+        for (std::size_t index = 0; index < records_.size(); ++index)
+            last[records_[index].path] = index;
+        superseded_.resize(records_.size());
+        for (std::size_t index = 0; index < records_.size(); ++index)
+            superseded_[index] = last[records_[index].path] != index;
     }
 
     const char* formatName() const override { return "xar"; }
@@ -162,8 +171,8 @@ public:
         bool allGood = true;
         for (std::size_t index : indexes) {
             std::optional<std::size_t> parent = parents_[index];
-            if (parent && selected[*parent])
-                continue;  // extracted with its parent
+            if ((parent && selected[*parent]) || superseded_[index])
+                continue;  // extracted with its parent, or replaced by a later namesake
             GWURL url = options.directory.URLByAppendingPathComponent(records_[index].path);
             if (refused(index, url, options, archiveName)) {
                 allGood = false;
@@ -296,7 +305,8 @@ private:
     }
 
     // Existing directories are merged into; anything else that exists is an
-    // error for that entry unless overwriting.
+    // error for that entry unless overwriting, and even then a directory is
+    // never replaced by what is not one.
     bool extractItem(std::size_t index, const GWURL& url, const ExtractOptions& options,
                      const std::string& archiveName) {
         const EntryRecord& record = records_[index];
@@ -304,10 +314,12 @@ private:
             return false;
         std::error_code error;
         auto status = std::filesystem::symlink_status(url.path(), error);
-        if (std::filesystem::exists(status)) {
-            if (std::filesystem::is_directory(status) && record.type == EntryType::directory) {
+        if (std::filesystem::is_directory(status)) {
+            if (record.type == EntryType::directory) {
                 bool allGood = true;
                 for (std::size_t child : children_[index]) {
+                    if (superseded_[child])
+                        continue;
                     allGood &= extractItem(
                         child,
                         url.URLByAppendingPathComponent(files_[child]->name().value_or("item")),
@@ -315,22 +327,29 @@ private:
                 }
                 return allGood;
             }
-            if (!options.overwrite) {
-                reportError(archiveName, record.path, GWPOSIXError(EEXIST, url));
-                return false;
-            }
-            std::filesystem::remove_all(url.path(), error);
-        }
-        bool checksumIsInvalid = false;
-        GWErrorPtr failure;
-        bool extracted = archive_->extractFile(files_[index], url, &checksumIsInvalid, &failure);
-        if (options.progress)
-            options.progress(subtreeBytes(index));
-        if (!extracted) {
-            reportError(archiveName, record.path, failure);
+            reportError(archiveName, record.path, GWPOSIXError(EISDIR, url));
             return false;
         }
-        if (checksumIsInvalid) {
+        if (std::filesystem::exists(status) && !options.overwrite) {
+            reportError(archiveName, record.path, GWPOSIXError(EEXIST, url));
+            return false;
+        }
+        auto operation = GWXARExtractOperation::initWithFile(files_[index], url, archive_);
+        operation->setReplacesExistingItem(options.overwrite);
+        operation->start();
+        if (options.progress)
+            options.progress(subtreeBytes(index));
+        // Entries that failed were left out of the tree; each is reported
+        // where it belongs, and the rest stays extracted.
+        const auto failures = operation->entryFailures();
+        for (const auto& failure : failures)
+            reportError(archiveName, failure.file->path(), failure.error);
+        if (GWErrorPtr failure = operation->error()) {
+            if (failures.empty())
+                reportError(archiveName, record.path, failure);
+            return false;
+        }
+        if (operation->checksumIsInvalid()) {
             reportFailure(archiveName, record.path,
                           "extracted, but a stored checksum did not match or metadata could not "
                           "be applied");
@@ -352,6 +371,7 @@ private:
     std::vector<GWXARFilePtr> files_;
     std::vector<std::optional<std::size_t>> parents_;
     std::vector<std::vector<std::size_t>> children_;
+    std::vector<bool> superseded_;
 };
 
 }  // namespace
