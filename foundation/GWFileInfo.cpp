@@ -108,13 +108,13 @@ void GWFileInfo::setLocation(std::uint32_t location) {
     setFinderField(kHorizontalOffset, 2, location >> 16);
 }
 
-bool GWFileInfo::applyFinderInfo(const std::string& path, GWErrorPtr* error) const {
+bool GWFileInfo::applyFinderInfo(int fd, const std::string& path, GWErrorPtr* error) const {
     if (std::none_of(finderInfoSet_.begin(), finderInfoSet_.end(), [](bool set) { return set; })) {
         return true;
     }
     // Read the current value at the moment of writing, so that fields set by
     // someone else since this object was loaded are kept too.
-    GWMetadataStore store(path);
+    GWMetadataStore store = fd >= 0 ? GWMetadataStore(fd, path) : GWMetadataStore(path);
     GWErrorPtr readError;
     const auto current = store.attribute(kGWFinderInfoAttributeName, &readError);
     if (readError) {
@@ -138,6 +138,14 @@ bool GWFileInfo::applyFinderInfo(const std::string& path, GWErrorPtr* error) con
 }
 
 bool GWFileInfo::applyToURL(const GWURL& url, GWErrorPtr* error) const {
+    return apply(-1, url, error);
+}
+
+bool GWFileInfo::applyToDescriptor(int fd, const GWURL& url, GWErrorPtr* error) const {
+    return apply(fd, url, error);
+}
+
+bool GWFileInfo::apply(int fd, const GWURL& url, GWErrorPtr* error) const {
     if (!url.isFileURL()) {
         return GWFail(error, GWCocoaError(GWFileWriteUnsupportedSchemeError, url));
     }
@@ -151,19 +159,23 @@ bool GWFileInfo::applyToURL(const GWURL& url, GWErrorPtr* error) const {
 
     // Attributes before the mode, which may take away the right to write them.
     GWErrorPtr finderError;
-    if (!applyFinderInfo(path, &finderError)) {
+    if (!applyFinderInfo(fd, path, &finderError)) {
         note(finderError);
     }
-    if ((ownerSet_ || groupSet_) && lchown(path.c_str(), ownerSet_ ? uid_t(ownerID_) : uid_t(-1),
-                                           groupSet_ ? gid_t(groupID_) : gid_t(-1)) != 0) {
+    const uid_t owner = ownerSet_ ? uid_t(ownerID_) : uid_t(-1);
+    const gid_t group = groupSet_ ? gid_t(groupID_) : gid_t(-1);
+    if ((ownerSet_ || groupSet_) &&
+        (fd >= 0 ? fchown(fd, owner, group) : lchown(path.c_str(), owner, group)) != 0) {
         note(GWPOSIXError(errno, url));
     }
     // After chown, which may clear the set-id bits.
     if (modeSet_) {
         struct stat info {};
-        if (lstat(path.c_str(), &info) != 0) {
+        if ((fd >= 0 ? fstat(fd, &info) : lstat(path.c_str(), &info)) != 0) {
             note(GWPOSIXError(errno, url));
-        } else if (!S_ISLNK(info.st_mode) && chmod(path.c_str(), mode_t(permissionsMode_)) != 0) {
+        } else if (!S_ISLNK(info.st_mode) &&
+                   (fd >= 0 ? fchmod(fd, mode_t(permissionsMode_))
+                            : chmod(path.c_str(), mode_t(permissionsMode_))) != 0) {
             note(GWPOSIXError(errno, url));
         }
     }
@@ -172,7 +184,8 @@ bool GWFileInfo::applyToURL(const GWURL& url, GWErrorPtr* error) const {
         struct timespec times[2];
         times[0] = accessDateSet_ ? timespecOf(accessDate_) : timespec{0, UTIME_OMIT};
         times[1] = modificationDateSet_ ? timespecOf(modificationDate_) : timespec{0, UTIME_OMIT};
-        if (utimensat(AT_FDCWD, path.c_str(), times, AT_SYMLINK_NOFOLLOW) != 0) {
+        if ((fd >= 0 ? futimens(fd, times)
+                     : utimensat(AT_FDCWD, path.c_str(), times, AT_SYMLINK_NOFOLLOW)) != 0) {
             note(GWPOSIXError(errno, url));
         }
     }

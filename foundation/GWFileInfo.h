@@ -61,6 +61,9 @@ public:
     // Writes everything that was set. Every part is attempted; the first
     // failure is reported.
     bool applyToURL(const GWURL& url, GWErrorPtr* error) const;
+    // The same through an open descriptor of the item, which no later rename
+    // or link can redirect; `url` only names it in errors.
+    bool applyToDescriptor(int fd, const GWURL& url, GWErrorPtr* error) const;
 
 private:
     // Offsets in the big-endian Finder information.
@@ -74,7 +77,9 @@ private:
 
     std::uint32_t finderField(std::size_t offset, std::size_t width) const;
     void setFinderField(std::size_t offset, std::size_t width, std::uint32_t value);
-    bool applyFinderInfo(const std::string& path, GWErrorPtr* error) const;
+    // `fd` is -1 when the item is reached by its path.
+    bool applyFinderInfo(int fd, const std::string& path, GWErrorPtr* error) const;
+    bool apply(int fd, const GWURL& url, GWErrorPtr* error) const;
 
     std::optional<GWDate> creationDate_;
     GWDate modificationDate_;

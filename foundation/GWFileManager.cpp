@@ -15,6 +15,7 @@
 
 #include "GWConversions.h"
 #include "GWFileDescriptor.h"
+#include "GWFileSystem.h"
 #include "GWMetadataStore.h"
 
 namespace {
@@ -31,69 +32,6 @@ bool requireFileURL(const GWURL& url, GWErrorPtr* error) {
     return GWFail(error, GWCocoaError(GWFileWriteUnsupportedSchemeError, url));
 }
 
-// Copies the bytes, the mode, the dates and the extended attributes of a
-// regular file to a new file, for moves that cannot be renames.
-bool copyRegularFile(const std::string& from, const std::string& to, int* failure) {
-    GWFileDescriptor source = GWFileDescriptor::open(from.c_str(), O_RDONLY | O_NOFOLLOW);
-    struct stat status {};
-    if (!source.isValid() || ::fstat(source.get(), &status) != 0) {
-        *failure = errno;
-        return false;
-    }
-    if (!S_ISREG(status.st_mode)) {
-        *failure = EXDEV;
-        return false;
-    }
-    GWFileDescriptor target =
-        GWFileDescriptor::open(to.c_str(), O_WRONLY | O_CREAT | O_EXCL, status.st_mode & 07777);
-    if (!target.isValid()) {
-        *failure = errno;
-        return false;
-    }
-    auto fail = [&](int number) {
-        *failure = number;
-        ::unlink(to.c_str());
-        return false;
-    };
-    std::vector<std::uint8_t> buffer(1 << 20);
-    std::uint64_t offset = 0;
-    for (;;) {
-        std::size_t got = 0;
-        if (!GWReadFully(source.get(), offset, buffer, got)) {
-            return fail(errno);
-        }
-        if (got == 0) {
-            break;
-        }
-        if (!GWWriteFully(target.get(), offset, std::span(buffer.data(), got))) {
-            return fail(errno);
-        }
-        offset += got;
-    }
-    const ssize_t listLength = ::flistxattr(source.get(), nullptr, 0);
-    if (listLength > 0) {
-        std::vector<char> names(std::size_t(listLength) + 1, '\0');
-        const ssize_t got = ::flistxattr(source.get(), names.data(), names.size() - 1);
-        for (ssize_t at = 0; got > 0 && at < got;) {
-            const char* name = names.data() + at;
-            const ssize_t size = ::fgetxattr(source.get(), name, nullptr, 0);
-            if (size >= 0) {
-                std::vector<std::uint8_t> value(static_cast<std::size_t>(size));
-                const ssize_t read = ::fgetxattr(source.get(), name, value.data(), value.size());
-                if (read >= 0 &&
-                    ::fsetxattr(target.get(), name, value.data(), std::size_t(read), 0) != 0 &&
-                    std::strncmp(name, "user.", 5) == 0) {
-                    return fail(errno);
-                }
-            }
-            at += ssize_t(std::strlen(name)) + 1;
-        }
-    }
-    const struct timespec times[2] = {status.st_atim, status.st_mtim};
-    ::futimens(target.get(), times);
-    return true;
-}
-
 }  // namespace
 
 bool GWItemExistsAtURL(const GWURL& url) {
@@ -108,12 +46,8 @@ bool GWRemoveItemAtURL(const GWURL& url, GWErrorPtr* error) {
     if (!GWItemExistsAtURL(url)) {
         return GWFail(error, posixError(ENOENT, url, "removing"));
     }
-    std::error_code code;
-    std::filesystem::remove_all(url.path(), code);
-    if (code) {
-        return GWFail(error, posixError(code.value(), url, "removing"));
-    }
-    return GWMetadataStore::removeMetadata(url.path(), error);
+    return GWRemoveItemRecursively(url.path(), error) &&
+           GWMetadataStore::removeMetadata(url.path(), error);
 }
 
 bool GWCreateDirectoryAtURL(const GWURL& url, bool intermediates, GWErrorPtr* error) {
@@ -186,67 +120,8 @@ bool GWMoveItemAtURL(const GWURL& from, const GWURL& to, GWErrorPtr* error) {
     if (!requireFileURL(from, error) || !requireFileURL(to, error)) {
         return false;
     }
-    const std::string source = from.path();
-    const std::string target = to.path();
-    int result = ::renameat2(AT_FDCWD, source.c_str(), AT_FDCWD, target.c_str(), RENAME_NOREPLACE);
-    if (result != 0 && (errno == EINVAL || errno == ENOSYS)) {
-        // A file system without the no-replace flag: check, then rename.
-        if (GWItemExistsAtURL(to)) {
-            return GWFail(error, posixError(EEXIST, to, "moving an item to"));
-        }
-        result = ::rename(source.c_str(), target.c_str());
-    }
-    if (result != 0 && errno == EXDEV) {
-        int failure = 0;
-        if (!copyRegularFile(source, target, &failure)) {
-            return GWFail(error, posixError(failure, to, "moving an item to"));
-        }
-        ::unlink(source.c_str());
-        const std::string side = GWMetadataSideFile::pathForItem(source);
-        if (::access(side.c_str(), F_OK) == 0) {
-            GWMetadataStore::removeMetadata(target, nullptr);
-            if (!copyRegularFile(side, GWMetadataSideFile::pathForItem(target), &failure)) {
-                return GWFail(error, posixError(failure, to, "moving the metadata of"));
-            }
-            ::unlink(side.c_str());
-        }
-        return true;
-    }
-    if (result != 0) {
-        return GWFail(error, posixError(errno, to, "moving an item to"));
-    }
-    return GWMetadataStore::moveMetadata(source, target, error);
-}
-
-std::optional<GWURL> GWItemReplacementDirectoryForURL(const GWURL& appropriateFor,
-                                                      GWErrorPtr* error) {
-    if (!requireFileURL(appropriateFor, error)) {
-        return std::nullopt;
-    }
-    std::string near = appropriateFor.path();
-    struct stat nearStatus {};
-    if (::stat(near.c_str(), &nearStatus) != 0) {
-        GWFail(error, posixError(errno, appropriateFor, "finding a replacement directory for"));
-        return std::nullopt;
-    }
-    if (!S_ISDIR(nearStatus.st_mode)) {
-        near = appropriateFor.URLByDeletingLastPathComponent().path();
-    }
-    const std::string temporary = GWTemporaryDirectoryPath();
-    struct stat temporaryStatus {};
-    std::string pattern;
-    if (::stat(temporary.c_str(), &temporaryStatus) == 0 &&
-        temporaryStatus.st_dev == nearStatus.st_dev) {
-        pattern = temporary + "/gwarchive-replace-XXXXXX";
-    } else {
-        pattern = (near == "/" ? std::string() : near) + "/.gwarchive-XXXXXX";
-    }
-    if (!::mkdtemp(pattern.data())) {
-        GWFail(error, posixError(errno, GWURL::fileURLWithPath(pattern),
-                                 "creating the replacement directory"));
-        return std::nullopt;
-    }
-    return GWURL::fileURLWithPath(pattern, true);
+    return GWMoveItemNoReplace(from.path(), to.path(), error) &&
+           GWMetadataStore::moveMetadata(from.path(), to.path(), error);
 }
 
 std::string GWTemporaryDirectoryPath() {

@@ -30,17 +30,10 @@ bool GWCreateEmptyFileAtomicallyAtURL(const GWURL& url, GWErrorPtr* error);
 bool GWCreateSymbolicLinkAtURL(const GWURL& url, const std::string& destinationPath,
                                GWErrorPtr* error);
 
-// Moves an item, failing with EEXIST when something is at the destination.
-// Across file systems a regular file is copied with its extended attributes.
-// An AppleDouble side file holding the item's refused metadata moves with it.
+// Moves an item, failing with EEXIST when something is at the destination
+// (GWMoveItemNoReplace). An AppleDouble side file holding the item's refused
+// metadata moves with it.
 bool GWMoveItemAtURL(const GWURL& from, const GWURL& to, GWErrorPtr* error);
-
-// A fresh private directory (mode 0700) on the file system of `appropriateFor`,
-// which must exist: in the temporary directory when that is on the same
-// device, otherwise a hidden ".gwarchive-XXXXXX" inside `appropriateFor`
-// itself (or its directory, when it is not one).
-std::optional<GWURL> GWItemReplacementDirectoryForURL(const GWURL& appropriateFor,
-                                                      GWErrorPtr* error);
 
 // $TMPDIR, or /tmp when it is unset or empty.
 std::string GWTemporaryDirectoryPath();

@@ -7,8 +7,8 @@
 #include <unordered_set>
 
 #include "GWArchiveSupport/GWArchiveConstants.h"
+#include "foundation/GWFileSystem.h"
 #include "foundation/GWFreeSpace.h"
-#include "foundation/GWItemReplacement.h"
 #include "foundation/GWLog.h"
 #include "foundation/GWMetadataStore.h"
 
@@ -161,7 +161,7 @@ bool GWXARExtractOperation::performExtractionOperationWithFile(const GWXARFilePt
         return false;
     }
     const std::string destinationPath = destinationURL.path();
-    auto temporary = GWItemReplacementDirectory::createForDestination(destinationPath, error);
+    auto temporary = GWReplacementFolder::createForDestination(destinationPath, error);
     if (!temporary) {
         return false;
     }

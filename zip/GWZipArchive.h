@@ -124,26 +124,30 @@ public:
     bool extractFile(const GWZipFilePtr& file, const GWURL& directory, bool atomically,
                      ProgressHandler progressHandler, GWErrorPtr* error);
     bool extractFiles(const GWZipFileArray& files, const GWURL& directory, bool atomically,
-                      ProgressHandler progressHandler, GWErrorPtr* error);
+                      ProgressHandler progressHandler, GWErrorPtr* error,
+                      const GWExtractOptions& options = {});
     // On `queue` (none: a new queue twice as wide as the processor count).
-    // The first error cancels the rest of the batch; the completion handler
-    // runs on the queue with it, or with none. If the operations cannot be
-    // built the handler is never called (known and kept).
+    // Unless the options say to go on, the first error cancels the rest of
+    // the batch; the completion handler runs on the queue with the first
+    // error, or with none, whatever happened. An atomic batch builds its
+    // files in one replacement folder, removed when the batch ends; the
+    // metadata of directories is applied last, deepest first, through
+    // descriptors that no link can redirect.
     void extractFile(const GWZipFilePtr& file, const GWURL& directory, bool atomically,
                      const GWOperationQueuePtr& queue, ProgressHandler progressHandler,
                      CompletionHandler completionHandler);
     void extractFiles(const GWZipFileArray& files, const GWURL& directory, bool atomically,
                       const GWOperationQueuePtr& queue, ProgressHandler progressHandler,
-                      CompletionHandler completionHandler);
+                      CompletionHandler completionHandler, const GWExtractOptions& options = {});
     // The operations of a batch, each entry's directory operation before
     // its descendants, which depend on it.
     std::optional<std::vector<GWZipExtractOperationPtr>> operationsToExtractFiles(
         const GWZipFileArray& files, const GWURL& directory, bool atomically,
-        ProgressHandler progressHandler, GWErrorPtr* error);
+        ProgressHandler progressHandler, GWErrorPtr* error, const GWExtractOptions& options = {});
     // `destination` is the entry's own location, not its parent directory.
     std::optional<std::vector<GWZipExtractOperationPtr>> operationsToExtractFile(
         const GWZipFilePtr& file, const GWURL& destination, bool atomically,
-        ProgressHandler progressHandler, GWErrorPtr* error);
+        ProgressHandler progressHandler, GWErrorPtr* error, const GWExtractOptions& options = {});
     // Streams the entry's data fork to the handler from an operation on
     // `queue` (none: a new queue).
     void extractDataForkOfFile(const GWZipFilePtr& file, const GWOperationQueuePtr& queue,

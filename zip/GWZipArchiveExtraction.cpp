@@ -1,18 +1,80 @@
+#include <algorithm>
+#include <mutex>
 #include <thread>
 
 #include "GWZipArchive.h"
 #include "GWZipExtractDestination.h"
 #include "foundation/GWDispatch.h"
+#include "foundation/GWFileSystem.h"
 #include "foundation/GWFreeSpace.h"
 
 namespace {
 
-// What the operations of one batch share: the first error, and the lock
-// that serialises their completion steps.
+// What the operations of one batch share: the replacement folder, the first
+// error, and the lock that serialises their completion steps.
 struct BatchState {
-    GWSemaphore lock{1};
     GWErrorPtr firstError;
     std::vector<std::weak_ptr<GWZipExtractOperation>> operations;
+    // In tree order, parents first; their metadata comes last, deepest first.
+    std::vector<GWZipExtractOperationPtr> directories;
+    std::shared_ptr<GWReplacementFolder> folder;
+    bool continueAfterFailure = false;
+    std::function<void(const std::string&, const GWErrorPtr&)> entryFailed;
+
+    void finished(GWZipExtractOperation& operation) {
+        std::lock_guard guard(mutex);
+        GWErrorPtr error = operation.error();
+        if (!error && operation.isCancelled() && !firstError) {
+            error = GWCocoaError(GWUserCancelledError);
+        }
+        if (!error) {
+            return;
+        }
+        // Entries cancelled because another failed are not failures of their own.
+        const bool knockOn = cancelling && error->is(kGWCocoaErrorDomain, GWUserCancelledError);
+        if (!knockOn && entryFailed) {
+            entryFailed(operation.file()->path(), error);
+        }
+        if (!firstError) {
+            firstError = error;
+        }
+        if (!continueAfterFailure && !cancelling) {
+            cancelling = true;
+            for (const auto& weak : operations) {
+                if (auto other = weak.lock()) {
+                    other->cancel();
+                }
+            }
+        }
+    }
+
+    void applyDirectoryInfo() {
+        for (auto it = directories.rbegin(); it != directories.rend(); ++it) {
+            const GWZipExtractOperation& operation = **it;
+            if (operation.error() || operation.isCancelled() || !operation.destURL()) {
+                continue;
+            }
+            GWErrorPtr error;
+            const GWURL root = operation.containmentRoot().value_or(
+                operation.destURL()->URLByDeletingLastPathComponent());
+            if (!(*it)->setInfoForDirectory(operation.file(), root, *operation.destURL(), &error)) {
+                // The directory and its contents are there; a refused date or
+                // mode is reported without undoing them.
+                std::lock_guard guard(mutex);
+                if (entryFailed) {
+                    entryFailed(operation.file()->path(), error);
+                }
+                if (!firstError) {
+                    firstError = error;
+                }
+            }
+        }
+        directories.clear();
+    }
+
+private:
+    std::mutex mutex;
+    bool cancelling = false;
 };
 
 // What a batch will write: each regular entry's data and its companions'.
@@ -44,8 +106,8 @@ bool GWZipArchive::extractFile(const GWZipFilePtr& file, const GWURL& directory,
 }
 
 bool GWZipArchive::extractFiles(const GWZipFileArray& files, const GWURL& directory,
-                                bool atomically, ProgressHandler progressHandler,
-                                GWErrorPtr* error) {
+                                bool atomically, ProgressHandler progressHandler, GWErrorPtr* error,
+                                const GWExtractOptions& options) {
     struct Result {
         GWSemaphore done{0};
         std::mutex mutex;
@@ -53,19 +115,19 @@ bool GWZipArchive::extractFiles(const GWZipFileArray& files, const GWURL& direct
         bool set = false;
     };
     auto result = std::make_shared<Result>();
-    // When the operations cannot be built the completion never runs and this
-    // waits for ever: known and kept.
-    extractFiles(files, directory, atomically, nullptr, std::move(progressHandler),
-                 [result](const GWErrorPtr& batchError) {
-                     {
-                         std::lock_guard lock(result->mutex);
-                         if (!result->set) {
-                             result->error = batchError;
-                             result->set = true;
-                         }
-                     }
-                     result->done.signal();
-                 });
+    extractFiles(
+        files, directory, atomically, nullptr, std::move(progressHandler),
+        [result](const GWErrorPtr& batchError) {
+            {
+                std::lock_guard lock(result->mutex);
+                if (!result->set) {
+                    result->error = batchError;
+                    result->set = true;
+                }
+            }
+            result->done.signal();
+        },
+        options);
     result->done.wait();
     std::lock_guard lock(result->mutex);
     if (result->error) {
@@ -84,54 +146,62 @@ void GWZipArchive::extractFile(const GWZipFilePtr& file, const GWURL& directory,
 void GWZipArchive::extractFiles(const GWZipFileArray& files, const GWURL& directory,
                                 bool atomically, const GWOperationQueuePtr& queue,
                                 ProgressHandler progressHandler,
-                                CompletionHandler completionHandler) {
+                                CompletionHandler completionHandler,
+                                const GWExtractOptions& options) {
     const GWOperationQueuePtr runQueue = queue ? queue : extractionQueue();
-    GWErrorPtr error;
-    auto operations =
-        operationsToExtractFiles(files, directory, atomically, std::move(progressHandler), &error);
-    if (!operations) {
-        // The completion handler is deliberately never called here.
-        return;
-    }
-    // Refused before anything is written: a hostile archive fills no disk.
-    if (!GWCheckFreeSpace(directory, declaredSize(*operations), &error)) {
+    auto finishEarly = [&](GWErrorPtr error) {
         if (completionHandler) {
             runQueue->addOperationWithBlock(
                 [error, completion = std::move(completionHandler)] { completion(error); });
         }
+    };
+    GWErrorPtr error;
+    auto operations = operationsToExtractFiles(files, directory, atomically,
+                                               std::move(progressHandler), &error, options);
+    if (!operations) {
+        finishEarly(error);
+        return;
+    }
+    // Refused before anything is written: a hostile archive fills no disk.
+    if (!GWCheckFreeSpace(directory, declaredSize(*operations), &error)) {
+        finishEarly(error);
         return;
     }
     auto state = std::make_shared<BatchState>();
+    state->continueAfterFailure = options.continueAfterFailure;
+    state->entryFailed = options.entryFailed;
+    const bool buildsFiles = std::any_of(operations->begin(), operations->end(),
+                                         [](const auto& op) { return !op->file()->isDirectory(); });
+    if (atomically && buildsFiles) {
+        state->folder = GWReplacementFolder::createForDestination(directory.path(), &error);
+        if (!state->folder) {
+            finishEarly(error);
+            return;
+        }
+    }
     for (const auto& operation : *operations) {
         state->operations.push_back(operation);
+        operation->setReplacementFolder(state->folder);
+        operation->setDefersDirectoryInfo(true);
+        if (operation->file()->isDirectory()) {
+            state->directories.push_back(operation);
+        }
     }
     auto finalOperation = std::make_shared<GWBlockOperation>();
     for (const auto& operation : *operations) {
         std::weak_ptr<GWZipExtractOperation> weakOperation = operation;
         operation->setCompletionBlock([weakOperation, state] {
-            state->lock.wait();
             if (auto finished = weakOperation.lock()) {
-                if (finished->isCancelled() && !state->firstError) {
-                    state->firstError = GWCocoaError(GWUserCancelledError);
-                }
-                if (auto operationError = finished->error(); operationError && !state->firstError) {
-                    state->firstError = operationError;
-                }
+                state->finished(*finished);
             }
-            if (state->firstError) {
-                for (const auto& weak : state->operations) {
-                    if (auto other = weak.lock()) {
-                        other->cancel();
-                    }
-                }
-            }
-            state->lock.signal();
         });
         finalOperation->addDependency(operation);
         runQueue->addOperation(operation);
     }
     finalOperation->addExecutionBlock(
         [runQueue, state, completion = std::move(completionHandler)]() mutable {
+            state->applyDirectoryInfo();
+            state->folder.reset();
             if (completion) {
                 runQueue->addOperationWithBlock(
                     [state, completion = std::move(completion)] { completion(state->firstError); });
@@ -142,7 +212,7 @@ void GWZipArchive::extractFiles(const GWZipFileArray& files, const GWURL& direct
 
 std::optional<std::vector<GWZipExtractOperationPtr>> GWZipArchive::operationsToExtractFiles(
     const GWZipFileArray& files, const GWURL& directory, bool atomically,
-    ProgressHandler progressHandler, GWErrorPtr* error) {
+    ProgressHandler progressHandler, GWErrorPtr* error, const GWExtractOptions& options) {
     std::vector<GWZipExtractOperationPtr> operations;
     for (const auto& file : files) {
         if (!file) {
@@ -150,7 +220,7 @@ std::optional<std::vector<GWZipExtractOperationPtr>> GWZipArchive::operationsToE
             return std::nullopt;
         }
         auto more = operationsToExtractFile(file, GWZipEntryDestinationURL(directory, file->path()),
-                                            atomically, progressHandler, error);
+                                            atomically, progressHandler, error, options);
         if (!more) {
             return std::nullopt;
         }
@@ -164,7 +234,7 @@ std::optional<std::vector<GWZipExtractOperationPtr>> GWZipArchive::operationsToE
 
 std::optional<std::vector<GWZipExtractOperationPtr>> GWZipArchive::operationsToExtractFile(
     const GWZipFilePtr& file, const GWURL& destination, bool atomically,
-    ProgressHandler progressHandler, GWErrorPtr* error) {
+    ProgressHandler progressHandler, GWErrorPtr* error, const GWExtractOptions& options) {
     // Built with a work list, not recursion: a tree may be thousands deep.
     // Each operation depends on its directory's, and through it on every
     // ancestor's; a directory comes before its descendants in the list.
@@ -189,19 +259,20 @@ std::optional<std::vector<GWZipExtractOperationPtr>> GWZipArchive::operationsToE
             return std::nullopt;
         }
         operation->setContainmentRoot(root);
+        operation->setReplacesExistingItems(options.replaceExisting);
         if (next.directoryOperation) {
             operation->addDependency(next.directoryOperation);
         }
         operations.push_back(operation);
-        if (next.file->isDirectory()) {
-            if (auto children = next.file->children()) {
-                // Reversed onto the stack, so children come out in order.
-                for (auto it = children->rbegin(); it != children->rend(); ++it) {
-                    if (*it) {
-                        pending.push_back(
-                            {*it, GWZipEntryDestinationURL(next.destination, (*it)->name()),
-                             operation});
-                    }
+        // Entries below a link are extracted too, to be refused by name
+        // rather than lost without a word.
+        if (auto children = next.file->children()) {
+            // Reversed onto the stack, so children come out in order.
+            for (auto it = children->rbegin(); it != children->rend(); ++it) {
+                if (*it) {
+                    pending.push_back({*it,
+                                       GWZipEntryDestinationURL(next.destination, (*it)->name()),
+                                       operation});
                 }
             }
         }

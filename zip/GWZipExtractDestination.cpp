@@ -1,4 +1,9 @@
+#include <fcntl.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
 #include <algorithm>
+#include <cerrno>
 
 #include "GWArchiveSupport/GWArchiveConstants.h"
 #include "GWZipExtractDestination.h"
@@ -6,59 +11,135 @@
 #include "foundation/GWContainment.h"
 #include "foundation/GWConversions.h"
 #include "foundation/GWFileManager.h"
+#include "foundation/GWFileSystem.h"
+#include "foundation/GWMetadataStore.h"
+
+namespace {
+
+// The process-wide creation semaphore, held for one scope and released on
+// every way out of it.
+class CreationLock {
+public:
+    explicit CreationLock(GWSemaphore& semaphore) : semaphore_(semaphore) { semaphore_.wait(); }
+    ~CreationLock() { semaphore_.signal(); }
+    CreationLock(const CreationLock&) = delete;
+    CreationLock& operator=(const CreationLock&) = delete;
+
+private:
+    GWSemaphore& semaphore_;
+};
+
+GWErrorPtr existsError(const GWURL& url) {
+    return GWGenerateError(kGWPOSIXErrorDomain, EEXIST, url, nullptr, {}, "%s already exists",
+                           url.path().c_str());
+}
+
+// Removes what is at `name` in `parent`, a directory with all it holds.
+bool removeExisting(int parent, const std::string& name, bool isDirectory, const GWURL& url,
+                    GWErrorPtr* error) {
+    if (isDirectory) {
+        return GWRemoveItemRecursively(url.path(), error);
+    }
+    return ::unlinkat(parent, name.c_str(), 0) == 0 || errno == ENOENT ||
+           GWFail(error, GWPOSIXError(errno, url));
+}
+
+}  // namespace
+
+GWURL GWZipExtractOperation::containmentRootOrParent() const {
+    return containmentRoot_ ? *containmentRoot_ : destURL_->URLByDeletingLastPathComponent();
+}
 
 std::optional<GWURL> GWZipExtractOperation::prepareTarget(bool isDirectory, bool isSymbolicLink,
                                                           GWErrorPtr* error) {
     // Concurrent operations would otherwise race while making the same parent
-    // directories. A failure below leaves the semaphore taken, so that every
-    // later extraction in the process waits: deliberate, kept as it is.
-    creationSemaphore().wait();
-    // Checked under the semaphore, so that no other preparation of the batch
-    // changes the path meanwhile. A refusal is not a preparation failure: the
-    // semaphore is released and the rest of the process goes on.
-    const GWURL root =
-        containmentRoot_ ? *containmentRoot_ : destURL_->URLByDeletingLastPathComponent();
+    // directories.
+    CreationLock lock(creationSemaphore());
+    const GWURL root = containmentRootOrParent();
     if (auto refusal = containmentErrorForFile(file_, root, *destURL_)) {
-        creationSemaphore().signal();
         GWFail(error, std::move(refusal));
         return std::nullopt;
     }
-    GWURL target = *destURL_;
-    if (isAtomic_) {
-        // The final move needs the destination's directory, which no other
-        // operation makes when the entry is extracted on its own.
-        const GWURL parent = target.URLByDeletingLastPathComponent();
-        if (!GWItemExistsAtURL(parent) && !GWCreateDirectoryAtURL(parent, true, error)) {
-            return std::nullopt;
-        }
-        GWURL existing = target;
-        while (!GWItemExistsAtURL(existing) && existing.path() != "/") {
-            existing = existing.URLByDeletingLastPathComponent();
-        }
-        auto directory = GWItemReplacementDirectoryForURL(existing, error);
-        if (!directory) {
-            return std::nullopt;
-        }
-        target = directory->URLByAppendingPathComponent(GWUniqueID());
-    }
-    if (GWItemExistsAtURL(target) && !GWRemoveItemAtURL(target, error)) {
+    // The caller's own directory may be made; below it, only real directories
+    // are walked, so no link the archive placed can lead the entry elsewhere.
+    const std::string relative = GWRelativePathBelow(root, *destURL_).value_or("");
+    const auto slash = relative.find_last_of('/');
+    const std::string name = slash == std::string::npos ? relative : relative.substr(slash + 1);
+    const std::string parentRelative = slash == std::string::npos ? "" : relative.substr(0, slash);
+    if (!GWItemExistsAtURL(root) && !GWCreateDirectoryAtURL(root, true, error)) {
         return std::nullopt;
     }
-    if (isDirectory) {
-        if (!GWCreateDirectoryAtURL(target, true, error)) {
+    GWFileDescriptor parent = GWOpenDirectoryBelow(root.path(), parentRelative, true, error);
+    if (!parent.isValid()) {
+        return std::nullopt;
+    }
+    struct stat existing;
+    const bool exists = ::fstatat(parent.get(), name.c_str(), &existing, AT_SYMLINK_NOFOLLOW) == 0;
+    const bool existingIsDirectory = exists && S_ISDIR(existing.st_mode);
+    if (isDirectory && existingIsDirectory) {
+        return *destURL_;  // merged into: what the user has there stays
+    }
+    if (exists && !replacesExistingItems()) {
+        GWFail(error, existsError(*destURL_));
+        return std::nullopt;
+    }
+    if (isDirectory || !isAtomic_) {
+        if (exists && !removeExisting(parent.get(), name, existingIsDirectory, *destURL_, error)) {
             return std::nullopt;
         }
-    } else {
-        const GWURL parent = target.URLByDeletingLastPathComponent();
-        if (!GWItemExistsAtURL(parent) && !GWCreateDirectoryAtURL(parent, true, error)) {
+        int made = 0;
+        if (isDirectory) {
+            made = ::mkdirat(parent.get(), name.c_str(), 0777);
+        } else if (!isSymbolicLink) {
+            GWFileDescriptor file(::openat(parent.get(), name.c_str(),
+                                           O_WRONLY | O_CREAT | O_EXCL | O_NOFOLLOW | O_CLOEXEC,
+                                           0666));
+            made = file.isValid() ? 0 : -1;
+        }
+        if (made != 0 && !(isDirectory && errno == EEXIST)) {
+            GWFail(error, GWPOSIXError(errno, *destURL_));
             return std::nullopt;
         }
-        if (!isSymbolicLink && !GWCreateEmptyFileAtomicallyAtURL(target, error)) {
+        return *destURL_;
+    }
+    if (!replacementFolder_) {
+        replacementFolder_ = GWReplacementFolder::createForDestination(destURL_->path(), error);
+        if (!replacementFolder_) {
             return std::nullopt;
         }
     }
-    creationSemaphore().signal();
+    const GWURL target = GWURL::fileURLWithPath(replacementFolder_->uniquePath());
+    if (!isSymbolicLink && !GWFileDescriptor::open(target.path().c_str(),
+                                                   O_WRONLY | O_CREAT | O_EXCL | O_NOFOLLOW, 0666)
+                                .isValid()) {
+        GWFail(error, GWPOSIXError(errno, target));
+        return std::nullopt;
+    }
     return target;
+}
+
+bool GWZipExtractOperation::moveIntoPlace(const GWURL& built, GWErrorPtr* error) {
+    const std::string destination = destURL_->path();
+    bool moved;
+    if (replacesExistingItems()) {
+        // A file over a directory replaces it only because the caller asked.
+        struct stat existing;
+        if (::lstat(destination.c_str(), &existing) == 0 && S_ISDIR(existing.st_mode) &&
+            !GWRemoveItemRecursively(destination, error)) {
+            return false;
+        }
+        moved = GWMoveItemReplacing(built.path(), destination, error);
+    } else {
+        moved = GWMoveItemNoReplace(built.path(), destination, error);
+    }
+    return moved && GWMetadataStore::moveMetadata(built.path(), destination, error);
+}
+
+bool GWZipExtractOperation::setInfoForDirectory(const GWZipFilePtr& file, const GWURL& root,
+                                                const GWURL& url, GWErrorPtr* error) {
+    GWFileDescriptor directory = GWOpenDirectoryBelow(
+        root.path(), GWRelativePathBelow(root, url).value_or(""), false, error);
+    return directory.isValid() && setInfoForFile(file, url, error, directory.get());
 }
 
 GWURL GWZipExtractTemporaryURL(const GWURL& target) {

@@ -5,11 +5,12 @@
 #include "foundation/GWFileDescriptor.h"
 #include "foundation/GWFileInfo.h"
 #include "foundation/GWFileManager.h"
+#include "foundation/GWMetadataNames.h"
 #include "foundation/GWMetadataStore.h"
 #include "foundation/GWRemoteFileHandle.h"
 
 bool GWZipExtractOperation::setInfoForFile(const GWZipFilePtr& file, const GWURL& url,
-                                           GWErrorPtr* error) {
+                                           GWErrorPtr* error, int fd) {
     auto info = GWFileInfo::initWithURL(url, error);
     if (!info) {
         return false;
@@ -48,7 +49,11 @@ bool GWZipExtractOperation::setInfoForFile(const GWZipFilePtr& file, const GWURL
     if (const std::uint16_t folder = file->putAwayFolderID()) {
         info->setPutAwayFolderID(folder);
     }
-    if (!info->applyToURL(url, error)) {
+    auto apply = [&](GWErrorPtr* applyError) {
+        return fd >= 0 ? info->applyToDescriptor(fd, url, applyError)
+                       : info->applyToURL(url, applyError);
+    };
+    if (!apply(error)) {
         return false;
     }
     const std::uint32_t mode = file->permissionsMode() & 07777;
@@ -58,10 +63,13 @@ bool GWZipExtractOperation::setInfoForFile(const GWZipFilePtr& file, const GWURL
         info->setGroupID(file->groupOwner());
         info->setPermissionsMode(mode);
         // Another user's ownership is often refused; the file is still good.
-        info->applyToURL(url, nullptr);
+        apply(nullptr);
     }
     if (auto comment = file->comment(); comment && !comment->empty()) {
-        GWSetSpotlightComments(*comment, url, nullptr);
+        const auto* bytes = reinterpret_cast<const std::uint8_t*>(comment->data());
+        GWMetadataStore store =
+            fd >= 0 ? GWMetadataStore(fd, url.path()) : GWMetadataStore(url.path());
+        store.setAttribute(kGWCommentAttributeName, std::span(bytes, comment->size()), nullptr);
     }
     return true;
 }

@@ -3,6 +3,7 @@
 #include "GWZipArchive.h"
 
 #include "foundation/GWFileManager.h"
+#include "foundation/GWFileSystem.h"
 #include "foundation/GWRemoteFileHandle.h"
 
 GWZipExtractOperationPtr GWZipExtractOperation::make(const GWZipFilePtr& file,
@@ -163,15 +164,21 @@ void GWZipExtractOperation::unpackWithHandler(ChunkHandler handler, Completion c
                        // Nothing that failed a check may stay on disk as if whole.
                        GWRemoveItemAtURL(*target, nullptr);
                    }
-                   if (error || !destURL_) {
-                       finalStep(error);
-                       return;
+                   GWErrorPtr stepError = error;
+                   if (!stepError && destURL_) {
+                       if (isDirectory) {
+                           if (!defersDirectoryInfo_) {
+                               setInfoForDirectory(file_, containmentRootOrParent(), *destURL_,
+                                                   &stepError);
+                           }
+                       } else if (*target == *destURL_ || moveIntoPlace(*target, &stepError)) {
+                           setInfoForFile(file_, *destURL_, &stepError);
+                       } else if (target) {
+                           GWRemoveItemAtURL(*target, nullptr);
+                       }
                    }
-                   GWErrorPtr stepError;
-                   if (isAtomic_ && !GWMoveItemAtURL(*target, *destURL_, &stepError)) {
-                       finalStep(stepError);
-                       return;
-                   }
-                   finalStep(setInfoForFile(file_, *destURL_, &stepError) ? nullptr : stepError);
+                   // The operation's own folder goes with it; a batch keeps its own.
+                   replacementFolder_.reset();
+                   finalStep(stepError);
                });
 }

@@ -13,11 +13,13 @@
 #include "GWZipWorkOperation.h"
 #include "foundation/GWDispatch.h"
 #include "foundation/GWError.h"
+#include "foundation/GWExtractOptions.h"
 #include "foundation/GWURL.h"
 #include "foundation/GWValue.h"
 
 class GWZipArchive;
 class GWRemoteFileHandle;
+class GWReplacementFolder;
 class GWZipExtractOperation;
 using GWZipExtractOperationPtr = std::shared_ptr<GWZipExtractOperation>;
 using GWRemoteFileHandlePtr = std::shared_ptr<GWRemoteFileHandle>;
@@ -76,6 +78,17 @@ public:
     // names and real directories; by default the destination's own directory.
     const std::optional<GWURL>& containmentRoot() const { return containmentRoot_; }
     void setContainmentRoot(const GWURL& root) { containmentRoot_ = root; }
+    // Where an atomic extraction builds its item; one is made for the
+    // operation when none is given, and a batch gives all its operations one.
+    void setReplacementFolder(std::shared_ptr<GWReplacementFolder> folder) {
+        replacementFolder_ = std::move(folder);
+    }
+    // Whether an item already at the destination may be replaced; none: only
+    // when writing in place. An existing directory is merged into either way.
+    void setReplacesExistingItems(std::optional<bool> replaces) { replacesExisting_ = replaces; }
+    bool replacesExistingItems() const { return replacesExisting_.value_or(!isAtomic_); }
+    // A batch applies directory metadata itself once their contents are written.
+    void setDefersDirectoryInfo(bool defers) { defersDirectoryInfo_ = defers; }
 
     // Why `file` may not be extracted at `destination` below `root`, or none:
     // the destination leaves `root` by name, an item between the two is a
@@ -122,7 +135,11 @@ public:
 
     // Dates, Finder information, then owner, group and mode (a refused
     // ownership change is not a failure), then the comment.
-    bool setInfoForFile(const GWZipFilePtr& file, const GWURL& url, GWErrorPtr* error);
+    // With `fd`, through that descriptor of the item instead of its path.
+    bool setInfoForFile(const GWZipFilePtr& file, const GWURL& url, GWErrorPtr* error, int fd = -1);
+    // The directory at `url` below `root`, reached without following links.
+    bool setInfoForDirectory(const GWZipFilePtr& file, const GWURL& root, const GWURL& url,
+                             GWErrorPtr* error);
     void writeResourceForkForFile(const GWZipFilePtr& file, const GWRemoteFileHandlePtr& handle,
                                   const GWURL& url, Completion completion);
     void applyAppleDoubleMetadataForFile(const GWZipFilePtr& file,
@@ -143,9 +160,12 @@ private:
     static GWZipExtractOperationPtr make(const GWZipFilePtr& file, const GWURL& archiveURL,
                                          std::uint64_t startOffset, GWErrorPtr* error);
 
-    // Where the data is written: the destination or a fresh place in an
-    // item-replacement directory. Holds the creation semaphore meanwhile.
+    // Where the data is written: the destination or a fresh place in the
+    // replacement folder. Holds the creation semaphore meanwhile.
     std::optional<GWURL> prepareTarget(bool isDirectory, bool isSymbolicLink, GWErrorPtr* error);
+    // Moves a finished item from the replacement folder to the destination.
+    bool moveIntoPlace(const GWURL& built, GWErrorPtr* error);
+    GWURL containmentRootOrParent() const;
     void setError(GWErrorPtr error);
     void markDone();
 
@@ -156,6 +176,9 @@ private:
     bool isAtomic_ = false;
     std::uint64_t startOffset_ = 0;
     std::optional<GWURL> containmentRoot_;
+    std::shared_ptr<GWReplacementFolder> replacementFolder_;
+    std::optional<bool> replacesExisting_;
+    bool defersDirectoryInfo_ = false;
 
     mutable std::mutex errorMutex_;
     GWErrorPtr error_;

@@ -37,6 +37,21 @@ SmallFileSystem::~SmallFileSystem() {
     }
 }
 
+ScopedEnvironment::ScopedEnvironment(const char* name, const std::string& value) : name_(name) {
+    if (const char* old = std::getenv(name)) {
+        previous_ = old;
+    }
+    setenv(name, value.c_str(), 1);
+}
+
+ScopedEnvironment::~ScopedEnvironment() {
+    if (previous_) {
+        setenv(name_, previous_->c_str(), 1);
+    } else {
+        unsetenv(name_);
+    }
+}
+
 void writeFile(const std::string& path, const GWData& bytes) {
     std::ofstream out(path, std::ios::binary | std::ios::trunc);
     out.write(reinterpret_cast<const char*>(bytes.data()), std::streamsize(bytes.size()));

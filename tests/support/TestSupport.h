@@ -39,6 +39,19 @@ private:
     bool mounted_ = false;
 };
 
+// Sets an environment variable for a scope, then restores what was there.
+class ScopedEnvironment {
+public:
+    ScopedEnvironment(const char* name, const std::string& value);
+    ~ScopedEnvironment();
+    ScopedEnvironment(const ScopedEnvironment&) = delete;
+    ScopedEnvironment& operator=(const ScopedEnvironment&) = delete;
+
+private:
+    const char* name_;
+    std::optional<std::string> previous_;
+};
+
 void writeFile(const std::string& path, const GWData& bytes);
 GWData readFile(const std::string& path);
 

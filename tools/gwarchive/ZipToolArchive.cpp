@@ -6,6 +6,7 @@
 #include <filesystem>
 #include <mutex>
 #include <thread>
+#include <unordered_set>
 
 #include "Diagnostics.h"
 #include "FormatAdapters.h"
@@ -219,27 +220,6 @@ private:
         }
     }
 
-    // Makes room for an entry at `url`: fails for an existing item unless overwriting.
-    bool prepare(const GWURL& url, const std::string& path, EntryType type,
-                 const ExtractOptions& options, const std::string& archiveName) {
-        std::error_code ignored;
-        auto status = std::filesystem::symlink_status(url.path(), ignored);
-        if (std::filesystem::exists(status)) {
-            if (type == EntryType::directory && std::filesystem::is_directory(status)) {
-                return true;  // merged into
-            }
-            if (!options.overwrite) {
-                reportError(archiveName, path, GWPOSIXError(EEXIST, url));
-                return false;
-            }
-            std::filesystem::remove_all(url.path(), ignored);
-        }
-        std::filesystem::create_directories(
-            type == EntryType::directory ? url.path() : url.URLByDeletingLastPathComponent().path(),
-            ignored);
-        return true;
-    }
-
     GWZipArchivePtr archive_;
     PathTable paths_;
     std::vector<EntryType> types_;
@@ -248,73 +228,32 @@ private:
 
 bool ZipToolArchive::extract(const std::vector<std::size_t>& indexes, const ExtractOptions& options,
                              const std::string& archiveName) {
-    auto queue = std::make_shared<GWOperationQueue>();
-    long cores = static_cast<long>(std::max(1u, std::thread::hardware_concurrency()));
-    queue->setMaxConcurrentOperationCount(2 * cores);
-    std::atomic<bool> allGood{true};
-    std::vector<std::pair<GWZipFilePtr, GWURL>> directories;
+    // The library brings each directory's subtree; only the selected entries
+    // whose parent is not selected are named to it.
+    std::unordered_set<const GWZipFile*> selected;
+    for (std::size_t index : indexes)
+        selected.insert(files_[index].get());
+    GWZipFileArray tops;
     for (std::size_t index : indexes) {
-        const std::string path(paths_[index]);
-        const EntryType type = types_[index];
-        GWURL url = options.directory.URLByAppendingPathComponent(path);
-        // Checked before anything is made for the entry, and again by its
-        // operation, when links extracted meanwhile are on disk.
-        if (auto refusal = GWZipExtractOperation::containmentErrorForFile(files_[index],
-                                                                          options.directory, url)) {
-            reportError(archiveName, path, refusal);
-            allGood = false;
-            continue;
-        }
-        if (!prepare(url, path, type, options, archiveName)) {
-            allGood = false;
-            continue;
-        }
-        if (type == EntryType::directory) {
-            directories.emplace_back(files_[index], url);
-            continue;
-        }
-        // Written under a private name beside the destination, then moved into
-        // place without replacing: as atomic as the library's own mode, but
-        // without a replacement folder left in $TMPDIR for every entry.
-        GWURL temporary = url.URLByDeletingLastPathComponent().URLByAppendingPathComponent(
-            ".gwarchive-" + GWUniqueID());
-        GWErrorPtr error;
-        auto operation = GWZipExtractOperation::initForExtractingFile(
-            files_[index], archive_, temporary, false, options.progress, &error);
-        if (!operation) {
-            reportError(archiveName, path, error);
-            allGood = false;
-            continue;
-        }
-        operation->setContainmentRoot(options.directory);
-        std::weak_ptr<GWZipExtractOperation> weak = operation;
-        operation->setCompletionBlock([weak, path, temporary, url, archiveName, &allGood] {
-            auto finished = weak.lock();
-            GWErrorPtr failure = finished ? finished->error() : nullptr;
-            if (!failure && !GWMoveItemAtURL(temporary, url, &failure) && !failure) {
-                failure = GWPOSIXError(EIO, url);
-            }
-            if (failure) {
-                GWRemoveItemAtURL(temporary, nullptr);
-                reportError(archiveName, path, failure);
-                allGood = false;
-            }
-        });
-        queue->addOperation(operation);
+        const GWZipFilePtr parent = files_[index]->parent();
+        if (!parent || !selected.count(parent.get()))
+            tops.push_back(files_[index]);
     }
-    queue->waitUntilAllOperationsAreFinished();
-    // Directory dates and modes last, deepest first, so that writing their
-    // contents does not undo them.
-    for (auto it = directories.rbegin(); it != directories.rend(); ++it) {
-        GWErrorPtr error;
-        auto operation = GWZipExtractOperation::initForExtractingFile(
-            it->first, archive_, it->second, false, nullptr, &error);
-        if (!operation || !operation->setInfoForFile(it->first, it->second, &error)) {
-            reportError(archiveName, it->first->path(), error);
-            allGood = false;
-        }
-    }
-    return allGood;
+    std::atomic<bool> reported{false};
+    GWExtractOptions batchOptions;
+    batchOptions.replaceExisting = options.overwrite;
+    batchOptions.continueAfterFailure = true;
+    batchOptions.entryFailed = [&](const std::string& path, const GWErrorPtr& error) {
+        reportError(archiveName, path, error);
+        reported = true;
+    };
+    GWErrorPtr error;
+    if (archive_->extractFiles(tops, options.directory, true, options.progress, &error,
+                               batchOptions))
+        return true;
+    if (!reported)
+        reportError(archiveName, std::nullopt, error);
+    return false;
 }
 
 }  // namespace

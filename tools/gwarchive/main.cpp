@@ -12,6 +12,7 @@
 #include "Command.h"
 #include "Diagnostics.h"
 #include "GWArchiveSupport/GWArchiveSupport.h"
+#include "foundation/GWFileSystem.h"
 
 using namespace gwarchive;
 
@@ -33,6 +34,8 @@ void printToolHelp(std::FILE* stream) {
         "\n"
         "commands:\n",
         stream);
+    // An interrupted extraction leaves none of its half-built items behind.
+    GWRemoveReplacementFoldersOnSignals();
     for (const Command* command : kCommands) {
         std::fprintf(stream, "  %-12s %s\n", command->name, command->summary);
     }
