@@ -16,6 +16,7 @@
 #include "GWXARSignature.h"
 #include "foundation/GWCoder.h"
 #include "foundation/GWError.h"
+#include "foundation/GWExtractOptions.h"
 #include "foundation/GWOperationQueue.h"
 #include "foundation/GWRef.h"
 #include "foundation/GWURL.h"
@@ -183,13 +184,15 @@ public:
     // Extracts `file` (and its subtree) to `url` on the calling thread. True
     // when the item is there; `checksumIsInvalid` then says whether a digest
     // failed or metadata could not be applied.
+    // `options` as GWXARExtractOperation::setOptions takes them.
     bool extractFile(const GWXARFilePtr& file, const GWURL& url, bool* checksumIsInvalid,
-                     GWErrorPtr* error);
+                     GWErrorPtr* error, const GWExtractOptions& options = {});
     // The same on `queue` (the archive's own when none); `operation` receives
     // the operation for cancelling before it is queued.
     void extractFile(const GWXARFilePtr& file, const GWURL& url, const GWOperationQueuePtr& queue,
                      std::shared_ptr<GWXARExtractOperation>* operation,
-                     ExtractionCompletionHandler completionHandler);
+                     ExtractionCompletionHandler completionHandler,
+                     const GWExtractOptions& options = {});
 
 private:
     void streamDataReference(const GWXARDataReferencePtr& reference, const GWXARFilePtr& file,

@@ -122,8 +122,9 @@ void GWXARArchive::streamDataReference(const GWXARDataReferencePtr& reference,
 }
 
 bool GWXARArchive::extractFile(const GWXARFilePtr& file, const GWURL& url, bool* checksumIsInvalid,
-                               GWErrorPtr* error) {
+                               GWErrorPtr* error, const GWExtractOptions& options) {
     auto operation = GWXARExtractOperation::initWithFile(file, url, shared_from_this());
+    operation->setOptions(options);
     operation->start();
     if (checksumIsInvalid) {
         *checksumIsInvalid = operation->checksumIsInvalid();
@@ -137,8 +138,10 @@ bool GWXARArchive::extractFile(const GWXARFilePtr& file, const GWURL& url, bool*
 void GWXARArchive::extractFile(const GWXARFilePtr& file, const GWURL& url,
                                const GWOperationQueuePtr& queue,
                                std::shared_ptr<GWXARExtractOperation>* operation,
-                               ExtractionCompletionHandler completionHandler) {
+                               ExtractionCompletionHandler completionHandler,
+                               const GWExtractOptions& options) {
     auto extraction = GWXARExtractOperation::initWithFile(file, url, shared_from_this());
+    extraction->setOptions(options);
     std::weak_ptr<GWXARExtractOperation> weakExtraction = extraction;
     extraction->setCompletionBlock([weakExtraction, completionHandler] {
         auto finished = weakExtraction.lock();

@@ -61,6 +61,17 @@ int linuxInodeFlags(std::uint32_t posixFlags) {
 bool GWXARExtractOperation::applyMetadataToFile(const GWXARFilePtr& file, const GWURL& url,
                                                 GWErrorPtr* error) {
     const std::string path = url.path();
+    // A directory is finished long after it was made, so it is reached by a
+    // walk that no link placed meanwhile can redirect, and changed through
+    // the descriptor the walk ends with.
+    GWFileDescriptor directory;
+    if (file->type() == GWXARFileTypeDirectory) {
+        directory = openBuiltDirectory(url, error);
+        if (!directory.isValid()) {
+            return false;
+        }
+    }
+    const int fd = directory.get();
     const GWDate now = GWDate::now();
     // Each step is tried whatever became of the one before: an attribute the
     // file system refuses must not cost the item its mode or owner.
@@ -68,19 +79,21 @@ bool GWXARExtractOperation::applyMetadataToFile(const GWXARFilePtr& file, const 
     // Creation and status-change dates cannot be set on Linux.
     const timespec times[2] = {timespecFromDate(file->accessDate(), now),
                                timespecFromDate(file->modificationDate(), now)};
-    if (::utimensat(AT_FDCWD, path.c_str(), times, AT_SYMLINK_NOFOLLOW) != 0) {
+    if ((fd >= 0 ? ::futimens(fd, times)
+                 : ::utimensat(AT_FDCWD, path.c_str(), times, AT_SYMLINK_NOFOLLOW)) != 0) {
         firstFailure = GWPOSIXError(errno, url);
     }
     GWErrorPtr attributesError;
-    if (!applyExtendedAttributesForFile(file, url, &attributesError) && !firstFailure) {
+    if (!applyExtendedAttributesForFile(file, url, &attributesError, fd) && !firstFailure) {
         firstFailure = attributesError ? attributesError : cancelledError();
     }
 
     // Owner, group, mode and ACL are best effort, as a file-security object is:
     // an unprivileged user cannot give files away, and that is no failure.
-    const bool isLink = file->type() == GWXARFileTypeSymbolicLink;
-    [[maybe_unused]] int ignored = ::lchown(path.c_str(), file->ownerID(), file->groupOwnerID());
-    if (!isLink) {
+    [[maybe_unused]] int ignored =
+        fd >= 0 ? ::fchown(fd, file->ownerID(), file->groupOwnerID())
+                : ::lchown(path.c_str(), file->ownerID(), file->groupOwnerID());
+    if (file->type() != GWXARFileTypeSymbolicLink) {
         // The access ACL is what Linux enforces; an extended one in POSIX form
         // stands in for a missing one. Setting an ACL rewrites the group bits
         // from its mask, so the mode comes after it and both end as archived.
@@ -89,19 +102,24 @@ bool GWXARExtractOperation::applyMetadataToFile(const GWXARFilePtr& file, const 
             acl = file->extendedACL();
         }
         if (acl && !acl->isMacExtended()) {
-            ignored = ::acl_set_file(path.c_str(), ACL_TYPE_ACCESS, acl->handle());
+            ignored = fd >= 0 ? ::acl_set_fd(fd, acl->handle())
+                              : ::acl_set_file(path.c_str(), ACL_TYPE_ACCESS, acl->handle());
         }
+        // The default ACL has no descriptor call; the descriptor's own entry
+        // in /proc names the directory the walk reached.
         const GWACL* inherited = file->defaultACL();
-        if (file->type() == GWXARFileTypeDirectory && inherited && !inherited->isMacExtended()) {
-            ignored = ::acl_set_file(path.c_str(), ACL_TYPE_DEFAULT, inherited->handle());
+        if (fd >= 0 && inherited && !inherited->isMacExtended()) {
+            ignored = ::acl_set_file(("/proc/self/fd/" + std::to_string(fd)).c_str(),
+                                     ACL_TYPE_DEFAULT, inherited->handle());
         }
-        ignored = ::chmod(path.c_str(), file->permissionsMode() & 07777);
+        const mode_t mode = file->permissionsMode() & 07777;
+        ignored = fd >= 0 ? ::fchmod(fd, mode) : ::chmod(path.c_str(), mode);
     }
-    applyFlags(*file, url);
+    applyFlags(*file, url, fd);
     return !firstFailure || GWFail(error, firstFailure);
 }
 
-void GWXARExtractOperation::applyFlags(const GWXARFile& file, const GWURL& url) {
+void GWXARExtractOperation::applyFlags(const GWXARFile& file, const GWURL& url, int fd) {
     const int wanted = linuxInodeFlags(file.posixFlags() & kRestorableFlagsMask);
     if (wanted == 0) {
         return;
@@ -117,16 +135,21 @@ void GWXARExtractOperation::applyFlags(const GWXARFile& file, const GWURL& url) 
     if (type != S_IFREG && type != S_IFDIR) {
         return;  // devices, FIFOs and links carry no inode flags we may open them for
     }
-    auto fd = GWFileDescriptor::open(url.path().c_str(), O_RDONLY | O_NONBLOCK | O_NOFOLLOW);
+    GWFileDescriptor opened;
+    if (fd < 0) {
+        opened = GWFileDescriptor::open(url.path().c_str(), O_RDONLY | O_NONBLOCK | O_NOFOLLOW);
+        fd = opened.get();
+    }
     int flags = 0;
-    if (fd.isValid() && ::ioctl(fd.get(), FS_IOC_GETFLAGS, &flags) == 0) {
+    if (fd >= 0 && ::ioctl(fd, FS_IOC_GETFLAGS, &flags) == 0) {
         flags |= wanted;
-        ::ioctl(fd.get(), FS_IOC_SETFLAGS, &flags);
+        ::ioctl(fd, FS_IOC_SETFLAGS, &flags);
     }
 }
 
 bool GWXARExtractOperation::applyExtendedAttributesForFile(const GWXARFilePtr& file,
-                                                           const GWURL& url, GWErrorPtr* error) {
+                                                           const GWURL& url, GWErrorPtr* error,
+                                                           int fd) {
     if (file->extendedAttributes().empty()) {
         return true;
     }
@@ -192,7 +215,7 @@ bool GWXARExtractOperation::applyExtendedAttributesForFile(const GWXARFilePtr& f
                     if (!self) {
                         failure = GWCocoaError(GWFileWriteUnknownError, url);
                     } else {
-                        self->appendDataToResourceFork(piece, url, *position, &failure);
+                        self->appendDataToResourceFork(piece, url, *position, &failure, fd);
                     }
                 } else if (!failure) {
                     if (buffer->size() + piece.size() > kMaxBufferedAttributeSize) {
@@ -209,7 +232,8 @@ bool GWXARExtractOperation::applyExtendedAttributesForFile(const GWXARFilePtr& f
                     }
                     if (!failure) {
                         setxattrQueue->sync([&] {
-                            GWMetadataStore store(path);
+                            GWMetadataStore store =
+                                fd >= 0 ? GWMetadataStore(fd, path) : GWMetadataStore(path);
                             GWErrorPtr storeError;
                             if (!store.setAttribute(name, *buffer, &storeError)) {
                                 failure = attributeError(storeError, url);
@@ -249,7 +273,7 @@ bool GWXARExtractOperation::applyExtendedAttributesForFile(const GWXARFilePtr& f
 
 bool GWXARExtractOperation::appendDataToResourceFork(std::span<const std::uint8_t> data,
                                                      const GWURL& url, std::uint32_t& position,
-                                                     GWErrorPtr* error) {
+                                                     GWErrorPtr* error, int fd) {
     if (std::uint64_t(position) + data.size() > 0xFFFFFFFFull) {
         auto archive = archive_.lock();
         return GWFail(
@@ -262,7 +286,7 @@ bool GWXARExtractOperation::appendDataToResourceFork(std::span<const std::uint8_
     if (data.empty()) {
         return true;
     }
-    GWMetadataStore store(url.path());
+    GWMetadataStore store = fd >= 0 ? GWMetadataStore(fd, url.path()) : GWMetadataStore(url.path());
     GWErrorPtr storeError;
     if (!store.writeResourceFork(data, position, &storeError)) {
         return GWFail(error, attributeError(storeError, url));

@@ -71,15 +71,6 @@ GWErrorPtr GWXARExtractOperation::cancelledError() const {
     return GWCocoaError(GWUserCancelledError, destURL_);
 }
 
-std::vector<GWXARExtractOperation::EntryFailure> GWXARExtractOperation::entryFailures() const {
-    std::lock_guard lock(failuresMutex_);
-    std::vector<EntryFailure> failures;
-    for (const auto& [order, failure] : failures_) {
-        failures.push_back(failure);
-    }
-    return failures;
-}
-
 GWURL GWXARExtractOperation::finalURL(const GWURL& url) const {
     if (!temporaryItemURL_) {
         return url;
@@ -190,10 +181,15 @@ bool GWXARExtractOperation::performExtractionOperationWithFile(const GWXARFilePt
     }
     pendingDirectories_.clear();
     GWErrorPtr firstFailure;
+    std::map<std::size_t, EntryFailure> failures;
     {
         std::lock_guard lock(failuresMutex_);
-        if (!failures_.empty()) {
-            firstFailure = failures_.begin()->second.error;
+        failures = failures_;
+    }
+    for (const auto& [order, failure] : failures) {
+        firstFailure = firstFailure ? firstFailure : failure.error;
+        if (options_.entryFailed) {
+            options_.entryFailed(failure.file->path(), failure.error);
         }
     }
     if (!created) {
@@ -233,21 +229,34 @@ bool GWXARExtractOperation::performExtractionOperationWithFile(const GWXARFilePt
 bool GWXARExtractOperation::moveIntoPlace(const std::string& item, const std::string& destination,
                                           bool isDirectory, GWErrorPtr* error) {
     struct stat existing;
-    if (!replacesExistingItem_ || ::lstat(destination.c_str(), &existing) != 0) {
+    if (!options_.replaceExisting.value_or(false) || ::lstat(destination.c_str(), &existing) != 0) {
         return GWMoveItemNoReplace(item, destination, error);
     }
     if (S_ISDIR(existing.st_mode)) {
         return GWFail(error, GWPOSIXError(EEXIST, GWURL::fileURLWithPath(destination)));
     }
-    // rename replaces a file in one step; a directory cannot take a file's
-    // place that way, so the file goes first.
-    if (isDirectory && ::unlink(destination.c_str()) != 0) {
-        return GWFail(error, GWPOSIXError(errno, GWURL::fileURLWithPath(destination)));
+    // A rename cannot put a directory where a file is, so the file goes first.
+    if (isDirectory) {
+        if (::unlink(destination.c_str()) != 0) {
+            return GWFail(error, GWPOSIXError(errno, GWURL::fileURLWithPath(destination)));
+        }
+        return GWMoveItemNoReplace(item, destination, error);
     }
-    if (::rename(item.c_str(), destination.c_str()) != 0) {
-        return GWFail(error, GWPOSIXError(errno, GWURL::fileURLWithPath(destination)));
+    return GWMoveItemReplacing(item, destination, error);
+}
+
+GWFileDescriptor GWXARExtractOperation::openBuiltDirectory(const GWURL& url,
+                                                           GWErrorPtr* error) const {
+    const std::string folder = temporaryItemURL_
+                                   ? temporaryItemURL_->URLByDeletingLastPathComponent().path()
+                                   : std::string();
+    const std::string path = url.path();
+    if (folder.empty() || path.compare(0, folder.size() + 1, folder + "/") != 0) {
+        GWFail(error, GWPOSIXError(EINVAL, url));
+        return GWFileDescriptor();
     }
-    return true;
+    return GWOpenDirectoryBelow(folder, std::string_view(path).substr(folder.size() + 1), false,
+                                error);
 }
 
 bool GWXARExtractOperation::extractFile(const GWXARFilePtr& file, const GWURL& url,

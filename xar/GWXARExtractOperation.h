@@ -12,6 +12,8 @@
 
 #include "GWXARFile.h"
 #include "foundation/GWError.h"
+#include "foundation/GWExtractOptions.h"
+#include "foundation/GWFileDescriptor.h"
 #include "foundation/GWOperation.h"
 #include "foundation/GWURL.h"
 
@@ -42,17 +44,13 @@ public:
     // Set when a stream's digests did not match, and also when metadata could
     // not be applied: the item is there, but not exactly as archived.
     bool checksumIsInvalid() const { return checksumIsInvalid_.load(); }
-    // Every entry that was left out, in tree order, each error naming where
-    // that entry was to appear.
-    struct EntryFailure {
-        GWXARFilePtr file;
-        GWErrorPtr error;
-    };
-    std::vector<EntryFailure> entryFailures() const;
 
-    // With replacement, an existing item at the destination that is not a
+    // With replaceExisting, an item at the destination that is not a
     // directory gives way to the extracted one; a directory never does.
-    void setReplacesExistingItem(bool replaces) { replacesExistingItem_ = replaces; }
+    // entryFailed hears of every entry left out, in tree order, once the
+    // walk is over, each error naming where the entry was to appear. Entries
+    // always go on after one fails: only cancelling the operation stops them.
+    void setOptions(GWExtractOptions options) { options_ = std::move(options); }
 
     void main() override;
 
@@ -86,12 +84,13 @@ public:
     // --- Metadata (GWXARExtractMetadata.cpp) ----------------------------------
     // Dates, extended attributes, owner, group, mode, ACL, then BSD flags.
     bool applyMetadataToFile(const GWXARFilePtr& file, const GWURL& url, GWErrorPtr* error);
+    // With `fd`, an open directory, attributes are set through it.
     bool applyExtendedAttributesForFile(const GWXARFilePtr& file, const GWURL& url,
-                                        GWErrorPtr* error);
+                                        GWErrorPtr* error, int fd = -1);
     // Writes a piece of the resource fork at `position` and advances it;
     // a fork may not pass 4 GiB.
     bool appendDataToResourceFork(std::span<const std::uint8_t> data, const GWURL& url,
-                                  std::uint32_t& position, GWErrorPtr* error);
+                                  std::uint32_t& position, GWErrorPtr* error, int fd = -1);
 
     GWErrorPtr cancelledError() const;
 
@@ -137,7 +136,10 @@ private:
                                                   GWErrorPtr* refusal) const;
     // BSD flags as Linux inode flags; those that would pin the item where it
     // is are held back for the top-level item until it has been moved.
-    void applyFlags(const GWXARFile& file, const GWURL& url);
+    void applyFlags(const GWXARFile& file, const GWURL& url, int fd = -1);
+    // A directory of the item being built, opened by a walk from the private
+    // folder that no symbolic link can lead elsewhere.
+    GWFileDescriptor openBuiltDirectory(const GWURL& url, GWErrorPtr* error) const;
 
     GWXARFilePtr file_;
     GWURL destURL_;
@@ -150,13 +152,17 @@ private:
     // wait for the move.
     std::optional<GWURL> temporaryItemURL_;
     bool deferTopLevelFlags_ = false;
-    bool replacesExistingItem_ = false;
+    GWExtractOptions options_;
 
     struct Workers;
     std::shared_ptr<Workers> workers_;
     // While the private-directory wrapper walks the item's tree.
     bool walking_ = false;
     std::size_t nextOrder_ = 0;
+    struct EntryFailure {
+        GWXARFilePtr file;
+        GWErrorPtr error;
+    };
     mutable std::mutex failuresMutex_;
     std::map<std::size_t, EntryFailure> failures_;
     // Directories whose metadata waits for their files, deepest first.

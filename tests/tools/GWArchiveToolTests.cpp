@@ -158,22 +158,48 @@ TEST(GWArchiveTool, ExtractRefusesExistingItemsButGoesOnAndOverwriteReplaces) {
     ZipBuilder zip;
     zip.addFile("a.txt", bytesOf("new a"), 8);
     zip.addFile("b.txt", bytesOf("new b"), 8);
-    TemporaryDirectory directory;
-    writeFile(directory.file("t.zip"), zip.bytes());
-    fs::create_directories(directory.file("out"));
-    writeFile(directory.file("out/a.txt"), bytesOf("old a"));
+    // The XAR one also has a folder with an entry that cannot be read.
+    XarBuilder xar;
+    std::string unreadable = xar.dataElement("data", bytesOf("c"), XarEncoding::gzip);
+    unreadable.replace(unreadable.find("x-gzip"), 6, "x-lzma");
+    auto file = [](int id, const std::string& name, const std::string& inner) {
+        return "<file id=\"" + std::to_string(id) + "\"><name>" + name +
+               "</name><type>file</type>" + inner + "</file>";
+    };
+    xar.setFiles(
+        file(1, "a.txt", xar.dataElement("data", bytesOf("new a"), XarEncoding::gzip)) +
+        "<file id=\"2\"><name>d</name><type>directory</type>" + file(3, "c.txt", unreadable) +
+        file(4, "e.txt", xar.dataElement("data", bytesOf("e"), XarEncoding::none)) + "</file>" +
+        file(5, "b.txt", xar.dataElement("data", bytesOf("new b"), XarEncoding::none)));
+    for (const auto& [name, bytes] : {std::pair{"t.zip", zip.bytes()}, {"t.xar", xar.bytes()}}) {
+        TemporaryDirectory directory;
+        writeFile(directory.file(name), bytes);
+        fs::create_directories(directory.file("out"));
+        writeFile(directory.file("out/a.txt"), bytesOf("old a"));
 
-    std::string arguments =
-        "-C " + shellQuote(directory.file("out")) + " " + shellQuote(directory.file("t.zip"));
-    ToolRun first = runTool("extract " + arguments);
-    EXPECT_EQ(first.status, 1);
-    EXPECT_TRUE(isErrorLine(first.err, directory.file("t.zip") + ": a.txt"));
-    EXPECT_EQ(readFile(directory.file("out/a.txt")), bytesOf("old a"));
-    EXPECT_EQ(readFile(directory.file("out/b.txt")), bytesOf("new b"));
+        std::string arguments =
+            "-C " + shellQuote(directory.file("out")) + " " + shellQuote(directory.file(name));
+        ToolRun first = runTool("extract " + arguments);
+        EXPECT_EQ(first.status, 1);
+        EXPECT_EQ(readFile(directory.file("out/a.txt")), bytesOf("old a"));
+        EXPECT_EQ(readFile(directory.file("out/b.txt")), bytesOf("new b"));
 
-    ToolRun second = runTool("extract --overwrite " + arguments);
-    EXPECT_EQ(second.status, 0) << second.err;
-    EXPECT_EQ(readFile(directory.file("out/a.txt")), bytesOf("new a"));
+        ToolRun second = runTool("extract --overwrite " + arguments);
+        EXPECT_EQ(readFile(directory.file("out/a.txt")), bytesOf("new a"));
+        const std::string prefix = "gwarchive: " + directory.file(name) + ": ";
+        if (std::string(name) == "t.zip") {
+            EXPECT_TRUE(isErrorLine(first.err, directory.file(name) + ": a.txt")) << first.err;
+            EXPECT_EQ(second.status, 0) << second.err;
+            continue;
+        }
+        // Each run names the failing entry itself and extracts its sibling.
+        EXPECT_EQ(first.err.rfind(prefix + "a.txt: ", 0), 0u) << first.err;
+        EXPECT_NE(first.err.find("\n" + prefix + "d/c.txt: "), std::string::npos) << first.err;
+        EXPECT_EQ(second.status, 1);
+        EXPECT_TRUE(isErrorLine(second.err, directory.file(name) + ": d/c.txt")) << second.err;
+        EXPECT_EQ(readFile(directory.file("out/d/e.txt")), bytesOf("e"));
+        EXPECT_FALSE(fs::exists(directory.file("out/d/c.txt")));
+    }
 }
 
 TEST(GWArchiveTool, SevenZipAndBsdtarZipArchivesListAsZipinfoSays) {

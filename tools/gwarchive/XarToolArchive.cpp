@@ -6,6 +6,7 @@
 #include "FormatAdapters.h"
 #include "JsonWriter.h"
 #include "foundation/GWContainment.h"
+#include "foundation/GWFileSystem.h"
 
 namespace gwarchive {
 
@@ -169,6 +170,8 @@ public:
         for (std::size_t index : indexes)
             selected[index] = true;
         bool allGood = true;
+        std::error_code ignored;  // a folder that cannot be made fails each entry below
+        std::filesystem::create_directories(options.directory.path(), ignored);
         for (std::size_t index : indexes) {
             std::optional<std::size_t> parent = parents_[index];
             if ((parent && selected[*parent]) || superseded_[index])
@@ -178,9 +181,18 @@ public:
                 allGood = false;
                 continue;
             }
-            std::error_code ignored;
-            std::filesystem::create_directories(url.URLByDeletingLastPathComponent().path(),
-                                                ignored);
+            // The folders on the way are made by a walk no link can redirect.
+            const std::string& path = records_[index].path;
+            const std::size_t slash = path.rfind('/');
+            GWErrorPtr failure;
+            if (!GWOpenDirectoryBelow(options.directory.path(),
+                                      slash == std::string::npos ? "" : path.substr(0, slash), true,
+                                      &failure)
+                     .isValid()) {
+                reportError(archiveName, path, failure);
+                allGood = false;
+                continue;
+            }
             allGood &= extractItem(index, url, options, archiveName);
         }
         return allGood;
@@ -334,22 +346,27 @@ private:
             reportError(archiveName, record.path, GWPOSIXError(EEXIST, url));
             return false;
         }
-        auto operation = GWXARExtractOperation::initWithFile(files_[index], url, archive_);
-        operation->setReplacesExistingItem(options.overwrite);
-        operation->start();
+        // Entries that fail are left out of the tree; each is reported under
+        // its own path, and the rest stays extracted.
+        bool reported = false;
+        GWExtractOptions extractOptions;
+        extractOptions.replaceExisting = options.overwrite;
+        extractOptions.entryFailed = [&](const std::string& path, const GWErrorPtr& failure) {
+            reportError(archiveName, path, failure);
+            reported = true;
+        };
+        bool checksumIsInvalid = false;
+        GWErrorPtr failure;
+        const bool extracted =
+            archive_->extractFile(files_[index], url, &checksumIsInvalid, &failure, extractOptions);
         if (options.progress)
             options.progress(subtreeBytes(index));
-        // Entries that failed were left out of the tree; each is reported
-        // where it belongs, and the rest stays extracted.
-        const auto failures = operation->entryFailures();
-        for (const auto& failure : failures)
-            reportError(archiveName, failure.file->path(), failure.error);
-        if (GWErrorPtr failure = operation->error()) {
-            if (failures.empty())
+        if (!extracted) {
+            if (!reported)
                 reportError(archiveName, record.path, failure);
             return false;
         }
-        if (operation->checksumIsInvalid()) {
+        if (checksumIsInvalid) {
             reportFailure(archiveName, record.path,
                           "extracted, but a stored checksum did not match or metadata could not "
                           "be applied");
