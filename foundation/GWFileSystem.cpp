@@ -220,7 +220,11 @@ void GWRemoveLiveReplacementFolders() {
     auto& folders = liveFolders();
     std::lock_guard lock(folders.mutex);
     for (const auto& path : folders.paths) {
-        GWRemoveItemRecursively(path, nullptr);
+        // Renamed first, so that threads still extracting into it by name
+        // cannot add to it while it is being removed.
+        const std::string doomed = path + "-removed";
+        GWRemoveItemRecursively(::rename(path.c_str(), doomed.c_str()) == 0 ? doomed : path,
+                                nullptr);
     }
     folders.paths.clear();
 }
@@ -235,6 +239,8 @@ void GWRemoveReplacementFoldersOnSignals() {
     if (::pthread_sigmask(SIG_BLOCK, &signals, nullptr) != 0) {
         return;
     }
+    // Also whatever an object kept until exit still owns.
+    std::atexit(GWRemoveLiveReplacementFolders);
     std::thread([signals] {
         int number = 0;
         while (::sigwait(&signals, &number) != 0) {

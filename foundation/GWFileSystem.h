@@ -39,7 +39,7 @@ private:
 // Removes the replacement folders of this process that are still there.
 void GWRemoveLiveReplacementFolders();
 // From now on SIGINT, SIGTERM and SIGHUP remove the live replacement folders
-// before the process dies of the signal. Called before any other thread
+// before the process dies of the signal, and so does exit(). Called before any other thread
 // exists, since the signals are taken by a thread of their own.
 void GWRemoveReplacementFoldersOnSignals();
 

@@ -92,6 +92,8 @@ void GWZipExtractOperation::setError(GWErrorPtr error) {
 }
 
 void GWZipExtractOperation::markDone() {
+    // The operation's own folder goes with it; a batch keeps its own.
+    replacementFolder_.reset();
     done_.store(true);
     finish();
 }
@@ -177,8 +179,6 @@ void GWZipExtractOperation::unpackWithHandler(ChunkHandler handler, Completion c
                            GWRemoveItemAtURL(*target, nullptr);
                        }
                    }
-                   // The operation's own folder goes with it; a batch keeps its own.
-                   replacementFolder_.reset();
                    finalStep(stepError);
                });
 }

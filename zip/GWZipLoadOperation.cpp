@@ -143,9 +143,19 @@ void GWZipLoadOperation::main() {
         return;
     }
     if (found == kNotFound) {
-        // An archive without a single local header (an empty one too) is
-        // refused on purpose.
-        setError(corruptError("No local file header found in %s", url_.path().c_str()));
+        // Without a local header only an end record that counts no entries
+        // makes an archive: an empty one.
+        GWZipEndOfCentralDirectoryRecord end;
+        GWErrorPtr endError;
+        if (getEnd(&end, *file, &endError) && end.totalEntries == 0) {
+            setStartOffset(0);
+            setFiles(GWZipFileArray());
+        } else {
+            setError(
+                corruptError("%s is not a ZIP archive: it has neither a local file header "
+                             "nor an end record",
+                             url_.path().c_str()));
+        }
         file->closeFileAndReturnError(nullptr);
         return;
     }

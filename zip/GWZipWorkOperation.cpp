@@ -104,6 +104,7 @@ std::optional<GWDictionary> GWZipWorkOperation::infoFromExtraFieldBlock(
         case 0x7875: return infoFromInfoZipUnix3GExtraField(block, length, isLocalHeader, error);
         case 0xA220: return infoFromMSOpenPackagingGrowthHintField(block, length, error);
         case 0xCAFE: return GWDictionary();  // marks a Java archive; nothing to decode
+        case 0xD935: return GWDictionary();  // Android's alignment padding
         default: *known = false; return std::nullopt;
     }
 }
@@ -124,10 +125,11 @@ std::optional<GWDictionary> GWZipWorkOperation::infoFromExtraFieldData(
         GWErrorPtr blockError;
         auto decoded = infoFromExtraFieldBlock(headerID, block, isLocalHeader, &known, &blockError);
         if (!known) {
+            // Android alignment, NT security descriptors, encryption headers
+            // and whatever comes next: an archive is no worse for a block
+            // this reader has no use for.
             GWLog("unknown extra info signature: 0x%x", unsigned(headerID));
-            blockError =
-                GWZipUnknownEntityError(GWZipArchiveUnknownExtraFieldError, headerID,
-                                        "unknown extra field header ID 0x%04x", unsigned(headerID));
+            continue;
         }
         if (decoded) {
             for (auto& [key, value] : *decoded) {

@@ -18,6 +18,11 @@ ContainmentSandbox::ContainmentSandbox() {
 std::map<std::string, std::string> ContainmentSandbox::outside() const {
     std::map<std::string, std::string> items;
     const std::filesystem::path root(parent());
+    // The parent itself too: a link to ".." is the way to reach it.
+    struct stat self {};
+    ::lstat(parent().c_str(), &self);
+    items["."] = std::to_string(self.st_mode) + " " + std::to_string(self.st_mtim.tv_sec) + "." +
+                 std::to_string(self.st_mtim.tv_nsec);
     auto it = std::filesystem::recursive_directory_iterator(root);
     for (; it != std::filesystem::recursive_directory_iterator(); ++it) {
         const std::string relative = it->path().lexically_relative(root).string();

@@ -18,7 +18,7 @@ public:
     GWURL outURL() const { return parent_.url("out"); }
     std::string canary() const { return parent_.file("canary"); }
 
-    // Every item of the parent folder outside "out" as "type size hash
+    // The parent folder and every item in it outside "out" as "type size hash
     // mtime" (a link's target instead of its contents), by relative path.
     std::map<std::string, std::string> outside() const;
 

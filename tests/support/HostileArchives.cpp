@@ -67,6 +67,14 @@ const std::vector<HostileArchive>& hostileZipArchives() {
              });
          },
          ""},
+        {"DirectoryThenLinkInItsPlace",
+         [](const std::string&) {
+             return zipOf([](ZipBuilder& zip) {
+                 zip.addDirectory("d/").externalAttributes = 040700u << 16;
+                 zip.addSymlink("d", "..");
+             });
+         },
+         ""},
         {"LinkToParentThenFile",
          [](const std::string&) {
              return zipOf([](ZipBuilder& zip) {

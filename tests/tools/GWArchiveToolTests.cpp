@@ -1,6 +1,11 @@
+#include <fcntl.h>
 #include <gtest/gtest.h>
+#include <limits.h>
+#include <signal.h>
 #include <sys/stat.h>
+#include <sys/wait.h>
 #include <sys/xattr.h>
+#include <unistd.h>
 
 #include <filesystem>
 #include <regex>
@@ -8,6 +13,7 @@
 #include "ToolTestSupport.h"
 #include "support/AppleDoubleBuilder.h"
 #include "support/MacBinaryBuilder.h"
+#include "support/StreamingZipWriter.h"
 #include "support/XarBuilder.h"
 #include "support/ZipBuilder.h"
 
@@ -143,6 +149,14 @@ TEST(GWArchiveTool, InfoZipArchiveListsExtractsAndCatsAsUnzipDoes) {
     ASSERT_EQ(extract.status, 0) << extract.err;
     EXPECT_TRUE(extract.err.empty()) << "no terminal, so no progress bar: " << extract.err;
     EXPECT_EQ(describeTree(directory.file("by-tool")), describeTree(directory.file("by-unzip")));
+    // Standard input, from a pipe (spooled) and from a file (read in place).
+    ASSERT_EQ(runCommand("cat " + shellQuote(archive) + " | " GW_TOOL_PATH " extract -C " +
+                         shellQuote(directory.file("by-pipe")) + " -")
+                  .status,
+              0);
+    EXPECT_EQ(describeTree(directory.file("by-pipe")), describeTree(directory.file("by-unzip")));
+    EXPECT_EQ(runTool("list - < " + shellQuote(archive)).out,
+              runTool("list " + shellQuote(archive)).out);
 
     ToolRun cat = runTool("cat " + shellQuote(archive) + " docs/deep/er/data.bin");
     ASSERT_EQ(cat.status, 0) << cat.err;
@@ -154,11 +168,45 @@ TEST(GWArchiveTool, InfoZipArchiveListsExtractsAndCatsAsUnzipDoes) {
     EXPECT_TRUE(isErrorLine(missing.err, archive + ": docs/nothing"));
 }
 
-TEST(GWArchiveTool, ExtractRefusesExistingItemsButGoesOnAndOverwriteReplaces) {
+// Hidden build folders anywhere below `root`.
+static std::vector<std::string> leftovers(const std::string& root) {
+    std::vector<std::string> found;
+    for (const auto& item : fs::recursive_directory_iterator(root))
+        if (item.path().filename().string().rfind(".gwarchive", 0) == 0)
+            found.push_back(item.path().string());
+    return found;
+}
+
+TEST(GWArchiveTool, ReExtractingMergesRefusesOrReplacesAndLeavesNothingBehind) {
     ZipBuilder zip;
-    zip.addFile("a.txt", bytesOf("new a"), 8);
+    zip.addDirectory("d/");
+    zip.addFile("d/a.txt", bytesOf("new a"), 8);
     zip.addFile("b.txt", bytesOf("new b"), 8);
-    // The XAR one also has a folder with an entry that cannot be read.
+    TemporaryDirectory directory;
+    ScopedEnvironment temporary("TMPDIR", directory.file("tmp"));
+    fs::create_directories(directory.file("tmp"));
+    writeFile(directory.file("t.zip"), zip.bytes());
+    fs::create_directories(directory.file("out/d"));
+    writeFile(directory.file("out/d/a.txt"), bytesOf("old a"));
+    writeFile(directory.file("out/d/mine"), bytesOf("the user's"));
+
+    std::string arguments =
+        "-C " + shellQuote(directory.file("out")) + " " + shellQuote(directory.file("t.zip"));
+    ToolRun first = runTool("extract " + arguments);
+    EXPECT_EQ(first.status, 1);
+    EXPECT_TRUE(isErrorLine(first.err, directory.file("t.zip") + ": d/a.txt"));
+    EXPECT_EQ(readFile(directory.file("out/d/a.txt")), bytesOf("old a"));
+    EXPECT_EQ(readFile(directory.file("out/b.txt")), bytesOf("new b"));
+
+    ToolRun second = runTool("extract --overwrite " + arguments);
+    EXPECT_EQ(second.status, 0) << second.err;
+    EXPECT_EQ(readFile(directory.file("out/d/a.txt")), bytesOf("new a"));
+    EXPECT_EQ(readFile(directory.file("out/d/mine")), bytesOf("the user's"));
+    EXPECT_TRUE(fs::is_empty(directory.file("tmp")));
+    EXPECT_EQ(leftovers(directory.file("out")), std::vector<std::string>{});
+}
+
+TEST(GWArchiveTool, XarExtractNamesEachFailedEntryAndExtractsTheRest) {
     XarBuilder xar;
     std::string unreadable = xar.dataElement("data", bytesOf("c"), XarEncoding::gzip);
     unreadable.replace(unreadable.find("x-gzip"), 6, "x-lzma");
@@ -169,37 +217,109 @@ TEST(GWArchiveTool, ExtractRefusesExistingItemsButGoesOnAndOverwriteReplaces) {
     xar.setFiles(
         file(1, "a.txt", xar.dataElement("data", bytesOf("new a"), XarEncoding::gzip)) +
         "<file id=\"2\"><name>d</name><type>directory</type>" + file(3, "c.txt", unreadable) +
-        file(4, "e.txt", xar.dataElement("data", bytesOf("e"), XarEncoding::none)) + "</file>" +
-        file(5, "b.txt", xar.dataElement("data", bytesOf("new b"), XarEncoding::none)));
-    for (const auto& [name, bytes] : {std::pair{"t.zip", zip.bytes()}, {"t.xar", xar.bytes()}}) {
-        TemporaryDirectory directory;
-        writeFile(directory.file(name), bytes);
-        fs::create_directories(directory.file("out"));
-        writeFile(directory.file("out/a.txt"), bytesOf("old a"));
+        file(4, "e.txt", xar.dataElement("data", bytesOf("e"), XarEncoding::none)) + "</file>");
+    TemporaryDirectory directory;
+    writeFile(directory.file("t.xar"), xar.bytes());
+    fs::create_directories(directory.file("out/d"));
+    writeFile(directory.file("out/a.txt"), bytesOf("old a"));
+    writeFile(directory.file("out/d/mine"), bytesOf("the user's"));
 
-        std::string arguments =
-            "-C " + shellQuote(directory.file("out")) + " " + shellQuote(directory.file(name));
-        ToolRun first = runTool("extract " + arguments);
-        EXPECT_EQ(first.status, 1);
-        EXPECT_EQ(readFile(directory.file("out/a.txt")), bytesOf("old a"));
-        EXPECT_EQ(readFile(directory.file("out/b.txt")), bytesOf("new b"));
+    const std::string arguments =
+        "-C " + shellQuote(directory.file("out")) + " " + shellQuote(directory.file("t.xar"));
+    const std::string prefix = "gwarchive: " + directory.file("t.xar") + ": ";
+    ToolRun first = runTool("extract " + arguments);
+    EXPECT_EQ(first.status, 1);
+    EXPECT_EQ(first.err.rfind(prefix + "a.txt: ", 0), 0u) << first.err;
+    EXPECT_NE(first.err.find("\n" + prefix + "d/c.txt: "), std::string::npos) << first.err;
+    EXPECT_EQ(readFile(directory.file("out/a.txt")), bytesOf("old a"));
 
-        ToolRun second = runTool("extract --overwrite " + arguments);
-        EXPECT_EQ(readFile(directory.file("out/a.txt")), bytesOf("new a"));
-        const std::string prefix = "gwarchive: " + directory.file(name) + ": ";
-        if (std::string(name) == "t.zip") {
-            EXPECT_TRUE(isErrorLine(first.err, directory.file(name) + ": a.txt")) << first.err;
-            EXPECT_EQ(second.status, 0) << second.err;
-            continue;
-        }
-        // Each run names the failing entry itself and extracts its sibling.
-        EXPECT_EQ(first.err.rfind(prefix + "a.txt: ", 0), 0u) << first.err;
-        EXPECT_NE(first.err.find("\n" + prefix + "d/c.txt: "), std::string::npos) << first.err;
-        EXPECT_EQ(second.status, 1);
-        EXPECT_TRUE(isErrorLine(second.err, directory.file(name) + ": d/c.txt")) << second.err;
-        EXPECT_EQ(readFile(directory.file("out/d/e.txt")), bytesOf("e"));
-        EXPECT_FALSE(fs::exists(directory.file("out/d/c.txt")));
+    ToolRun second = runTool("extract --overwrite " + arguments);
+    EXPECT_EQ(second.status, 1);
+    EXPECT_TRUE(isErrorLine(second.err, directory.file("t.xar") + ": d/c.txt")) << second.err;
+    EXPECT_EQ(readFile(directory.file("out/a.txt")), bytesOf("new a"));
+    EXPECT_EQ(readFile(directory.file("out/d/e.txt")), bytesOf("e"));
+    EXPECT_EQ(readFile(directory.file("out/d/mine")), bytesOf("the user's"));
+    EXPECT_FALSE(fs::exists(directory.file("out/d/c.txt")));
+}
+
+// Runs the tool as `nobody` in a child process that may live 5 s at most.
+static int runToolUnprivileged(const std::vector<std::string>& arguments) {
+    const pid_t child = fork();
+    if (child == 0) {
+        alarm(5);
+        if (setgid(65534) != 0 || setuid(65534) != 0)
+            _exit(97);
+        std::vector<char*> argv{const_cast<char*>(GW_TOOL_PATH)};
+        for (const auto& word : arguments)
+            argv.push_back(const_cast<char*>(word.c_str()));
+        argv.push_back(nullptr);
+        const int null = open("/dev/null", O_WRONLY);
+        dup2(null, STDERR_FILENO);
+        execv(GW_TOOL_PATH, argv.data());
+        _exit(98);
     }
+    int status = 0;
+    waitpid(child, &status, 0);
+    return WIFEXITED(status) ? WEXITSTATUS(status) : 128 + WTERMSIG(status);
+}
+
+TEST(GWArchiveTool, ExtractingWhereTheUserMayNotWriteEndsWithAnError) {
+    if (geteuid() != 0)
+        GTEST_SKIP() << "needs root to become another user";
+    TemporaryDirectory directory;
+    chmod(directory.path().c_str(), 0755);
+    ZipBuilder zip;
+    zip.addDirectory("d/");
+    zip.addFile("d/a.txt", bytesOf("a"), 8);
+    zip.addFile("b.txt", bytesOf("b"));
+    writeFile(directory.file("t.zip"), zip.bytes());
+    XarBuilder xar;
+    xar.setFiles(
+        "<file id=\"1\"><name>d</name><type>directory</type><file id=\"2\"><name>a</name>"
+        "<type>file</type>" +
+        xar.dataElement("data", bytesOf("a"), XarEncoding::gzip) + "</file></file>");
+    writeFile(directory.file("t.xar"), xar.bytes());
+    fs::create_directories(directory.file("closed"));
+    fs::create_directories(directory.file("open"));
+    chmod(directory.file("open").c_str(), 0777);
+    std::string tooLong = directory.file("open");
+    while (tooLong.size() <= PATH_MAX)
+        tooLong += "/" + std::string(200, 'x');
+    for (const char* archive : {"t.zip", "t.xar"}) {
+        for (const std::string& destination : {directory.file("closed"), tooLong}) {
+            const int status = runToolUnprivileged(
+                {"extract", "--no-progress", "-C", destination, directory.file(archive)});
+            EXPECT_EQ(status, 1) << archive << " into " << destination.substr(0, 80);
+        }
+    }
+}
+
+TEST(GWArchiveTool, AnInterruptedExtractionLeavesNoBuildFolders) {
+    TemporaryDirectory directory;
+    const GWData block = randomBytes(20 * 1024, 7);
+    StreamingZipWriter writer(directory.file("big.zip"));
+    for (int i = 0; i < 15000; ++i)
+        writer.add("dir" + std::to_string(i % 50) + "/file" + std::to_string(i), block);
+    ASSERT_TRUE(writer.finish());
+    fs::create_directories(directory.file("tmp"));
+    fs::create_directories(directory.file("out"));
+    const pid_t child = fork();
+    if (child == 0) {
+        setenv("TMPDIR", directory.file("tmp").c_str(), 1);
+        const int null = open("/dev/null", O_WRONLY);
+        dup2(null, STDERR_FILENO);
+        execl(GW_TOOL_PATH, GW_TOOL_PATH, "extract", "--no-progress", "-C",
+              directory.file("out").c_str(), directory.file("big.zip").c_str(), nullptr);
+        _exit(98);
+    }
+    usleep(300000);
+    kill(child, SIGINT);
+    int status = 0;
+    waitpid(child, &status, 0);
+    ASSERT_TRUE(WIFSIGNALED(status)) << "the extraction ended before it was interrupted";
+    EXPECT_EQ(WTERMSIG(status), SIGINT);
+    EXPECT_TRUE(fs::is_empty(directory.file("tmp")));
+    EXPECT_EQ(leftovers(directory.file("out")), std::vector<std::string>{});
 }
 
 TEST(GWArchiveTool, SevenZipAndBsdtarZipArchivesListAsZipinfoSays) {

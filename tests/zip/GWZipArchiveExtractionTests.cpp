@@ -101,11 +101,14 @@ TEST_F(GWZipArchiveExtraction, DirectoryOperationsComeFirstAndAreDependedOn) {
     EXPECT_TRUE(dependsOn(ops[3], ops[0]));
 }
 
-TEST_F(GWZipArchiveExtraction, AnEmptyListCompletesWithoutError) {
+TEST_F(GWZipArchiveExtraction, AnEmptyListCompletesAndAnUnbuildableOneFails) {
     ZipBuilder zip;
     zip.addFile("a", bytesOf("x"));
     auto archive = open(zip);
     EXPECT_TRUE(archive->extractFiles({}, directory.url("out"), true, nullptr, &error));
+    // Once a wait for ever: the batch's operations cannot be built.
+    EXPECT_FALSE(archive->extractFiles({nullptr}, directory.url("out"), true, nullptr, &error));
+    EXPECT_TRUE(error);
 
     GWSemaphore done(0);
     GWErrorPtr reported = GWCocoaError(GWFileReadUnknownError);
@@ -141,10 +144,12 @@ TEST_F(GWZipArchiveExtraction, AProgressHandlerAnsweringFalseCancelsTheBatch) {
     }
 }
 
-TEST_F(GWZipArchiveExtraction, TheFirstErrorIsTheBatchsResult) {
+TEST_F(GWZipArchiveExtraction, TheFirstErrorIsTheBatchsResultAndTheRestMayGoOn) {
     ZipBuilder zip;
-    zip.addFile("good", bytesOf("fine"));
     zip.addFile("bad", bytesOf("data"), 9);
+    for (int i = 0; i < 20; ++i) {
+        zip.addFile("good" + std::to_string(i), textBytes(30000, i), 8);
+    }
     auto archive = open(zip);
     auto queue = std::make_shared<GWOperationQueue>();
     GWSemaphore done(0);
@@ -157,6 +162,20 @@ TEST_F(GWZipArchiveExtraction, TheFirstErrorIsTheBatchsResult) {
     done.wait();
     ASSERT_TRUE(reported);
     EXPECT_TRUE(reported->is(kGWZipArchiveErrorDomain, 1));
+
+    std::vector<std::string> failed;
+    GWExtractOptions options;
+    options.continueAfterFailure = true;
+    options.entryFailed = [&](const std::string& path, const GWErrorPtr&) {
+        failed.push_back(path);
+    };
+    EXPECT_FALSE(archive->extractFiles(archive->files(), directory.url("again"), true, nullptr,
+                                       &error, options));
+    EXPECT_TRUE(error->is(kGWZipArchiveErrorDomain, 1));
+    EXPECT_EQ(failed, std::vector<std::string>{"bad"});
+    for (int i = 0; i < 20; ++i) {
+        EXPECT_EQ(readFile(directory.file("again/good" + std::to_string(i))), textBytes(30000, i));
+    }
 }
 
 TEST_F(GWZipArchiveExtraction, ABatchThatCannotFitIsRefusedBeforeAnythingIsWritten) {

@@ -78,11 +78,6 @@ TEST_P(GWZipArchiveHostile, FailsQuicklyWithItsError) {
 
 const HostileCase kHostileCases[] = {
     {"Empty", [] { return GWData(); }},
-    {"NoLocalHeaderOnlyAnEndRecord",
-     [] {
-         ZipBuilder zip;
-         return zip.bytes();
-     }},
     {"ShorterThanAnEndRecord", [] { return GWData{'P', 'K', 3, 4, 0, 0, 0}; }},
     {"EndRecordMissing",
      [] {
@@ -237,6 +232,24 @@ const HostileCase kHostileCases[] = {
 
 INSTANTIATE_TEST_SUITE_P(Mutations, GWZipArchiveHostile, ::testing::ValuesIn(kHostileCases),
                          [](const auto& info) { return std::string(info.param.name); });
+
+TEST(GWZipArchiveEmpty, AnEndRecordAloneIsAnEmptyArchiveAndNothingAtAllIsNoArchive) {
+    TemporaryDirectory directory;
+    for (const char* comment : {"", "made by nobody"}) {
+        ZipBuilder zip;
+        zip.archiveComment = bytesOf(comment);
+        writeFile(directory.file("empty.zip"), zip.bytes());
+        GWErrorPtr error;
+        auto archive = GWZipArchive::initWithURL(directory.url("empty.zip"), &error);
+        ASSERT_TRUE(archive) << error->localizedDescription();
+        EXPECT_TRUE(archive->files().empty());
+    }
+    writeFile(directory.file("text.zip"), bytesOf("just some text, long enough to be searched"));
+    GWErrorPtr error;
+    EXPECT_FALSE(GWZipArchive::initWithURL(directory.url("text.zip"), &error));
+    ASSERT_TRUE(error);
+    EXPECT_NE(error->localizedDescription().find("is not a ZIP archive"), std::string::npos);
+}
 
 TEST(GWZipArchiveTruncation, EveryCutOfAnArchiveIsCorrupt) {
     const GWData whole = sampleArchive();

@@ -2,8 +2,11 @@
 // atomic and in-place writing, handlers, cancellation and local headers.
 
 #include <gtest/gtest.h>
+
 #include <sys/stat.h>
 #include <unistd.h>
+#include <filesystem>
+#include <optional>
 
 #include <cerrno>
 #include <functional>
@@ -271,18 +274,6 @@ TEST_F(GWZipExtractOperationTest, SymbolicLinksTakeTheirTargetFromTheData) {
 
 // --- Atomic and in-place writing -------------------------------------------------
 
-TEST_F(GWZipExtractOperationTest, AtomicExtractionDoesNotReplaceAnExistingItem) {
-    ZipBuilder zip;
-    zip.addFile("a.txt", bytesOf("new"));
-    write(zip);
-    writeFile(directory.file("a.txt"), bytesOf("old"));
-    auto operation = toDisk(zipEntryFromBuilder(zip, 0), "a.txt", true);
-    runToEnd(operation);
-    ASSERT_TRUE(operation->error());
-    EXPECT_TRUE(operation->error()->is(kGWPOSIXErrorDomain, EEXIST));
-    EXPECT_EQ(readFile(directory.file("a.txt")), bytesOf("old"));
-}
-
 TEST_F(GWZipExtractOperationTest, AtomicExtractionShowsNothingUntilTheDataIsComplete) {
     ZipBuilder zip;
     zip.addFile("a.txt", textBytes(200000, 4), 8);
@@ -299,16 +290,52 @@ TEST_F(GWZipExtractOperationTest, AtomicExtractionShowsNothingUntilTheDataIsComp
     EXPECT_EQ(readFile(destination), textBytes(200000, 4));
 }
 
-TEST_F(GWZipExtractOperationTest, InPlaceExtractionReplacesAnExistingItem) {
+TEST_F(GWZipExtractOperationTest, WhatIsAlreadyThereIsMergedReplacedOrKept) {
+    const struct {
+        const char* name;
+        bool directoryEntry;
+        bool atomically;
+        std::optional<bool> replace;
+        bool existingIsDirectory;
+        int expectedError;  // 0: extracted
+    } cases[] = {
+        {"atomic file keeps a file", false, true, std::nullopt, false, EEXIST},
+        {"atomic file replaces when asked", false, true, true, false, 0},
+        {"atomic file replaces a directory when asked", false, true, true, true, 0},
+        {"in-place file replaces", false, false, std::nullopt, true, 0},
+        {"in-place file keeps when told", false, false, false, false, EEXIST},
+        {"directory merges in place", true, false, std::nullopt, true, 0},
+        {"directory merges atomically", true, true, true, true, 0},
+    };
     ZipBuilder zip;
-    zip.addFile("a.txt", bytesOf("new"));
+    zip.addFile("a", bytesOf("new"));
+    zip.addDirectory("a/");
     write(zip);
-    ::mkdir(directory.file("a.txt").c_str(), 0755);
-    writeFile(directory.file("a.txt/inside"), bytesOf("old"));
-    auto operation = toDisk(zipEntryFromBuilder(zip, 0), "a.txt", false);
-    runToEnd(operation);
-    ASSERT_FALSE(operation->error());
-    EXPECT_EQ(readFile(directory.file("a.txt")), bytesOf("new"));
+    for (const auto& row : cases) {
+        std::filesystem::remove_all(directory.file("a"));
+        if (row.existingIsDirectory) {
+            ::mkdir(directory.file("a").c_str(), 0755);
+            writeFile(directory.file("a/mine"), bytesOf("old"));
+        } else {
+            writeFile(directory.file("a"), bytesOf("old"));
+        }
+        auto operation =
+            toDisk(zipEntryFromBuilder(zip, row.directoryEntry ? 1 : 0), "a", row.atomically);
+        operation->setReplacesExistingItems(row.replace);
+        runToEnd(operation);
+        const std::string kept = row.existingIsDirectory ? "a/mine" : "a";
+        if (row.expectedError != 0) {
+            ASSERT_TRUE(operation->error()) << row.name;
+            EXPECT_TRUE(operation->error()->is(kGWPOSIXErrorDomain, row.expectedError)) << row.name;
+            EXPECT_EQ(readFile(directory.file(kept)), bytesOf("old")) << row.name;
+        } else if (row.directoryEntry) {
+            ASSERT_FALSE(operation->error()) << row.name;
+            EXPECT_EQ(readFile(directory.file(kept)), bytesOf("old")) << row.name;
+        } else {
+            ASSERT_FALSE(operation->error()) << row.name;
+            EXPECT_EQ(readFile(directory.file("a")), bytesOf("new")) << row.name;
+        }
+    }
 }
 
 TEST_F(GWZipExtractOperationTest, ModeAndModificationDateAreApplied) {

@@ -8,7 +8,8 @@ namespace gwarchive {
 
 // A path operand as a file URL, made absolute against the working directory.
 GWURL localURL(const std::string& path);
-// An archive operand: an http, https or file URL as written, anything else a path.
+// An archive operand: an http, https or file URL as written, "-" standard
+// input, anything else a path.
 GWURL archiveURL(const std::string& operand);
 
 }  // namespace gwarchive

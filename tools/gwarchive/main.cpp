@@ -34,8 +34,6 @@ void printToolHelp(std::FILE* stream) {
         "\n"
         "commands:\n",
         stream);
-    // An interrupted extraction leaves none of its half-built items behind.
-    GWRemoveReplacementFoldersOnSignals();
     for (const Command* command : kCommands) {
         std::fprintf(stream, "  %-12s %s\n", command->name, command->summary);
     }
@@ -101,6 +99,9 @@ void adviseHugePageHeap() {
 }  // namespace
 
 int main(int argc, char** argv) {
+    // First, before any thread exists: an interrupted extraction leaves none
+    // of its half-built items behind.
+    GWRemoveReplacementFoldersOnSignals();
     adviseHugePageHeap();
     if (argc < 2) {
         printToolHelp(stderr);
