@@ -172,7 +172,8 @@ public:
                               const GWOperationQueuePtr& queue, const GWXARDataHandler& handler);
     // The same for one extraction: it stops when `isCancelled` says so, and a
     // refusal or a damaged stream ends this stream alone, leaving the
-    // archive's cancellation and every other stream alone.
+    // archive's cancellation and every other stream alone. A reference given
+    // is read as the file's own, whatever kind of item the file is.
     void extractDataReference(const GWXARDataReferencePtr& reference, const GWXARFilePtr& file,
                               const GWXARDataHandler& handler, std::function<bool()> isCancelled);
     // The single place a data handler is called: a refusal cancels the
@@ -195,8 +196,11 @@ public:
                      const GWExtractOptions& options = {});
 
 private:
+    // Without `resolveItem` the stream is read as `file`'s own, as the
+    // attributes of a folder or a link must be when they are extracted.
     void streamDataReference(const GWXARDataReferencePtr& reference, const GWXARFilePtr& file,
-                             const GWXARDataHandler& handler, GWXARStreamContext context);
+                             const GWXARDataHandler& handler, GWXARStreamContext context,
+                             bool resolveItem);
     // Copies a finished load's results in.
     void takeResultsOfLoad(const GWXARLoadOperation& operation);
 

@@ -59,7 +59,8 @@ void GWXARArchive::extractDataReference(const GWXARDataReferencePtr& reference,
     const auto self = shared_from_this();
     streamDataReference(reference, file, handler,
                         {URL(), [self] { return self->isCancelled(); },
-                         [self](bool cancelled) { self->setIsCancelled(cancelled); }, nullptr});
+                         [self](bool cancelled) { self->setIsCancelled(cancelled); }, nullptr},
+                        true);
 }
 
 void GWXARArchive::extractDataReference(const GWXARDataReferencePtr& reference,
@@ -70,12 +71,13 @@ void GWXARArchive::extractDataReference(const GWXARDataReferencePtr& reference,
         reference, file, handler,
         {URL(),
          [stopped, isCancelled] { return stopped->load() || (isCancelled && isCancelled()); },
-         [stopped](bool cancelled) { stopped->store(cancelled); }, nullptr});
+         [stopped](bool cancelled) { stopped->store(cancelled); }, nullptr},
+        !reference);
 }
 
 void GWXARArchive::streamDataReference(const GWXARDataReferencePtr& reference,
                                        const GWXARFilePtr& file, const GWXARDataHandler& handler,
-                                       GWXARStreamContext context) {
+                                       GWXARStreamContext context, bool resolveItem) {
     const auto self = shared_from_this();
     const GWURL url = URL();
     auto report = [&](std::optional<std::span<const std::uint8_t>> data, const GWErrorPtr& error) {
@@ -87,10 +89,8 @@ void GWXARArchive::streamDataReference(const GWXARDataReferencePtr& reference,
     }
     // Follow hard links to the item that holds the data. Each step is a
     // weak link to another entry; a cycle is a corrupt tree, not a hang.
-    // A stream named outright (an attribute of a directory or a link, say)
-    // is the item's own.
     GWXARFilePtr item = file;
-    for (std::size_t hops = 0; !reference; ++hops) {
+    for (std::size_t hops = 0; resolveItem; ++hops) {
         const auto type = item->type();
         if (type == GWXARFileTypeRegular) {
             break;
