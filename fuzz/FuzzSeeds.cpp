@@ -13,6 +13,7 @@
 #include "support/MacBinaryBuilder.h"
 #include "support/TestSupport.h"
 #include "support/XarBuilder.h"
+#include "support/XarSigning.h"
 #include "support/ZipBuilder.h"
 #include "support/ZipExtraFields.h"
 #include "support/ZipLegacyEncoders.h"
@@ -207,6 +208,19 @@ Seeds xarSeeds() {
                     "<archived-checksum style=\"sha1\">" +
                     range + "<size>20</size></archived-checksum></data></file>");
     seeds.push_back(shared.bytes());
+    // Real chains and CMS signers, one message without any, for the checks to chew on.
+    XarSigning signing;
+    XarBuilder signedXar;
+    signedXar.setFiles(xarFiles(signedXar));
+    XarSigning::Request noSigners("CMS", signing.leaf(XarKeyType::ecdsa), true);
+    noSigners.withoutSigners = true;
+    if (signing.signArchive(signedXar, {{"RSA", signing.leaf(XarKeyType::rsa)},
+                                        {"CMS", signing.leaf(XarKeyType::ecdsa)},
+                                        noSigners})) {
+        seeds.push_back(signedXar.bytes());
+    } else {
+        std::fprintf(stderr, "no signed XAR seed: %s\n", signing.problem().c_str());
+    }
     return seeds;
 }
 

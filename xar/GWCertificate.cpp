@@ -28,8 +28,8 @@ GWCertificate::~GWCertificate() {
     X509_free(certificate_);
 }
 
-std::optional<std::string> GWCertificate::commonName() const {
-    const X509_NAME* subject = X509_get_subject_name(certificate_);
+std::optional<std::string> GWCertificate::commonNameOf(const X509* certificate) {
+    const X509_NAME* subject = certificate ? X509_get_subject_name(certificate) : nullptr;
     if (!subject) {
         return std::nullopt;
     }

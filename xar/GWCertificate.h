@@ -28,7 +28,8 @@ public:
     // The DER encoding, as it was given.
     const GWData& data() const { return der_; }
     // The last common name of the subject; none when it has none.
-    std::optional<std::string> commonName() const;
+    std::optional<std::string> commonName() const { return commonNameOf(certificate_); }
+    static std::optional<std::string> commonNameOf(const X509* certificate);
 
     // Owned by the certificate; valid as long as it lives.
     X509* x509() const { return certificate_; }

@@ -21,12 +21,18 @@ GWXARArchivePtr GWXARArchive::init() {
 
 GWXARArchivePtr GWXARArchive::initWithURL(const GWURL& url, bool failOnInvalidSignature,
                                           GWErrorPtr* error) {
+    return initWithURL(url, failOnInvalidSignature, nullptr, error);
+}
+
+GWXARArchivePtr GWXARArchive::initWithURL(const GWURL& url, bool failOnInvalidSignature,
+                                          const GWXARTrustPtr& trust, GWErrorPtr* error) {
     auto archive = init();
     archive->ref_ = GWRef::initWithURL(url);
     if (!archive->ref_) {
         return nullptr;
     }
     auto operation = GWXARLoadOperation::initWithArchive(archive, failOnInvalidSignature);
+    operation->setTrust(trust);
     operation->start();
     if (!operation->files()) {
         GWFail(error, operation->error());
@@ -39,7 +45,8 @@ GWXARArchivePtr GWXARArchive::initWithURL(const GWURL& url, bool failOnInvalidSi
 GWXARArchivePtr GWXARArchive::initWithURL(const GWURL& url, bool failOnInvalidSignature,
                                           const GWOperationQueuePtr& loadingQueue,
                                           GWXARLoadOperationPtr* loadOperation,
-                                          CompletionHandler completionHandler) {
+                                          CompletionHandler completionHandler,
+                                          const GWXARTrustPtr& trust) {
     auto archive = init();
     const GWOperationQueuePtr queue = loadingQueue ? loadingQueue : archive->operationQueue_;
     archive->ref_ = GWRef::initWithURL(url);
@@ -53,6 +60,7 @@ GWXARArchivePtr GWXARArchive::initWithURL(const GWURL& url, bool failOnInvalidSi
     }
 
     auto operation = GWXARLoadOperation::initWithArchive(archive, failOnInvalidSignature);
+    operation->setTrust(trust);
     // Weak: the operation owns this block, and the block must not own it back.
     std::weak_ptr<GWXARLoadOperation> weakOperation = operation;
     operation->setCompletionBlock([weakOperation, archive, handler = std::move(completionHandler)] {
@@ -168,6 +176,30 @@ GWErrorPtr GWXARArchive::signatureValidationError() const {
     std::lock_guard<std::mutex> lock(mutex_);
     return privateSignatureValidationError_ ? privateSignatureValidationError_
                                             : checksumValidationError_;
+}
+
+GWXARSignatureVerdict GWXARArchive::signatureVerdict() const {
+    const GWXARSignaturePtr deciding = GWXARDecidingSignature(signatures());
+    if (!deciding) {
+        return GWXARSignatureVerdictNone;
+    }
+    if (!checksumIsValid()) {
+        return GWXARSignatureVerdictInvalid;
+    }
+    // Archives kept before verdicts were recorded have only the flag.
+    if (deciding->verdict() == GWXARSignatureVerdictNone) {
+        return privateSignatureIsValid() ? GWXARSignatureVerdictValid
+                                         : GWXARSignatureVerdictInvalid;
+    }
+    return deciding->verdict();
+}
+
+std::string GWXARArchive::signatureVerdictReason() const {
+    const GWXARSignaturePtr deciding = GWXARDecidingSignature(signatures());
+    if (deciding && !checksumIsValid()) {
+        return "the checksum does not match the table of contents";
+    }
+    return deciding ? deciding->verdictReason() : "";
 }
 
 GWOperationQueuePtr GWXARArchive::operationQueue() const {

@@ -51,6 +51,10 @@ public:
     // in checksumIsValid and signatureIsValid.
     static GWXARArchivePtr initWithURL(const GWURL& url, bool failOnInvalidSignature,
                                        GWErrorPtr* error);
+    // The same with the trust anchors signing chains must reach (the
+    // system's when none; see GWXARTrust).
+    static GWXARArchivePtr initWithURL(const GWURL& url, bool failOnInvalidSignature,
+                                       const GWXARTrustPtr& trust, GWErrorPtr* error);
     // Returns the archive at once and loads it on `loadingQueue` (the
     // archive's own queue when none); `loadOperation` receives the operation
     // for cancelling. The handler runs on the thread that finished the load,
@@ -60,7 +64,8 @@ public:
     static GWXARArchivePtr initWithURL(const GWURL& url, bool failOnInvalidSignature,
                                        const GWOperationQueuePtr& loadingQueue,
                                        GWXARLoadOperationPtr* loadOperation,
-                                       CompletionHandler completionHandler);
+                                       CompletionHandler completionHandler,
+                                       const GWXARTrustPtr& trust = nullptr);
 
     // Use init(): a plain archive has no operation queue (decoded ones start so).
     GWXARArchive() = default;
@@ -96,6 +101,13 @@ public:
     // A signature counts only over a table of contents whose checksum holds.
     bool signatureIsValid() const { return privateSignatureIsValid() && checksumIsValid(); }
     void setSignatureIsValid(bool valid) { setPrivateSignatureIsValid(valid); }
+    // Valid only when every signature is valid and the checksum holds;
+    // untrusted when all check out but a chain reaches no anchor; none
+    // without signatures. A signature's own verdict says which failed.
+    GWXARSignatureVerdict signatureVerdict() const;
+    // Why the verdict is not valid, in a few words; empty when it is.
+    std::string signatureVerdictReason() const;
+
     // The signature's error, else the checksum's.
     GWErrorPtr signatureValidationError() const;
     void setSignatureValidationError(GWErrorPtr error) {

@@ -64,8 +64,9 @@ int GWXARCMSMessage::numberOfSigners() const {
     return sk_CMS_SignerInfo_num(CMS_get0_SignerInfos(message_.get()));
 }
 
-GWXARCMSMessage::SignerStatus GWXARCMSMessage::signerStatus(int index, X509_STORE* store) const {
-    SignerStatus result{false, 0, false, {GWXARTrustResult::notTrusted, X509_V_OK, true}};
+GWXARCMSMessage::SignerStatus GWXARCMSMessage::signerStatus(int index,
+                                                            const GWXARTrust& trust) const {
+    SignerStatus result{false, 0, false, {}};
     CMS_SignerInfo* signer = sk_CMS_SignerInfo_value(CMS_get0_SignerInfos(message_.get()), index);
     X509* certificate = nullptr;
     if (signer) {
@@ -78,7 +79,7 @@ GWXARCMSMessage::SignerStatus GWXARCMSMessage::signerStatus(int index, X509_STOR
     }
 
     GWOwnedCertificateStack others(CMS_get1_certs(message_.get()));
-    result.trust = GWXAREvaluateTrust(store, certificate, others.get());
+    result.trust = trust.evaluate(certificate, others.get());
 
     // Signed attributes carry their own signature and the content's digest;
     // without them the signature covers the content's digest directly.

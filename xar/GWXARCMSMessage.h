@@ -26,7 +26,7 @@ public:
         bool signatureIsValid;   // over the detached content
         GWXARTrustResult trust;  // of the signer's certificate and the message's others
     };
-    SignerStatus signerStatus(int index, X509_STORE* store) const;
+    SignerStatus signerStatus(int index, const GWXARTrust& trust) const;
 
 private:
     explicit GWXARCMSMessage(GWOpenSSLPtr<CMS_ContentInfo> message);

@@ -15,6 +15,7 @@
 #include "GWXARDataReference.h"
 #include "GWXARFile.h"
 #include "GWXARSignature.h"
+#include "GWXARTrust.h"
 #include "foundation/GWError.h"
 #include "foundation/GWOperation.h"
 #include "foundation/GWRemoteFileHandle.h"
@@ -49,6 +50,9 @@ public:
 
     const std::shared_ptr<GWXARArchive>& archive() const { return archive_; }
     bool failOnInvalidSignature() const { return failOnInvalidSignature_; }
+    // The anchors signing chains must reach; the system's when none is set.
+    const GWXARTrustPtr& trust() const { return trust_; }
+    void setTrust(GWXARTrustPtr trust) { trust_ = std::move(trust); }
     // The archive's location, named by the errors of the load.
     const std::optional<GWURL>& archiveURL() const { return archiveURL_; }
     void setArchiveURL(std::optional<GWURL> url) { archiveURL_ = std::move(url); }
@@ -202,20 +206,31 @@ public:
     // The certificates of a "KeyInfo" element's "X509Data" children, in order.
     std::optional<GWCertificateArray> certificatesFromKeyInfo(const pugi::xml_node& keyInfo,
                                                               GWErrorPtr* error);
-    // Loads the signatures and checks each, in order, over `tocChecksum`; true
-    // also when there are none. `checksumAlgorithm` is the header's GWChecksum
-    // number: with none, a signed archive is false without an error object.
+    // Loads the signatures and checks every one over `tocChecksum`, giving
+    // each its verdict; true when all are valid, and when there are none.
+    // Otherwise the error is that of the first signature with the worst
+    // verdict. `checksumAlgorithm` is the header's GWChecksum number: with
+    // none, a signed archive is false without an error object.
     bool verifySignaturesWithTOC(const pugi::xml_node& toc, int checksumAlgorithm,
                                  GWErrorPtr* error);
-    // Whether the certificates (leaf first) lead to a trusted root.
+    // Whether the certificates (leaf first) lead to a trust anchor.
     bool canTrustSignature(const GWXARSignature& signature, GWErrorPtr* error);
+    // Whether the signature checks out over `data` (CMS: over `tocChecksum`)
+    // and, for CMS, every signer's chain reaches a trust anchor.
     bool validateData(const GWData& data, const GWXARSignature& signature, GWErrorPtr* error);
-    // RSA, DSA and ECDSA: `data` is the signed digest itself.
-    bool validateDataWithTypicalSignature(const GWData& data, const GWXARSignature& signature,
-                                          GWErrorPtr* error);
-    // The content checked is always `tocChecksum`, which is what `data` holds.
-    bool validateDataWithCMSSignature(const GWData& data, const GWXARSignature& signature,
-                                      GWErrorPtr* error);
+
+    // One signature's outcome and the error the load reports for it.
+    struct SignatureCheck {
+        GWXARSignatureVerdict verdict = GWXARSignatureVerdictInvalid;
+        std::string reason;
+        std::vector<std::string> chain;
+        GWErrorPtr error;
+    };
+    SignatureCheck checkSignature(const GWXARSignature& signature);
+    // RSA, DSA and ECDSA: `data` is the signed digest itself. Valid or invalid.
+    SignatureCheck checkTypicalSignature(const GWData& data, const GWXARSignature& signature);
+    // Every signer must sign `tocChecksum`, and its chain reach an anchor.
+    SignatureCheck checkCMSSignature(const GWXARSignature& signature);
 
     // --- Errors (GWXARLoadOperation.cpp) --------------------------------------
 
@@ -237,14 +252,22 @@ private:
     void recordHardLink(const GWXARFilePtr& file, std::string targetID);
     bool resolveHardLinks(GWErrorPtr* error);
 
+    // Trust of the certificates the table of contents lists for `signature`.
+    GWXARTrustResult evaluateKeyInfo(const GWXARSignature& signature, GWErrorPtr* error);
+    const GWXARTrust* effectiveTrust(GWErrorPtr* error);
+
     std::shared_ptr<GWXARArchive> archive_;
     bool failOnInvalidSignature_ = false;
+    GWXARTrustPtr trust_;
     std::optional<GWURL> archiveURL_;
     std::shared_ptr<GWRemoteFileHandle> fileHandle_;
     std::uint64_t heapStart_ = 0;
     std::uint64_t tocMemoryUsed_ = 0;
     // Certificates already made, by their base64 text.
     std::unordered_map<std::string, GWCertificatePtr> certificatesByText_;
+    // Trust already evaluated, by the certificates (shared through their text):
+    // archives sign many times with one chain.
+    std::map<std::vector<const GWCertificate*>, GWXARTrustResult> trustByChain_;
     // Heap bytes already read, by (offset, size): repeated references are free.
     std::map<std::pair<std::uint64_t, std::uint64_t>, std::shared_ptr<const GWData>> heapRanges_;
     std::optional<GWXARSignatureArray> signatures_;

@@ -165,76 +165,124 @@ bool GWXARLoadOperation::verifySignaturesWithTOC(const pugi::xml_node& toc, int 
     if (!loadSignaturesWithTOC(toc, error)) {
         return false;
     }
-    if (!signatures_->empty() && checksumAlgorithm == 0) {
-        // Nothing was signed, so no signature can hold; callers report this
-        // without an error object on purpose.
-        return GWFail(error, nullptr);
-    }
-    const GWData& checksum = computedTOCChecksum_;
-    for (const auto& signature : *signatures_) {
-        if (!signature->certificates() || signature->certificates()->empty()) {
-            return GWFail(error, errorWithCode(GWXARArchiveMissingCertificateError, std::nullopt,
-                                               pugi::xml_node()));
+    // Every signature gets its verdict; the worst one decides, the first of
+    // equals. Only the deciding error is kept: there may be 100,000 signatures.
+    std::optional<SignatureCheck> deciding;
+    for (auto& signature : *signatures_) {
+        // Without a checksum nothing was signed, so no signature can hold;
+        // callers report this without an error object on purpose.
+        SignatureCheck check{GWXARSignatureVerdictInvalid, "no checksum was signed", {}, nullptr};
+        if (checksumAlgorithm != 0) {
+            check = checkSignature(*signature);
         }
-        if (!canTrustSignature(*signature, error) || !validateData(checksum, *signature, error)) {
-            return false;
+        signature = signature->copyWithVerdict(check.verdict, check.reason, check.chain);
+        if (!deciding || check.verdict > deciding->verdict) {
+            deciding = std::move(check);
         }
     }
-    return true;
+    if (!deciding || deciding->verdict == GWXARSignatureVerdictValid) {
+        return true;
+    }
+    return GWFail(error, deciding->error);
+}
+
+const GWXARTrust* GWXARLoadOperation::effectiveTrust(GWErrorPtr* error) {
+    if (!trust_) {
+        trust_ = GWXARTrust::systemTrust(error);
+    }
+    return trust_.get();
+}
+
+GWXARTrustResult GWXARLoadOperation::evaluateKeyInfo(const GWXARSignature& signature,
+                                                     GWErrorPtr* error) {
+    GWXARTrustResult failed;
+    const auto& certificates = signature.certificates();
+    if (!certificates || certificates->empty() || !certificates->front()) {
+        GWFail(error,
+               errorWithCode(GWXARArchiveMissingCertificateError, std::nullopt, pugi::xml_node()));
+        return failed;
+    }
+    std::vector<const GWCertificate*> key;
+    for (const auto& certificate : *certificates) {
+        key.push_back(certificate.get());
+    }
+    auto known = trustByChain_.find(key);
+    if (known == trustByChain_.end()) {
+        const GWXARTrust* trust = effectiveTrust(error);
+        if (!trust) {
+            return failed;
+        }
+        GWBorrowedCertificateStack intermediates(sk_X509_new_null());
+        for (std::size_t i = 1; intermediates && i < certificates->size(); ++i) {
+            if ((*certificates)[i] &&
+                !sk_X509_push(intermediates.get(), (*certificates)[i]->x509())) {
+                intermediates.reset();
+            }
+        }
+        if (!intermediates) {
+            failed.status =
+                GWOpenSSLTakeErrorStatus(ERR_PACK(ERR_LIB_X509, 0, ERR_R_MALLOC_FAILURE));
+            GWFail(error, failed.securityError());
+            return failed;
+        }
+        known = trustByChain_
+                    .emplace(std::move(key),
+                             trust->evaluate(certificates->front()->x509(), intermediates.get()))
+                    .first;
+    }
+    const GWXARTrustResult& result = known->second;
+    if (result.kind == GWXARTrustResult::evaluationFailed) {
+        GWFail(error, result.securityError());
+    } else if (result.kind == GWXARTrustResult::notTrusted) {
+        // The verify result says why, for whoever reads the error.
+        GWFail(error, withUnderlyingError(errorWithCode(GWXARArchiveUntrustedCertificateError,
+                                                        std::nullopt, pugi::xml_node()),
+                                          result.securityError()));
+    }
+    return result;
 }
 
 bool GWXARLoadOperation::canTrustSignature(const GWXARSignature& signature, GWErrorPtr* error) {
-    const auto& certificates = signature.certificates();
-    if (!certificates || certificates->empty() || !certificates->front()) {
-        return GWFail(error, errorWithCode(GWXARArchiveMissingCertificateError, std::nullopt,
-                                           pugi::xml_node()));
-    }
-    long status = 0;
-    auto store = GWXARCreateTrustStore(&status);
-    if (!store) {
-        return GWFail(error, GWSecurityError(status, false));
-    }
-    GWBorrowedCertificateStack intermediates(sk_X509_new_null());
-    if (!intermediates) {
-        return GWFail(
-            error,
-            GWSecurityError(
-                GWOpenSSLTakeErrorStatus(ERR_PACK(ERR_LIB_X509, 0, ERR_R_MALLOC_FAILURE)), false));
-    }
-    for (std::size_t i = 1; i < certificates->size(); ++i) {
-        if ((*certificates)[i] && !sk_X509_push(intermediates.get(), (*certificates)[i]->x509())) {
-            return GWFail(error, GWSecurityError(GWOpenSSLTakeErrorStatus(ERR_PACK(
-                                                     ERR_LIB_X509, 0, ERR_R_MALLOC_FAILURE)),
-                                                 false));
-        }
-    }
-
-    const GWXARTrustResult trust =
-        GWXAREvaluateTrust(store.get(), certificates->front()->x509(), intermediates.get());
-    switch (trust.kind) {
-        case GWXARTrustResult::trusted: return true;
-        case GWXARTrustResult::evaluationFailed: return GWFail(error, trust.securityError());
-        case GWXARTrustResult::notTrusted:
-            // The verify result says why, for whoever reads the error.
-            return GWFail(error,
-                          withUnderlyingError(errorWithCode(GWXARArchiveUntrustedCertificateError,
-                                                            std::nullopt, pugi::xml_node()),
-                                              trust.securityError()));
-    }
-    return false;
+    return evaluateKeyInfo(signature, error).kind == GWXARTrustResult::trusted;
 }
 
 bool GWXARLoadOperation::validateData(const GWData& data, const GWXARSignature& signature,
                                       GWErrorPtr* error) {
-    if (signature.type() == GWXARSignatureTypeCMS) {
-        return validateDataWithCMSSignature(data, signature, error);
-    }
-    return validateDataWithTypicalSignature(data, signature, error);
+    const SignatureCheck check = signature.type() == GWXARSignatureTypeCMS
+                                     ? checkCMSSignature(signature)
+                                     : checkTypicalSignature(data, signature);
+    return check.verdict == GWXARSignatureVerdictValid || GWFail(error, check.error);
 }
 
-bool GWXARLoadOperation::validateDataWithTypicalSignature(const GWData& data,
-                                                          const GWXARSignature& signature,
-                                                          GWErrorPtr* error) {
+GWXARLoadOperation::SignatureCheck GWXARLoadOperation::checkSignature(
+    const GWXARSignature& signature) {
+    const auto& certificates = signature.certificates();
+    if (!certificates || certificates->empty()) {
+        return {GWXARSignatureVerdictInvalid,
+                "no certificates",
+                {},
+                errorWithCode(GWXARArchiveMissingCertificateError, std::nullopt, pugi::xml_node())};
+    }
+    // A signature that does not check out is invalid whoever vouches for its certificates.
+    SignatureCheck check = signature.type() == GWXARSignatureTypeCMS
+                               ? checkCMSSignature(signature)
+                               : checkTypicalSignature(computedTOCChecksum_, signature);
+    if (check.verdict == GWXARSignatureVerdictInvalid) {
+        return check;
+    }
+    GWErrorPtr trustError;
+    GWXARTrustResult trust = evaluateKeyInfo(signature, &trustError);
+    if (trust.kind != GWXARTrustResult::trusted) {
+        return {GWXARSignatureVerdictUntrusted, trust.reason(), std::move(trust.chain), trustError};
+    }
+    if (check.chain.empty()) {
+        check.chain = std::move(trust.chain);
+    }
+    return check;
+}
+
+GWXARLoadOperation::SignatureCheck GWXARLoadOperation::checkTypicalSignature(
+    const GWData& data, const GWXARSignature& signature) {
     const auto& certificates = signature.certificates();
     EVP_PKEY* key = certificates && !certificates->empty() && certificates->front()
                         ? X509_get0_pubkey(certificates->front()->x509())
@@ -242,55 +290,81 @@ bool GWXARLoadOperation::validateDataWithTypicalSignature(const GWData& data,
     if (!key) {
         const long status = GWOpenSSLTakeErrorStatus(
             ERR_PACK(ERR_LIB_X509, 0, X509_R_UNABLE_TO_GET_CERTS_PUBLIC_KEY));
-        return GWFail(
-            error, errorWithDomain(kGWOSStatusErrorDomain, status, std::nullopt, pugi::xml_node()));
+        return {GWXARSignatureVerdictInvalid,
+                "the leaf's public key is unusable",
+                {},
+                errorWithDomain(kGWOSStatusErrorDomain, status, std::nullopt, pugi::xml_node())};
     }
     const GWXARSignatureCheck check =
         GWXARVerifyDigestSignature(key, data, signature.signatureData());
     switch (check.kind) {
-        case GWXARSignatureCheck::valid: return true;
+        case GWXARSignatureCheck::valid: return {GWXARSignatureVerdictValid, "", {}, nullptr};
         case GWXARSignatureCheck::failed:
-            return GWFail(error, GWSecurityError(check.status, false));
-        case GWXARSignatureCheck::invalid:
-            return GWFail(error, errorWithCode(GWXARArchiveInvalidSignatureError, std::nullopt,
-                                               pugi::xml_node()));
+            return {GWXARSignatureVerdictInvalid,
+                    "the signature could not be checked",
+                    {},
+                    GWSecurityError(check.status, false)};
+        case GWXARSignatureCheck::invalid: break;
     }
-    return false;
+    return {GWXARSignatureVerdictInvalid,
+            "the signature does not match the checksum",
+            {},
+            errorWithCode(GWXARArchiveInvalidSignatureError, std::nullopt, pugi::xml_node())};
 }
 
-bool GWXARLoadOperation::validateDataWithCMSSignature(const GWData&,
-                                                      const GWXARSignature& signature,
-                                                      GWErrorPtr* error) {
+GWXARLoadOperation::SignatureCheck GWXARLoadOperation::checkCMSSignature(
+    const GWXARSignature& signature) {
     long status = 0;
     auto message = GWXARCMSMessage::decode(signature.signatureData(), &status);
     if (!message) {
-        return GWFail(error, GWSecurityError(status, false));
+        return {GWXARSignatureVerdictInvalid,
+                "not a CMS signed-data message",
+                {},
+                GWSecurityError(status, false)};
     }
     // A failure here shows as invalid signers below.
     message->setDetachedContent(computedTOCChecksum_);
 
     const int signers = message->numberOfSigners();
     if (signers <= 0) {
-        // A message without signers vouches for nothing yet is accepted, as
-        // archives signed that way have always been.
-        return true;
+        // Any certificates at all could ride in such a message: it vouches for nothing.
+        return {GWXARSignatureVerdictInvalid,
+                "no signers",
+                {},
+                errorWithCode(GWXARArchiveInvalidSignatureError, std::nullopt, pugi::xml_node())};
     }
-    auto store = GWXARCreateTrustStore(&status);
-    if (!store) {
-        return GWFail(error, GWSecurityError(status, false));
+    GWErrorPtr trustError;
+    const GWXARTrust* trust = effectiveTrust(&trustError);
+    if (!trust) {
+        return {GWXARSignatureVerdictUntrusted, "trust could not be evaluated", {}, trustError};
     }
+    std::optional<SignatureCheck> untrusted;
+    std::vector<std::string> chain;
     for (int index = 0; index < signers; ++index) {
-        const auto signer = message->signerStatus(index, store.get());
+        auto signer = message->signerStatus(index, *trust);
         if (signer.callFailed) {
-            return GWFail(error, GWSecurityError(signer.status, false));
-        }
-        if (signer.trust.kind != GWXARTrustResult::trusted) {
-            return GWFail(error, signer.trust.securityError());
+            return {GWXARSignatureVerdictInvalid,
+                    "a signer's certificate is missing",
+                    {},
+                    GWSecurityError(signer.status, false)};
         }
         if (!signer.signatureIsValid) {
-            return GWFail(error, errorWithCode(GWXARArchiveInvalidSignatureError, std::nullopt,
-                                               pugi::xml_node()));
+            return {
+                GWXARSignatureVerdictInvalid,
+                "a signer's signature does not match the checksum",
+                {},
+                errorWithCode(GWXARArchiveInvalidSignatureError, std::nullopt, pugi::xml_node())};
+        }
+        if (signer.trust.kind != GWXARTrustResult::trusted && !untrusted) {
+            untrusted = SignatureCheck{GWXARSignatureVerdictUntrusted, signer.trust.reason(),
+                                       signer.trust.chain, signer.trust.securityError()};
+        }
+        if (index == 0) {
+            chain = std::move(signer.trust.chain);
         }
     }
-    return true;
+    if (untrusted) {
+        return *untrusted;
+    }
+    return {GWXARSignatureVerdictValid, "", std::move(chain), nullptr};
 }

@@ -9,6 +9,9 @@ const char* const kTypeKey = "Type";
 const char* const kSignatureDataKey = "SignatureData";
 const char* const kCertificatesKey = "Certificates";
 const char* const kIsExtendedKey = "IsExtended";
+const char* const kVerdictKey = "Verdict";
+const char* const kVerdictReasonKey = "VerdictReason";
+const char* const kChainKey = "ChainCommonNames";
 
 const char* typeName(std::uint64_t type) {
     switch (type) {
@@ -21,6 +24,25 @@ const char* typeName(std::uint64_t type) {
 }
 
 }  // namespace
+
+const char* GWXARSignatureVerdictName(std::uint64_t verdict) {
+    switch (verdict) {
+        case GWXARSignatureVerdictValid: return "valid";
+        case GWXARSignatureVerdictUntrusted: return "untrusted";
+        case GWXARSignatureVerdictInvalid: return "invalid";
+        default: return "none";
+    }
+}
+
+GWXARSignaturePtr GWXARDecidingSignature(const GWXARSignatureArray& signatures) {
+    GWXARSignaturePtr deciding;
+    for (const auto& signature : signatures) {
+        if (signature && (!deciding || signature->verdict() > deciding->verdict())) {
+            deciding = signature;
+        }
+    }
+    return deciding;
+}
 
 GWXARSignature::GWXARSignature(std::uint64_t type, std::shared_ptr<const GWData> signatureData,
                                std::optional<GWCertificateArray> certificates, bool isExtended)
@@ -60,6 +82,15 @@ std::optional<std::vector<std::string>> GWXARSignature::certificateCommonNames()
     return names;
 }
 
+GWXARSignaturePtr GWXARSignature::copyWithVerdict(GWXARSignatureVerdict verdict, std::string reason,
+                                                  std::vector<std::string> chain) const {
+    auto signature = copy();
+    signature->verdict_ = verdict;
+    signature->verdictReason_ = std::move(reason);
+    signature->chainCommonNames_ = std::move(chain);
+    return signature;
+}
+
 std::string GWXARSignature::description() const {
     std::string names = "(none)";
     if (auto commonNames = certificateCommonNames()) {
@@ -69,9 +100,12 @@ std::string GWXARSignature::description() const {
         }
     }
     return GWFormat(
-        "<%s %s\n\ttype=%s\n\tsignatureData=%zu bytes\n\tcertificates=%s\n\tisExtended=%s\n>",
+        "<%s %s\n\ttype=%s\n\tsignatureData=%zu bytes\n\tcertificates=%s\n\tisExtended=%s"
+        "\n\tverdict=%s%s%s\n>",
         className().c_str(), GWXARDescribing::pointerText(this).c_str(), typeName(type_),
-        signatureData_->size(), names.c_str(), isExtended_ ? "YES" : "NO");
+        signatureData_->size(), names.c_str(), isExtended_ ? "YES" : "NO",
+        GWXARSignatureVerdictName(verdict_), verdictReason_.empty() ? "" : " ",
+        verdictReason_.c_str());
 }
 
 void GWXARSignature::encodeWithCoder(GWCoder& coder) const {
@@ -91,6 +125,12 @@ void GWXARSignature::encodeWithCoder(GWCoder& coder) const {
         coder.encodeValue(GWValue(std::move(encodings)), kCertificatesKey);
     }
     coder.encodeBool(isExtended_, kIsExtendedKey);
+    if (verdict_ != GWXARSignatureVerdictNone) {
+        coder.encodeInteger(std::int64_t(verdict_), kVerdictKey);
+        coder.encodeValue(GWValue(verdictReason_), kVerdictReasonKey);
+        GWArray chain(chainCommonNames_.begin(), chainCommonNames_.end());
+        coder.encodeValue(GWValue(std::move(chain)), kChainKey);
+    }
 }
 
 GWXARSignaturePtr GWXARSignature::initWithCoder(GWCoder& coder) {
@@ -110,11 +150,27 @@ GWXARSignaturePtr GWXARSignature::initWithCoder(GWCoder& coder) {
             certificates->push_back(std::move(certificate));
         }
     }
-    return initWithType(coder.decodeUInt64(kTypeKey),
-                        coder.decodeData(kSignatureDataKey).value_or(GWData()),
-                        std::move(certificates), coder.decodeBool(kIsExtendedKey));
+    auto signature = initWithType(coder.decodeUInt64(kTypeKey),
+                                  coder.decodeData(kSignatureDataKey).value_or(GWData()),
+                                  std::move(certificates), coder.decodeBool(kIsExtendedKey));
+    const std::uint64_t verdict = coder.decodeUInt64(kVerdictKey);
+    // An unknown verdict from a later writer is no verdict here.
+    if (verdict <= GWXARSignatureVerdictInvalid) {
+        signature->verdict_ = GWXARSignatureVerdict(verdict);
+    }
+    signature->verdictReason_ = coder.decodeString(kVerdictReasonKey).value_or("");
+    for (const GWValue& name : coder.decodeArray(kChainKey).value_or(GWArray())) {
+        if (const std::string* text = name.string()) {
+            signature->chainCommonNames_.push_back(*text);
+        }
+    }
+    return signature;
 }
 
 GWXARSignaturePtr GWXARSignature::copy() const {
-    return initSharingData(type_, signatureData_, certificates_, isExtended_);
+    auto signature = initSharingData(type_, signatureData_, certificates_, isExtended_);
+    signature->verdict_ = verdict_;
+    signature->verdictReason_ = verdictReason_;
+    signature->chainCommonNames_ = chainCommonNames_;
+    return signature;
 }

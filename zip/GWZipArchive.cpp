@@ -90,6 +90,7 @@ GWZipArchivePtr GWZipArchive::initWithURL(const GWURL& url, GWErrorPtr* error) {
     }
     archive->setFiles(operation->files().value_or(GWZipFileArray()));
     archive->startOffset_ = operation->startOffset();
+    archive->recoveredEntryCount_ = operation->recoveredEntryCount();
     archive->compressedSize_ = operation->compressedSize();
     return archive;
 }
@@ -118,6 +119,7 @@ GWZipArchivePtr GWZipArchive::initWithURL(const GWURL& url, const GWOperationQue
         } else {
             archive->setFiles(finished->files().value_or(GWZipFileArray()));
             archive->startOffset_ = finished->startOffset();
+            archive->recoveredEntryCount_ = finished->recoveredEntryCount();
             archive->compressedSize_ = finished->compressedSize();
         }
         if (completionHandler) {

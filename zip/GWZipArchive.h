@@ -68,6 +68,9 @@ public:
     // Where the ZIP data begins in the file; every offset is relative to it.
     std::uint64_t startOffset() const { return startOffset_; }
     void setStartOffset(std::uint64_t offset) { startOffset_ = offset; }
+    // How many entries were recovered from local headers because the end
+    // record or the central directory could not be read; 0 for a whole archive.
+    std::uint64_t recoveredEntryCount() const { return recoveredEntryCount_; }
     // Never set by loading, so 0; neither archived nor copied.
     std::uint64_t compressedSize() const { return compressedSize_; }
     void setCompressedSize(std::uint64_t size) { compressedSize_ = size; }
@@ -99,6 +102,7 @@ private:
 
     GWRefPtr ref_;
     std::uint64_t startOffset_ = 0;
+    std::uint64_t recoveredEntryCount_ = 0;
     std::uint64_t compressedSize_ = 0;
 
     // `files` is set from the loading queue while callers read it.

@@ -161,6 +161,14 @@ void GWZipLoadOperation::main() {
     }
     setStartOffset(found);
     auto roots = loadFilesFromZipArchiveAtHandle(*file, &error);
+    if (!roots && error && error->is(kGWCocoaErrorDomain, GWFileReadCorruptFileError)) {
+        // A lost or damaged directory still leaves the entries written before it.
+        setStartOffset(found);
+        if (auto recovered = recoverFilesFromLocalHeaders(*file, nullptr)) {
+            roots = std::move(recovered);
+            error = nullptr;
+        }
+    }
     if (!roots) {
         setError(error);
     } else {

@@ -130,6 +130,15 @@ public:
                              std::uint16_t permissionsMode, GWDictionary extraInfo,
                              GWZipTreeBuilder& rootItems, GWErrorPtr* error);
 
+    // --- Damaged archives --------------------------------------------------------------
+    // The entries found by walking the local headers from the start offset,
+    // for an archive whose end record or central directory cannot be read;
+    // only entries whose data lies wholly in the file. Fails when there is none.
+    std::optional<GWZipFileArray> recoverFilesFromLocalHeaders(GWRemoteFileHandle& file,
+                                                               GWErrorPtr* error);
+    // How many entries the load recovered that way; 0 for a whole archive.
+    std::uint64_t recoveredEntryCount() const { return recoveredEntryCount_; }
+
     // --- Mac metadata companions ----------------------------------------------------
 
     // Attaches the entries of "__MACOSX" and of "XtraStuf.mac" / "Re$0urce.Fk"
@@ -183,6 +192,7 @@ private:
 
     GWURL url_;
     std::uint64_t startOffset_ = 0;
+    std::uint64_t recoveredEntryCount_ = 0;
     // The walk's (dateFromDOS) and the tree builder's own, when they run on
     // two threads.
     std::unordered_map<std::uint32_t, GWDate> dosDates_;

@@ -9,6 +9,7 @@
 #include "GWXARExtractOperation.h"
 #include "GWXARFile.h"
 #include "GWXARSignature.h"
+#include "GWXARTrust.h"
 #include "GWZipArchive.h"
 #include "GWZipExtractOperation.h"
 #include "GWZipFile.h"

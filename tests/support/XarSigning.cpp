@@ -3,6 +3,10 @@
 #include <cstdlib>
 
 #include <openssl/evp.h>
+#include <openssl/pem.h>
+#include <openssl/x509v3.h>
+
+#include "xar/GWOpenSSL.h"
 
 namespace gwtest {
 
@@ -47,6 +51,18 @@ void restoreEnvironment(const char* name, const std::optional<std::string>& valu
     } else {
         unsetenv(name);
     }
+}
+
+GWOpenSSLPtr<EVP_PKEY> readKey(const std::string& file) {
+    GWOpenSSLPtr<BIO> bio(BIO_new_file(file.c_str(), "r"));
+    return GWOpenSSLPtr<EVP_PKEY>(
+        bio ? PEM_read_bio_PrivateKey(bio.get(), nullptr, nullptr, nullptr) : nullptr);
+}
+
+GWOpenSSLPtr<X509> readCertificate(const std::string& file) {
+    GWOpenSSLPtr<BIO> bio(BIO_new_file(file.c_str(), "r"));
+    return GWOpenSSLPtr<X509>(bio ? PEM_read_bio_X509(bio.get(), nullptr, nullptr, nullptr)
+                                  : nullptr);
 }
 
 }  // namespace
@@ -183,22 +199,111 @@ const XarSigningIdentity& XarSigning::selfSignedLeaf() {
     return selfSigned_ ? *selfSigned_ : empty_;
 }
 
-GWData XarSigning::signDigest(const XarSigningIdentity& identity, const GWData& checksum) {
-    const std::string input = folder_.file("digest-" + std::to_string(files_++) + ".bin");
-    const std::string output = input + ".sig";
-    writeFile(input, checksum);
-    const bool isRSA = identity.keyType == XarKeyType::rsa;
-    std::string digest;
-    if (checksum.size() == 20) {
-        digest = " -pkeyopt digest:sha1";
-    } else if (checksum.size() == 16 && isRSA) {
-        digest = " -pkeyopt digest:md5";
+std::optional<XarSigningIdentity> XarSigning::issue(const std::string& name,
+                                                    const XarSigningIdentity& issuer,
+                                                    bool expired) {
+    auto issuerKey = readKey(issuer.keyFile);
+    auto issuerCertificate = readCertificate(issuer.certificateFile);
+    GWOpenSSLPtr<EVP_PKEY> key(EVP_EC_gen("P-256"));
+    GWOpenSSLPtr<X509> certificate(X509_new());
+    if (!issuerKey || !issuerCertificate || !key || !certificate) {
+        problem_ = "issue " + name + ": no key or certificate";
+        return std::nullopt;
     }
-    if (!run("openssl pkeyutl -sign -inkey " + shellQuote(identity.keyFile) + " -in " +
-             shellQuote(input) + digest + " -out " + shellQuote(output))) {
+    X509* made = certificate.get();
+    const std::string commonName = "GW Test " + name + " Signer";
+    X509_set_version(made, X509_VERSION_3);
+    ASN1_INTEGER_set(X509_get_serialNumber(made), serial_++);
+    X509_NAME_add_entry_by_txt(X509_get_subject_name(made), "CN", MBSTRING_UTF8,
+                               reinterpret_cast<const unsigned char*>(commonName.c_str()), -1, -1,
+                               0);
+    X509_set_issuer_name(made, X509_get_subject_name(issuerCertificate.get()));
+    const long day = 24 * 60 * 60;
+    X509_gmtime_adj(X509_getm_notBefore(made), expired ? -2 * day : -day);
+    X509_gmtime_adj(X509_getm_notAfter(made), expired ? -day : 3650 * day);
+    X509_set_pubkey(made, key.get());
+    X509V3_CTX context;
+    X509V3_set_ctx(&context, issuerCertificate.get(), made, nullptr, nullptr, 0);
+    for (const auto& [nid, value] : {std::pair{NID_basic_constraints, "critical,CA:FALSE"},
+                                     std::pair{NID_key_usage, "critical,digitalSignature"}}) {
+        X509_EXTENSION* extension = X509V3_EXT_conf_nid(nullptr, &context, nid, value);
+        X509_add_ext(made, extension, -1);
+        X509_EXTENSION_free(extension);
+    }
+    XarSigningIdentity identity;
+    identity.keyType = XarKeyType::ecdsa;
+    identity.keyFile = folder_.file(name + ".key");
+    identity.certificateFile = folder_.file(name + ".pem");
+    GWOpenSSLPtr<BIO> keyOut(BIO_new_file(identity.keyFile.c_str(), "w"));
+    GWOpenSSLPtr<BIO> certificateOut(BIO_new_file(identity.certificateFile.c_str(), "w"));
+    if (X509_sign(made, issuerKey.get(), EVP_sha256()) <= 0 || !keyOut || !certificateOut ||
+        PEM_write_bio_PrivateKey(keyOut.get(), key.get(), nullptr, nullptr, 0, nullptr, nullptr) !=
+            1 ||
+        PEM_write_bio_X509(certificateOut.get(), made) != 1) {
+        problem_ = "issue " + name + ": signing or writing failed";
+        return std::nullopt;
+    }
+    keyOut.reset();
+    certificateOut.reset();
+    // The issuer and what vouches for it, for CMS signing.
+    identity.chainFile = folder_.file(name + "-chain.pem");
+    GWData chain = readFile(issuer.certificateFile);
+    if (!issuer.chainFile.empty() && issuer.chainFile != issuer.certificateFile) {
+        const GWData more = readFile(issuer.chainFile);
+        chain.insert(chain.end(), more.begin(), more.end());
+    }
+    writeFile(identity.chainFile, chain);
+    identity.chain = {derOf(identity.certificateFile)};
+    identity.commonNames = {commonName};
+    identity.chain.insert(identity.chain.end(), issuer.chain.begin(), issuer.chain.end());
+    identity.commonNames.insert(identity.commonNames.end(), issuer.commonNames.begin(),
+                                issuer.commonNames.end());
+    return ok() ? std::optional(identity) : std::nullopt;
+}
+
+const XarSigningIdentity& XarSigning::expiredLeaf() {
+    if (!expired_ && ok()) {
+        // The intermediate as an issuer: its chain is only itself.
+        XarSigningIdentity intermediate;
+        intermediate.keyFile = folder_.file("intermediate.key");
+        intermediate.certificateFile = folder_.file("intermediate.pem");
+        intermediate.chain = {intermediateCertificate_};
+        intermediate.commonNames = {"GW Test Intermediate CA"};
+        expired_ = issue("Expired", intermediate, true);
+    }
+    return expired_ ? *expired_ : empty_;
+}
+
+const XarSigningIdentity& XarSigning::leafIssuedByLeaf() {
+    if (!issuedByLeaf_ && ok()) {
+        const XarSigningIdentity& rsa = leaf(XarKeyType::rsa);
+        issuedByLeaf_ = ok() ? issue("Leaf-Issued", rsa, false) : std::nullopt;
+    }
+    return issuedByLeaf_ ? *issuedByLeaf_ : empty_;
+}
+
+GWData XarSigning::signDigest(const XarSigningIdentity& identity, const GWData& checksum) {
+    // In process: an archive with hundreds of signatures is signed in a blink.
+    auto key = readKey(identity.keyFile);
+    GWOpenSSLPtr<EVP_PKEY_CTX> context(key ? EVP_PKEY_CTX_new(key.get(), nullptr) : nullptr);
+    const bool isRSA = identity.keyType == XarKeyType::rsa;
+    const EVP_MD* digest = checksum.size() == 20            ? EVP_sha1()
+                           : checksum.size() == 16 && isRSA ? EVP_md5()
+                                                            : nullptr;
+    std::size_t length = 0;
+    if (!context || EVP_PKEY_sign_init(context.get()) != 1 ||
+        (digest && EVP_PKEY_CTX_set_signature_md(context.get(), digest) != 1) ||
+        EVP_PKEY_sign(context.get(), nullptr, &length, checksum.data(), checksum.size()) != 1) {
+        problem_ = "signDigest: " + std::to_string(GWOpenSSLTakeErrorStatus(0));
         return {};
     }
-    return readFile(output);
+    GWData signature(length);
+    if (EVP_PKEY_sign(context.get(), signature.data(), &length, checksum.data(), checksum.size()) !=
+        1) {
+        return {};
+    }
+    signature.resize(length);
+    return signature;
 }
 
 GWData XarSigning::signCMS(const XarSigningIdentity& identity, const GWData& checksum) {
@@ -264,7 +369,9 @@ bool XarSigning::signArchive(XarBuilder& xar, const std::vector<Request>& reques
         const GWData checksum = xar.tocChecksum();
         bool settled = true;
         for (std::size_t i = 0; i < requests.size(); ++i) {
-            GWData signature = sign(requests[i].style, *requests[i].identity, checksum);
+            GWData signature = requests[i].withoutSigners
+                                   ? certificatesOnlyCMS(*requests[i].identity)
+                                   : sign(requests[i].style, *requests[i].identity, checksum);
             if (signature.empty()) {
                 xar.setFiles(files);
                 return false;

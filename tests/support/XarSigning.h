@@ -13,10 +13,11 @@
 
 namespace gwtest {
 
-// Signing material for XAR tests, made with the openssl tool in a temporary
-// folder: a test root CA, an intermediate CA it issued, leaves the
-// intermediate issued (RSA, DSA, ECDSA keys) and a self-signed leaf no root
-// vouches for. Nothing is trusted until a TrustedRootScope says so.
+// Signing material for XAR tests, made with the openssl tool and API in a
+// temporary folder: a test root CA, an intermediate CA it issued, leaves the
+// intermediate issued (RSA, DSA, ECDSA keys; one expired), a leaf the RSA
+// leaf issued as if it were a CA, and a self-signed leaf no root vouches
+// for. Nothing is trusted until a TrustedRootScope or an added anchor says so.
 //
 //     XarSigning signing;
 //     ASSERT_TRUE(signing.ok()) << signing.problem();
@@ -53,6 +54,11 @@ public:
     const XarSigningIdentity& leaf(XarKeyType type);
     // Signed by its own key; its chain is the leaf alone.
     const XarSigningIdentity& selfSignedLeaf();
+    // An ECDSA leaf of the intermediate whose validity ended yesterday.
+    const XarSigningIdentity& expiredLeaf();
+    // An ECDSA leaf issued by the RSA leaf, which is no CA; its chain runs
+    // through the RSA leaf to the intermediate.
+    const XarSigningIdentity& leafIssuedByLeaf();
 
     // A raw signature over `checksum` taken as a digest: SHA-1 for 20 bytes,
     // MD5 for 16 (RSA only; DSA and ECDSA sign other lengths bare). Empty on failure.
@@ -74,7 +80,8 @@ public:
 
         std::string style;  // "RSA", "SHA1withRSA", "DSA", "ECDSA", "CMS", ...
         const XarSigningIdentity* identity;
-        bool extended;  // an "x-signature" element
+        bool extended;                // an "x-signature" element
+        bool withoutSigners = false;  // a CMS message carrying only the certificates
         std::optional<std::vector<GWData>> certificates;
         std::optional<std::string> keyInfoXML;
     };
@@ -96,6 +103,8 @@ private:
     std::optional<XarSigningIdentity> makeIdentity(const std::string& name, XarKeyType type,
                                                    const std::string& keyFile, bool selfSigned);
     GWData derOf(const std::string& pemFile);
+    std::optional<XarSigningIdentity> issue(const std::string& name,
+                                            const XarSigningIdentity& issuer, bool expired);
 
     TemporaryDirectory folder_;
     std::string problem_;
@@ -105,6 +114,8 @@ private:
     GWData intermediateCertificate_;
     std::map<int, XarSigningIdentity> leaves_;
     std::optional<XarSigningIdentity> selfSigned_;
+    std::optional<XarSigningIdentity> expired_;
+    std::optional<XarSigningIdentity> issuedByLeaf_;
     XarSigningIdentity empty_;
     int serial_ = 1;
     int files_ = 0;

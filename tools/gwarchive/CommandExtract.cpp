@@ -40,10 +40,16 @@ std::uint64_t declaredSize(const ToolArchive& archive, const std::vector<std::si
 }
 
 int runExtract(const ParsedArguments& arguments) {
+    if (!useTrustOption(arguments))
+        return kExitFailure;
     const std::string& operand = arguments.operands[0];
     auto archive = openArchiveOperand(operand);
     if (!archive)
         return kExitFailure;
+    if (GWErrorPtr refusal = signatureRefusal(*archive, arguments)) {
+        reportError(operand, std::nullopt, refusal);
+        return kExitFailure;
+    }
     if (GWErrorPtr integrity = archive->integrityError();
         integrity && !arguments.has("ignore-checksum")) {
         reportError(operand, std::nullopt, integrity);
@@ -90,6 +96,7 @@ const Command kExtractCommand = {
     "\n"
     "SYNOPSIS\n"
     "    gwarchive extract [-C DIR] [--overwrite] [--ignore-checksum]\n"
+    "                      [--trust FILE] [--require-signature]\n"
     "                      [--progress|--no-progress] [-v] ARCHIVE [PATH...]\n"
     "\n"
     "DESCRIPTION\n"
@@ -114,6 +121,10 @@ const Command kExtractCommand = {
     "    --overwrite          replace existing items instead of failing.\n"
     "    --ignore-checksum    extract a XAR whose table of contents does not match\n"
     "                         its checksum; without it nothing is written.\n"
+    "    --trust FILE         PEM certificates that XAR signing chains may end at,\n"
+    "                         besides the system's trusted roots.\n"
+    "    --require-signature  write nothing unless the archive's signature is\n"
+    "                         valid (see gwarchive info --help).\n"
     "    --progress           always show the progress bar on standard error.\n"
     "    --no-progress        never show it. By default it is shown when standard\n"
     "                         error is a terminal: bytes done and total, rate and\n"
@@ -122,8 +133,8 @@ const Command kExtractCommand = {
     "\n"
     "EXIT STATUS\n"
     "    0 when every entry was extracted; 1 when ARCHIVE cannot be opened, its\n"
-    "    table of contents is damaged, a PATH is not in it or any entry failed; 2\n"
-    "    on wrong usage.\n"
+    "    table of contents is damaged, its signature is required and not valid, a\n"
+    "    PATH is not in it or any entry failed; 2 on wrong usage.\n"
     "\n"
     "EXAMPLES\n"
     "    gwarchive extract -C ~/Restored Photos.zip\n"
@@ -131,6 +142,8 @@ const Command kExtractCommand = {
     {{'C', "directory", true},
      {0, "overwrite", false},
      {0, "ignore-checksum", false},
+     {0, "trust", true},
+     {0, "require-signature", false},
      {0, "progress", false},
      {0, "no-progress", false}},
     1,

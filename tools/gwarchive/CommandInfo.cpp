@@ -2,6 +2,7 @@
 
 #include "Command.h"
 #include "Diagnostics.h"
+#include "JsonWriter.h"
 #include "Locations.h"
 #include "ToolArchive.h"
 
@@ -10,6 +11,8 @@ namespace gwarchive {
 namespace {
 
 int runInfo(const ParsedArguments& arguments) {
+    if (!useTrustOption(arguments))
+        return kExitFailure;
     const std::string& operand = arguments.operands[0];
     auto archive = openArchiveOperand(operand);
     if (!archive)
@@ -27,6 +30,28 @@ int runInfo(const ParsedArguments& arguments) {
         } else {
             ++files;
         }
+    }
+    if (arguments.has("json")) {
+        JsonWriter json;
+        json.beginObject();
+        json.key("archive");
+        json.value(operand);
+        json.key("format");
+        json.value(archive->formatName());
+        archive->writeArchiveFields(json);
+        for (const auto& [key, count] :
+             {std::pair{"entries", archive->entryCount()}, std::pair{"directories", directories},
+              std::pair{"others", files}}) {
+            json.key(key);
+            json.value(static_cast<std::uint64_t>(count));
+        }
+        json.key("bytes");
+        json.value(bytes);
+        json.key("compressedBytes");
+        json.value(compressed);
+        json.endObject();
+        std::printf("%s\n", json.text().c_str());
+        return kExitSuccess;
     }
     std::printf("archive: %s\n", operand.c_str());
     std::printf("format: %s\n", archive->formatName());
@@ -48,16 +73,30 @@ const Command kInfoCommand = {
     "    gwarchive info - summarise an archive\n"
     "\n"
     "SYNOPSIS\n"
-    "    gwarchive info [-v] ARCHIVE\n"
+    "    gwarchive info [--json] [--trust FILE] [-v] ARCHIVE\n"
     "\n"
     "DESCRIPTION\n"
     "    Prints one \"key: value\" line each for: the format; for ZIP the offset at\n"
     "    which the ZIP data starts (not 0 for self-extractors); for XAR whether the\n"
     "    table-of-contents checksum is valid (\"none\" when the archive has no\n"
-    "    checksums at all), whether the archive carries a valid signature, each\n"
-    "    signature's kind and its certificates' common names, and the names of\n"
-    "    the sub-documents; then the number of entries and the total of their\n"
-    "    sizes, decoded and stored. ARCHIVE may be a path or an http(s) URL.\n"
+    "    checksums at all), the signature verdict, each signature's kind, verdict\n"
+    "    and certificates' common names, and the names of the sub-documents;\n"
+    "    then the number of entries and the total of their sizes, decoded and\n"
+    "    stored. ARCHIVE may be a path or an http(s) URL.\n"
+    "\n"
+    "    The signature verdict is one of: none; valid (leaf, anchor): it signs the\n"
+    "    checksum and its chain reaches a trusted root; untrusted (why, chain up\n"
+    "    to where it stopped): it signs the checksum but the chain reaches no\n"
+    "    trusted root, is expired or runs through a certificate that is not a CA;\n"
+    "    INVALID (why): it does not sign this table of contents.\n"
+    "\n"
+    "OPTIONS\n"
+    "    --json        one JSON object instead: archive, format, the archive fields\n"
+    "                  of list --json, entries, directories, others, bytes and\n"
+    "                  compressedBytes.\n"
+    "    --trust FILE  PEM certificates that signing chains may end at, besides\n"
+    "                  the system's trusted roots (SSL_CERT_FILE, SSL_CERT_DIR).\n"
+    "    -v, --verbose show the library's log on standard error.\n"
     "\n"
     "EXIT STATUS\n"
     "    0 on success, 1 when ARCHIVE cannot be opened, 2 on wrong usage. An\n"
@@ -65,7 +104,7 @@ const Command kInfoCommand = {
     "\n"
     "EXAMPLE\n"
     "    gwarchive info Installer.pkg\n",
-    {},
+    {{0, "json", false}, {0, "trust", true}},
     1,
     1,
     runInfo,

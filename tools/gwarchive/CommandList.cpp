@@ -124,6 +124,8 @@ void printLongEntry(const EntryRecord& entry) {
 }
 
 int runList(const ParsedArguments& arguments) {
+    if (!useTrustOption(arguments))
+        return kExitFailure;
     const std::string& operand = arguments.operands[0];
     auto archive = openArchiveOperand(operand);
     if (!archive)
@@ -172,7 +174,7 @@ const Command kListCommand = {
     "    gwarchive list - list the entries of a ZIP or XAR archive\n"
     "\n"
     "SYNOPSIS\n"
-    "    gwarchive list [-l|--long] [--json] [-v] ARCHIVE [PATH...]\n"
+    "    gwarchive list [-l|--long] [--json] [--trust FILE] [-v] ARCHIVE [PATH...]\n"
     "\n"
     "DESCRIPTION\n"
     "    Lists the entries of ARCHIVE depth-first in tree order, each directory\n"
@@ -193,8 +195,10 @@ const Command kListCommand = {
     "                type bits), size, compressedSize, mtime (RFC 3339, UTC), uid, gid,\n"
     "                appleDouble, macBinary, xattrs, and where known linkTarget,\n"
     "                typeCode, creatorCode, resourceForkSize and compression. ZIP\n"
-    "                archives add startOffset; XAR archives add checksumIsValid,\n"
-    "                signatureIsValid, signatures and subdocuments.\n"
+    "                archives add startOffset; XAR archives add checksum,\n"
+    "                checksumIsValid, signatureIsValid, signature, signatureReason,\n"
+    "                signatures and subdocuments (see the README).\n"
+    "    --trust FILE  PEM certificates that XAR signing chains may end at.\n"
     "    -v, --verbose  show the library's log on standard error.\n"
     "\n"
     "EXIT STATUS\n"
@@ -204,7 +208,7 @@ const Command kListCommand = {
     "EXAMPLES\n"
     "    gwarchive list -l Photos.zip\n"
     "    gwarchive list --json Installer.pkg | python3 -m json.tool\n",
-    {{'l', "long", false}, {0, "json", false}},
+    {{'l', "long", false}, {0, "json", false}, {0, "trust", true}},
     1,
     kAnyNumber,
     runList,

@@ -2,6 +2,7 @@
 
 #include "Command.h"
 #include "Diagnostics.h"
+#include "JsonWriter.h"
 #include "Locations.h"
 #include "ToolArchive.h"
 
@@ -9,17 +10,80 @@ namespace gwarchive {
 
 namespace {
 
+void writeError(JsonWriter& json, const std::string& domain, long code, const std::string& text) {
+    json.beginObject();
+    json.key("domain");
+    json.value(domain);
+    json.key("code");
+    json.value(static_cast<std::int64_t>(code));
+    json.key("message");
+    json.value(text);
+    json.endObject();
+}
+
+// The whole verdict as one object; `failure` is what stopped the test before its entries.
+void printJSON(const std::string& operand, const ToolArchive& archive,
+               const std::vector<EntryProblem>& problems, const GWErrorPtr& failure) {
+    JsonWriter json;
+    json.beginObject();
+    json.key("archive");
+    json.value(operand);
+    json.key("format");
+    json.value(archive.formatName());
+    archive.writeArchiveFields(json);
+    json.key("entries");
+    json.value(static_cast<std::uint64_t>(archive.entryCount()));
+    json.key("unverified");
+    json.value(static_cast<std::uint64_t>(archive.unverifiedCount()));
+    json.key("bad");
+    json.beginArray();
+    for (const EntryProblem& problem : problems) {
+        json.beginObject();
+        json.key("path");
+        json.value(problem.path);
+        json.key("error");
+        writeError(json, problem.domain, problem.code, problem.message);
+        json.endObject();
+    }
+    json.endArray();
+    json.key("error");
+    if (failure) {
+        writeError(json, failure->domain(), failure->code(), failure->localizedDescription());
+    } else {
+        json.null();
+    }
+    json.key("passed");
+    json.value(!failure && problems.empty());
+    json.endObject();
+    std::printf("%s\n", json.text().c_str());
+}
+
 int runTest(const ParsedArguments& arguments) {
+    if (!useTrustOption(arguments))
+        return kExitFailure;
     const std::string& operand = arguments.operands[0];
     auto archive = openArchiveOperand(operand);
     if (!archive)
         return kExitFailure;
+    const bool json = arguments.has("json");
+    if (GWErrorPtr refusal = signatureRefusal(*archive, arguments)) {
+        reportError(operand, std::nullopt, refusal);
+        if (json)
+            printJSON(operand, *archive, {}, refusal);
+        return kExitFailure;
+    }
     // Digests listed in a table of contents that fails its own check prove nothing.
     if (GWErrorPtr integrity = archive->integrityError()) {
         reportError(operand, std::nullopt, integrity);
+        if (json)
+            printJSON(operand, *archive, {}, integrity);
         return kExitFailure;
     }
     std::vector<EntryProblem> problems = archive->test();
+    if (json) {
+        printJSON(operand, *archive, problems, nullptr);
+        return problems.empty() ? kExitSuccess : kExitFailure;
+    }
     for (const EntryProblem& problem : problems) {
         std::printf("%s: %s\n", problem.path.c_str(), problem.message.c_str());
     }
@@ -40,7 +104,7 @@ const Command kTestCommand = {
     "    gwarchive test - check an archive's data without writing anything\n"
     "\n"
     "SYNOPSIS\n"
-    "    gwarchive test [-v] ARCHIVE\n"
+    "    gwarchive test [--json] [--trust FILE] [--require-signature] [-v] ARCHIVE\n"
     "\n"
     "DESCRIPTION\n"
     "    Decodes every entry of ARCHIVE, companions included, and compares what\n"
@@ -52,14 +116,24 @@ const Command kTestCommand = {
     "    A XAR whose table of contents does not match its checksum fails at once.\n"
     "    ARCHIVE may be a path or an http(s) URL.\n"
     "\n"
+    "OPTIONS\n"
+    "    --json               one JSON object instead: format, archive fields as\n"
+    "                         for list --json, entries, unverified, bad (each with\n"
+    "                         path and error {domain, code, message}), error (what\n"
+    "                         stopped the test, or null) and passed.\n"
+    "    --trust FILE         PEM certificates that XAR signing chains may end at,\n"
+    "                         besides the system's trusted roots.\n"
+    "    --require-signature  fail unless the archive's signature is valid.\n"
+    "    -v, --verbose        show the library's log on standard error.\n"
+    "\n"
     "EXIT STATUS\n"
     "    0 when no entry is bad (unverified ones included); 1 when ARCHIVE cannot\n"
-    "    be opened, its table of contents is damaged or any entry is bad; 2 on\n"
-    "    wrong usage.\n"
+    "    be opened, its table of contents is damaged, its signature is required\n"
+    "    and not valid, or any entry is bad; 2 on wrong usage.\n"
     "\n"
     "EXAMPLE\n"
     "    gwarchive test Backup.zip\n",
-    {},
+    {{0, "json", false}, {0, "trust", true}, {0, "require-signature", false}},
     1,
     1,
     runTest,

@@ -30,6 +30,19 @@ void reportFailure(const std::string& archive, const std::optional<std::string>&
     std::fprintf(stderr, "%s: %s\n", prefix(archive, path).c_str(), message.c_str());
 }
 
+namespace {
+bool damaged = false;
+}
+
+void reportDamage(const std::string& archive, const std::string& message) {
+    reportFailure(archive, std::nullopt, message);
+    damaged = true;
+}
+
+int exitStatusAfterDamage(int status) {
+    return status == kExitSuccess && damaged ? kExitFailure : status;
+}
+
 void setVerbose(bool verbose) {
     if (verbose) {
         GWSetLogSink(nullptr);

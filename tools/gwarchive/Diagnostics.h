@@ -16,6 +16,11 @@ void reportError(const std::string& archive, const std::optional<std::string>& p
 void reportFailure(const std::string& archive, const std::optional<std::string>& path,
                    const std::string& message);
 
+// Says what is wrong with an archive the command still works on; the command
+// then ends with kExitFailure however well the rest goes.
+void reportDamage(const std::string& archive, const std::string& message);
+int exitStatusAfterDamage(int status);
+
 // The library logs only when asked to: its lines are for debugging, not for
 // people reading the tool's errors.
 void setVerbose(bool verbose);

@@ -74,11 +74,43 @@ void keepUntilExit(std::unique_ptr<ToolArchive> archive) {
     delete std::exchange(kept, archive.release());
 }
 
+namespace {
+GWXARTrustPtr gTrustAnchors;
+}  // namespace
+
+bool useTrustOption(const ParsedArguments& arguments) {
+    const auto file = arguments.value("trust");
+    if (!file)
+        return true;
+    GWErrorPtr error;
+    gTrustAnchors = GWXARTrust::trustWithAnchorsFile(*file, &error);
+    if (!gTrustAnchors)
+        reportError(*file, std::nullopt, error);
+    return gTrustAnchors != nullptr;
+}
+
+GWXARTrustPtr trustAnchors() {
+    return gTrustAnchors;
+}
+
+GWErrorPtr signatureRefusal(const ToolArchive& archive, const ParsedArguments& arguments) {
+    const std::string verdict = archive.signatureVerdict();
+    if (!arguments.has("require-signature") || verdict == "valid")
+        return nullptr;
+    return GWGenerateError(kGWXARArchiveErrorDomain,
+                           verdict == "untrusted" ? GWXARArchiveUntrustedCertificateError
+                                                  : GWXARArchiveInvalidSignatureError,
+                           std::nullopt, nullptr, {}, "Refused: the signature is %s",
+                           archive.signatureSummary().c_str());
+}
+
 std::unique_ptr<ToolArchive> openArchiveOperand(const std::string& operand) {
     GWErrorPtr error;
     auto archive = ToolArchive::open(archiveURL(operand), &error);
     if (!archive)
         reportError(operand, std::nullopt, error);
+    else if (auto note = archive->damageNote())
+        reportDamage(operand, *note);
     return archive;
 }
 

@@ -8,6 +8,7 @@
 #include <string_view>
 #include <vector>
 
+#include "CommandLine.h"
 #include "GWArchiveSupport/GWArchiveSupport.h"
 
 namespace gwarchive {
@@ -64,6 +65,8 @@ struct ExtractOptions {
 struct EntryProblem {
     std::string path;
     std::string message;
+    std::string domain;
+    long code = 0;
 };
 
 // One opened archive of either format, as the subcommands need it. Entries
@@ -92,6 +95,10 @@ public:
     virtual void writeArchiveFields(JsonWriter& json) const = 0;
     // The format-specific lines of `info`.
     virtual std::vector<std::string> infoLines() const = 0;
+    // "valid", "untrusted", "invalid" or "none" (unsigned; every ZIP), then
+    // in brackets the certificates' names or why it is not valid.
+    virtual std::string signatureVerdict() const { return "none"; }
+    virtual std::string signatureSummary() const { return "none"; }
 
     // The decoded data fork of one entry (a link's text for a symbolic link).
     // All data reaches the sink before a stored checksum is found wrong.
@@ -104,6 +111,9 @@ public:
     // What makes every entry untrustworthy, such as a XAR table of contents
     // that does not match its checksum; none when there is nothing.
     virtual GWErrorPtr integrityError() const { return nullptr; }
+    // What was lost before the archive could be read, such as a missing
+    // central directory whose entries were recovered; none for a whole archive.
+    virtual std::optional<std::string> damageNote() const { return std::nullopt; }
     // Extracts the given entries (all when empty); each failure is reported
     // on standard error as it happens. Returns whether all succeeded.
     virtual bool extract(const std::vector<std::size_t>& indexes, const ExtractOptions& options,
@@ -116,6 +126,14 @@ protected:
 // Keeps the archive until the process ends, which is right after a command:
 // freeing a tree of 200,000 entries node by node costs a tenth of a listing.
 void keepUntilExit(std::unique_ptr<ToolArchive> archive);
+
+// Reads the certificates of --trust FILE as anchors for XAR signatures
+// besides the system's; false, said on standard error, when FILE cannot serve.
+bool useTrustOption(const ParsedArguments& arguments);
+GWXARTrustPtr trustAnchors();
+// With --require-signature, why an archive whose signature is anything but
+// valid is refused (XAR code 7 when untrusted, else 6); none otherwise.
+GWErrorPtr signatureRefusal(const ToolArchive& archive, const ParsedArguments& arguments);
 
 // Opens an ARCHIVE operand, or says why not on standard error and returns none.
 std::unique_ptr<ToolArchive> openArchiveOperand(const std::string& operand);

@@ -67,19 +67,27 @@ public:
         json.value(archive_->checksumIsValid());
         json.key("signatureIsValid");
         json.value(archive_->signatureIsValid());
+        json.key("signature");
+        json.value(signatureVerdict());
+        json.key("signatureReason");
+        json.value(archive_->signatureVerdictReason());
         json.key("signatures");
         json.beginArray();
         for (const auto& signature : archive_->signatures()) {
             json.beginObject();
             json.key("type");
             json.value(signatureTypeName(signature->type()));
+            json.key("extended");
+            json.value(signature->isExtended());
+            json.key("verdict");
+            json.value(GWXARSignatureVerdictName(signature->verdict()));
+            json.key("reason");
+            json.value(signature->verdictReason());
             json.key("certificates");
-            json.beginArray();
-            for (const std::string& name :
-                 signature->certificateCommonNames().value_or(std::vector<std::string>{})) {
-                json.value(name);
-            }
-            json.endArray();
+            writeNames(json,
+                       signature->certificateCommonNames().value_or(std::vector<std::string>{}));
+            json.key("chain");
+            writeNames(json, signature->chainCommonNames());
             json.endObject();
         }
         json.endArray();
@@ -94,13 +102,11 @@ public:
         std::vector<std::string> lines;
         const std::string checksum = checksumVerdict();
         lines.push_back("checksum: " + (checksum == "invalid" ? "INVALID" : checksum));
-        std::string verdict = archive_->signatures().empty() ? "none"
-                              : archive_->signatureIsValid() ? "valid"
-                                                             : "INVALID";
-        lines.push_back("signature: " + verdict);
+        lines.push_back("signature: " + signatureSummary());
         for (const auto& signature : archive_->signatures()) {
             std::string line = std::string("  ") + signatureTypeName(signature->type()) +
-                               (signature->isExtended() ? " (extended)" : "") + ":";
+                               (signature->isExtended() ? " (extended)" : "") + " " +
+                               GWXARSignatureVerdictName(signature->verdict()) + ":";
             for (const std::string& name :
                  signature->certificateCommonNames().value_or(std::vector<std::string>{})) {
                 line += " \"" + name + "\"";
@@ -112,6 +118,34 @@ public:
             names += (names.empty() ? "" : ", ") + name;
         lines.push_back("subdocuments: " + (names.empty() ? std::string("none") : names));
         return lines;
+    }
+
+    std::string signatureVerdict() const override {
+        return GWXARSignatureVerdictName(archive_->signatureVerdict());
+    }
+
+    // "valid (leaf, anchor)", "untrusted (why, leaf, ..., where it stopped)", "INVALID (why)".
+    std::string signatureSummary() const override {
+        const GWXARSignatureVerdict verdict = archive_->signatureVerdict();
+        const GWXARSignaturePtr deciding = GWXARDecidingSignature(archive_->signatures());
+        if (verdict == GWXARSignatureVerdictNone || !deciding)
+            return "none";
+        const std::vector<std::string>& chain = deciding->chainCommonNames();
+        std::vector<std::string> notes;
+        if (verdict == GWXARSignatureVerdictValid) {
+            if (!chain.empty())
+                notes.push_back(chain.front());
+            if (chain.size() > 1)
+                notes.push_back(chain.back());
+        } else {
+            notes.push_back(archive_->signatureVerdictReason());
+            if (verdict == GWXARSignatureVerdictUntrusted)
+                notes.insert(notes.end(), chain.begin(), chain.end());
+        }
+        std::string text = verdict == GWXARSignatureVerdictInvalid ? "INVALID" : signatureVerdict();
+        for (std::size_t index = 0; index < notes.size(); ++index)
+            text += (index == 0 ? " (" : ", ") + notes[index];
+        return notes.empty() ? text : text + ")";
     }
 
     bool stream(std::size_t index, const DataSink& sink, GWErrorPtr* error,
@@ -143,11 +177,13 @@ public:
             // only something that could not be checked.
             const GWXARDataReferencePtr stream = reference ? reference : dataForkOf(file);
             if (!read) {
-                problems.push_back({label, describe(error)});
+                problems.push_back({label, describe(error), error ? error->domain() : "",
+                                    error ? error->code() : 0});
             } else if (stream && !stream->compressedChecksum() && !stream->uncompressedChecksum()) {
                 ++unverified_;
             } else if (checksumFailed) {
-                problems.push_back({label, "the data does not match its stored checksum"});
+                problems.push_back({label, "the data does not match its stored checksum",
+                                    kGWCocoaErrorDomain, GWFileReadCorruptFileError});
             }
         };
         for (std::size_t index = 0; index < files_.size(); ++index) {
@@ -211,6 +247,13 @@ private:
         for (int hops = 0; file && file->type() == GWXARFileTypeHardLink && hops < 64; ++hops)
             file = file->hardlinkDestination();
         return file ? file->dataFork() : nullptr;
+    }
+
+    static void writeNames(JsonWriter& json, const std::vector<std::string>& names) {
+        json.beginArray();
+        for (const std::string& name : names)
+            json.value(name);
+        json.endArray();
     }
 
     std::vector<std::string> subdocumentNames() const {
@@ -394,7 +437,7 @@ private:
 }  // namespace
 
 std::unique_ptr<ToolArchive> openXARArchive(const GWURL& url, GWErrorPtr* error) {
-    GWXARArchivePtr archive = GWXARArchive::initWithURL(url, false, error);
+    GWXARArchivePtr archive = GWXARArchive::initWithURL(url, false, trustAnchors(), error);
     if (!archive)
         return nullptr;
     return std::make_unique<XARToolArchive>(std::move(archive));

@@ -100,6 +100,13 @@ public:
         json.value(archive_->startOffset());
     }
 
+    std::optional<std::string> damageNote() const override {
+        if (const std::uint64_t count = archive_->recoveredEntryCount())
+            return "central directory missing: " + std::to_string(count) +
+                   " entries recovered from local headers";
+        return std::nullopt;
+    }
+
     std::vector<std::string> infoLines() const override {
         return {"start offset: " + std::to_string(archive_->startOffset())};
     }
@@ -213,10 +220,11 @@ private:
         GWErrorPtr error;
         if (!streamFile(
                 file, [](const std::uint8_t*, std::size_t) { return true; }, &error, nullptr)) {
-            problems.push_back({path, error
-                                          ? error->localizedDescription() + " (" + error->domain() +
-                                                " " + std::to_string(error->code()) + ")"
-                                          : "unknown error"});
+            problems.push_back({path,
+                                error ? error->localizedDescription() + " (" + error->domain() +
+                                            " " + std::to_string(error->code()) + ")"
+                                      : "unknown error",
+                                error ? error->domain() : "", error ? error->code() : 0});
         }
     }
 

@@ -118,7 +118,7 @@ int main(int argc, char** argv) {
     }
     for (const Command* command : kCommands) {
         if (first == command->name)
-            return runCommand(*command, {argv + 2, argv + argc});
+            return exitStatusAfterDamage(runCommand(*command, {argv + 2, argv + argc}));
     }
     std::fprintf(stderr, "gwarchive: unknown command '%s'\n\n", first.c_str());
     printToolHelp(stderr);
