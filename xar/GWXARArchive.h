@@ -16,6 +16,7 @@
 #include "GWXARSignature.h"
 #include "foundation/GWCoder.h"
 #include "foundation/GWError.h"
+#include "foundation/GWExtractOptions.h"
 #include "foundation/GWOperationQueue.h"
 #include "foundation/GWRef.h"
 #include "foundation/GWURL.h"
@@ -181,6 +182,12 @@ public:
     // cancelled by another extraction stops without a last call.
     void extractDataReference(const GWXARDataReferencePtr& reference, const GWXARFilePtr& file,
                               const GWOperationQueuePtr& queue, const GWXARDataHandler& handler);
+    // The same for one extraction: it stops when `isCancelled` says so, and a
+    // refusal or a damaged stream ends this stream alone, leaving the
+    // archive's cancellation and every other stream alone. A reference given
+    // is read as the file's own, whatever kind of item the file is.
+    void extractDataReference(const GWXARDataReferencePtr& reference, const GWXARFilePtr& file,
+                              const GWXARDataHandler& handler, std::function<bool()> isCancelled);
     // The single place a data handler is called: a refusal cancels the
     // archive and earns one last call with the user-cancelled error.
     void invokeDataHandler(const GWXARDataHandler& handler, const GWOperationQueuePtr& queue,
@@ -190,15 +197,22 @@ public:
     // Extracts `file` (and its subtree) to `url` on the calling thread. True
     // when the item is there; `checksumIsInvalid` then says whether a digest
     // failed or metadata could not be applied.
+    // `options` as GWXARExtractOperation::setOptions takes them.
     bool extractFile(const GWXARFilePtr& file, const GWURL& url, bool* checksumIsInvalid,
-                     GWErrorPtr* error);
+                     GWErrorPtr* error, const GWExtractOptions& options = {});
     // The same on `queue` (the archive's own when none); `operation` receives
     // the operation for cancelling before it is queued.
     void extractFile(const GWXARFilePtr& file, const GWURL& url, const GWOperationQueuePtr& queue,
                      std::shared_ptr<GWXARExtractOperation>* operation,
-                     ExtractionCompletionHandler completionHandler);
+                     ExtractionCompletionHandler completionHandler,
+                     const GWExtractOptions& options = {});
 
 private:
+    // Without `resolveItem` the stream is read as `file`'s own, as the
+    // attributes of a folder or a link must be when they are extracted.
+    void streamDataReference(const GWXARDataReferencePtr& reference, const GWXARFilePtr& file,
+                             const GWXARDataHandler& handler, GWXARStreamContext context,
+                             bool resolveItem);
     // Copies a finished load's results in.
     void takeResultsOfLoad(const GWXARLoadOperation& operation);
 

@@ -1,5 +1,7 @@
 // The archive's read path for stored streams, and its extract-to-disk entry points.
 
+#include <atomic>
+
 #include "GWArchiveSupport/GWArchiveConstants.h"
 #include "GWXARArchive.h"
 #include "GWXARExtractOperation.h"
@@ -52,36 +54,59 @@ void GWXARArchive::extractExtendedAttribute(const std::string& name, const GWXAR
 }
 
 void GWXARArchive::extractDataReference(const GWXARDataReferencePtr& reference,
-                                        const GWXARFilePtr& file, const GWOperationQueuePtr& queue,
+                                        const GWXARFilePtr& file, const GWOperationQueuePtr&,
                                         const GWXARDataHandler& handler) {
     const auto self = shared_from_this();
+    streamDataReference(reference, file, handler,
+                        {URL(), [self] { return self->isCancelled(); },
+                         [self](bool cancelled) { self->setIsCancelled(cancelled); }, nullptr},
+                        true);
+}
+
+void GWXARArchive::extractDataReference(const GWXARDataReferencePtr& reference,
+                                        const GWXARFilePtr& file, const GWXARDataHandler& handler,
+                                        std::function<bool()> isCancelled) {
+    auto stopped = std::make_shared<std::atomic<bool>>(false);
+    streamDataReference(
+        reference, file, handler,
+        {URL(),
+         [stopped, isCancelled] { return stopped->load() || (isCancelled && isCancelled()); },
+         [stopped](bool cancelled) { stopped->store(cancelled); }, nullptr},
+        !reference);
+}
+
+void GWXARArchive::streamDataReference(const GWXARDataReferencePtr& reference,
+                                       const GWXARFilePtr& file, const GWXARDataHandler& handler,
+                                       GWXARStreamContext context, bool resolveItem) {
+    const auto self = shared_from_this();
     const GWURL url = URL();
+    auto report = [&](std::optional<std::span<const std::uint8_t>> data, const GWErrorPtr& error) {
+        GWXARHeapStream::invokeDataHandler(handler, context, data, true, false, error);
+    };
     if (!file || file->archive() != self) {
-        invokeDataHandler(handler, queue, std::nullopt, true, false, notInArchiveError(url));
+        report(std::nullopt, notInArchiveError(url));
         return;
     }
     // Follow hard links to the item that holds the data. Each step is a
     // weak link to another entry; a cycle is a corrupt tree, not a hang.
     GWXARFilePtr item = file;
-    for (std::size_t hops = 0;; ++hops) {
+    for (std::size_t hops = 0; resolveItem; ++hops) {
         const auto type = item->type();
         if (type == GWXARFileTypeRegular) {
             break;
         }
         if (type == GWXARFileTypeDirectory) {
-            invokeDataHandler(handler, queue, std::nullopt, true, false, GWPOSIXError(EISDIR, url));
+            report(std::nullopt, GWPOSIXError(EISDIR, url));
             return;
         }
         if (type == GWXARFileTypeSymbolicLink) {
             const std::string text = item->symlinkDestination().value_or("");
-            invokeDataHandler(
-                handler, queue,
-                std::span(reinterpret_cast<const std::uint8_t*>(text.data()), text.size()), true,
-                false, nullptr);
+            report(std::span(reinterpret_cast<const std::uint8_t*>(text.data()), text.size()),
+                   nullptr);
             return;
         }
         if (type != GWXARFileTypeHardLink || hops >= kMaxHardLinkChain) {
-            invokeDataHandler(handler, queue, std::nullopt, true, false, GWPOSIXError(EINVAL, url));
+            report(std::nullopt, GWPOSIXError(EINVAL, url));
             return;
         }
         item = item->hardlinkDestination();
@@ -89,20 +114,17 @@ void GWXARArchive::extractDataReference(const GWXARDataReferencePtr& reference,
     const GWXARDataReferencePtr stream = reference ? reference : item->dataFork();
     if (!stream) {
         // Writers leave the data out of empty files.
-        invokeDataHandler(handler, queue, std::span<const std::uint8_t>(), true, false, nullptr);
+        report(std::span<const std::uint8_t>(), nullptr);
         return;
     }
-    GWXARHeapStream::streamDataReference(
-        *stream,
-        {url, [self] { return self->isCancelled(); },
-         [self](bool cancelled) { self->setIsCancelled(cancelled); },
-         [self, item] { return item->archive() == self; }},
-        handler);
+    context.fileBelongsToArchive = [self, item] { return item->archive() == self; };
+    GWXARHeapStream::streamDataReference(*stream, context, handler);
 }
 
 bool GWXARArchive::extractFile(const GWXARFilePtr& file, const GWURL& url, bool* checksumIsInvalid,
-                               GWErrorPtr* error) {
+                               GWErrorPtr* error, const GWExtractOptions& options) {
     auto operation = GWXARExtractOperation::initWithFile(file, url, shared_from_this());
+    operation->setOptions(options);
     operation->start();
     if (checksumIsInvalid) {
         *checksumIsInvalid = operation->checksumIsInvalid();
@@ -116,8 +138,10 @@ bool GWXARArchive::extractFile(const GWXARFilePtr& file, const GWURL& url, bool*
 void GWXARArchive::extractFile(const GWXARFilePtr& file, const GWURL& url,
                                const GWOperationQueuePtr& queue,
                                std::shared_ptr<GWXARExtractOperation>* operation,
-                               ExtractionCompletionHandler completionHandler) {
+                               ExtractionCompletionHandler completionHandler,
+                               const GWExtractOptions& options) {
     auto extraction = GWXARExtractOperation::initWithFile(file, url, shared_from_this());
+    extraction->setOptions(options);
     std::weak_ptr<GWXARExtractOperation> weakExtraction = extraction;
     extraction->setCompletionBlock([weakExtraction, completionHandler] {
         auto finished = weakExtraction.lock();

@@ -6,6 +6,7 @@
 #include <unistd.h>
 
 #include <atomic>
+#include <unordered_map>
 
 #include "GWArchiveSupport/GWArchiveConstants.h"
 #include "GWXARArchive.h"
@@ -17,9 +18,10 @@
 
 bool GWXARExtractOperation::extractRegularFile(const GWXARFilePtr& file, const GWURL& url,
                                                GWErrorPtr* error) {
-    // O_EXCL and O_NOFOLLOW: the private directory holds nothing we did not make.
+    // O_EXCL and O_NOFOLLOW: the private directory holds nothing we did not
+    // make. Ordinary permissions until the archived ones are applied.
     auto fd = GWFileDescriptor::open(url.path().c_str(),
-                                     O_WRONLY | O_CREAT | O_EXCL | O_NOFOLLOW | O_TRUNC, 0600);
+                                     O_WRONLY | O_CREAT | O_EXCL | O_NOFOLLOW | O_TRUNC, 0644);
     if (!fd.isValid()) {
         return GWFail(error, GWPOSIXError(errno, url));
     }
@@ -38,7 +40,6 @@ bool GWXARExtractOperation::writeDataForkOfFile(const GWXARFilePtr& file, int fd
     if (!archive) {
         return false;
     }
-    auto queue = std::make_shared<GWOperationQueue>();
     auto semaphore = std::make_shared<GWSemaphore>(0);
     // Shared with the handler, which the reading machinery may outlive us with.
     struct State {
@@ -67,8 +68,8 @@ bool GWXARExtractOperation::writeDataForkOfFile(const GWXARFilePtr& file, int fd
         end();
         return false;
     };
-    archive->extractDataForkOfFile(
-        file, queue,
+    archive->extractDataReference(
+        file->dataFork(), file,
         [state, end, weakSelf, fail, fd, url](std::optional<std::span<const std::uint8_t>> data,
                                               bool isDone, bool checksumFailed,
                                               const GWErrorPtr& streamError) {
@@ -93,9 +94,13 @@ bool GWXARExtractOperation::writeDataForkOfFile(const GWXARFilePtr& file, int fd
                 end();
             }
             return true;
+        },
+        [weakSelf] {
+            auto self = weakSelf.lock();
+            return !self || self->isCancelled();
         });
-    // Another extraction on the archive failed or was cancelled meanwhile:
-    // the stream stopped without its last call, and nothing else will come.
+    // This extraction was cancelled: the stream stopped without its last
+    // call, and nothing else will come.
     if (!state->ended.load()) {
         fail(cancelledError());
     }
@@ -109,8 +114,9 @@ bool GWXARExtractOperation::writeDataForkOfFile(const GWXARFilePtr& file, int fd
 
 bool GWXARExtractOperation::extractDirectory(const GWXARFilePtr& file, const GWURL& url,
                                              GWErrorPtr* error) {
-    // Owner-only until the archived mode is applied after the subtree.
-    if (::mkdir(url.path().c_str(), 0700) != 0) {
+    // Ordinary permissions until the archived ones are applied after the
+    // subtree, so that a metadata step that fails leaves a usable folder.
+    if (::mkdir(url.path().c_str(), 0755) != 0) {
         return GWFail(error, GWPOSIXError(errno, url));
     }
     std::vector<DeferredHardLink> hardLinks;
@@ -118,16 +124,14 @@ bool GWXARExtractOperation::extractDirectory(const GWXARFilePtr& file, const GWU
         return false;
     }
     // Links find their targets on disk: the files written so far must be there.
-    if (!hardLinks.empty() && !finishWorkers(error)) {
-        return false;
+    if (!hardLinks.empty()) {
+        finishWorkers();
     }
     for (const auto& link : hardLinks) {
         if (isCancelled()) {
             return GWFail(error, cancelledError());
         }
-        if (!extractFile(link.file, link.url, error)) {
-            return false;
-        }
+        extractEntry(link.file, link.url, link.order);
     }
     return true;
 }
@@ -136,28 +140,39 @@ bool GWXARExtractOperation::extractChildrenOfDirectory(const GWXARFilePtr& direc
                                                        const GWURL& url,
                                                        std::vector<DeferredHardLink>& hardLinks,
                                                        GWErrorPtr* error) {
-    for (const auto& child : directory->children()) {
+    // Of several children with one name the last wins, as it would had
+    // each been written over the one before.
+    std::unordered_map<std::string, std::size_t> lastWithName;
+    const auto& children = directory->children();
+    for (std::size_t index = 0; index < children.size(); ++index) {
+        lastWithName[children[index]->name().value_or("")] = index;
+    }
+    for (std::size_t index = 0; index < children.size(); ++index) {
+        const GWXARFilePtr& child = children[index];
         if (isCancelled()) {
             return GWFail(error, cancelledError());
         }
-        if (workerFailed()) {
-            return finishWorkers(error);
+        if (lastWithName[child->name().value_or("")] != index) {
+            continue;
         }
-        auto destination = childURL(url, *child, error);
+        const std::size_t order = nextOrder_++;
+        GWErrorPtr refusal;
+        auto destination = childURL(url, *child, &refusal);
         if (!destination) {
-            return false;
+            recordFailure(order, child, url, refusal);
+            continue;
         }
         // Hard links come after everything else in the directory, so that
         // targets among the siblings and their subtrees exist.
         if (child->type() == GWXARFileTypeHardLink) {
-            hardLinks.push_back({child, *destination});
+            hardLinks.push_back({child, *destination, order});
         } else if (child->type() == GWXARFileTypeRegular) {
-            extractFileOnWorker(child, *destination);
-        } else if (!extractFile(child, *destination, error)) {
-            return false;
+            extractFileOnWorker(child, *destination, order);
+        } else {
+            extractEntry(child, *destination, order);
         }
     }
-    return true;
+    return !isCancelled() || GWFail(error, cancelledError());
 }
 
 bool GWXARExtractOperation::extractSymbolicLink(const GWXARFilePtr& file, const GWURL& url,

@@ -61,34 +61,65 @@ int linuxInodeFlags(std::uint32_t posixFlags) {
 bool GWXARExtractOperation::applyMetadataToFile(const GWXARFilePtr& file, const GWURL& url,
                                                 GWErrorPtr* error) {
     const std::string path = url.path();
+    // A directory is finished long after it was made, so it is reached by a
+    // walk that no link placed meanwhile can redirect, and changed through
+    // the descriptor the walk ends with.
+    GWFileDescriptor directory;
+    if (file->type() == GWXARFileTypeDirectory) {
+        directory = openBuiltDirectory(url, error);
+        if (!directory.isValid()) {
+            return false;
+        }
+    }
+    const int fd = directory.get();
     const GWDate now = GWDate::now();
+    // Each step is tried whatever became of the one before: an attribute the
+    // file system refuses must not cost the item its mode or owner.
+    GWErrorPtr firstFailure;
     // Creation and status-change dates cannot be set on Linux.
     const timespec times[2] = {timespecFromDate(file->accessDate(), now),
                                timespecFromDate(file->modificationDate(), now)};
-    if (::utimensat(AT_FDCWD, path.c_str(), times, AT_SYMLINK_NOFOLLOW) != 0) {
-        return GWFail(error, GWPOSIXError(errno, url));
+    if ((fd >= 0 ? ::futimens(fd, times)
+                 : ::utimensat(AT_FDCWD, path.c_str(), times, AT_SYMLINK_NOFOLLOW)) != 0) {
+        firstFailure = GWPOSIXError(errno, url);
     }
-    if (!applyExtendedAttributesForFile(file, url, error)) {
-        return false;
+    GWErrorPtr attributesError;
+    if (!applyExtendedAttributesForFile(file, url, &attributesError, fd) && !firstFailure) {
+        firstFailure = attributesError ? attributesError : cancelledError();
     }
 
     // Owner, group, mode and ACL are best effort, as a file-security object is:
     // an unprivileged user cannot give files away, and that is no failure.
-    const bool isLink = file->type() == GWXARFileTypeSymbolicLink;
-    [[maybe_unused]] int ignored = ::lchown(path.c_str(), file->ownerID(), file->groupOwnerID());
-    if (!isLink) {
-        ignored = ::chmod(path.c_str(), file->permissionsMode() & 07777);
-        // Only the extended ACL governs access; a POSIX one is the access ACL here.
-        const GWACL* acl = file->extendedACL();
-        if (acl && !acl->isMacExtended()) {
-            ignored = ::acl_set_file(path.c_str(), ACL_TYPE_ACCESS, acl->handle());
+    [[maybe_unused]] int ignored =
+        fd >= 0 ? ::fchown(fd, file->ownerID(), file->groupOwnerID())
+                : ::lchown(path.c_str(), file->ownerID(), file->groupOwnerID());
+    if (file->type() != GWXARFileTypeSymbolicLink) {
+        // The access ACL is what Linux enforces; an extended one in POSIX form
+        // stands in for a missing one. Setting an ACL rewrites the group bits
+        // from its mask, so the mode comes after it and both end as archived.
+        const GWACL* acl = file->accessACL();
+        if (!acl || acl->isMacExtended()) {
+            acl = file->extendedACL();
         }
+        if (acl && !acl->isMacExtended()) {
+            ignored = fd >= 0 ? ::acl_set_fd(fd, acl->handle())
+                              : ::acl_set_file(path.c_str(), ACL_TYPE_ACCESS, acl->handle());
+        }
+        // The default ACL has no descriptor call; the descriptor's own entry
+        // in /proc names the directory the walk reached.
+        const GWACL* inherited = file->defaultACL();
+        if (fd >= 0 && inherited && !inherited->isMacExtended()) {
+            ignored = ::acl_set_file(("/proc/self/fd/" + std::to_string(fd)).c_str(),
+                                     ACL_TYPE_DEFAULT, inherited->handle());
+        }
+        const mode_t mode = file->permissionsMode() & 07777;
+        ignored = fd >= 0 ? ::fchmod(fd, mode) : ::chmod(path.c_str(), mode);
     }
-    applyFlags(*file, url);
-    return true;
+    applyFlags(*file, url, fd);
+    return !firstFailure || GWFail(error, firstFailure);
 }
 
-void GWXARExtractOperation::applyFlags(const GWXARFile& file, const GWURL& url) {
+void GWXARExtractOperation::applyFlags(const GWXARFile& file, const GWURL& url, int fd) {
     const int wanted = linuxInodeFlags(file.posixFlags() & kRestorableFlagsMask);
     if (wanted == 0) {
         return;
@@ -104,16 +135,21 @@ void GWXARExtractOperation::applyFlags(const GWXARFile& file, const GWURL& url) 
     if (type != S_IFREG && type != S_IFDIR) {
         return;  // devices, FIFOs and links carry no inode flags we may open them for
     }
-    auto fd = GWFileDescriptor::open(url.path().c_str(), O_RDONLY | O_NONBLOCK | O_NOFOLLOW);
+    GWFileDescriptor opened;
+    if (fd < 0) {
+        opened = GWFileDescriptor::open(url.path().c_str(), O_RDONLY | O_NONBLOCK | O_NOFOLLOW);
+        fd = opened.get();
+    }
     int flags = 0;
-    if (fd.isValid() && ::ioctl(fd.get(), FS_IOC_GETFLAGS, &flags) == 0) {
+    if (fd >= 0 && ::ioctl(fd, FS_IOC_GETFLAGS, &flags) == 0) {
         flags |= wanted;
-        ::ioctl(fd.get(), FS_IOC_SETFLAGS, &flags);
+        ::ioctl(fd, FS_IOC_SETFLAGS, &flags);
     }
 }
 
 bool GWXARExtractOperation::applyExtendedAttributesForFile(const GWXARFilePtr& file,
-                                                           const GWURL& url, GWErrorPtr* error) {
+                                                           const GWURL& url, GWErrorPtr* error,
+                                                           int fd) {
     if (file->extendedAttributes().empty()) {
         return true;
     }
@@ -121,17 +157,16 @@ bool GWXARExtractOperation::applyExtendedAttributesForFile(const GWXARFilePtr& f
     if (!archive) {
         return false;
     }
-    auto queue = std::make_shared<GWOperationQueue>();
     auto group = std::make_shared<GWGroup>();
     auto setxattrQueue = GWDispatchQueue::serialQueue("GWXARArchive setxattr queue");
+    // Each attribute stops alone: one the file system refuses leaves the
+    // others to be set.
     struct Shared {
-        std::atomic<bool> stop{false};
         std::mutex mutex;
         GWErrorPtr error;
     };
     auto shared = std::make_shared<Shared>();
     auto keepFirst = [shared](GWErrorPtr failure) {
-        shared->stop.store(true);
         std::lock_guard lock(shared->mutex);
         if (!shared->error) {
             shared->error = std::move(failure);
@@ -153,6 +188,7 @@ bool GWXARExtractOperation::applyExtendedAttributesForFile(const GWXARFilePtr& f
         auto buffer = std::make_shared<GWData>();
         auto position = std::make_shared<std::uint32_t>(0);
         auto left = std::make_shared<std::atomic<bool>>(false);
+        auto stop = std::make_shared<std::atomic<bool>>(false);
         auto leave = [group, left] {
             if (!left->exchange(true)) {
                 group->leave();
@@ -160,10 +196,10 @@ bool GWXARExtractOperation::applyExtendedAttributesForFile(const GWXARFilePtr& f
         };
         group->enter();
         archive->extractDataReference(
-            attribute, file, queue,
+            attribute, file,
             [=](std::optional<std::span<const std::uint8_t>> data, bool isDone, bool checksumFailed,
                 const GWErrorPtr& streamError) {
-                if (shared->stop.load()) {
+                if (stop->load()) {
                     return false;
                 }
                 auto self = weakSelf.lock();
@@ -179,7 +215,7 @@ bool GWXARExtractOperation::applyExtendedAttributesForFile(const GWXARFilePtr& f
                     if (!self) {
                         failure = GWCocoaError(GWFileWriteUnknownError, url);
                     } else {
-                        self->appendDataToResourceFork(piece, url, *position, &failure);
+                        self->appendDataToResourceFork(piece, url, *position, &failure, fd);
                     }
                 } else if (!failure) {
                     if (buffer->size() + piece.size() > kMaxBufferedAttributeSize) {
@@ -196,7 +232,8 @@ bool GWXARExtractOperation::applyExtendedAttributesForFile(const GWXARFilePtr& f
                     }
                     if (!failure) {
                         setxattrQueue->sync([&] {
-                            GWMetadataStore store(path);
+                            GWMetadataStore store =
+                                fd >= 0 ? GWMetadataStore(fd, path) : GWMetadataStore(path);
                             GWErrorPtr storeError;
                             if (!store.setAttribute(name, *buffer, &storeError)) {
                                 failure = attributeError(storeError, url);
@@ -210,12 +247,17 @@ bool GWXARExtractOperation::applyExtendedAttributesForFile(const GWXARFilePtr& f
                     }
                     return true;
                 }
+                stop->store(true);
                 keepFirst(failure);
                 leave();
                 return false;
+            },
+            [weakSelf] {
+                auto self = weakSelf.lock();
+                return !self || self->isCancelled();
             });
-        // A stream stopped without its last call (the archive was cancelled
-        // by another extraction, or an earlier attribute failed) has ended all the same.
+        // A stream stopped without its last call (this extraction was
+        // cancelled) has ended all the same.
         if (!left->load()) {
             keepFirst(cancelledError());
             leave();
@@ -231,7 +273,7 @@ bool GWXARExtractOperation::applyExtendedAttributesForFile(const GWXARFilePtr& f
 
 bool GWXARExtractOperation::appendDataToResourceFork(std::span<const std::uint8_t> data,
                                                      const GWURL& url, std::uint32_t& position,
-                                                     GWErrorPtr* error) {
+                                                     GWErrorPtr* error, int fd) {
     if (std::uint64_t(position) + data.size() > 0xFFFFFFFFull) {
         auto archive = archive_.lock();
         return GWFail(
@@ -244,7 +286,7 @@ bool GWXARExtractOperation::appendDataToResourceFork(std::span<const std::uint8_
     if (data.empty()) {
         return true;
     }
-    GWMetadataStore store(url.path());
+    GWMetadataStore store = fd >= 0 ? GWMetadataStore(fd, url.path()) : GWMetadataStore(url.path());
     GWErrorPtr storeError;
     if (!store.writeResourceFork(data, position, &storeError)) {
         return GWFail(error, attributeError(storeError, url));

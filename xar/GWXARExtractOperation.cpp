@@ -55,6 +55,10 @@ std::uint64_t declaredDataSize(const GWXARFilePtr& item) {
 
 GWErrorPtr GWXARExtractOperation::error() const {
     std::lock_guard lock(errorMutex_);
+    // Cancelled on its queue before it ran: the body that says so never came.
+    if (!error_ && !ran_.load() && isCancelled()) {
+        return cancelledError();
+    }
     return error_;
 }
 
@@ -67,7 +71,56 @@ GWErrorPtr GWXARExtractOperation::cancelledError() const {
     return GWCocoaError(GWUserCancelledError, destURL_);
 }
 
+GWURL GWXARExtractOperation::finalURL(const GWURL& url) const {
+    if (!temporaryItemURL_) {
+        return url;
+    }
+    const std::string root = temporaryItemURL_->path();
+    const std::string path = url.path();
+    if (path == root) {
+        return destURL_;
+    }
+    if (path.size() > root.size() && path.compare(0, root.size(), root) == 0 &&
+        path[root.size()] == '/') {
+        return GWURL::fileURLWithPath(destURL_.path() + path.substr(root.size()));
+    }
+    return url;
+}
+
+void GWXARExtractOperation::recordFailure(std::size_t order, const GWXARFilePtr& file,
+                                          const GWURL& url, GWErrorPtr error) {
+    // The private directory is gone by the time anyone reads this.
+    const GWURL where = finalURL(url);
+    if (!error) {
+        error = GWCocoaError(GWFileWriteUnknownError, where);
+    } else if (error->URL() != std::optional<GWURL>(where)) {
+        error = GWGenerateError(error->domain(), error->code(), where, error, error->userInfo(),
+                                "%s", error->localizedDescription().c_str());
+    }
+    std::lock_guard lock(failuresMutex_);
+    failures_.emplace(order, EntryFailure{file, std::move(error)});
+}
+
+bool GWXARExtractOperation::extractEntry(const GWXARFilePtr& file, const GWURL& url,
+                                         std::size_t order) {
+    GWErrorPtr failure;
+    if (extractFile(file, url, &failure)) {
+        return true;
+    }
+    if (isCancelled()) {
+        return false;  // the whole extraction ends as cancelled
+    }
+    // A directory fails only at its own creation; anything else may have
+    // left a partial file that must not pass for the entry.
+    if (file->type() != GWXARFileTypeDirectory) {
+        ::unlink(url.path().c_str());
+    }
+    recordFailure(order, file, url, std::move(failure));
+    return false;
+}
+
 void GWXARExtractOperation::main() {
+    ran_.store(true);
     try {
         GWErrorPtr failure;
         if (performExtractionOperationWithFile(file_, destURL_, &failure)) {
@@ -111,32 +164,47 @@ bool GWXARExtractOperation::performExtractionOperationWithFile(const GWXARFilePt
                               .value_or(temporaryURL.URLByAppendingPathComponent("item"));
     temporaryItemURL_ = itemURL;
     deferTopLevelFlags_ = false;
-    walking_ = true;
-    GWErrorPtr walkError;
-    const bool walked = extractFile(file, itemURL, &walkError);
-    walking_ = false;
-    // A worker's failure lies before the point where the walk stopped.
-    GWErrorPtr workerError;
-    if (!finishWorkers(&workerError)) {
-        return GWFail(error, workerError);
+    nextOrder_ = 0;
+    {
+        std::lock_guard lock(failuresMutex_);
+        failures_.clear();
     }
-    if (!walked) {
-        return GWFail(error, walkError);
+    walking_ = true;
+    const bool created = extractEntry(file, itemURL, nextOrder_++);
+    walking_ = false;
+    finishWorkers();
+    if (isCancelled()) {
+        return GWFail(error, cancelledError());
     }
     for (const auto& [directory, directoryURL] : pendingDirectories_) {
         applyMetadataOrNote(directory, directoryURL);
     }
     pendingDirectories_.clear();
+    GWErrorPtr firstFailure;
+    std::map<std::size_t, EntryFailure> failures;
+    {
+        std::lock_guard lock(failuresMutex_);
+        failures = failures_;
+    }
+    for (const auto& [order, failure] : failures) {
+        firstFailure = firstFailure ? firstFailure : failure.error;
+        if (options_.entryFailed) {
+            options_.entryFailed(failure.file->path(), failure.error);
+        }
+    }
+    if (!created) {
+        return GWFail(error, firstFailure);
+    }
     // Moving a directory updates its "..", which needs write permission on
     // it; without privileges a read-only one gets that for the move only.
-    struct stat itemInfo;
-    const bool lendWrite = ::lstat(itemURL.path().c_str(), &itemInfo) == 0 &&
-                           S_ISDIR(itemInfo.st_mode) && !(itemInfo.st_mode & S_IWUSR) &&
-                           ::geteuid() != 0;
+    struct stat itemInfo = {};
+    const bool isDirectory =
+        ::lstat(itemURL.path().c_str(), &itemInfo) == 0 && S_ISDIR(itemInfo.st_mode);
+    const bool lendWrite = isDirectory && !(itemInfo.st_mode & S_IWUSR) && ::geteuid() != 0;
     if (lendWrite) {
         ::chmod(itemURL.path().c_str(), (itemInfo.st_mode & 07777) | S_IWUSR);
     }
-    if (!GWMoveItemNoReplace(itemURL.path(), destinationPath, error)) {
+    if (!moveIntoPlace(itemURL.path(), destinationPath, isDirectory, error)) {
         return false;
     }
     if (lendWrite) {
@@ -155,7 +223,40 @@ bool GWXARExtractOperation::performExtractionOperationWithFile(const GWXARFilePt
     if (deferTopLevelFlags_) {
         applyFlags(*file, destinationURL);
     }
-    return true;
+    return !firstFailure || GWFail(error, firstFailure);
+}
+
+bool GWXARExtractOperation::moveIntoPlace(const std::string& item, const std::string& destination,
+                                          bool isDirectory, GWErrorPtr* error) {
+    struct stat existing;
+    if (!options_.replaceExisting.value_or(false) || ::lstat(destination.c_str(), &existing) != 0) {
+        return GWMoveItemNoReplace(item, destination, error);
+    }
+    if (S_ISDIR(existing.st_mode)) {
+        return GWFail(error, GWPOSIXError(EEXIST, GWURL::fileURLWithPath(destination)));
+    }
+    // A rename cannot put a directory where a file is, so the file goes first.
+    if (isDirectory) {
+        if (::unlink(destination.c_str()) != 0) {
+            return GWFail(error, GWPOSIXError(errno, GWURL::fileURLWithPath(destination)));
+        }
+        return GWMoveItemNoReplace(item, destination, error);
+    }
+    return GWMoveItemReplacing(item, destination, error);
+}
+
+GWFileDescriptor GWXARExtractOperation::openBuiltDirectory(const GWURL& url,
+                                                           GWErrorPtr* error) const {
+    const std::string folder = temporaryItemURL_
+                                   ? temporaryItemURL_->URLByDeletingLastPathComponent().path()
+                                   : std::string();
+    const std::string path = url.path();
+    if (folder.empty() || path.compare(0, folder.size() + 1, folder + "/") != 0) {
+        GWFail(error, GWPOSIXError(EINVAL, url));
+        return GWFileDescriptor();
+    }
+    return GWOpenDirectoryBelow(folder, std::string_view(path).substr(folder.size() + 1), false,
+                                error);
 }
 
 bool GWXARExtractOperation::extractFile(const GWXARFilePtr& file, const GWURL& url,
@@ -176,21 +277,16 @@ bool GWXARExtractOperation::extractFile(const GWXARFilePtr& file, const GWURL& u
                                      file->path().c_str(),
                                      GWXARFile::stringFromFileType(file->type()).c_str()));
     }
+    if (!created) {
+        return false;
+    }
     if (file->type() == GWXARFileTypeDirectory) {
-        if (walking_ && created) {
+        if (walking_) {
             // Applied once the workers have written everything below it.
             pendingDirectories_.emplace_back(file, url);
             return true;
         }
-        if (!walking_) {
-            GWErrorPtr workerError;
-            if (!finishWorkers(&workerError) && created) {
-                return GWFail(error, workerError);
-            }
-        }
-    }
-    if (!created) {
-        return false;
+        finishWorkers();
     }
     applyMetadataOrNote(file, url);
     return true;

@@ -2,6 +2,7 @@
 
 #include <atomic>
 #include <cstdint>
+#include <map>
 #include <memory>
 #include <mutex>
 #include <optional>
@@ -11,6 +12,8 @@
 
 #include "GWXARFile.h"
 #include "foundation/GWError.h"
+#include "foundation/GWExtractOptions.h"
+#include "foundation/GWFileDescriptor.h"
 #include "foundation/GWOperation.h"
 #include "foundation/GWURL.h"
 
@@ -20,8 +23,10 @@ using GWXARExtractOperationPtr = std::shared_ptr<GWXARExtractOperation>;
 
 // Recreates one archive item, and for a directory its whole subtree, on disk
 // with its metadata. The item is built in a private directory on the
-// destination's file system and moved into place only when complete, never
-// over an existing item; a failed extraction leaves nothing at the destination.
+// destination's file system and moved into place once the walk is over, never
+// over an existing item. An entry that cannot be created is left out while
+// the rest is extracted, and the first such failure in tree order is the
+// result; a cancelled extraction leaves nothing at the destination.
 //
 // Data comes through the archive's streaming read path; this operation only
 // creates file-system objects and writes bytes. Results are published in
@@ -39,6 +44,13 @@ public:
     // Set when a stream's digests did not match, and also when metadata could
     // not be applied: the item is there, but not exactly as archived.
     bool checksumIsInvalid() const { return checksumIsInvalid_.load(); }
+
+    // With replaceExisting, an item at the destination that is not a
+    // directory gives way to the extracted one; a directory never does.
+    // entryFailed hears of every entry left out, in tree order, once the
+    // walk is over, each error naming where the entry was to appear. Entries
+    // always go on after one fails: only cancelling the operation stops them.
+    void setOptions(GWExtractOptions options) { options_ = std::move(options); }
 
     void main() override;
 
@@ -60,6 +72,7 @@ public:
     struct DeferredHardLink {
         GWXARFilePtr file;
         GWURL url;
+        std::size_t order = 0;
     };
     // Extracts the children in order; hard links are only recorded, to be
     // made once everything else in the directory exists.
@@ -71,27 +84,26 @@ public:
     // --- Metadata (GWXARExtractMetadata.cpp) ----------------------------------
     // Dates, extended attributes, owner, group, mode, ACL, then BSD flags.
     bool applyMetadataToFile(const GWXARFilePtr& file, const GWURL& url, GWErrorPtr* error);
+    // With `fd`, an open directory, attributes are set through it.
     bool applyExtendedAttributesForFile(const GWXARFilePtr& file, const GWURL& url,
-                                        GWErrorPtr* error);
+                                        GWErrorPtr* error, int fd = -1);
     // Writes a piece of the resource fork at `position` and advances it;
     // a fork may not pass 4 GiB.
     bool appendDataToResourceFork(std::span<const std::uint8_t> data, const GWURL& url,
-                                  std::uint32_t& position, GWErrorPtr* error);
+                                  std::uint32_t& position, GWErrorPtr* error, int fd = -1);
 
     GWErrorPtr cancelledError() const;
 
     // --- Workers (GWXARExtractWorkers.cpp) -----------------------------------
     // The regular files of a directory are written by workers, twice the
     // processor count of them, while the tree is walked; directories get
-    // their metadata once everything below them is written.
-    void extractFileOnWorker(const GWXARFilePtr& file, const GWURL& url);
-    // Waits for the workers; false with the first failure in tree order.
-    bool finishWorkers(GWErrorPtr* error);
+    // their metadata once everything below them is written. `order` is the
+    // entry's place in the walk.
+    void extractFileOnWorker(const GWXARFilePtr& file, const GWURL& url, std::size_t order);
+    void finishWorkers();
     // A metadata failure leaves the item in place: logged, and reported
     // through checksumIsInvalid().
     void applyMetadataOrNote(const GWXARFilePtr& file, const GWURL& url);
-    // True once a worker has failed: the walk stops there.
-    bool workerFailed() const;
 
     // Whole attributes other than the resource fork are gathered in memory
     // before they are set; one larger than this is refused (E2BIG).
@@ -102,6 +114,15 @@ private:
                           const std::shared_ptr<GWXARArchive>& archive);
 
     void setError(GWErrorPtr error);
+    // extractFile for one entry of the walk: a failure removes what was made
+    // for the entry and is recorded under `order`, and the walk goes on.
+    bool extractEntry(const GWXARFilePtr& file, const GWURL& url, std::size_t order);
+    void recordFailure(std::size_t order, const GWXARFilePtr& file, const GWURL& url,
+                       GWErrorPtr error);
+    bool moveIntoPlace(const std::string& item, const std::string& destination, bool isDirectory,
+                       GWErrorPtr* error);
+    // Where `url` in the private directory is to appear.
+    GWURL finalURL(const GWURL& url) const;
     void markChecksumInvalid() { checksumIsInvalid_.store(true); }
     // Where a child of the directory at `directory` goes; refuses names that
     // would leave the directory.
@@ -115,7 +136,10 @@ private:
                                                   GWErrorPtr* refusal) const;
     // BSD flags as Linux inode flags; those that would pin the item where it
     // is are held back for the top-level item until it has been moved.
-    void applyFlags(const GWXARFile& file, const GWURL& url);
+    void applyFlags(const GWXARFile& file, const GWURL& url, int fd = -1);
+    // A directory of the item being built, opened by a walk from the private
+    // folder that no symbolic link can lead elsewhere.
+    GWFileDescriptor openBuiltDirectory(const GWURL& url, GWErrorPtr* error) const;
 
     GWXARFilePtr file_;
     GWURL destURL_;
@@ -123,15 +147,24 @@ private:
     mutable std::mutex errorMutex_;
     GWErrorPtr error_;
     std::atomic<bool> checksumIsInvalid_{false};
+    std::atomic<bool> ran_{false};
     // The top-level item in the private directory, and whether its flags
     // wait for the move.
     std::optional<GWURL> temporaryItemURL_;
     bool deferTopLevelFlags_ = false;
+    GWExtractOptions options_;
 
     struct Workers;
     std::shared_ptr<Workers> workers_;
     // While the private-directory wrapper walks the item's tree.
     bool walking_ = false;
+    std::size_t nextOrder_ = 0;
+    struct EntryFailure {
+        GWXARFilePtr file;
+        GWErrorPtr error;
+    };
+    mutable std::mutex failuresMutex_;
+    std::map<std::size_t, EntryFailure> failures_;
     // Directories whose metadata waits for their files, deepest first.
     std::vector<std::pair<GWXARFilePtr, GWURL>> pendingDirectories_;
 };

@@ -218,6 +218,42 @@ TEST(GWArchiveTool, ReExtractingMergesRefusesOrReplacesAndLeavesNothingBehind) {
     EXPECT_EQ(leftovers(directory.file("out")), std::vector<std::string>{});
 }
 
+TEST(GWArchiveTool, XarExtractNamesEachFailedEntryAndExtractsTheRest) {
+    XarBuilder xar;
+    std::string unreadable = xar.dataElement("data", bytesOf("c"), XarEncoding::gzip);
+    unreadable.replace(unreadable.find("x-gzip"), 6, "x-lzma");
+    auto file = [](int id, const std::string& name, const std::string& inner) {
+        return "<file id=\"" + std::to_string(id) + "\"><name>" + name +
+               "</name><type>file</type>" + inner + "</file>";
+    };
+    xar.setFiles(
+        file(1, "a.txt", xar.dataElement("data", bytesOf("new a"), XarEncoding::gzip)) +
+        "<file id=\"2\"><name>d</name><type>directory</type>" + file(3, "c.txt", unreadable) +
+        file(4, "e.txt", xar.dataElement("data", bytesOf("e"), XarEncoding::none)) + "</file>");
+    TemporaryDirectory directory;
+    writeFile(directory.file("t.xar"), xar.bytes());
+    fs::create_directories(directory.file("out/d"));
+    writeFile(directory.file("out/a.txt"), bytesOf("old a"));
+    writeFile(directory.file("out/d/mine"), bytesOf("the user's"));
+
+    const std::string arguments =
+        "-C " + shellQuote(directory.file("out")) + " " + shellQuote(directory.file("t.xar"));
+    const std::string prefix = "gwarchive: " + directory.file("t.xar") + ": ";
+    ToolRun first = runTool("extract " + arguments);
+    EXPECT_EQ(first.status, 1);
+    EXPECT_EQ(first.err.rfind(prefix + "a.txt: ", 0), 0u) << first.err;
+    EXPECT_NE(first.err.find("\n" + prefix + "d/c.txt: "), std::string::npos) << first.err;
+    EXPECT_EQ(readFile(directory.file("out/a.txt")), bytesOf("old a"));
+
+    ToolRun second = runTool("extract --overwrite " + arguments);
+    EXPECT_EQ(second.status, 1);
+    EXPECT_TRUE(isErrorLine(second.err, directory.file("t.xar") + ": d/c.txt")) << second.err;
+    EXPECT_EQ(readFile(directory.file("out/a.txt")), bytesOf("new a"));
+    EXPECT_EQ(readFile(directory.file("out/d/e.txt")), bytesOf("e"));
+    EXPECT_EQ(readFile(directory.file("out/d/mine")), bytesOf("the user's"));
+    EXPECT_FALSE(fs::exists(directory.file("out/d/c.txt")));
+}
+
 // Runs the tool as `nobody` in a child process that may live 5 s at most.
 static int runToolUnprivileged(const std::vector<std::string>& arguments) {
     const pid_t child = fork();

@@ -38,6 +38,7 @@ protected:
         ASSERT_EQ(mkdir((root + "/d/e").c_str(), 0755), 0);
         ASSERT_EQ(mkdir((root + "/d/e/f").c_str(), 0705), 0);
         write("d/e/f/deep", gwtest::textBytes(10000, 3));
+        setxattr((root + "/d/e/f").c_str(), "user.folder", "f", 1, 0);
         ASSERT_EQ(symlink("../small", (root + "/d/relative").c_str()), 0);
         ASSERT_EQ(symlink("/nonexistent/absolute", (root + "/absolute").c_str()), 0);
         ASSERT_EQ(link((root + "/small").c_str(), (root + "/d/hard").c_str()), 0);

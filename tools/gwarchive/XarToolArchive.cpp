@@ -1,10 +1,12 @@
 #include <cerrno>
 #include <filesystem>
+#include <unordered_map>
 
 #include "Diagnostics.h"
 #include "FormatAdapters.h"
 #include "JsonWriter.h"
 #include "foundation/GWContainment.h"
+#include "foundation/GWFileSystem.h"
 
 namespace gwarchive {
 
@@ -42,6 +44,14 @@ public:
     explicit XARToolArchive(GWXARArchivePtr archive) : archive_(std::move(archive)) {
         for (const GWXARFilePtr& file : archive_->files())
             add(file);
+        // Of several entries with one path the last wins, as the library
+        // does among siblings.
+        std::unordered_map<std::string_view, std::size_t> last;
+        for (std::size_t index = 0; index < records_.size(); ++index)
+            last[records_[index].path] = index;
+        superseded_.resize(records_.size());
+        for (std::size_t index = 0; index < records_.size(); ++index)
+            superseded_[index] = last[records_[index].path] != index;
     }
 
     const char* formatName() const override { return "xar"; }
@@ -196,18 +206,29 @@ public:
         for (std::size_t index : indexes)
             selected[index] = true;
         bool allGood = true;
+        std::error_code ignored;  // a folder that cannot be made fails each entry below
+        std::filesystem::create_directories(options.directory.path(), ignored);
         for (std::size_t index : indexes) {
             std::optional<std::size_t> parent = parents_[index];
-            if (parent && selected[*parent])
-                continue;  // extracted with its parent
+            if ((parent && selected[*parent]) || superseded_[index])
+                continue;  // extracted with its parent, or replaced by a later namesake
             GWURL url = options.directory.URLByAppendingPathComponent(records_[index].path);
             if (refused(index, url, options, archiveName)) {
                 allGood = false;
                 continue;
             }
-            std::error_code ignored;
-            std::filesystem::create_directories(url.URLByDeletingLastPathComponent().path(),
-                                                ignored);
+            // The folders on the way are made by a walk no link can redirect.
+            const std::string& path = records_[index].path;
+            const std::size_t slash = path.rfind('/');
+            GWErrorPtr failure;
+            if (!GWOpenDirectoryBelow(options.directory.path(),
+                                      slash == std::string::npos ? "" : path.substr(0, slash), true,
+                                      &failure)
+                     .isValid()) {
+                reportError(archiveName, path, failure);
+                allGood = false;
+                continue;
+            }
             allGood &= extractItem(index, url, options, archiveName);
         }
         return allGood;
@@ -339,7 +360,8 @@ private:
     }
 
     // Existing directories are merged into; anything else that exists is an
-    // error for that entry unless overwriting.
+    // error for that entry unless overwriting, and even then a directory is
+    // never replaced by what is not one.
     bool extractItem(std::size_t index, const GWURL& url, const ExtractOptions& options,
                      const std::string& archiveName) {
         const EntryRecord& record = records_[index];
@@ -347,10 +369,12 @@ private:
             return false;
         std::error_code error;
         auto status = std::filesystem::symlink_status(url.path(), error);
-        if (std::filesystem::exists(status)) {
-            if (std::filesystem::is_directory(status) && record.type == EntryType::directory) {
+        if (std::filesystem::is_directory(status)) {
+            if (record.type == EntryType::directory) {
                 bool allGood = true;
                 for (std::size_t child : children_[index]) {
+                    if (superseded_[child])
+                        continue;
                     allGood &= extractItem(
                         child,
                         url.URLByAppendingPathComponent(files_[child]->name().value_or("item")),
@@ -358,19 +382,31 @@ private:
                 }
                 return allGood;
             }
-            if (!options.overwrite) {
-                reportError(archiveName, record.path, GWPOSIXError(EEXIST, url));
-                return false;
-            }
-            std::filesystem::remove_all(url.path(), error);
+            reportError(archiveName, record.path, GWPOSIXError(EISDIR, url));
+            return false;
         }
+        if (std::filesystem::exists(status) && !options.overwrite) {
+            reportError(archiveName, record.path, GWPOSIXError(EEXIST, url));
+            return false;
+        }
+        // Entries that fail are left out of the tree; each is reported under
+        // its own path, and the rest stays extracted.
+        bool reported = false;
+        GWExtractOptions extractOptions;
+        extractOptions.replaceExisting = options.overwrite;
+        extractOptions.entryFailed = [&](const std::string& path, const GWErrorPtr& failure) {
+            reportError(archiveName, path, failure);
+            reported = true;
+        };
         bool checksumIsInvalid = false;
         GWErrorPtr failure;
-        bool extracted = archive_->extractFile(files_[index], url, &checksumIsInvalid, &failure);
+        const bool extracted =
+            archive_->extractFile(files_[index], url, &checksumIsInvalid, &failure, extractOptions);
         if (options.progress)
             options.progress(subtreeBytes(index));
         if (!extracted) {
-            reportError(archiveName, record.path, failure);
+            if (!reported)
+                reportError(archiveName, record.path, failure);
             return false;
         }
         if (checksumIsInvalid) {
@@ -395,6 +431,7 @@ private:
     std::vector<GWXARFilePtr> files_;
     std::vector<std::optional<std::size_t>> parents_;
     std::vector<std::vector<std::size_t>> children_;
+    std::vector<bool> superseded_;
 };
 
 }  // namespace
