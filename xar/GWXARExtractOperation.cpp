@@ -215,7 +215,8 @@ bool GWXARExtractOperation::performExtractionOperationWithFile(const GWXARFilePt
     const std::string sideFile = GWMetadataSideFile::pathForItem(itemURL.path());
     GWErrorPtr sideFileError;
     if (::access(sideFile.c_str(), F_OK) == 0 &&
-        !GWMetadataStore::moveMetadata(itemURL.path(), destinationPath, &sideFileError)) {
+        !GWMetadataStore::moveMetadata(itemURL.path(), destinationPath,
+                                       options_.replaceExisting.value_or(false), &sideFileError)) {
         GWLog("Failed to apply metadata for %s: %s", destinationPath.c_str(),
               sideFileError->localizedDescription().c_str());
         markChecksumInvalid();
