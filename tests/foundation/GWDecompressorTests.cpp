@@ -1,8 +1,6 @@
 #include <bzlib.h>
 #include <gtest/gtest.h>
-#include <lzma.h>
 #include <zlib.h>
-#include <zstd.h>
 
 #include "foundation/GWChecksum.h"
 #include "foundation/GWDecompressor.h"
@@ -38,28 +36,6 @@ GWData bzip2Bytes(const GWData& input) {
                              reinterpret_cast<char*>(const_cast<std::uint8_t*>(input.data())),
                              unsigned(input.size()), 9, 0, 0);
     output.resize(length);
-    return output;
-}
-
-// ZIP's LZMA form: version, properties size and properties, then raw LZMA
-// ended by its marker.
-GWData zipLzmaBytes(const GWData& input) {
-    lzma_options_lzma options;
-    lzma_lzma_preset(&options, 6);
-    const lzma_filter filters[] = {{LZMA_FILTER_LZMA1, &options}, {LZMA_VLI_UNKNOWN, nullptr}};
-    GWData output(9 + input.size() + input.size() / 2 + 1024);
-    output[0] = 9, output[1] = 20, output[2] = 5;
-    lzma_properties_encode(filters, output.data() + 4);
-    std::size_t length = 9;
-    lzma_raw_buffer_encode(filters, nullptr, input.data(), input.size(), output.data(), &length,
-                           output.size());
-    output.resize(length);
-    return output;
-}
-
-GWData zstdBytes(const GWData& input) {
-    GWData output(ZSTD_compressBound(input.size()));
-    output.resize(ZSTD_compress(output.data(), output.size(), input.data(), input.size(), 3));
     return output;
 }
 
@@ -116,10 +92,10 @@ const Codec kCodecs[] = {
      [](const GWData& d) { return deflateBytes(d, Wrapping::Raw, 9); },
      [] { return GWMakeDeflate64Decoder(false); }},
     {"deflate64", GWDecompressorAlgorithmDeflate64, deflate64Bytes},
-    {"lzma", GWDecompressorAlgorithmLZMA, zipLzmaBytes},
+    {"lzma", GWDecompressorAlgorithmLZMA, gwtest::zipLzmaBytes},
     {"xz", GWDecompressorAlgorithmXZ,
      [](const GWData& d) { return gwtest::xarEncode(d, gwtest::XarEncoding::xz); }},
-    {"zstd", GWDecompressorAlgorithmZstd, zstdBytes},
+    {"zstd", GWDecompressorAlgorithmZstd, gwtest::zstdBytes},
 };
 
 }  // namespace
