@@ -70,6 +70,12 @@ def workloads():
             "7zz": "7zz e -so {archive} " + text,
             "unar": "unar -q -o - {archive} " + text,
         }, "bsdtar", 0.5, prepare=False),
+        Workload("deflate64", "Stream the 256 MiB text entry to /dev/null (ZIP, 7zz Deflate64)",
+                 "deflate64.zip", 5, {
+                     "gwarchive": "{gw} cat {archive} " + text,
+                     "unzip": "unzip -p {archive} " + text,
+                     "7zz": "7zz e -so {archive} " + text,
+                 }, "7zz", 0.5, prepare=False),
     ]
 
 

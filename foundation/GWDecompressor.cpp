@@ -35,6 +35,10 @@ std::shared_ptr<GWDecompressor> GWDecompressor::initForStreamingWithAlgorithm(in
         case GWDecompressorAlgorithmCopy: engine = GWMakeCopyDecoder(); break;
         case GWDecompressorAlgorithmDeflate: engine = GWMakeInflateDecoder(); break;
         case GWDecompressorAlgorithmBzip2: engine = GWMakeBzip2Decoder(); break;
+        case GWDecompressorAlgorithmDeflate64: engine = GWMakeDeflate64Decoder(); break;
+        case GWDecompressorAlgorithmLZMA: engine = GWMakeZipLzmaDecoder(UINT64_MAX, true); break;
+        case GWDecompressorAlgorithmZstd: engine = GWMakeZstdDecoder(); break;
+        case GWDecompressorAlgorithmXZ: engine = GWMakeXzDecoder(); break;
         default:
             GWFail(error, GWGenerateError(kGWPOSIXErrorDomain, EINVAL, std::nullopt, nullptr, {},
                                           "Unknown decompressor algorithm %d", algorithm));
@@ -52,6 +56,11 @@ std::shared_ptr<GWDecompressor> GWDecompressor::initForExplodeStreamingWithUncom
     std::uint64_t size, bool useLargeDictionary, bool useLiteralTree, GWErrorPtr* /*error*/) {
     return std::make_shared<GWDecompressor>(
         GWMakeExplodeDecoder(size, useLargeDictionary, useLiteralTree));
+}
+
+std::shared_ptr<GWDecompressor> GWDecompressor::initForLZMAStreamingWithUncompressedSize(
+    std::uint64_t size, bool hasEndMarker, GWErrorPtr* /*error*/) {
+    return std::make_shared<GWDecompressor>(GWMakeZipLzmaDecoder(size, hasEndMarker));
 }
 
 std::span<const std::uint8_t> GWDecompressor::takeInput(std::span<const std::uint8_t> input) {

@@ -17,6 +17,11 @@ enum GWDecompressorAlgorithm : int {
     GWDecompressorAlgorithmCopy = 0,
     GWDecompressorAlgorithmDeflate = 1,  // raw or zlib-wrapped
     GWDecompressorAlgorithmBzip2 = 5,
+    // Numbered after their ZIP methods.
+    GWDecompressorAlgorithmDeflate64 = 9,
+    GWDecompressorAlgorithmLZMA = 14,  // ZIP's form, ended by its end marker
+    GWDecompressorAlgorithmZstd = 93,
+    GWDecompressorAlgorithmXZ = 95,  // or the older .lzma form
 };
 
 // A streaming decoder: feed it pieces of a compressed stream, take the bytes
@@ -31,6 +36,9 @@ public:
         std::uint64_t size, GWErrorPtr* error);
     static std::shared_ptr<GWDecompressor> initForExplodeStreamingWithUncompressedSize(
         std::uint64_t size, bool useLargeDictionary, bool useLiteralTree, GWErrorPtr* error);
+    // ZIP method 14; without an end marker (flag bit 1) the stream stops at `size`.
+    static std::shared_ptr<GWDecompressor> initForLZMAStreamingWithUncompressedSize(
+        std::uint64_t size, bool hasEndMarker, GWErrorPtr* error);
     ~GWDecompressor();
 
     // One step. Returns none with an error for a damaged stream. Sets

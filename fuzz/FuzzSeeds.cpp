@@ -10,6 +10,7 @@
 #include <vector>
 
 #include "support/AppleDoubleBuilder.h"
+#include "support/DecoderTestSupport.h"
 #include "support/MacBinaryBuilder.h"
 #include "support/TestSupport.h"
 #include "support/XarBuilder.h"
@@ -315,6 +316,13 @@ Seeds decompressorSeeds() {
         seeds.push_back(
             seed(std::uint8_t(3 | flags), text.size(), 100, implodeBytes(text, settings)));
     }
+    // Deflate without 258-byte matches is also Deflate64.
+    seeds.push_back(seed(4, 0, 255, zipCompress(text, 8)));
+    seeds.push_back(seed(5, 0, 6, zipCompress(text, 8)));
+    seeds.push_back(seed(6, 0, 255, zipLzmaBytes(text)));
+    seeds.push_back(seed(7, text.size(), 255, zipLzmaBytes(text)));
+    seeds.push_back(seed(8, 0, 255, zstdBytes(text)));
+    seeds.push_back(seed(9, 0, 255, xarEncode(text, XarEncoding::xz)));
     return seeds;
 }
 

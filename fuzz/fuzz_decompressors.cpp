@@ -1,6 +1,6 @@
 // The streaming decoders behind ZIP and XAR entries, fed a stream in pieces.
 // The first byte picks the decoder (and the explode flags), the next two the
-// expanded size of the legacy methods, the fourth the piece length.
+// expanded size of the methods that need one, the fourth the piece length.
 
 #include <algorithm>
 #include <cstddef>
@@ -8,6 +8,7 @@
 
 #include "FuzzSupport.h"
 #include "foundation/GWDecompressor.h"
+#include "foundation/decoders/GWStreamDecoder.h"
 
 namespace {
 
@@ -17,7 +18,7 @@ constexpr std::uint64_t kMaxOutput = 8 * 1024 * 1024;
 
 std::shared_ptr<GWDecompressor> decompressor(std::uint8_t kind, std::uint64_t size) {
     GWErrorPtr error;
-    switch (kind % 4) {
+    switch ((kind & 0x0F) % 10) {
         case 0:
             return GWDecompressor::initForStreamingWithAlgorithm(GWDecompressorAlgorithmDeflate,
                                                                  &error);
@@ -25,9 +26,23 @@ std::shared_ptr<GWDecompressor> decompressor(std::uint8_t kind, std::uint64_t si
             return GWDecompressor::initForStreamingWithAlgorithm(GWDecompressorAlgorithmBzip2,
                                                                  &error);
         case 2: return GWDecompressor::initForUnshrinkStreamingWithUncompressedSize(size, &error);
-        default:
+        case 3:
             return GWDecompressor::initForExplodeStreamingWithUncompressedSize(
                 size, (kind & 0x10) != 0, (kind & 0x20) != 0, &error);
+        case 4:
+            return GWDecompressor::initForStreamingWithAlgorithm(GWDecompressorAlgorithmDeflate64,
+                                                                 &error);
+        case 5: return std::make_shared<GWDecompressor>(GWMakeDeflate64Decoder(false));
+        case 6:
+            return GWDecompressor::initForStreamingWithAlgorithm(GWDecompressorAlgorithmLZMA,
+                                                                 &error);
+        case 7:
+            return GWDecompressor::initForLZMAStreamingWithUncompressedSize(size, false, &error);
+        case 8:
+            return GWDecompressor::initForStreamingWithAlgorithm(GWDecompressorAlgorithmZstd,
+                                                                 &error);
+        default:
+            return GWDecompressor::initForStreamingWithAlgorithm(GWDecompressorAlgorithmXZ, &error);
     }
 }
 

@@ -6,7 +6,7 @@ set -euo pipefail
 
 packages=(
   build-essential cmake pkg-config python3 clang-format clang-14 libclang-rt-14-dev
-  zlib1g-dev libbz2-dev libssl-dev openssl
+  zlib1g-dev libbz2-dev liblzma-dev libzstd-dev libssl-dev openssl
   libpugixml-dev libacl1-dev libplist-dev libcurl4-openssl-dev libisal-dev
   libgtest-dev libgmock-dev libbenchmark-dev
   unzip zip libarchive-tools 7zip unar macutils nginx

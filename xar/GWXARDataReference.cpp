@@ -37,6 +37,7 @@ std::string GWXARDataReference::stringFromCompressionType(std::uint64_t type) {
         case GWXARCompressionTypeGZip: return "GZip";
         case GWXARCompressionTypeBZ2: return "BZ2";
         case GWXARCompressionTypeLZMA: return "LZMA";
+        case GWXARCompressionTypeXZ: return "XZ";
         default: return "Unknown";
     }
 }

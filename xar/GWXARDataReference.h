@@ -28,6 +28,7 @@ enum GWXARCompressionType : std::uint64_t {
     GWXARCompressionTypeGZip = 1,
     GWXARCompressionTypeBZ2 = 2,
     GWXARCompressionTypeLZMA = 3,
+    GWXARCompressionTypeXZ = 4,
 };
 
 class GWXARDataReference;

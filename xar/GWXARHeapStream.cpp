@@ -21,8 +21,7 @@ GWErrorPtr sizeMismatchError(std::uint64_t statedSize, GWStreamEnd end, const GW
 }
 
 GWErrorPtr unsupportedCompressionError(std::uint64_t type, const GWURL& url) {
-    const std::string entity =
-        type == GWXARCompressionTypeLZMA ? std::string("LZMA") : std::to_string(type);
+    const std::string entity = std::to_string(type);
     return GWGenerateError(kGWXARArchiveErrorDomain, GWXARArchiveUnsupportedCompressionError, url,
                            nullptr, {{kGWXARArchiveUnknownEntityErrorKey, GWValue(entity)}},
                            "The compression \"%s\" of an item in %s cannot be read.",
@@ -36,6 +35,9 @@ std::optional<int> GWXARHeapStream::decompressorAlgorithm(std::uint64_t compress
         case GWXARCompressionTypeNone: return GWDecompressorAlgorithmCopy;
         case GWXARCompressionTypeGZip: return GWDecompressorAlgorithmDeflate;
         case GWXARCompressionTypeBZ2: return GWDecompressorAlgorithmBzip2;
+        // Writers label xz data "x-lzma" as well; the decoder tells the two forms apart.
+        case GWXARCompressionTypeLZMA:
+        case GWXARCompressionTypeXZ: return GWDecompressorAlgorithmXZ;
         default: return std::nullopt;
     }
 }

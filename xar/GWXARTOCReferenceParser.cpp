@@ -195,6 +195,7 @@ bool GWXARLoadOperation::getCompressionType(std::uint64_t* compressionType,
         {"application/x-gzip", GWXARCompressionTypeGZip},
         {"application/x-bzip2", GWXARCompressionTypeBZ2},
         {"application/x-lzma", GWXARCompressionTypeLZMA},
+        {"application/x-xz", GWXARCompressionTypeXZ},
     };
     for (const auto& [name, type] : kStyles) {
         if (name == style.value()) {

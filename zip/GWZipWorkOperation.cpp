@@ -66,7 +66,15 @@ std::shared_ptr<GWDecompressor> GWZipWorkOperation::decompressorForFile(
                 file->storedUncompressedSize(), (file->generalPurposeFlags() & 0x0002) != 0,
                 (file->generalPurposeFlags() & 0x0004) != 0, error);
         case 8: return GWDecompressor::initForStreamingWithAlgorithm(1, error);
+        case 9:
+        case 93:
+        case 95: return GWDecompressor::initForStreamingWithAlgorithm(compressionMethod, error);
         case 12: return GWDecompressor::initForStreamingWithAlgorithm(5, error);
+        case 14:
+            // Without a file (data inside an extra field) only the end marker can end it.
+            return GWDecompressor::initForLZMAStreamingWithUncompressedSize(
+                file ? file->storedUncompressedSize() : UINT64_MAX,
+                !file || (file->generalPurposeFlags() & 0x0002) != 0, error);
         default:
             GWLog("unsupported compression method: %u", unsigned(compressionMethod));
             GWFail(error, GWZipUnknownEntityError(

@@ -49,3 +49,13 @@ std::unique_ptr<GWStreamDecoder> GWMakeBzip2Decoder();
 std::unique_ptr<GWStreamDecoder> GWMakeUnshrinkDecoder(std::uint64_t uncompressedSize);
 std::unique_ptr<GWStreamDecoder> GWMakeExplodeDecoder(std::uint64_t uncompressedSize,
                                                       bool useLargeDictionary, bool useLiteralTree);
+// Deflate64 (ZIP method 9); with `deflate64` false the same engine reads
+// plain raw deflate, which lets it be checked against zlib.
+std::unique_ptr<GWStreamDecoder> GWMakeDeflate64Decoder(bool deflate64 = true);
+// xz, or the older .lzma form (ZIP method 95; XAR's x-xz and x-lzma).
+std::unique_ptr<GWStreamDecoder> GWMakeXzDecoder();
+// ZIP method 14: raw LZMA behind a 9-byte header. Without an end marker
+// (general-purpose bit 1) the stream ends after `uncompressedSize` bytes.
+std::unique_ptr<GWStreamDecoder> GWMakeZipLzmaDecoder(std::uint64_t uncompressedSize,
+                                                      bool hasEndMarker);
+std::unique_ptr<GWStreamDecoder> GWMakeZstdDecoder();

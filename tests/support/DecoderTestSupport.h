@@ -14,4 +14,8 @@ std::optional<GWData> decodeInPieces(GWDecompressor& decompressor,
                                      std::span<const std::uint8_t> stream, std::size_t pieceSize,
                                      GWErrorPtr* error);
 
+// ZIP method 14's stream (with its end marker) and a zstd frame of `input`.
+GWData zipLzmaBytes(const GWData& input);
+GWData zstdBytes(const GWData& input);
+
 }  // namespace gwtest

@@ -1,6 +1,7 @@
 #include "XarBuilder.h"
 
 #include <bzlib.h>
+#include <lzma.h>
 #include <zlib.h>
 
 #include <stdexcept>
@@ -44,6 +45,7 @@ const char* encodingStyle(XarEncoding encoding) {
     switch (encoding) {
         case XarEncoding::gzip: return "application/x-gzip";
         case XarEncoding::bzip2: return "application/x-bzip2";
+        case XarEncoding::xz: return "application/x-xz";
         default: return "application/octet-stream";
     }
 }
@@ -74,6 +76,16 @@ GWData xarEncode(const GWData& bytes, XarEncoding encoding) {
                                      reinterpret_cast<char*>(input.data()), unsigned(input.size()),
                                      9, 0, 0) != BZ_OK) {
             throw std::runtime_error("bzip2 compression failed");
+        }
+        out.resize(length);
+        return out;
+    }
+    if (encoding == XarEncoding::xz) {
+        GWData out(lzma_stream_buffer_bound(bytes.size()));
+        std::size_t length = 0;
+        if (lzma_easy_buffer_encode(6, LZMA_CHECK_CRC64, nullptr, bytes.data(), bytes.size(),
+                                    out.data(), &length, out.size()) != LZMA_OK) {
+            throw std::runtime_error("xz compression failed");
         }
         out.resize(length);
         return out;

@@ -18,7 +18,7 @@ namespace gwtest {
 //     std::string data = xar.dataElement("data", bytesOf("hello"), XarEncoding::gzip);
 //     xar.setFiles("<file id=\"1\"><name>a</name><type>file</type>" + data + "</file>");
 //     writeFile(path, xar.bytes());
-enum class XarEncoding { none, gzip, bzip2 };
+enum class XarEncoding { none, gzip, bzip2, xz };
 
 class XarBuilder {
 public:
@@ -77,7 +77,7 @@ private:
     GWData heap_;
 };
 
-// The zlib, bzip2 or stored form of `bytes`, as XAR heaps carry them.
+// The zlib, bzip2, xz or stored form of `bytes`, as XAR heaps carry them.
 GWData xarEncode(const GWData& bytes, XarEncoding encoding);
 
 }  // namespace gwtest

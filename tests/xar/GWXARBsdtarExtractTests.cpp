@@ -159,7 +159,7 @@ TEST_P(BsdtarExtraction, SingleItemsExtractOnTheirOwn) {
 }
 
 INSTANTIATE_TEST_SUITE_P(Compressions, BsdtarExtraction,
-                         ::testing::Values("gzip", "bzip2", "none"));
+                         ::testing::Values("gzip", "bzip2", "xz", "none"));
 
 // Peak memory while a 500 MiB entry is extracted stays a few MiB above what
 // the process needed before. Only with GW_LARGE_TESTS=1: it takes a while.

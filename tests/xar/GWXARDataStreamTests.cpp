@@ -143,18 +143,26 @@ TEST_F(DataStreamContract, RefusingHandlerGetsExactlyOneCancelledCall) {
     EXPECT_FALSE(archive->isCancelled());
 }
 
-TEST_F(DataStreamContract, LZMAIsRefusedWithCode13) {
-    const GWData content = gwtest::bytesOf("pretend this is xz");
-    std::string element = xar.dataElement("data", content, XarEncoding::none);
-    const std::string style = "application/octet-stream";
-    element.replace(element.find(style), style.size(), "application/x-lzma");
-    auto archive = openWithFile(content, "", element);
+TEST_F(DataStreamContract, XzDecodesUnderEitherStyleAndOtherTypesAreRefusedWithCode13) {
+    const GWData content = gwtest::textBytes(300000, 3);
+    for (const char* style : {"application/x-xz", "application/x-lzma"}) {
+        std::string element = xar.dataElement("data", content, XarEncoding::xz);
+        element.replace(element.find("application/x-xz"), 16, style);
+        auto archive = openWithFile(content, "", element);
+        ASSERT_TRUE(archive);
+        const auto calls = dataFork(archive, "f");
+        EXPECT_EQ(calls.bytes(), content) << style;
+        EXPECT_FALSE(calls.last().error) << style;
+        EXPECT_FALSE(calls.last().checksumFailed) << style;
+    }
+    auto archive = openWithFile(content);
     ASSERT_TRUE(archive);
+    archive->fileWithPath("f")->dataFork()->setCompressionType(5);
     const auto calls = dataFork(archive, "f");
     ASSERT_EQ(calls.calls.size(), 1u);
     ASSERT_TRUE(calls.last().error);
     EXPECT_TRUE(calls.last().error->is(kGWXARArchiveErrorDomain, 13));
-    EXPECT_EQ(calls.last().error->detailString(kGWXARArchiveUnknownEntityErrorKey), "LZMA");
+    EXPECT_EQ(calls.last().error->detailString(kGWXARArchiveUnknownEntityErrorKey), "5");
     EXPECT_EQ(calls.last().error->URL(), archive->URL());
     EXPECT_TRUE(calls.last().isDone);
 }

@@ -581,13 +581,26 @@ INSTANTIATE_TEST_SUITE_P(
             "UnreadableTopLevelFile",
             [](XarBuilder& xar) { return file(xar, 1, "d", gwtest::textBytes(9000, 1)); },
             [](GWXARArchive& archive) {
-                archive.fileWithPath("d")->dataFork()->setCompressionType(GWXARCompressionTypeLZMA);
+                archive.fileWithPath("d")->dataFork()->setCompressionType(7);
             },
             false,
             kGWXARArchiveErrorDomain,
             GWXARArchiveUnsupportedCompressionError,
             "out/d",
             {}},
+        ExtractionOutcome{"MislabelledCompression",
+                          [](XarBuilder& xar) {
+                              std::string data = xar.dataElement("data", gwtest::textBytes(9000, 1),
+                                                                 XarEncoding::gzip);
+                              data.replace(data.find("x-gzip"), 6, "x-lzma");
+                              return xarFileElement(1, "d", "file", "0644", data);
+                          },
+                          nullptr,
+                          false,
+                          kGWCocoaErrorDomain,
+                          GWFileReadCorruptFileError,
+                          "out/d",
+                          {}},
         ExtractionOutcome{"FilesLargerThanTheFreeSpace",
                           [](XarBuilder& xar) {
                               return xarFileElement(1, "d", "directory", "0755",
@@ -714,8 +727,7 @@ TEST_F(XarExtraction, FailedAttributeCostsTheItemNothingElse) {
                                               "sha1", "<name>user.second</name>");
     auto archive = open(xarFileElement(1, "f", "file", "0604", inner));
     ASSERT_TRUE(archive);
-    archive->fileWithPath("f")->extendedAttributes().front()->setCompressionType(
-        GWXARCompressionTypeLZMA);
+    archive->fileWithPath("f")->extendedAttributes().front()->setCompressionType(7);
     gwtest::LogCapture log;
     bool invalid = false;
     GWErrorPtr error;

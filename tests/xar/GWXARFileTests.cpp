@@ -243,7 +243,8 @@ TEST(GWXARFileText, TypeNames) {
     EXPECT_EQ(GWXARDataReference::stringFromChecksumType(3), "MD2");
     EXPECT_EQ(GWXARDataReference::stringFromChecksumType(9), "SHA512");
     EXPECT_EQ(GWXARDataReference::stringFromCompressionType(3), "LZMA");
-    EXPECT_EQ(GWXARDataReference::stringFromCompressionType(4), "Unknown");
+    EXPECT_EQ(GWXARDataReference::stringFromCompressionType(4), "XZ");
+    EXPECT_EQ(GWXARDataReference::stringFromCompressionType(5), "Unknown");
     EXPECT_EQ(GWXARFile::stringFromFileType(GWXARFileTypeCharacterSpecial), "character special");
 }
 

@@ -261,7 +261,7 @@ TEST_F(GWZipMacExtraFields, Mac3WithABadChecksumOrMethodFails) {
     // Methods that need an entry's size have none here.
     EXPECT_FALSE(decode(0x334D, mac3Payload(0, "TEXT", "ttxt", attributes, 6), true));
     EXPECT_TRUE(error->is(kGWPOSIXErrorDomain, EINVAL));
-    EXPECT_FALSE(decode(0x334D, mac3Payload(0, "TEXT", "ttxt", attributes, 9), true));
+    EXPECT_FALSE(decode(0x334D, mac3Payload(0, "TEXT", "ttxt", attributes, 98), true));
     EXPECT_TRUE(error->is(kGWZipArchiveErrorDomain, GWZipArchiveUnsupportedCompressionMethodError));
     // A damaged deflate stream.
     GWData damaged = mac3Payload(0, "TEXT", "ttxt", attributes, 8);

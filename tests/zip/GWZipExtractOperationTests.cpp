@@ -13,11 +13,14 @@
 
 #include "GWArchiveSupport/GWArchiveConstants.h"
 #include "foundation/GWFileManager.h"
+#include "support/DecoderTestSupport.h"
 #include "support/MetadataTestSupport.h"
 #include "support/TestSupport.h"
+#include "support/XarBuilder.h"
 #include "support/ZipBuilder.h"
 #include "support/ZipExtraFields.h"
 #include "support/ZipLegacyEncoders.h"
+#include "zip/GWZipArchive.h"
 #include "zip/ZipExtractTestSupport.h"
 #include "zip/ZipTestSupport.h"
 
@@ -79,6 +82,12 @@ TEST_P(GWZipExtractMethods, WritesTheDecodedBytes) {
         settings.largeDictionary = (c.flags & 2) != 0;
         settings.literalTree = (c.flags & 4) != 0;
         entry.stored = implodeBytes(content, settings);
+    } else if (c.method == 14) {
+        entry.stored = zipLzmaBytes(content);
+    } else if (c.method == 93) {
+        entry.stored = zstdBytes(content);
+    } else if (c.method == 95) {
+        entry.stored = xarEncode(content, XarEncoding::xz);
     }
     if (c.withCompanion) {
         zip.addFile("XtraStuf.mac/member.txt", bytesOf("fork"));
@@ -102,20 +111,55 @@ INSTANTIATE_TEST_SUITE_P(EveryDecoder, GWZipExtractMethods,
                                            MethodCase{"Imploded", 6, 0},
                                            MethodCase{"ImplodedWithCompanion", 6, 0, true},
                                            MethodCase{"ImplodedLargeWithTree", 6, 6},
-                                           MethodCase{"Deflated", 8, 0},
-                                           MethodCase{"Bzip2", 12, 0}),
+                                           MethodCase{"Deflated", 8, 0}, MethodCase{"Bzip2", 12, 0},
+                                           // The end marker is allowed, not needed, without bit 1.
+                                           MethodCase{"LZMA", 14, 2},
+                                           MethodCase{"LZMASized", 14, 0},
+                                           MethodCase{"Zstd", 93, 0}, MethodCase{"XZ", 95, 0}),
                          [](const auto& info) { return std::string(info.param.label); });
 
-TEST_F(GWZipExtractOperationTest, Deflate64IsRefusedWithItsMethodNumber) {
+TEST_F(GWZipExtractOperationTest, SevenZipArchivesOfEveryMethodExtractAsSevenZipDoes) {
+    if (!toolAvailable("7zz")) {
+        GTEST_SKIP() << "7zz is not installed";
+    }
+    // Runs of a 40000-byte block reach Deflate64's far distances and long lengths.
+    GWData content = textBytes(1 << 20, 5);
+    const GWData block = randomBytes(40000, 6);
+    for (int copies = 0; copies < 5; ++copies) {
+        content.insert(content.end(), block.begin(), block.end());
+    }
+    writeFile(directory.file("member.bin"), content);
+    for (const char* method : {"Deflate64", "LZMA", "xz"}) {
+        std::filesystem::remove(archivePath);
+        const std::string folder = shellQuote(directory.path());
+        ASSERT_EQ(runCommand("cd " + folder + " && 7zz a -tzip -mm=" + method +
+                             " archive.zip member.bin >/dev/null")
+                      .status,
+                  0);
+        const CommandResult peer = runCommand("cd " + folder + " && 7zz x -so archive.zip");
+        ASSERT_EQ(peer.output, std::string(content.begin(), content.end())) << method;
+        GWErrorPtr error;
+        auto archive = GWZipArchive::initWithURL(archiveURL, &error);
+        ASSERT_TRUE(archive) << method;
+        std::filesystem::remove(directory.file("out.bin"));
+        auto operation = toDisk(archive->fileWithPath("member.bin"), "out.bin", true);
+        runToEnd(operation);
+        ASSERT_FALSE(operation->error())
+            << method << ": " << operation->error()->localizedDescription();
+        EXPECT_TRUE(readFile(directory.file("out.bin")) == content) << method;
+    }
+}
+
+TEST_F(GWZipExtractOperationTest, UnsupportedMethodsAreRefusedWithTheirNumber) {
     ZipBuilder zip;
-    zip.addFile("a.bin", bytesOf("data"), 9);
+    zip.addFile("a.bin", bytesOf("data"), 98);
     write(zip);
     DataHandlerLog log;
     auto operation = toHandler(zipEntryFromBuilder(zip, 0), log);
     runToEnd(operation);
     ASSERT_TRUE(operation->error());
     EXPECT_TRUE(operation->error()->is(kGWZipArchiveErrorDomain, 1));
-    EXPECT_EQ(operation->error()->detailString(kGWZipArchiveUnknownEntityErrorKey), "9");
+    EXPECT_EQ(operation->error()->detailString(kGWZipArchiveUnknownEntityErrorKey), "98");
     // The handler hears of the failure once, with no data.
     ASSERT_EQ(log.doneFlags.size(), 1u);
     EXPECT_TRUE(log.doneFlags[0]);

@@ -137,9 +137,10 @@ TEST_F(GWZipLocalHeader, ShrunkAndImplodedWithoutAnEntryAreInvalid) {
 
 TEST_F(GWZipLocalHeader, OtherMethodsAreRefusedWithTheirNumber) {
     ZipLogCapture log;
-    for (std::uint16_t method : {2, 3, 4, 5, 7, 9, 14, 95, 99, 0xFFFF}) {
+    for (std::uint16_t method : {2, 3, 4, 5, 7, 98, 99, 0xFFFF}) {
         error = nullptr;
-        EXPECT_EQ(operation->decompressorForFile(entryFor(10, 0), method, &error), nullptr);
+        EXPECT_EQ(operation->decompressorForFile(entryFor(10, 0), method, &error), nullptr)
+            << method;
         ASSERT_NE(error, nullptr);
         EXPECT_TRUE(
             error->is(kGWZipArchiveErrorDomain, GWZipArchiveUnsupportedCompressionMethodError));
