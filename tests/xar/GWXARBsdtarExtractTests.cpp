@@ -158,8 +158,10 @@ TEST_P(BsdtarExtraction, SingleItemsExtractOnTheirOwn) {
     }
 }
 
+// xz is left to the listing table and the stream tests: bsdtar takes most of
+// a minute to write this tree with it, and its own extraction of it fails.
 INSTANTIATE_TEST_SUITE_P(Compressions, BsdtarExtraction,
-                         ::testing::Values("gzip", "bzip2", "xz", "none"));
+                         ::testing::Values("gzip", "bzip2", "none"));
 
 // Peak memory while a 500 MiB entry is extracted stays a few MiB above what
 // the process needed before. Only with GW_LARGE_TESTS=1: it takes a while.
