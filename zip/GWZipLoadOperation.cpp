@@ -256,6 +256,11 @@ std::optional<GWZipFileArray> GWZipLoadOperation::loadFilesFromZipArchiveAtHandl
     if (!buildTreeFromDirectory(end, directoryOffset, directorySize, file, tree, error)) {
         return std::nullopt;
     }
+    return finishTree(tree, error);
+}
+
+std::optional<GWZipFileArray> GWZipLoadOperation::finishTree(GWZipTreeBuilder& tree,
+                                                             GWErrorPtr* error) {
     lastParent_ = nullptr;
     GWZipFileArray roots = tree.finish();
     if (!setUpMetadataItemsForFiles(roots, error)) {

@@ -130,6 +130,9 @@ public:
                              std::uint16_t permissionsMode, GWDictionary extraInfo,
                              GWZipTreeBuilder& rootItems, GWErrorPtr* error);
 
+    // The roots of a built tree, with the Mac metadata companions attached.
+    std::optional<GWZipFileArray> finishTree(GWZipTreeBuilder& tree, GWErrorPtr* error);
+
     // --- Damaged archives --------------------------------------------------------------
     // The entries found by walking the local headers from the start offset,
     // for an archive whose end record or central directory cannot be read;

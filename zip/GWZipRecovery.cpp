@@ -65,8 +65,8 @@ std::optional<GWZipFileArray> GWZipLoadOperation::recoverFilesFromLocalHeaders(
     GWRemoteFileHandle& file, GWErrorPtr* error) {
     const std::uint64_t fileSize = file.fileSize();
     auto cancelled = [this] { return isCancelled(); };
+    // Names and extra fields are copied out before the next read reuses it.
     GWZipReadWindow window(file);
-    GWZipReadWindow parseWindow(file);
     GWZipEntryPipe pipe(GWZipEntryPipe::kUnbounded);
     GWZipParsedBatch batch;
     std::uint64_t position = startOffset_;
@@ -128,8 +128,8 @@ std::optional<GWZipFileArray> GWZipLoadOperation::recoverFilesFromLocalHeaders(
         record.localHeaderOffset = position - startOffset_;
         auto name = filenameFromData(nameBytes, record, &stepError);
         if (!name ||
-            !parseItemFromCentralDirectoryRecord(record, parseWindow, std::move(*name), nameBytes,
-                                                 extra, std::nullopt, batch, &stepError)) {
+            !parseItemFromCentralDirectoryRecord(record, window, std::move(*name), nameBytes, extra,
+                                                 std::nullopt, batch, &stepError)) {
             break;
         }
         if (!batch.entries.empty()) {
@@ -155,10 +155,5 @@ std::optional<GWZipFileArray> GWZipLoadOperation::recoverFilesFromLocalHeaders(
     if (!buildTree(pipe, tree, error)) {
         return std::nullopt;
     }
-    lastParent_ = nullptr;
-    GWZipFileArray roots = tree.finish();
-    if (!setUpMetadataItemsForFiles(roots, error)) {
-        return std::nullopt;
-    }
-    return roots;
+    return finishTree(tree, error);
 }
