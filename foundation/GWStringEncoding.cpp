@@ -148,6 +148,15 @@ std::optional<std::string> GWStringFromBytes(std::string_view bytes, GWStringEnc
     return convert(bytes, iconvName(encoding), "UTF-8");
 }
 
+std::optional<std::string> GWStringFromBytesInNamedEncoding(std::string_view bytes,
+                                                            const std::string& iconvName) {
+    return convert(bytes, iconvName.c_str(), "UTF-8");
+}
+
+bool GWIsKnownEncodingName(const std::string& iconvName) {
+    return !iconvName.empty() && converter(iconvName.c_str(), "UTF-8") != iconv_t(-1);
+}
+
 std::optional<std::string> GWBytesFromString(std::string_view text, GWStringEncoding encoding) {
     const auto* data = reinterpret_cast<const std::uint8_t*>(text.data());
     if (!GWIsValidUTF8(std::span(data, text.size()))) {

@@ -24,6 +24,11 @@ enum class GWStringEncoding {
 std::optional<std::string> GWStringFromBytes(std::span<const std::uint8_t> bytes,
                                              GWStringEncoding encoding);
 std::optional<std::string> GWStringFromBytes(std::string_view bytes, GWStringEncoding encoding);
+// The bytes as UTF-8 text from the encoding iconv calls `iconvName` (such as
+// "CP437"); none when iconv does not know the name or the bytes are not valid in it.
+std::optional<std::string> GWStringFromBytesInNamedEncoding(std::string_view bytes,
+                                                            const std::string& iconvName);
+bool GWIsKnownEncodingName(const std::string& iconvName);
 // UTF-8 text in the encoding; none when a character has no place in it.
 std::optional<std::string> GWBytesFromString(std::string_view text, GWStringEncoding encoding);
 

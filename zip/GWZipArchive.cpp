@@ -73,11 +73,17 @@ GWZipArchivePtr GWZipArchive::initWithURL(const GWURL& url, GWZipLoadOperationPt
 }
 
 GWZipArchivePtr GWZipArchive::initWithURL(const GWURL& url, GWErrorPtr* error) {
+    return initWithURL(url, std::string(), error);
+}
+
+GWZipArchivePtr GWZipArchive::initWithURL(const GWURL& url, const std::string& filenameEncoding,
+                                          GWErrorPtr* error) {
     GWZipLoadOperationPtr operation;
     auto archive = initWithURL(url, &operation, error);
     if (!archive) {
         return nullptr;
     }
+    operation->setFilenameEncoding(filenameEncoding);
     operation->start();
     operation->waitUntilFinished();
     if (operation->isCancelled()) {

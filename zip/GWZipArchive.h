@@ -46,6 +46,10 @@ public:
     // Loads on the calling thread; none with the load's error, or
     // GWUserCancelledError when the load was cancelled.
     static GWZipArchivePtr initWithURL(const GWURL& url, GWErrorPtr* error);
+    // The same, reading names without the UTF-8 flag in the encoding iconv
+    // calls `filenameEncoding` (empty: guessed from the host system).
+    static GWZipArchivePtr initWithURL(const GWURL& url, const std::string& filenameEncoding,
+                                       GWErrorPtr* error);
     // Returns at once with an archive whose `files` stay empty until the
     // handler runs. The load runs on `loadingQueue` (a new queue when none is
     // given), the operation is handed back for cancelling, and the handler

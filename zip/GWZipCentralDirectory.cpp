@@ -17,6 +17,7 @@
 namespace {
 
 constexpr std::uint16_t kDataDescriptorFlag = 0x0008;
+constexpr std::uint16_t kUTF8NamesFlag = 0x0800;
 constexpr std::uint32_t kMSDOSReadOnlyAttribute = 0x01;
 constexpr std::uint32_t kMSDOSDirectoryAttribute = 0x10;
 
@@ -228,6 +229,13 @@ std::string GWZipLoadOperation::convertBackslashesInFilename(std::string filenam
 std::optional<std::string> GWZipLoadOperation::filenameFromData(
     std::span<const std::uint8_t> data, const GWZipCentralDirectoryRecord& record,
     GWErrorPtr*) const {
+    // A caller who names the encoding knows the archive better than any guess.
+    if (!filenameEncoding_.empty() && !(record.generalPurposeFlags & kUTF8NamesFlag)) {
+        const std::string_view bytes(reinterpret_cast<const char*>(data.data()), data.size());
+        if (auto name = GWStringFromBytesInNamedEncoding(bytes, filenameEncoding_)) {
+            return name;
+        }
+    }
     // The UTF-8 flag is not trusted either way: valid UTF-8 wins.
     if (auto name = GWZipFileSystemString(data)) {
         return name;

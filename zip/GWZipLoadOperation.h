@@ -47,6 +47,9 @@ public:
     void setStartOffset(std::uint64_t offset) { startOffset_ = offset; }
     // Never assigned by loading.
     std::uint64_t compressedSize() const { return 0; }
+    // The iconv name of the encoding for names that do not carry the UTF-8
+    // flag; empty (the default) guesses from the host system.
+    void setFilenameEncoding(std::string iconvName) { filenameEncoding_ = std::move(iconvName); }
 
     void main() override;
 
@@ -196,6 +199,7 @@ private:
     GWURL url_;
     std::uint64_t startOffset_ = 0;
     std::uint64_t recoveredEntryCount_ = 0;
+    std::string filenameEncoding_;
     // The walk's (dateFromDOS) and the tree builder's own, when they run on
     // two threads.
     std::unordered_map<std::uint32_t, GWDate> dosDates_;

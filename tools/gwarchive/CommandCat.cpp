@@ -11,6 +11,8 @@ namespace gwarchive {
 namespace {
 
 int runCat(const ParsedArguments& arguments) {
+    if (int status = useOpeningOptions(arguments); status != kExitSuccess)
+        return status;
     const std::string& operand = arguments.operands[0];
     const std::string& path = arguments.operands[1];
     auto archive = openArchiveOperand(operand);
@@ -62,7 +64,7 @@ const Command kCatCommand = {
     "    gwarchive cat - write one entry's data to standard output\n"
     "\n"
     "SYNOPSIS\n"
-    "    gwarchive cat [-v] ARCHIVE PATH\n"
+    "    gwarchive cat [--encoding NAME] [-v] ARCHIVE PATH\n"
     "\n"
     "DESCRIPTION\n"
     "    Decodes the data fork of the entry PATH of ARCHIVE and writes it to\n"
@@ -72,6 +74,11 @@ const Command kCatCommand = {
     "    ARCHIVE may be a path or an http(s) URL; from a server only the\n"
     "    directory and the entry's own bytes are fetched.\n"
     "\n"
+    "OPTIONS\n"
+    "    --encoding NAME  read ZIP names that do not say they are UTF-8 in the\n"
+    "                     encoding iconv calls NAME (e.g. CP437, CP866).\n"
+    "    -v, --verbose    show the library's log on standard error.\n"
+    "\n"
     "EXIT STATUS\n"
     "    0 when all the data was written; 1 when ARCHIVE cannot be opened, PATH is\n"
     "    not a file in it, the data is corrupt or standard output fails; 2 on\n"
@@ -80,7 +87,7 @@ const Command kCatCommand = {
     "\n"
     "EXAMPLE\n"
     "    gwarchive cat Archive.zip docs/README.txt | less\n",
-    {},
+    {{0, "encoding", true}},
     2,
     2,
     runCat,

@@ -40,8 +40,8 @@ std::uint64_t declaredSize(const ToolArchive& archive, const std::vector<std::si
 }
 
 int runExtract(const ParsedArguments& arguments) {
-    if (!useTrustOption(arguments))
-        return kExitFailure;
+    if (int status = useOpeningOptions(arguments); status != kExitSuccess)
+        return status;
     const std::string& operand = arguments.operands[0];
     auto archive = openArchiveOperand(operand);
     if (!archive)
@@ -96,7 +96,7 @@ const Command kExtractCommand = {
     "\n"
     "SYNOPSIS\n"
     "    gwarchive extract [-C DIR] [--overwrite] [--ignore-checksum]\n"
-    "                      [--trust FILE] [--require-signature]\n"
+    "                      [--encoding NAME] [--trust FILE] [--require-signature]\n"
     "                      [--progress|--no-progress] [-v] ARCHIVE [PATH...]\n"
     "\n"
     "DESCRIPTION\n"
@@ -121,6 +121,8 @@ const Command kExtractCommand = {
     "    --overwrite          replace existing items instead of failing.\n"
     "    --ignore-checksum    extract a XAR whose table of contents does not match\n"
     "                         its checksum; without it nothing is written.\n"
+    "    --encoding NAME      read ZIP names that do not say they are UTF-8 in the\n"
+    "                         encoding iconv calls NAME (e.g. CP437, CP866).\n"
     "    --trust FILE         PEM certificates that XAR signing chains may end at,\n"
     "                         besides the system's trusted roots.\n"
     "    --require-signature  write nothing unless the archive's signature is\n"
@@ -142,6 +144,7 @@ const Command kExtractCommand = {
     {{'C', "directory", true},
      {0, "overwrite", false},
      {0, "ignore-checksum", false},
+     {0, "encoding", true},
      {0, "trust", true},
      {0, "require-signature", false},
      {0, "progress", false},

@@ -12,8 +12,8 @@ namespace gwarchive {
 namespace {
 
 int runInfo(const ParsedArguments& arguments) {
-    if (!useTrustOption(arguments))
-        return kExitFailure;
+    if (int status = useOpeningOptions(arguments); status != kExitSuccess)
+        return status;
     const std::string& operand = arguments.operands[0];
     auto archive = openArchiveOperand(operand);
     if (!archive)

@@ -124,8 +124,8 @@ void printLongEntry(const EntryRecord& entry) {
 }
 
 int runList(const ParsedArguments& arguments) {
-    if (!useTrustOption(arguments))
-        return kExitFailure;
+    if (int status = useOpeningOptions(arguments); status != kExitSuccess)
+        return status;
     const std::string& operand = arguments.operands[0];
     auto archive = openArchiveOperand(operand);
     if (!archive)
@@ -174,7 +174,8 @@ const Command kListCommand = {
     "    gwarchive list - list the entries of a ZIP or XAR archive\n"
     "\n"
     "SYNOPSIS\n"
-    "    gwarchive list [-l|--long] [--json] [--trust FILE] [-v] ARCHIVE [PATH...]\n"
+    "    gwarchive list [-l|--long] [--json] [--encoding NAME] [--trust FILE] [-v]\n"
+    "                   ARCHIVE [PATH...]\n"
     "\n"
     "DESCRIPTION\n"
     "    Lists the entries of ARCHIVE depth-first in tree order, each directory\n"
@@ -198,6 +199,8 @@ const Command kListCommand = {
     "                archives add startOffset; XAR archives add checksum,\n"
     "                checksumIsValid, signatureIsValid, signature, signatureReason,\n"
     "                signatures and subdocuments (see the README).\n"
+    "    --encoding NAME  read ZIP names that do not say they are UTF-8 in the\n"
+    "                encoding iconv calls NAME (e.g. CP437, CP866).\n"
     "    --trust FILE  PEM certificates that XAR signing chains may end at.\n"
     "    -v, --verbose  show the library's log on standard error.\n"
     "\n"
@@ -208,7 +211,7 @@ const Command kListCommand = {
     "EXAMPLES\n"
     "    gwarchive list -l Photos.zip\n"
     "    gwarchive list --json Installer.pkg | python3 -m json.tool\n",
-    {{'l', "long", false}, {0, "json", false}, {0, "trust", true}},
+    {{'l', "long", false}, {0, "json", false}, {0, "encoding", true}, {0, "trust", true}},
     1,
     kAnyNumber,
     runList,

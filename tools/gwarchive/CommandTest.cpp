@@ -60,8 +60,8 @@ void printJSON(const std::string& operand, const ToolArchive& archive,
 }
 
 int runTest(const ParsedArguments& arguments) {
-    if (!useTrustOption(arguments))
-        return kExitFailure;
+    if (int status = useOpeningOptions(arguments); status != kExitSuccess)
+        return status;
     const std::string& operand = arguments.operands[0];
     auto archive = openArchiveOperand(operand);
     if (!archive)
@@ -105,7 +105,8 @@ const Command kTestCommand = {
     "    gwarchive test - check an archive's data without writing anything\n"
     "\n"
     "SYNOPSIS\n"
-    "    gwarchive test [--json] [--trust FILE] [--require-signature] [-v] ARCHIVE\n"
+    "    gwarchive test [--json] [--encoding NAME] [--trust FILE] [--require-signature]\n"
+    "                   [-v] ARCHIVE\n"
     "\n"
     "DESCRIPTION\n"
     "    Decodes every entry of ARCHIVE, companions included, and compares what\n"
@@ -122,6 +123,8 @@ const Command kTestCommand = {
     "                         for list --json, entries, unverified, bad (each with\n"
     "                         path and error {domain, code, message}), error (what\n"
     "                         stopped the test, or null) and passed.\n"
+    "    --encoding NAME      read ZIP names that do not say they are UTF-8 in the\n"
+    "                         encoding iconv calls NAME (e.g. CP437, CP866).\n"
     "    --trust FILE         PEM certificates that XAR signing chains may end at,\n"
     "                         besides the system's trusted roots.\n"
     "    --require-signature  fail unless the archive's signature is valid.\n"
@@ -134,7 +137,10 @@ const Command kTestCommand = {
     "\n"
     "EXAMPLE\n"
     "    gwarchive test Backup.zip\n",
-    {{0, "json", false}, {0, "trust", true}, {0, "require-signature", false}},
+    {{0, "json", false},
+     {0, "encoding", true},
+     {0, "trust", true},
+     {0, "require-signature", false}},
     1,
     1,
     runTest,

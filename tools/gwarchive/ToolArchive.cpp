@@ -10,6 +10,7 @@
 #include "Locations.h"
 #include "foundation/GWHTTPRangeReader.h"
 #include "foundation/GWRecentHTTPResources.h"
+#include "foundation/GWStringEncoding.h"
 
 namespace gwarchive {
 
@@ -94,17 +95,30 @@ void keepUntilExit(std::unique_ptr<ToolArchive> archive) {
 
 namespace {
 GWXARTrustPtr gTrustAnchors;
+std::string gNamesEncoding;
 }  // namespace
 
-bool useTrustOption(const ParsedArguments& arguments) {
+int useOpeningOptions(const ParsedArguments& arguments) {
+    if (auto encoding = arguments.value("encoding")) {
+        if (!GWIsKnownEncodingName(*encoding)) {
+            reportFailure("--encoding " + *encoding, std::nullopt,
+                          "not an encoding iconv knows (see iconv -l)");
+            return kExitUsage;
+        }
+        gNamesEncoding = *encoding;
+    }
     const auto file = arguments.value("trust");
     if (!file)
-        return true;
+        return kExitSuccess;
     GWErrorPtr error;
     gTrustAnchors = GWXARTrust::trustWithAnchorsFile(*file, &error);
     if (!gTrustAnchors)
         reportError(*file, std::nullopt, error);
-    return gTrustAnchors != nullptr;
+    return gTrustAnchors ? kExitSuccess : kExitFailure;
+}
+
+const std::string& namesEncoding() {
+    return gNamesEncoding;
 }
 
 GWXARTrustPtr trustAnchors() {

@@ -127,10 +127,14 @@ protected:
 // freeing a tree of 200,000 entries node by node costs a tenth of a listing.
 void keepUntilExit(std::unique_ptr<ToolArchive> archive);
 
-// Reads the certificates of --trust FILE as anchors for XAR signatures
-// besides the system's; false, said on standard error, when FILE cannot serve.
-bool useTrustOption(const ParsedArguments& arguments);
+// Takes the options that shape how archives open: the certificates of
+// --trust FILE as anchors for XAR signatures besides the system's, and
+// --encoding NAME for ZIP names without the UTF-8 flag. The exit status to
+// end with, said on standard error, when one cannot serve; kExitSuccess otherwise.
+int useOpeningOptions(const ParsedArguments& arguments);
 GWXARTrustPtr trustAnchors();
+// The iconv name given with --encoding; empty when none was.
+const std::string& namesEncoding();
 // With --require-signature, why an archive whose signature is anything but
 // valid is refused (XAR code 7 when untrusted, else 6); none otherwise.
 GWErrorPtr signatureRefusal(const ToolArchive& archive, const ParsedArguments& arguments);

@@ -267,7 +267,7 @@ bool ZipToolArchive::extract(const std::vector<std::size_t>& indexes, const Extr
 }  // namespace
 
 std::unique_ptr<ToolArchive> openZipArchive(const GWURL& url, GWErrorPtr* error) {
-    GWZipArchivePtr archive = GWZipArchive::initWithURL(url, error);
+    GWZipArchivePtr archive = GWZipArchive::initWithURL(url, namesEncoding(), error);
     if (!archive)
         return nullptr;
     return std::make_unique<ZipToolArchive>(std::move(archive));
