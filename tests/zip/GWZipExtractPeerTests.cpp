@@ -155,12 +155,14 @@ TEST_F(GWZipExtractPeers, InfoZipWithoutExtraFields) {
     check("plain.zip", false);
 }
 
-TEST_F(GWZipExtractPeers, PythonStoredDeflatedBzip2AndZip64) {
+// Laid out as Android and Java tools do: a JAR marker on the first entry and
+// alignment padding blocks on stored ones.
+TEST_F(GWZipExtractPeers, PythonAndroidLikeStoredDeflatedBzip2AndZip64) {
     if (!toolAvailable("python3")) {
         GTEST_SKIP() << "python3 not installed";
     }
     const char* script = R"(
-import os, sys, zipfile
+import os, struct, sys, zipfile
 out = sys.argv[1]
 with zipfile.ZipFile(out, 'w') as z:
     for root, dirs, files in os.walk('src/tree'):
@@ -176,12 +178,52 @@ with zipfile.ZipFile(out, 'w') as z:
             data = open(path, 'rb').read()
             info.compress_type = [zipfile.ZIP_STORED, zipfile.ZIP_DEFLATED,
                                   zipfile.ZIP_BZIP2][len(name) % 3]
+            if not z.infolist():
+                info.extra = struct.pack('<HH', 0xCAFE, 0)
+            elif info.compress_type == zipfile.ZIP_STORED:
+                info.extra = struct.pack('<HHH3x', 0xD935, 5, 4)
             with z.open(info, 'w', force_zip64=name.endswith('.bin')) as f:
                 f.write(data)
 )";
     writeFile(directory.file("make.py"), bytesOf(script));
     run("python3 make.py python.zip");
     check("python.zip", false);
+}
+
+// An archive cut short in an entry's data, in the central directory or in
+// the end record gives back every whole entry 7zz gives back, and never the
+// cut one.
+TEST_F(GWZipExtractPeers, CutArchivesGiveBackWhatSevenZipDoes) {
+    if (!toolAvailable("7zz")) {
+        GTEST_SKIP() << "7zz not installed";
+    }
+    run("cd src && 7zz a -tzip -snl ../whole.zip tree > /dev/null");
+    const GWData whole = readFile(directory.file("whole.zip"));
+    const Tree original = treeAt(source);
+    for (std::size_t cut : {whole.size() / 2, whole.size() - 30, whole.size() - 10}) {
+        SCOPED_TRACE(cut);
+        const std::string name = "cut" + std::to_string(cut);
+        writeFile(directory.file(name + ".zip"), GWData(whole.begin(), whole.begin() + cut));
+        GWErrorPtr error;
+        auto opened = GWZipArchive::initWithURL(directory.url(name + ".zip"), &error);
+        ASSERT_TRUE(opened) << error->localizedDescription();
+        EXPECT_GT(opened->recoveredEntryCount(), 0u);
+        ASSERT_TRUE(opened->extractFiles(opened->files(), directory.url("ours-" + name), true,
+                                         nullptr, &error))
+            << error->localizedDescription();
+        runCommand("cd " + shellQuote(directory.path()) + " && 7zz x -y -o7zz-" + name + " " +
+                   name + ".zip > /dev/null 2>&1");
+        const Tree ours = treeAt(directory.file("ours-" + name));
+        const Tree theirs = treeAt(directory.file("7zz-" + name));
+        for (const auto& [path, item] : theirs) {
+            const bool whole = item.bytes == original.at(path).bytes;
+            EXPECT_EQ(ours.count(path) != 0, whole || item.kind == 'd') << path;
+        }
+        for (const auto& [path, item] : ours) {
+            ASSERT_TRUE(theirs.count(path)) << path;
+            EXPECT_EQ(item.bytes, original.at(path).bytes) << path;
+        }
+    }
 }
 
 TEST_F(GWZipExtractPeers, BsdtarZipMatchesUnzipAndBsdtar) {
