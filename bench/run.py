@@ -75,7 +75,7 @@ def workloads():
                      "gwarchive": "{gw} cat {archive} " + text,
                      "unzip": "unzip -p {archive} " + text,
                      "7zz": "7zz e -so {archive} " + text,
-                 }, "7zz", 0.5, prepare=False),
+                 }, "7zz", 2.0, prepare=False),
     ]
 
 

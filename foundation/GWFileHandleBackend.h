@@ -26,6 +26,8 @@ public:
 
 std::unique_ptr<GWFileHandleBackend> GWOpenLocalFileBackend(const GWURL& url, bool forWriting,
                                                             GWErrorPtr* error);
+// Reads and writes a regular file the caller has open and goes on owning.
+std::unique_ptr<GWFileHandleBackend> GWMakeLocalFileBackendForDescriptor(int fd, const GWURL& url);
 std::unique_ptr<GWFileHandleBackend> GWMakeDiscardingBackend();
 // Reads an http or https resource with range requests; never writes.
 std::unique_ptr<GWFileHandleBackend> GWOpenHTTPFileBackend(const GWURL& url, GWErrorPtr* error);

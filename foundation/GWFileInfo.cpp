@@ -25,6 +25,29 @@ struct timespec timespecOf(const GWDate& date) {
 
 }  // namespace
 
+std::shared_ptr<GWFileInfo> GWFileInfo::initWithDescriptor(int fd, const GWURL& url,
+                                                           GWErrorPtr* error) {
+    struct statx info {};
+    if (statx(fd, "", AT_EMPTY_PATH, STATX_BASIC_STATS | STATX_BTIME, &info) != 0) {
+        GWFail(error, GWPOSIXError(errno, url));
+        return nullptr;
+    }
+    auto fileInfo = std::shared_ptr<GWFileInfo>(new GWFileInfo());
+    fileInfo->setStatus(info);
+    return fileInfo;
+}
+
+void GWFileInfo::setStatus(const struct statx& info) {
+    if (info.stx_mask & STATX_BTIME) {
+        creationDate_ = dateOf(info.stx_btime);
+    }
+    modificationDate_ = dateOf(info.stx_mtime);
+    accessDate_ = dateOf(info.stx_atime);
+    ownerID_ = info.stx_uid;
+    groupID_ = info.stx_gid;
+    permissionsMode_ = info.stx_mode & 07777;
+}
+
 std::shared_ptr<GWFileInfo> GWFileInfo::initWithURL(const GWURL& url, GWErrorPtr* error) {
     if (!url.isFileURL()) {
         GWFail(error, GWCocoaError(GWFileReadUnsupportedSchemeError, url));
@@ -38,15 +61,7 @@ std::shared_ptr<GWFileInfo> GWFileInfo::initWithURL(const GWURL& url, GWErrorPtr
         return nullptr;
     }
     auto fileInfo = std::shared_ptr<GWFileInfo>(new GWFileInfo());
-    if (info.stx_mask & STATX_BTIME) {
-        fileInfo->creationDate_ = dateOf(info.stx_btime);
-    }
-    fileInfo->modificationDate_ = dateOf(info.stx_mtime);
-    fileInfo->accessDate_ = dateOf(info.stx_atime);
-    fileInfo->ownerID_ = info.stx_uid;
-    fileInfo->groupID_ = info.stx_gid;
-    fileInfo->permissionsMode_ = info.stx_mode & 07777;
-
+    fileInfo->setStatus(info);
     GWErrorPtr readError;
     const auto finderInfo = GWMetadataStore(path).attribute(kGWFinderInfoAttributeName, &readError);
     if (readError) {

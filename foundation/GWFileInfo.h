@@ -1,5 +1,7 @@
 #pragma once
 
+#include <sys/stat.h>
+
 #include <array>
 #include <cstdint>
 #include <memory>
@@ -19,6 +21,11 @@
 class GWFileInfo {
 public:
     static std::shared_ptr<GWFileInfo> initWithURL(const GWURL& url, GWErrorPtr* error);
+    // The item open at `fd`, for one being made: its Finder information is not
+    // read (it reads as zeros), which saves the lookups of a new file's
+    // attributes and side file. `url` names it in errors.
+    static std::shared_ptr<GWFileInfo> initWithDescriptor(int fd, const GWURL& url,
+                                                          GWErrorPtr* error);
 
     // None where the file system records no creation date.
     const std::optional<GWDate>& creationDate() const { return creationDate_; }
@@ -66,6 +73,8 @@ public:
     bool applyToDescriptor(int fd, const GWURL& url, GWErrorPtr* error) const;
 
 private:
+    void setStatus(const struct statx& info);
+
     // Offsets in the big-endian Finder information.
     static constexpr std::size_t kTypeOffset = 0;
     static constexpr std::size_t kCreatorOffset = 4;

@@ -213,7 +213,7 @@ std::shared_ptr<GWReplacementFolder> GWReplacementFolder::createForDestination(
 }
 
 std::string GWReplacementFolder::uniquePath() const {
-    return path_ + "/" + GWUniqueID();
+    return path_ + "/" + std::to_string(used_.fetch_add(1) + 1);
 }
 
 void GWRemoveLiveReplacementFolders() {
@@ -335,15 +335,15 @@ bool GWRemoveItemRecursively(const std::string& path, GWErrorPtr* error) {
     return true;
 }
 
-GWFileDescriptor GWOpenDirectoryBelow(const std::string& root, std::string_view relative,
-                                      bool create, GWErrorPtr* error) {
-    constexpr int kFlags = O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC;
-    GWFileDescriptor current = GWFileDescriptor::open(root.c_str(), kFlags);
-    if (!current.isValid()) {
-        GWFail(error, posixError(errno, root));
-        return {};
-    }
-    std::string reached = root;
+namespace {
+
+constexpr int kDirectoryFlags = O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC;
+
+// Walks from the directory `start`, at the path `reached`, down `relative`,
+// a component at a time; `current` ends as the last directory reached, or
+// stays as it is when `relative` has no components.
+bool walkBelow(int start, std::string reached, std::string_view relative, bool create,
+               GWFileDescriptor& current, GWErrorPtr* error) {
     while (!relative.empty()) {
         const std::size_t slash = relative.find('/');
         const std::string name(relative.substr(0, slash));
@@ -354,22 +354,91 @@ GWFileDescriptor GWOpenDirectoryBelow(const std::string& root, std::string_view 
         }
         reached += "/" + name;
         if (name == "." || name == "..") {
-            GWFail(error, posixError(EINVAL, reached));
-            return {};
+            return GWFail(error, posixError(EINVAL, reached));
         }
-        int next = ::openat(current.get(), name.c_str(), kFlags);
+        const int at = current.isValid() ? current.get() : start;
+        int next = ::openat(at, name.c_str(), kDirectoryFlags);
         if (next < 0 && errno == ENOENT && create) {
-            if (::mkdirat(current.get(), name.c_str(), 0777) != 0 && errno != EEXIST) {
-                GWFail(error, posixError(errno, reached));
-                return {};
+            if (::mkdirat(at, name.c_str(), 0777) != 0 && errno != EEXIST) {
+                return GWFail(error, posixError(errno, reached));
             }
-            next = ::openat(current.get(), name.c_str(), kFlags);
+            next = ::openat(at, name.c_str(), kDirectoryFlags);
         }
         if (next < 0) {
-            GWFail(error, posixError(errno, reached));
-            return {};
+            return GWFail(error, posixError(errno, reached));
         }
         current.reset(next);
     }
-    return current;
+    return true;
+}
+
+}  // namespace
+
+GWFileDescriptor GWOpenDirectoryBelow(const std::string& root, std::string_view relative,
+                                      bool create, GWErrorPtr* error) {
+    GWFileDescriptor current = GWFileDescriptor::open(root.c_str(), kDirectoryFlags);
+    if (!current.isValid()) {
+        GWFail(error, posixError(errno, root));
+        return {};
+    }
+    GWFileDescriptor below;
+    if (!walkBelow(current.get(), root, relative, create, below, error)) {
+        return {};
+    }
+    return below.isValid() ? std::move(below) : std::move(current);
+}
+
+std::shared_ptr<const GWFileDescriptor> GWDirectoryCache::find(const std::string& relative) {
+    std::lock_guard lock(mutex_);
+    const auto found = open_.find(relative);
+    return found == open_.end() ? nullptr : found->second;
+}
+
+std::shared_ptr<const GWFileDescriptor> GWDirectoryCache::open(const std::string& relative,
+                                                               GWErrorPtr* error) {
+    // From the nearest ancestor already open, or from the root.
+    std::shared_ptr<const GWFileDescriptor> start;
+    std::string startPath = relative;
+    while (!start) {
+        if ((start = find(startPath))) {
+            break;
+        }
+        if (startPath.empty()) {
+            break;
+        }
+        const std::size_t slash = startPath.rfind('/');
+        startPath = slash == std::string::npos ? std::string() : startPath.substr(0, slash);
+    }
+    if (start && startPath == relative) {
+        return start;
+    }
+    GWFileDescriptor walked;
+    if (start) {
+        const std::string rest = relative.substr(startPath.size() + (startPath.empty() ? 0 : 1));
+        const std::string startAt = startPath.empty() ? root_ : root_ + "/" + startPath;
+        if (!walkBelow(start->get(), startAt, rest, true, walked, error)) {
+            return nullptr;
+        }
+        if (!walked.isValid()) {
+            return start;
+        }
+    } else {
+        walked = GWOpenDirectoryBelow(root_, relative, true, error);
+        if (!walked.isValid()) {
+            return nullptr;
+        }
+    }
+    auto opened = std::make_shared<const GWFileDescriptor>(std::move(walked));
+    std::lock_guard lock(mutex_);
+    // A few directories at a time are busy; the rest would only hold descriptors.
+    if (open_.size() >= 64) {
+        open_.clear();
+    }
+    open_.emplace(relative, opened);
+    return opened;
+}
+
+void GWDirectoryCache::forget() {
+    std::lock_guard lock(mutex_);
+    open_.clear();
 }

@@ -1,8 +1,11 @@
 #pragma once
 
+#include <atomic>
 #include <memory>
+#include <mutex>
 #include <string>
 #include <string_view>
+#include <unordered_map>
 
 #include "GWError.h"
 #include "GWFileDescriptor.h"
@@ -28,12 +31,14 @@ public:
 
     const std::string& path() const { return path_; }
     // A path in the folder that no other caller gets; nothing is made there.
+    // A count, not a random name: nobody else can write in the folder.
     std::string uniquePath() const;
 
 private:
     explicit GWReplacementFolder(std::string path);
 
     std::string path_;
+    mutable std::atomic<std::uint64_t> used_{0};
 };
 
 // Removes the replacement folders of this process that are still there.
@@ -68,3 +73,26 @@ bool GWRemoveItemRecursively(const std::string& path, GWErrorPtr* error);
 // opens `root` itself.
 GWFileDescriptor GWOpenDirectoryBelow(const std::string& root, std::string_view relative,
                                       bool create, GWErrorPtr* error);
+
+// The directories below one root that an extraction has walked to (as
+// GWOpenDirectoryBelow does, making what is missing), kept open so that each
+// is walked once rather than once per entry. Whatever is removed below the
+// root makes the cache forget them all: a descriptor of a directory that was
+// replaced would lead entries to a place nobody sees. Thread-safe.
+class GWDirectoryCache {
+public:
+    explicit GWDirectoryCache(std::string root) : root_(std::move(root)) {}
+
+    const std::string& root() const { return root_; }
+    // The directory at `relative` if it was walked to and nothing was removed
+    // since; none otherwise. Makes no system call.
+    std::shared_ptr<const GWFileDescriptor> find(const std::string& relative);
+    // The directory at `relative`, walked to from the nearest one known.
+    std::shared_ptr<const GWFileDescriptor> open(const std::string& relative, GWErrorPtr* error);
+    void forget();
+
+private:
+    std::string root_;
+    std::mutex mutex_;
+    std::unordered_map<std::string, std::shared_ptr<const GWFileDescriptor>> open_;
+};

@@ -10,10 +10,10 @@ namespace {
 
 class LocalFileBackend final : public GWFileHandleBackend {
 public:
-    LocalFileBackend(int fd, GWURL url, bool seekable)
-        : fd_(fd), url_(std::move(url)), seekable_(seekable) {}
+    LocalFileBackend(int fd, GWURL url, bool seekable, bool owns = true)
+        : fd_(fd), url_(std::move(url)), seekable_(seekable), owns_(owns) {}
     ~LocalFileBackend() override {
-        if (fd_ >= 0) {
+        if (fd_ >= 0 && owns_) {
             ::close(fd_);
         }
     }
@@ -68,7 +68,7 @@ public:
         if (fd_ < 0) {
             return true;
         }
-        const int result = ::close(fd_);
+        const int result = owns_ ? ::close(fd_) : 0;
         fd_ = -1;
         return result == 0 || GWFail(error, GWPOSIXError(errno, url_));
     }
@@ -77,6 +77,7 @@ private:
     int fd_;
     GWURL url_;
     bool seekable_;
+    bool owns_;
 };
 
 class DiscardingBackend final : public GWFileHandleBackend {
@@ -128,6 +129,10 @@ std::unique_ptr<GWFileHandleBackend> GWOpenLocalFileBackend(const GWURL& url, bo
     }
     const bool seekable = S_ISREG(info.st_mode) || S_ISBLK(info.st_mode);
     return std::make_unique<LocalFileBackend>(fd, url, seekable);
+}
+
+std::unique_ptr<GWFileHandleBackend> GWMakeLocalFileBackendForDescriptor(int fd, const GWURL& url) {
+    return std::make_unique<LocalFileBackend>(fd, url, true, false);
 }
 
 std::unique_ptr<GWFileHandleBackend> GWMakeDiscardingBackend() {

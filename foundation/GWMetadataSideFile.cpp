@@ -4,6 +4,7 @@
 #include <sys/stat.h>
 
 #include <algorithm>
+#include <atomic>
 #include <cerrno>
 #include <cstdio>
 #include <cstring>
@@ -56,6 +57,7 @@ public:
             return;
         }
         std::lock_guard lock(mutex_);
+        made_.store(true, std::memory_order_release);
         place->changed = file.st_ctim;
         files_[{file.st_dev, file.st_ino}] = std::move(*place);
         if (files_.size() >= sweepAt_) {
@@ -67,6 +69,10 @@ public:
         std::lock_guard lock(mutex_);
         files_.erase({file.st_dev, file.st_ino});
     }
+
+    // Whether no side file was ever made: asked for every extracted file, so
+    // without the lock.
+    bool noneEverMade() const { return !made_.load(std::memory_order_acquire); }
 
     bool owns(const struct stat& file, const std::string& path) {
         if (!S_ISREG(file.st_mode)) {
@@ -115,6 +121,7 @@ private:
     std::mutex mutex_;
     std::map<std::pair<dev_t, ino_t>, Place> files_;
     std::size_t sweepAt_ = 256;
+    std::atomic<bool> made_{false};
 };
 
 int renameNoReplace(const std::string& from, const std::string& to) {
@@ -480,9 +487,13 @@ bool GWMetadataSideFile::writeResourceFork(std::span<const std::uint8_t> bytes,
 
 bool GWMetadataSideFile::moveWithItem(const std::string& fromItem, const std::string& toItem,
                                       bool replaceExisting, GWErrorPtr* error) {
+    auto& owned = OwnedSideFiles::shared();
+    // Neither item can have a side file of ours: nothing to look for.
+    if (owned.noneEverMade()) {
+        return true;
+    }
     const std::string from = pathForItem(fromItem);
     const std::string to = pathForItem(toItem);
-    auto& owned = OwnedSideFiles::shared();
     struct stat source {};
     struct stat target {};
     const bool targetIsOurs = isOurs(to, target);

@@ -62,6 +62,14 @@ std::shared_ptr<GWRemoteFileHandle> GWRemoteFileHandle::initForWritingToURL(
     return handle;
 }
 
+std::shared_ptr<GWRemoteFileHandle> GWRemoteFileHandle::initForWritingToDescriptor(
+    int fd, const GWURL& url) {
+    auto handle =
+        std::make_shared<GWRemoteFileHandle>(GWMakeLocalFileBackendForDescriptor(fd, url));
+    handle->url_ = url;
+    return handle;
+}
+
 std::uint64_t GWRemoteFileHandle::fileSize() const {
     return backend_->size();
 }

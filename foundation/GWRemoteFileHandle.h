@@ -45,6 +45,9 @@ public:
     // discards whatever is written.
     static std::shared_ptr<GWRemoteFileHandle> initForWritingToURL(const std::optional<GWURL>& url,
                                                                    GWErrorPtr* error);
+    // Writes from the start of the regular file open at `fd`, which the
+    // caller keeps and closes; `url` names it in errors.
+    static std::shared_ptr<GWRemoteFileHandle> initForWritingToDescriptor(int fd, const GWURL& url);
 
     explicit GWRemoteFileHandle(std::unique_ptr<GWFileHandleBackend> backend);
     ~GWRemoteFileHandle();

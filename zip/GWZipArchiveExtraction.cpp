@@ -7,6 +7,7 @@
 #include "foundation/GWDispatch.h"
 #include "foundation/GWFileSystem.h"
 #include "foundation/GWFreeSpace.h"
+#include "foundation/GWRemoteFileHandlePool.h"
 
 namespace {
 
@@ -179,8 +180,12 @@ void GWZipArchive::extractFiles(const GWZipFileArray& files, const GWURL& direct
             return;
         }
     }
+    auto handles = std::make_shared<GWRemoteFileHandlePool>(URL());
+    auto directories = std::make_shared<GWDirectoryCache>(directory.path());
     for (const auto& operation : *operations) {
         state->operations.push_back(operation);
+        operation->setArchiveHandles(handles);
+        operation->setDirectoryCache(directories);
         operation->setReplacementFolder(state->folder);
         operation->setDefersDirectoryInfo(true);
         if (operation->file()->isDirectory()) {

@@ -4,6 +4,7 @@
 
 #include <algorithm>
 #include <cerrno>
+#include <optional>
 
 #include "GWArchiveSupport/GWArchiveConstants.h"
 #include "GWZipExtractDestination.h"
@@ -50,54 +51,89 @@ GWURL GWZipExtractOperation::containmentRootOrParent() const {
     return containmentRoot_ ? *containmentRoot_ : destURL_->URLByDeletingLastPathComponent();
 }
 
-std::optional<GWURL> GWZipExtractOperation::prepareTarget(bool isDirectory, bool isSymbolicLink,
-                                                          GWErrorPtr* error) {
-    // Concurrent operations would otherwise race while making the same parent
-    // directories.
-    CreationLock lock(creationSemaphore());
-    const GWURL root = containmentRootOrParent();
-    if (auto refusal = containmentErrorForFile(file_, root, *destURL_)) {
-        GWFail(error, std::move(refusal));
-        return std::nullopt;
-    }
+std::shared_ptr<const GWFileDescriptor> GWZipExtractOperation::openParent(
+    const GWURL& root, const std::string& parentRelative, GWErrorPtr* error) {
     // The caller's own directory may be made; below it, only real directories
     // are walked, so no link the archive placed can lead the entry elsewhere.
+    if (!GWItemExistsAtURL(root) && !GWCreateDirectoryAtURL(root, true, error)) {
+        return nullptr;
+    }
+    if (directories_ && directories_->root() == root.path()) {
+        return directories_->open(parentRelative, error);
+    }
+    GWFileDescriptor parent = GWOpenDirectoryBelow(root.path(), parentRelative, true, error);
+    if (!parent.isValid()) {
+        return nullptr;
+    }
+    return std::make_shared<const GWFileDescriptor>(std::move(parent));
+}
+
+std::optional<GWURL> GWZipExtractOperation::prepareTarget(bool isDirectory, bool isSymbolicLink,
+                                                          GWErrorPtr* error) {
+    const GWURL root = containmentRootOrParent();
     const std::string relative = GWRelativePathBelow(root, *destURL_).value_or("");
     const auto slash = relative.find_last_of('/');
     const std::string name = slash == std::string::npos ? relative : relative.substr(slash + 1);
     const std::string parentRelative = slash == std::string::npos ? "" : relative.substr(0, slash);
-    if (!GWItemExistsAtURL(root) && !GWCreateDirectoryAtURL(root, true, error)) {
-        return std::nullopt;
+    // A new item that may replace nothing needs no look at what is there: its
+    // creation (or the move into place) fails if anything is.
+    const bool createsOnly = !isDirectory && !replacesExistingItems();
+    std::shared_ptr<const GWFileDescriptor> parent;
+    if (createsOnly && directories_ && directories_->root() == root.path()) {
+        parent = directories_->find(parentRelative);
     }
-    GWFileDescriptor parent = GWOpenDirectoryBelow(root.path(), parentRelative, true, error);
-    if (!parent.isValid()) {
-        return std::nullopt;
+    // Concurrent operations would otherwise race while making the same parent
+    // directories or replacing the same item.
+    std::optional<CreationLock> lock;
+    if (parent) {
+        if (auto refusal = containmentErrorForFile(file_, root, *destURL_, false)) {
+            GWFail(error, std::move(refusal));
+            return std::nullopt;
+        }
+    } else {
+        lock.emplace(creationSemaphore());
+        if (auto refusal = containmentErrorForFile(file_, root, *destURL_)) {
+            GWFail(error, std::move(refusal));
+            return std::nullopt;
+        }
+        if (!(parent = openParent(root, parentRelative, error))) {
+            return std::nullopt;
+        }
     }
-    struct stat existing;
-    const bool exists = ::fstatat(parent.get(), name.c_str(), &existing, AT_SYMLINK_NOFOLLOW) == 0;
-    const bool existingIsDirectory = exists && S_ISDIR(existing.st_mode);
-    if (isDirectory && existingIsDirectory) {
-        return *destURL_;  // merged into: what the user has there stays
-    }
-    if (exists && !replacesExistingItems()) {
-        GWFail(error, existsError(*destURL_));
-        return std::nullopt;
+    bool exists = false;
+    bool existingIsDirectory = false;
+    if (!createsOnly) {
+        struct stat existing;
+        exists = ::fstatat(parent->get(), name.c_str(), &existing, AT_SYMLINK_NOFOLLOW) == 0;
+        existingIsDirectory = exists && S_ISDIR(existing.st_mode);
+        if (isDirectory && existingIsDirectory) {
+            return *destURL_;  // merged into: what the user has there stays
+        }
+        if (exists && !replacesExistingItems()) {
+            GWFail(error, existsError(*destURL_));
+            return std::nullopt;
+        }
     }
     if (isDirectory || !isAtomic_) {
-        if (exists && !removeExisting(parent.get(), name, existingIsDirectory, *destURL_, error)) {
-            return std::nullopt;
+        if (exists) {
+            if (existingIsDirectory && directories_) {
+                directories_->forget();
+            }
+            if (!removeExisting(parent->get(), name, existingIsDirectory, *destURL_, error)) {
+                return std::nullopt;
+            }
         }
         int made = 0;
         if (isDirectory) {
-            made = ::mkdirat(parent.get(), name.c_str(), 0777);
+            made = ::mkdirat(parent->get(), name.c_str(), 0777);
         } else if (!isSymbolicLink) {
-            GWFileDescriptor file(::openat(parent.get(), name.c_str(),
-                                           O_WRONLY | O_CREAT | O_EXCL | O_NOFOLLOW | O_CLOEXEC,
-                                           0666));
-            made = file.isValid() ? 0 : -1;
+            targetFile_.reset(::openat(parent->get(), name.c_str(),
+                                       O_WRONLY | O_CREAT | O_EXCL | O_NOFOLLOW | O_CLOEXEC, 0666));
+            made = targetFile_.isValid() ? 0 : -1;
         }
         if (made != 0 && !(isDirectory && errno == EEXIST)) {
-            GWFail(error, GWPOSIXError(errno, *destURL_));
+            GWFail(error,
+                   errno == EEXIST ? existsError(*destURL_) : GWPOSIXError(errno, *destURL_));
             return std::nullopt;
         }
         return *destURL_;
@@ -109,11 +145,13 @@ std::optional<GWURL> GWZipExtractOperation::prepareTarget(bool isDirectory, bool
         }
     }
     const GWURL target = GWURL::fileURLWithPath(replacementFolder_->uniquePath());
-    if (!isSymbolicLink && !GWFileDescriptor::open(target.path().c_str(),
-                                                   O_WRONLY | O_CREAT | O_EXCL | O_NOFOLLOW, 0666)
-                                .isValid()) {
-        GWFail(error, GWPOSIXError(errno, target));
-        return std::nullopt;
+    if (!isSymbolicLink) {
+        targetFile_ = GWFileDescriptor::open(target.path().c_str(),
+                                             O_WRONLY | O_CREAT | O_EXCL | O_NOFOLLOW, 0666);
+        if (!targetFile_.isValid()) {
+            GWFail(error, GWPOSIXError(errno, target));
+            return std::nullopt;
+        }
     }
     return target;
 }
@@ -124,9 +162,13 @@ bool GWZipExtractOperation::moveIntoPlace(const GWURL& built, GWErrorPtr* error)
     if (replacesExistingItems()) {
         // A file over a directory replaces it only because the caller asked.
         struct stat existing;
-        if (::lstat(destination.c_str(), &existing) == 0 && S_ISDIR(existing.st_mode) &&
-            !GWRemoveItemRecursively(destination, error)) {
-            return false;
+        if (::lstat(destination.c_str(), &existing) == 0 && S_ISDIR(existing.st_mode)) {
+            if (directories_) {
+                directories_->forget();
+            }
+            if (!GWRemoveItemRecursively(destination, error)) {
+                return false;
+            }
         }
         moved = GWMoveItemReplacing(built.path(), destination, error);
     } else {
@@ -167,9 +209,9 @@ GWURL GWZipEntryDestinationURL(const GWURL& base, std::string_view relativePath)
 
 GWErrorPtr GWZipExtractOperation::containmentErrorForFile(const GWZipFilePtr& file,
                                                           const GWURL& root,
-                                                          const GWURL& destination) {
+                                                          const GWURL& destination, bool onDisk) {
     const auto relative = GWRelativePathBelow(root, destination);
-    bool contained = relative && GWIsContainedDestination(root, destination);
+    bool contained = relative && (!onDisk || GWIsContainedDestination(root, destination));
     if (contained && file) {
         // The entry's own ancestors down to `root`: one per separator.
         auto levels = std::count(relative->begin(), relative->end(), '/');

@@ -12,7 +12,8 @@
 
 bool GWZipExtractOperation::setInfoForFile(const GWZipFilePtr& file, const GWURL& url,
                                            GWErrorPtr* error, int fd) {
-    auto info = GWFileInfo::initWithURL(url, error);
+    auto info = fd >= 0 && !file->isDirectory() ? GWFileInfo::initWithDescriptor(fd, url, error)
+                                                : GWFileInfo::initWithURL(url, error);
     if (!info) {
         return false;
     }

@@ -5,6 +5,7 @@
 #include "foundation/GWFileManager.h"
 #include "foundation/GWFileSystem.h"
 #include "foundation/GWRemoteFileHandle.h"
+#include "foundation/GWRemoteFileHandlePool.h"
 
 GWZipExtractOperationPtr GWZipExtractOperation::make(const GWZipFilePtr& file,
                                                      const GWURL& archiveURL,
@@ -94,6 +95,7 @@ void GWZipExtractOperation::setError(GWErrorPtr error) {
 void GWZipExtractOperation::markDone() {
     // The operation's own folder goes with it; a batch keeps its own.
     replacementFolder_.reset();
+    targetFile_.reset();
     done_.store(true);
     finish();
 }
@@ -138,9 +140,13 @@ void GWZipExtractOperation::main() {
 
 void GWZipExtractOperation::unpackWithHandler(ChunkHandler handler, Completion completion) {
     GWErrorPtr openError;
-    auto handle = GWRemoteFileHandle::initForReadingFromURL(srcURL_, &openError);
-    Completion finalStep = [handle, completion = std::move(completion)](const GWErrorPtr& error) {
-        if (handle) {
+    auto handle = archiveHandles_ ? archiveHandles_->acquire(&openError)
+                                  : GWRemoteFileHandle::initForReadingFromURL(srcURL_, &openError);
+    Completion finalStep = [this, handle,
+                            completion = std::move(completion)](const GWErrorPtr& error) {
+        if (handle && archiveHandles_) {
+            archiveHandles_->release(handle);
+        } else if (handle) {
             handle->closeFileAndReturnError(nullptr);
         }
         completion(error);
@@ -173,12 +179,28 @@ void GWZipExtractOperation::unpackWithHandler(ChunkHandler handler, Completion c
                                setInfoForDirectory(file_, containmentRootOrParent(), *destURL_,
                                                    &stepError);
                            }
-                       } else if (*target == *destURL_ || moveIntoPlace(*target, &stepError)) {
-                           setInfoForFile(file_, *destURL_, &stepError);
-                       } else if (target) {
-                           GWRemoveItemAtURL(*target, nullptr);
+                       } else {
+                           // Set through the file still open, before it moves: a
+                           // decoded MacBinary member is another file by now.
+                           const bool throughDescriptor =
+                               targetFile_.isValid() && !file_->isMacBinaryEncoded();
+                           GWErrorPtr infoError;
+                           if (throughDescriptor) {
+                               setInfoForFile(file_, *target, &infoError, targetFile_.get());
+                           }
+                           if (*target == *destURL_ || moveIntoPlace(*target, &stepError)) {
+                               if (!throughDescriptor) {
+                                   setInfoForFile(file_, *destURL_, &stepError);
+                               }
+                           } else if (target) {
+                               GWRemoveItemAtURL(*target, nullptr);
+                           }
+                           if (!stepError) {
+                               stepError = infoError;
+                           }
                        }
                    }
+                   targetFile_.reset();
                    finalStep(stepError);
                });
 }

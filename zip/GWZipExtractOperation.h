@@ -14,12 +14,15 @@
 #include "foundation/GWDispatch.h"
 #include "foundation/GWError.h"
 #include "foundation/GWExtractOptions.h"
+#include "foundation/GWFileDescriptor.h"
 #include "foundation/GWURL.h"
 #include "foundation/GWValue.h"
 
 class GWZipArchive;
 class GWRemoteFileHandle;
 class GWReplacementFolder;
+class GWDirectoryCache;
+class GWRemoteFileHandlePool;
 class GWZipExtractOperation;
 using GWZipExtractOperationPtr = std::shared_ptr<GWZipExtractOperation>;
 using GWRemoteFileHandlePtr = std::shared_ptr<GWRemoteFileHandle>;
@@ -89,14 +92,25 @@ public:
     bool replacesExistingItems() const { return replacesExisting_.value_or(!isAtomic_); }
     // A batch applies directory metadata itself once their contents are written.
     void setDefersDirectoryInfo(bool defers) { defersDirectoryInfo_ = defers; }
+    // What the operations of a batch share so that an entry costs a few system
+    // calls: open handles on the archive, and the directories walked to below
+    // the containment root. Without them each operation opens and walks its own.
+    void setArchiveHandles(std::shared_ptr<GWRemoteFileHandlePool> handles) {
+        archiveHandles_ = std::move(handles);
+    }
+    void setDirectoryCache(std::shared_ptr<GWDirectoryCache> directories) {
+        directories_ = std::move(directories);
+    }
 
     // Why `file` may not be extracted at `destination` below `root`, or none:
     // the destination leaves `root` by name, an item between the two is a
     // symbolic link (or no directory), or an entry of the archive between
     // them is a link, which would be written through once it exists. The
     // error is GWZipArchiveEntryOutsideDestinationError naming the entry.
+    // `onDisk` false leaves out the look at the items on disk, for a
+    // destination whose directory was walked to without following links.
     static GWErrorPtr containmentErrorForFile(const GWZipFilePtr& file, const GWURL& root,
-                                              const GWURL& destination);
+                                              const GWURL& destination, bool onDisk = true);
     // The error the operation ended with; none while running and on success.
     GWErrorPtr error() const;
     bool started() const { return started_.load(); }
@@ -161,8 +175,14 @@ private:
                                          std::uint64_t startOffset, GWErrorPtr* error);
 
     // Where the data is written: the destination or a fresh place in the
-    // replacement folder. Holds the creation semaphore meanwhile.
+    // replacement folder, left open in targetFile_ for a regular file. Holds
+    // the creation semaphore meanwhile unless the destination's directory is
+    // known and nothing there is to be replaced.
     std::optional<GWURL> prepareTarget(bool isDirectory, bool isSymbolicLink, GWErrorPtr* error);
+    // The directory that will hold the destination, `parentRelative` below `root`.
+    std::shared_ptr<const GWFileDescriptor> openParent(const GWURL& root,
+                                                       const std::string& parentRelative,
+                                                       GWErrorPtr* error);
     // Moves a finished item from the replacement folder to the destination.
     bool moveIntoPlace(const GWURL& built, GWErrorPtr* error);
     GWURL containmentRootOrParent() const;
@@ -179,6 +199,12 @@ private:
     std::shared_ptr<GWReplacementFolder> replacementFolder_;
     std::optional<bool> replacesExisting_;
     bool defersDirectoryInfo_ = false;
+    std::shared_ptr<GWRemoteFileHandlePool> archiveHandles_;
+    std::shared_ptr<GWDirectoryCache> directories_;
+    // The regular file being written, open from its creation until the
+    // operation ends, so that it is opened once and its metadata is set
+    // through it.
+    GWFileDescriptor targetFile_;
 
     mutable std::mutex errorMutex_;
     GWErrorPtr error_;

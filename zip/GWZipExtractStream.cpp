@@ -26,14 +26,14 @@ GWErrorPtr corruptOffsetError(const GWZipFilePtr& file) {
 bool readLocalHeader(const GWZipWorkOperation& operation, const GWZipFilePtr& file,
                      GWRemoteFileHandle& handle, std::uint64_t headerOffset,
                      GWZipLocalFileHeader* header, GWErrorPtr* error) {
-    if (!handle.seekToFileOffset(headerOffset, error)) {
+    // A positioned read: no look at the file's size first.
+    GWData bytes(GWZipLocalFileHeader::kLength);
+    auto got = handle.readDataAtOffset(headerOffset, bytes, error);
+    if (!got) {
         return false;
     }
-    auto bytes = handle.readDataOfLength(GWZipLocalFileHeader::kLength, error);
-    if (!bytes) {
-        return false;
-    }
-    if (!operation.readLocalHeaderRecord(header, *bytes, error)) {
+    bytes.resize(*got);
+    if (!operation.readLocalHeaderRecord(header, bytes, error)) {
         GWLog("error reading local record for file %s", file->path().c_str());
         return false;
     }
@@ -124,7 +124,9 @@ void GWZipExtractOperation::unpackFile(const GWZipFilePtr& file,
     const bool isSymbolicLink = file->isSymbolicLink();
     auto linkText = std::make_shared<GWData>();
     GWRemoteFileHandlePtr writer;
-    if (!isSymbolicLink) {
+    if (targetFile_.isValid() && file == file_) {
+        writer = GWRemoteFileHandle::initForWritingToDescriptor(targetFile_.get(), *target);
+    } else if (!isSymbolicLink) {
         GWErrorPtr error;
         writer = GWRemoteFileHandle::initForWritingToURL(target, &error);
         if (!writer) {
