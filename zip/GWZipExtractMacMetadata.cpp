@@ -2,6 +2,7 @@
 
 #include "GWZipExtractOperation.h"
 #include "applefile/GWAppleFileDecoder.h"
+#include "foundation/GWExtractPolicy.h"
 #include "foundation/GWFileDescriptor.h"
 #include "foundation/GWFileInfo.h"
 #include "foundation/GWFileManager.h"
@@ -9,6 +10,11 @@
 #include "foundation/GWMetadataNames.h"
 #include "foundation/GWMetadataStore.h"
 #include "foundation/GWRemoteFileHandle.h"
+
+const GWExtractOptions& GWZipExtractOperation::extractOptions() const {
+    static const GWExtractOptions kDefaults;
+    return options_ ? *options_ : kDefaults;
+}
 
 bool GWZipExtractOperation::setInfoForFile(const GWZipFilePtr& file, const GWURL& url,
                                            GWErrorPtr* error, int fd) {
@@ -57,7 +63,7 @@ bool GWZipExtractOperation::setInfoForFile(const GWZipFilePtr& file, const GWURL
     if (!apply(error)) {
         return false;
     }
-    const std::uint32_t mode = file->permissionsMode() & 07777;
+    const std::uint32_t mode = GWExtractedPermissions(file->permissionsMode(), extractOptions());
     if (file->owner() != info->ownerID() || file->groupOwner() != info->groupID() ||
         mode != info->permissionsMode()) {
         info->setOwnerID(file->owner());
@@ -125,25 +131,27 @@ void GWZipExtractOperation::applyAppleDoubleMetadataForFile(const GWZipFilePtr& 
     ChunkHandler write = [writer](std::span<const std::uint8_t> data, bool, GWErrorPtr* error) {
         return writer->writeData(data, error);
     };
-    unpackFile(file->appleDoubleFile(), handle, std::move(write),
-               [writer, temporary, url, completion](const GWErrorPtr& error) {
-                   writer->closeFileAndReturnError(nullptr);
-                   if (error) {
-                       GWRemoveItemAtURL(temporary, nullptr);
-                       completion(error);
-                       return;
-                   }
-                   // A companion that does not merge is no reason to fail the
-                   // entry. The copy lives beside the file, so it goes either way.
-                   GWErrorPtr mergeError;
-                   if (!GWAppleFileDecoder::sharedInstance()->mergeAppleDoubleFileAtURL(
-                           temporary, url, &mergeError)) {
-                       GWLog("the AppleDouble companion of %s was not applied: %s",
-                             url.path().c_str(), mergeError->localizedDescription().c_str());
-                   }
-                   GWRemoveItemAtURL(temporary, nullptr);
-                   completion(nullptr);
-               });
+    unpackFile(
+        file->appleDoubleFile(), handle, std::move(write),
+        [writer, temporary, url, file, options = options_, completion](const GWErrorPtr& error) {
+            writer->closeFileAndReturnError(nullptr);
+            if (error) {
+                GWRemoveItemAtURL(temporary, nullptr);
+                completion(error);
+                return;
+            }
+            // A companion that does not merge is no reason to fail the
+            // entry. The copy lives beside the file, so it goes either way.
+            GWErrorPtr mergeError;
+            if (!GWAppleFileDecoder::sharedInstance()->mergeAppleDoubleFileAtURL(
+                    temporary, url, &mergeError, file->path(),
+                    options ? *options : GWExtractOptions())) {
+                GWLog("the AppleDouble companion of %s was not applied: %s", url.path().c_str(),
+                      mergeError->localizedDescription().c_str());
+            }
+            GWRemoveItemAtURL(temporary, nullptr);
+            completion(nullptr);
+        });
 }
 
 void GWZipExtractOperation::decodeMacBinaryFileAtURL(const GWURL& url, Completion completion) {

@@ -89,6 +89,12 @@ public:
     bool replacesExistingItems() const { return replacesExisting_.value_or(!isAtomic_); }
     // A batch applies directory metadata itself once their contents are written.
     void setDefersDirectoryInfo(bool defers) { defersDirectoryInfo_ = defers; }
+    // What the archive may grant on disk (set-ID bits, attributes); shared
+    // by a batch. None: the defaults, which grant nothing.
+    void setExtractOptions(std::shared_ptr<const GWExtractOptions> options) {
+        options_ = std::move(options);
+    }
+    const GWExtractOptions& extractOptions() const;
 
     // Why `file` may not be extracted at `destination` below `root`, or none:
     // the destination leaves `root` by name, an item between the two is a
@@ -179,6 +185,7 @@ private:
     std::shared_ptr<GWReplacementFolder> replacementFolder_;
     std::optional<bool> replacesExisting_;
     bool defersDirectoryInfo_ = false;
+    std::shared_ptr<const GWExtractOptions> options_;
 
     mutable std::mutex errorMutex_;
     GWErrorPtr error_;
