@@ -7,6 +7,7 @@
 #include <sys/xattr.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <filesystem>
 #include <regex>
 
@@ -376,6 +377,40 @@ TEST(GWArchiveTool, JsonListingCarriesTheDocumentedFields) {
               "d directory 0o40755 0 2020-01-01T12:00:00Z None None\n"
               "d/f.txt file 0o100644 1000 2020-01-01T12:00:00Z None deflate\n"
               "d/l symlink 0o120777 5 2020-01-01T12:00:00Z f.txt stored\n");
+}
+
+TEST(GWArchiveTool, ControlCharactersInNamesAreEscapedExceptInJson) {
+    const std::vector<std::string> names = {"esc\x1b[2J", "cr\rx", "lf\nx",
+                                            "x\ngwarchive: t.zip: forged (POSIX 1)", "c1\xc2\x9b"};
+    ZipBuilder zip;
+    for (const std::string& name : names)
+        zip.addFile(name, bytesOf("x"));
+    zip.addSymlink("link", "t\x1b]0;title\x07");
+    TemporaryDirectory directory;
+    writeFile(directory.file("t.zip"), zip.bytes());
+    for (const char* command : {"list ", "list -l "}) {
+        ToolRun run = runTool(command + shellQuote(directory.file("t.zip")));
+        ASSERT_EQ(run.status, 0) << run.err;
+        EXPECT_EQ(std::count(run.out.begin(), run.out.end(), '\n'), 6) << run.out;
+        EXPECT_TRUE(std::none_of(run.out.begin(), run.out.end(), [](char c) {
+            return (c > 0 && c < 0x20 && c != '\n') || c == 0x7F;
+        })) << run.out;
+        EXPECT_EQ(run.out.find("\xc2\x9b"), std::string::npos);
+        EXPECT_NE(run.out.find("lf\\012x"), std::string::npos) << run.out;
+    }
+    ToolRun json = runTool("list --json " + shellQuote(directory.file("t.zip")));
+    std::vector<std::string> sorted = names;
+    sorted.push_back("link");
+    std::sort(sorted.begin(), sorted.end());
+    std::string expected;
+    for (const std::string& name : sorted)
+        expected += name + "|";
+    EXPECT_EQ(pythonJSON(json.out,
+                         "e = sorted(d['entries'], key=lambda e: e['path'])\n"
+                         "print(''.join(x['path'] + '|' for x in e), end='')\n"
+                         "print([x.get('linkTarget') for x in e if x['path'] == "
+                         "'link'][0], end='')"),
+              expected + "t\x1b]0;title\x07");
 }
 
 // --- XAR archives ---------------------------------------------------------------
