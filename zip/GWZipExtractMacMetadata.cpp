@@ -131,27 +131,25 @@ void GWZipExtractOperation::applyAppleDoubleMetadataForFile(const GWZipFilePtr& 
     ChunkHandler write = [writer](std::span<const std::uint8_t> data, bool, GWErrorPtr* error) {
         return writer->writeData(data, error);
     };
-    unpackFile(
-        file->appleDoubleFile(), handle, std::move(write),
-        [writer, temporary, url, file, options = options_, completion](const GWErrorPtr& error) {
-            writer->closeFileAndReturnError(nullptr);
-            if (error) {
-                GWRemoveItemAtURL(temporary, nullptr);
-                completion(error);
-                return;
-            }
-            // A companion that does not merge is no reason to fail the
-            // entry. The copy lives beside the file, so it goes either way.
-            GWErrorPtr mergeError;
-            if (!GWAppleFileDecoder::sharedInstance()->mergeAppleDoubleFileAtURL(
-                    temporary, url, &mergeError, file->path(),
-                    options ? *options : GWExtractOptions())) {
-                GWLog("the AppleDouble companion of %s was not applied: %s", url.path().c_str(),
-                      mergeError->localizedDescription().c_str());
-            }
-            GWRemoveItemAtURL(temporary, nullptr);
-            completion(nullptr);
-        });
+    unpackFile(file->appleDoubleFile(), handle, std::move(write),
+               [this, writer, temporary, url, file, completion](const GWErrorPtr& error) {
+                   writer->closeFileAndReturnError(nullptr);
+                   if (error) {
+                       GWRemoveItemAtURL(temporary, nullptr);
+                       completion(error);
+                       return;
+                   }
+                   // A companion that does not merge is no reason to fail the
+                   // entry. The copy lives beside the file, so it goes either way.
+                   GWErrorPtr mergeError;
+                   if (!GWAppleFileDecoder::sharedInstance()->mergeAppleDoubleFileAtURL(
+                           temporary, url, &mergeError, file->path(), extractOptions())) {
+                       GWLog("the AppleDouble companion of %s was not applied: %s",
+                             url.path().c_str(), mergeError->localizedDescription().c_str());
+                   }
+                   GWRemoveItemAtURL(temporary, nullptr);
+                   completion(nullptr);
+               });
 }
 
 void GWZipExtractOperation::decodeMacBinaryFileAtURL(const GWURL& url, Completion completion) {
