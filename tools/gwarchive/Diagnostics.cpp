@@ -76,7 +76,9 @@ int exitStatusAfterDamage(int status) {
 
 void setVerbose(bool verbose) {
     if (verbose) {
-        GWSetLogSink(nullptr);
+        // Log lines name entries too.
+        GWSetLogSink(
+            [](const std::string& line) { std::fprintf(stderr, "%s\n", printable(line).c_str()); });
     } else {
         GWSetLogSink([](const std::string&) {});
     }
