@@ -5,8 +5,8 @@
 
 #include "GWAppleFileDecoder.h"
 #include "foundation/GWAppleDouble.h"
+#include "foundation/GWExtractPolicy.h"
 #include "foundation/GWFileDescriptor.h"
-#include "foundation/GWLog.h"
 #include "foundation/GWMetadataStore.h"
 #include "foundation/GWStringEncoding.h"
 
@@ -53,7 +53,8 @@ bool copyResourceFork(int fd, const GWAppleDoubleContents::Extent& fork, GWMetad
 }  // namespace
 
 bool GWAppleFileDecoder::mergeAppleDoubleFileAtURL(const GWURL& appleDouble, const GWURL& dataFile,
-                                                   GWErrorPtr* error) const {
+                                                   GWErrorPtr* error, const std::string& entryPath,
+                                                   const GWExtractOptions& options) const {
     if (!appleDouble.isFileURL() || !dataFile.isFileURL()) {
         return GWFail(error, GWPOSIXError(EINVAL));
     }
@@ -76,10 +77,9 @@ bool GWAppleFileDecoder::mergeAppleDoubleFileAtURL(const GWURL& appleDouble, con
     for (const auto& attribute : contents.attributes) {
         // A name that reads as another Linux namespace (security.capability,
         // trusted.*, system.posix_acl_access) would reach past the file's
-        // user metadata; a Mac never meant one, so it is left out.
-        if (!GWLinuxAttributeName(attribute.name).starts_with("user.")) {
-            GWLog("skipping extended attribute \"%s\" outside the user namespace",
-                  attribute.name.c_str());
+        // user metadata.
+        if (!GWMayExtractAttribute(GWLinuxAttributeName(attribute.name),
+                                   entryPath.empty() ? dataPath : entryPath, options)) {
             continue;
         }
         if (!store.setAttribute(attribute.name, attribute.value, error)) {

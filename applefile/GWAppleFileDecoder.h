@@ -2,8 +2,10 @@
 
 #include <memory>
 #include <optional>
+#include <string>
 
 #include "foundation/GWError.h"
+#include "foundation/GWExtractOptions.h"
 #include "foundation/GWURL.h"
 
 // Turns the single-file encodings of classic Mac files back into files with
@@ -22,8 +24,11 @@ public:
     // extended attributes, resource fork, comment) to `dataFile`, whose
     // contents stay as they are. The AppleDouble file is left alone. Failures
     // are POSIX errors without a location: EINVAL for a malformed file.
+    // Attributes outside "user." follow `options`; `entryPath` names the
+    // file in notes of what was left out.
     bool mergeAppleDoubleFileAtURL(const GWURL& appleDouble, const GWURL& dataFile,
-                                   GWErrorPtr* error) const;
+                                   GWErrorPtr* error, const std::string& entryPath = {},
+                                   const GWExtractOptions& options = {}) const;
 
 private:
     GWAppleFileDecoder() = default;

@@ -19,4 +19,21 @@ struct GWExtractOptions {
     bool continueAfterFailure = false;
     // Told of each entry that fails, with its path in the archive, as it happens.
     std::function<void(const std::string& entryPath, const GWErrorPtr& error)> entryFailed;
+
+    // What an archive may grant on disk. Each is off by default: archives
+    // from strangers are unpacked as root too, and none of these should come
+    // from one unasked. Owner and group are restored only for root either way.
+    // Set-user-ID, set-group-ID and sticky bits; otherwise dropped.
+    bool keepSetIDBits = false;
+    // Character and block devices; otherwise left out with a note.
+    bool createDevices = false;
+    // Extended attributes outside "user." ("trusted.", "security.",
+    // "system."); otherwise left out with a note. ACLs come from their own
+    // elements either way.
+    bool privilegedAttributes = false;
+    // Immutable and append-only inode flags; otherwise not set (nodump is).
+    bool keepPinningFlags = false;
+    // Told of each device or attribute left out for want of its switch, with
+    // the entry's path in the archive and what was left out.
+    std::function<void(const std::string& entryPath, const std::string& what)> withheld;
 };

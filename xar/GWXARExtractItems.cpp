@@ -14,6 +14,7 @@
 #include "foundation/GWChecksum.h"
 #include "foundation/GWContainment.h"
 #include "foundation/GWDispatch.h"
+#include "foundation/GWExtractPolicy.h"
 #include "foundation/GWFileDescriptor.h"
 
 bool GWXARExtractOperation::extractRegularFile(const GWXARFilePtr& file, const GWURL& url,
@@ -229,7 +230,9 @@ bool GWXARExtractOperation::extractDevice(const GWXARFilePtr& file, const GWURL&
     }
     const dev_t device = ::makedev(static_cast<unsigned int>(file->deviceMajorNumber()),
                                    static_cast<unsigned int>(file->deviceMinorNumber()));
-    if (::mknod(url.path().c_str(), file->permissionsMode(), device) != 0) {
+    const mode_t mode = (file->permissionsMode() & S_IFMT) |
+                        GWExtractedPermissions(file->permissionsMode(), options_);
+    if (::mknod(url.path().c_str(), mode, device) != 0) {
         return GWFail(error, GWPOSIXError(errno, url));
     }
     return true;
@@ -237,7 +240,8 @@ bool GWXARExtractOperation::extractDevice(const GWXARFilePtr& file, const GWURL&
 
 bool GWXARExtractOperation::extractFIFO(const GWXARFilePtr& file, const GWURL& url,
                                         GWErrorPtr* error) {
-    if (::mkfifo(url.path().c_str(), file->permissionsMode() & 07777) != 0) {
+    if (::mkfifo(url.path().c_str(), GWExtractedPermissions(file->permissionsMode(), options_)) !=
+        0) {
         return GWFail(error, GWPOSIXError(errno, url));
     }
     return true;

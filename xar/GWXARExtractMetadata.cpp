@@ -15,6 +15,7 @@
 #include "GWXARArchive.h"
 #include "GWXARExtractOperation.h"
 #include "foundation/GWDispatch.h"
+#include "foundation/GWExtractPolicy.h"
 #include "foundation/GWFileDescriptor.h"
 #include "foundation/GWMetadataStore.h"
 
@@ -112,7 +113,7 @@ bool GWXARExtractOperation::applyMetadataToFile(const GWXARFilePtr& file, const 
             ignored = ::acl_set_file(("/proc/self/fd/" + std::to_string(fd)).c_str(),
                                      ACL_TYPE_DEFAULT, inherited->handle());
         }
-        const mode_t mode = file->permissionsMode() & 07777;
+        const mode_t mode = GWExtractedPermissions(file->permissionsMode(), options_);
         ignored = fd >= 0 ? ::fchmod(fd, mode) : ::chmod(path.c_str(), mode);
     }
     applyFlags(*file, url, fd);
@@ -120,7 +121,8 @@ bool GWXARExtractOperation::applyMetadataToFile(const GWXARFilePtr& file, const 
 }
 
 void GWXARExtractOperation::applyFlags(const GWXARFile& file, const GWURL& url, int fd) {
-    const int wanted = linuxInodeFlags(file.posixFlags() & kRestorableFlagsMask);
+    const int wanted =
+        GWExtractedInodeFlags(linuxInodeFlags(file.posixFlags() & kRestorableFlagsMask), options_);
     if (wanted == 0) {
         return;
     }
@@ -184,6 +186,9 @@ bool GWXARExtractOperation::applyExtendedAttributesForFile(const GWXARFilePtr& f
             return false;
         }
         const std::string name = attribute->name().value_or("");
+        if (!GWMayExtractAttribute(GWLinuxAttributeName(name), file->path(), options_)) {
+            continue;
+        }
         const bool isResourceFork = name == kResourceForkName;
         auto buffer = std::make_shared<GWData>();
         auto position = std::make_shared<std::uint32_t>(0);

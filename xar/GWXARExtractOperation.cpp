@@ -7,6 +7,7 @@
 #include <unordered_set>
 
 #include "GWArchiveSupport/GWArchiveConstants.h"
+#include "foundation/GWExtractPolicy.h"
 #include "foundation/GWFileSystem.h"
 #include "foundation/GWFreeSpace.h"
 #include "foundation/GWLog.h"
@@ -49,6 +50,10 @@ std::uint64_t declaredDataSize(const GWXARFilePtr& item) {
         total = size > UINT64_MAX - total ? UINT64_MAX : total + size;
     }
     return total;
+}
+
+bool isDevice(const GWXARFile& file) {
+    return file.type() == GWXARFileTypeCharacterSpecial || file.type() == GWXARFileTypeBlockSpecial;
 }
 
 }  // namespace
@@ -145,6 +150,9 @@ bool GWXARExtractOperation::performExtractionOperationWithFile(const GWXARFilePt
     }
     if (!file) {
         return GWFail(error, GWCocoaError(GWFileWriteUnknownError, destinationURL));
+    }
+    if (isDevice(*file) && !GWMayExtractDevice(file->path(), options_)) {
+        return true;
     }
     // Refusing before the first byte beats filling the disk and undoing it.
     if (!GWCheckFreeSpace(destinationURL.URLByDeletingLastPathComponent(), declaredDataSize(file),
@@ -269,7 +277,13 @@ bool GWXARExtractOperation::extractFile(const GWXARFilePtr& file, const GWURL& u
         case GWXARFileTypeSymbolicLink: created = extractSymbolicLink(file, url, error); break;
         case GWXARFileTypeHardLink: created = extractHardLink(file, url, error); break;
         case GWXARFileTypeCharacterSpecial:
-        case GWXARFileTypeBlockSpecial: created = extractDevice(file, url, error); break;
+        case GWXARFileTypeBlockSpecial:
+            // Left out with a note; the rest of the tree goes on.
+            if (!GWMayExtractDevice(file->path(), options_)) {
+                return true;
+            }
+            created = extractDevice(file, url, error);
+            break;
         case GWXARFileTypeFIFO: created = extractFIFO(file, url, error); break;
         default:
             return GWFail(error, GWGenerateError(

@@ -254,6 +254,7 @@ std::optional<std::vector<GWZipExtractOperationPtr>> GWZipArchive::operationsToE
     // The caller named the entry's own destination: nothing of its subtree
     // may land outside the directory that holds it.
     const GWURL root = destination.URLByDeletingLastPathComponent();
+    const auto shared = std::make_shared<const GWExtractOptions>(options);
     while (!pending.empty()) {
         Pending next = std::move(pending.back());
         pending.pop_back();
@@ -265,6 +266,7 @@ std::optional<std::vector<GWZipExtractOperationPtr>> GWZipArchive::operationsToE
         }
         operation->setContainmentRoot(root);
         operation->setReplacesExistingItems(options.replaceExisting);
+        operation->setExtractOptions(shared);
         if (next.directoryOperation) {
             operation->addDependency(next.directoryOperation);
         }

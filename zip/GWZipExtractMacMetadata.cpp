@@ -2,6 +2,7 @@
 
 #include "GWZipExtractOperation.h"
 #include "applefile/GWAppleFileDecoder.h"
+#include "foundation/GWExtractPolicy.h"
 #include "foundation/GWFileDescriptor.h"
 #include "foundation/GWFileInfo.h"
 #include "foundation/GWFileManager.h"
@@ -9,6 +10,11 @@
 #include "foundation/GWMetadataNames.h"
 #include "foundation/GWMetadataStore.h"
 #include "foundation/GWRemoteFileHandle.h"
+
+const GWExtractOptions& GWZipExtractOperation::extractOptions() const {
+    static const GWExtractOptions kDefaults;
+    return options_ ? *options_ : kDefaults;
+}
 
 bool GWZipExtractOperation::setInfoForFile(const GWZipFilePtr& file, const GWURL& url,
                                            GWErrorPtr* error, int fd) {
@@ -58,7 +64,7 @@ bool GWZipExtractOperation::setInfoForFile(const GWZipFilePtr& file, const GWURL
     if (!apply(error)) {
         return false;
     }
-    const std::uint32_t mode = file->permissionsMode() & 07777;
+    const std::uint32_t mode = GWExtractedPermissions(file->permissionsMode(), extractOptions());
     if (file->owner() != info->ownerID() || file->groupOwner() != info->groupID() ||
         mode != info->permissionsMode()) {
         info->setOwnerID(file->owner());
@@ -127,7 +133,7 @@ void GWZipExtractOperation::applyAppleDoubleMetadataForFile(const GWZipFilePtr& 
         return writer->writeData(data, error);
     };
     unpackFile(file->appleDoubleFile(), handle, std::move(write),
-               [writer, temporary, url, completion](const GWErrorPtr& error) {
+               [this, writer, temporary, url, file, completion](const GWErrorPtr& error) {
                    writer->closeFileAndReturnError(nullptr);
                    if (error) {
                        GWRemoveItemAtURL(temporary, nullptr);
@@ -138,7 +144,7 @@ void GWZipExtractOperation::applyAppleDoubleMetadataForFile(const GWZipFilePtr& 
                    // entry. The copy lives beside the file, so it goes either way.
                    GWErrorPtr mergeError;
                    if (!GWAppleFileDecoder::sharedInstance()->mergeAppleDoubleFileAtURL(
-                           temporary, url, &mergeError)) {
+                           temporary, url, &mergeError, file->path(), extractOptions())) {
                        GWLog("the AppleDouble companion of %s was not applied: %s",
                              url.path().c_str(), mergeError->localizedDescription().c_str());
                    }

@@ -101,6 +101,12 @@ public:
     void setDirectoryCache(std::shared_ptr<GWDirectoryCache> directories) {
         directories_ = std::move(directories);
     }
+    // What the archive may grant on disk (set-ID bits, attributes); shared
+    // by a batch. None: the defaults, which grant nothing.
+    void setExtractOptions(std::shared_ptr<const GWExtractOptions> options) {
+        options_ = std::move(options);
+    }
+    const GWExtractOptions& extractOptions() const;
 
     // Why `file` may not be extracted at `destination` below `root`, or none:
     // the destination leaves `root` by name, an item between the two is a
@@ -205,6 +211,7 @@ private:
     // operation ends, so that it is opened once and its metadata is set
     // through it.
     GWFileDescriptor targetFile_;
+    std::shared_ptr<const GWExtractOptions> options_;
 
     mutable std::mutex errorMutex_;
     GWErrorPtr error_;

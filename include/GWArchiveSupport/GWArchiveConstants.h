@@ -58,9 +58,9 @@ enum GWXARArchiveErrorCode : long {
     // through a symbolic link to elsewhere. kGWXARArchiveUnknownEntityErrorKey
     // holds the item's path.
     GWXARArchiveEntryOutsideDestinationError = 21,
-    // A character or block device, refused without the privileges to create
-    // device nodes on purpose. kGWXARArchiveUnknownEntityErrorKey holds the
-    // item's path.
+    // A character or block device asked for (GWExtractOptions::createDevices),
+    // refused without the privileges to create device nodes on purpose.
+    // kGWXARArchiveUnknownEntityErrorKey holds the item's path.
     GWXARArchiveDeviceNotPermittedError = 22,
     // A stored stream decodes to more or fewer bytes than its <size> element
     // says; decoding stops at that size. The detail holds the size.

@@ -7,6 +7,7 @@
 #include <sys/xattr.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <filesystem>
 #include <regex>
 
@@ -376,6 +377,45 @@ TEST(GWArchiveTool, JsonListingCarriesTheDocumentedFields) {
               "d directory 0o40755 0 2020-01-01T12:00:00Z None None\n"
               "d/f.txt file 0o100644 1000 2020-01-01T12:00:00Z None deflate\n"
               "d/l symlink 0o120777 5 2020-01-01T12:00:00Z f.txt stored\n");
+}
+
+TEST(GWArchiveTool, ControlCharactersInNamesAreEscapedExceptInJson) {
+    const std::vector<std::string> names = {"esc\x1b[2J", "cr\rx", "lf\nx",
+                                            "x\ngwarchive: t.zip: forged (POSIX 1)", "c1\xc2\x9b"};
+    ZipBuilder zip;
+    for (const std::string& name : names)
+        zip.addFile(name, bytesOf("x")).crc32 = 1;  // so that test and extract name them too
+    zip.addSymlink("link", "t\x1b]0;title\x07");
+    TemporaryDirectory directory;
+    writeFile(directory.file("t.zip"), zip.bytes());
+    const std::string out = shellQuote(directory.file("out"));
+    // Lines on both streams: every entry, or every bad one (and test's summary).
+    for (const auto& [command, lines] : {std::pair<std::string, int>{"list", 6},
+                                         {"list -l", 6},
+                                         {"test", 6},
+                                         {"extract --no-progress -C " + out, 5}}) {
+        ToolRun run = runTool(command + " " + shellQuote(directory.file("t.zip")));
+        const std::string text = run.out + run.err;
+        EXPECT_EQ(std::count(text.begin(), text.end(), '\n'), lines) << command << "\n" << text;
+        EXPECT_TRUE(std::none_of(text.begin(), text.end(), [](char c) {
+            return (c > 0 && c < 0x20 && c != '\n') || c == 0x7F;
+        })) << text;
+        EXPECT_EQ(text.find("\xc2\x9b"), std::string::npos) << command;
+        EXPECT_NE(text.find("lf\\012x"), std::string::npos) << text;
+    }
+    ToolRun json = runTool("list --json " + shellQuote(directory.file("t.zip")));
+    std::vector<std::string> sorted = names;
+    sorted.push_back("link");
+    std::sort(sorted.begin(), sorted.end());
+    std::string expected;
+    for (const std::string& name : sorted)
+        expected += name + "|";
+    EXPECT_EQ(pythonJSON(json.out,
+                         "e = sorted(d['entries'], key=lambda e: e['path'])\n"
+                         "print(''.join(x['path'] + '|' for x in e), end='')\n"
+                         "print([x.get('linkTarget') for x in e if x['path'] == "
+                         "'link'][0], end='')"),
+              expected + "t\x1b]0;title\x07");
 }
 
 // --- XAR archives ---------------------------------------------------------------

@@ -113,7 +113,10 @@ TEST_P(BsdtarExtraction, MatchesTheSourceTreeAndBsdtarsOwnExtraction) {
     ASSERT_TRUE(tree);
     ASSERT_EQ(mkdir(directory.file("ours").c_str(), 0755), 0);
     bool checksumIsInvalid = true;
-    ASSERT_TRUE(archive->extractFile(tree, directory.url("ours/tree"), &checksumIsInvalid, &error))
+    GWExtractOptions devices;
+    devices.createDevices = true;
+    ASSERT_TRUE(
+        archive->extractFile(tree, directory.url("ours/tree"), &checksumIsInvalid, &error, devices))
         << error->localizedDescription();
     EXPECT_FALSE(checksumIsInvalid);
 

@@ -62,7 +62,13 @@ int runExtract(const ParsedArguments& arguments) {
         return kExitFailure;
 
     ExtractOptions options{localURL(arguments.value("directory").value_or(".")),
-                           arguments.has("overwrite"), nullptr};
+                           arguments.has("overwrite"),
+                           nullptr,
+                           {}};
+    options.grants.keepSetIDBits = arguments.has("keep-setuid");
+    options.grants.createDevices = arguments.has("devices");
+    options.grants.privilegedAttributes = arguments.has("privileged-xattrs");
+    options.grants.keepPinningFlags = arguments.has("keep-flags");
     // Refused before anything is written: a hostile archive fills no disk.
     GWErrorPtr spaceError;
     if (!GWCheckFreeSpace(options.directory, declaredSize(*archive, selected), &spaceError)) {
@@ -97,6 +103,8 @@ const Command kExtractCommand = {
     "SYNOPSIS\n"
     "    gwarchive extract [-C DIR] [--overwrite] [--ignore-checksum]\n"
     "                      [--encoding NAME] [--trust FILE] [--require-signature]\n"
+    "                      [--keep-setuid] [--devices] [--privileged-xattrs]\n"
+    "                      [--keep-flags]\n"
     "                      [--progress|--no-progress] [-v] ARCHIVE [PATH...]\n"
     "\n"
     "DESCRIPTION\n"
@@ -113,8 +121,16 @@ const Command kExtractCommand = {
     "    (or an AppleDouble file ._name beside the file where the file system\n"
     "    refuses large attributes), comments in user.xdg.comment. AppleDouble\n"
     "    companions and MacBinary members are merged into the file they describe.\n"
-    "    XAR owners, modes, flags, ACLs, extended attributes, hard links, devices\n"
-    "    and FIFOs are restored as far as the system and the user's rights allow.\n"
+    "    XAR modes, flags, ACLs, extended attributes, hard links and FIFOs are\n"
+    "    restored as far as the system and the user's rights allow. Owners and\n"
+    "    groups are restored only when running as root.\n"
+    "\n"
+    "    Nothing that grants privilege comes from an archive unless asked for,\n"
+    "    since archives from strangers are often unpacked as root: set-ID and\n"
+    "    sticky bits are dropped; device entries are not created and extended\n"
+    "    attributes outside user. are not written, each with a warning line on\n"
+    "    standard error (the extraction still succeeds); immutable and\n"
+    "    append-only flags are not set. The options below restore each.\n"
     "\n"
     "OPTIONS\n"
     "    -C, --directory DIR  extract beneath DIR.\n"
@@ -131,6 +147,18 @@ const Command kExtractCommand = {
     "    --no-progress        never show it. By default it is shown when standard\n"
     "                         error is a terminal: bytes done and total, rate and\n"
     "                         time left.\n"
+    "    --keep-setuid        keep set-user-ID, set-group-ID and sticky bits; off\n"
+    "                         because a set-user-ID file unpacked as root runs as\n"
+    "                         root for whoever starts it.\n"
+    "    --devices            create character and block devices; off because a\n"
+    "                         device node opens whatever disk or memory it names,\n"
+    "                         whatever mode the archive gave it.\n"
+    "    --privileged-xattrs  write trusted., security. and system. attributes;\n"
+    "                         off because they carry integrity labels,\n"
+    "                         capabilities and ACLs that no stranger should set.\n"
+    "    --keep-flags         set immutable and append-only flags; off because\n"
+    "                         they make items that even root cannot remove or\n"
+    "                         replace without clearing them first.\n"
     "    -v, --verbose        show the library's log on standard error.\n"
     "\n"
     "EXIT STATUS\n"
@@ -148,7 +176,11 @@ const Command kExtractCommand = {
      {0, "trust", true},
      {0, "require-signature", false},
      {0, "progress", false},
-     {0, "no-progress", false}},
+     {0, "no-progress", false},
+     {0, "keep-setuid", false},
+     {0, "devices", false},
+     {0, "privileged-xattrs", false},
+     {0, "keep-flags", false}},
     1,
     kAnyNumber,
     runExtract,

@@ -57,7 +57,7 @@ int runInfo(const ParsedArguments& arguments) {
     std::printf("archive: %s\n", GWRedactedURLString(operand).c_str());
     std::printf("format: %s\n", archive->formatName());
     for (const std::string& line : archive->infoLines())
-        std::printf("%s\n", line.c_str());
+        std::printf("%s\n", printable(line).c_str());
     std::printf("entries: %zu (%zu directories, %zu others)\n", archive->entryCount(), directories,
                 files);
     std::printf("bytes: %llu (%llu compressed)\n", static_cast<unsigned long long>(bytes),

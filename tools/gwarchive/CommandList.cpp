@@ -1,3 +1,4 @@
+#include <algorithm>
 #include <cstdio>
 #include <ctime>
 
@@ -109,7 +110,14 @@ std::string displayName(const std::string& path, EntryType type) {
 // Standard output stays locked while the names go out: 200,000 lines would
 // otherwise take and release the lock twice each.
 void printName(std::string_view path, EntryType type) {
-    fwrite_unlocked(path.data(), 1, path.size(), stdout);
+    // Most names need no escaping; only those that might are copied.
+    const bool plain = std::none_of(path.begin(), path.end(), [](char c) {
+        const auto byte = static_cast<unsigned char>(c);
+        return byte < 0x20 || byte == 0x7F || byte == 0xC2;
+    });
+    const std::string escaped = plain ? std::string() : printable(path);
+    const std::string_view shown = plain ? path : std::string_view(escaped);
+    fwrite_unlocked(shown.data(), 1, shown.size(), stdout);
     if (type == EntryType::directory)
         putchar_unlocked('/');
     putchar_unlocked('\n');
@@ -120,7 +128,8 @@ void printLongEntry(const EntryRecord& entry) {
     std::printf("%s %5u/%-5u %12llu %s %s%s%s\n", modeString(entry).c_str(), entry.uid, entry.gid,
                 static_cast<unsigned long long>(entry.size),
                 shortDate(entry.modificationDate).c_str(),
-                displayName(entry.path, entry.type).c_str(), link.c_str(), macNotes(entry).c_str());
+                printable(displayName(entry.path, entry.type)).c_str(), printable(link).c_str(),
+                printable(macNotes(entry)).c_str());
 }
 
 int runList(const ParsedArguments& arguments) {

@@ -86,7 +86,8 @@ int runTest(const ParsedArguments& arguments) {
         return problems.empty() ? kExitSuccess : kExitFailure;
     }
     for (const EntryProblem& problem : problems) {
-        std::printf("%s: %s\n", problem.path.c_str(), problem.message.c_str());
+        std::printf("%s: %s\n", printable(problem.path).c_str(),
+                    printable(problem.message).c_str());
     }
     std::printf("%s: %zu entries, %zu bad", GWRedactedURLString(operand).c_str(),
                 archive->entryCount(), problems.size());

@@ -5,12 +5,40 @@
 
 namespace gwarchive {
 
+std::string printable(std::string_view text) {
+    auto isControl = [&](std::size_t at) {
+        const auto byte = static_cast<unsigned char>(text[at]);
+        if (byte < 0x20 || byte == 0x7F)
+            return 1;
+        // U+0080 to U+009F, which some terminals obey as controls.
+        if (byte == 0xC2 && at + 1 < text.size() &&
+            (static_cast<unsigned char>(text[at + 1]) & 0xE0) == 0x80)
+            return 2;
+        return 0;
+    };
+    std::string out;
+    out.reserve(text.size());
+    for (std::size_t at = 0; at < text.size();) {
+        const int length = isControl(at);
+        if (length == 0) {
+            out += text[at++];
+            continue;
+        }
+        for (int i = 0; i < length; ++i, ++at) {
+            char escaped[5];
+            std::snprintf(escaped, sizeof escaped, "\\%03o", static_cast<unsigned char>(text[at]));
+            out += escaped;
+        }
+    }
+    return out;
+}
+
 namespace {
 
 std::string prefix(const std::string& archive, const std::optional<std::string>& path) {
-    std::string line = "gwarchive: " + GWRedactedURLString(archive);
+    std::string line = "gwarchive: " + printable(GWRedactedURLString(archive));
     if (path)
-        line += ": " + *path;
+        line += ": " + printable(*path);
     return line;
 }
 
@@ -22,13 +50,15 @@ void reportError(const std::string& archive, const std::optional<std::string>& p
         reportFailure(archive, path, "unknown error");
         return;
     }
+    // Descriptions name entries too.
     std::fprintf(stderr, "%s: %s (%s %ld)\n", prefix(archive, path).c_str(),
-                 error->localizedDescription().c_str(), error->domain().c_str(), error->code());
+                 printable(error->localizedDescription()).c_str(), error->domain().c_str(),
+                 error->code());
 }
 
 void reportFailure(const std::string& archive, const std::optional<std::string>& path,
                    const std::string& message) {
-    std::fprintf(stderr, "%s: %s\n", prefix(archive, path).c_str(), message.c_str());
+    std::fprintf(stderr, "%s: %s\n", prefix(archive, path).c_str(), printable(message).c_str());
 }
 
 namespace {
@@ -46,7 +76,9 @@ int exitStatusAfterDamage(int status) {
 
 void setVerbose(bool verbose) {
     if (verbose) {
-        GWSetLogSink(nullptr);
+        // Log lines name entries too.
+        GWSetLogSink(
+            [](const std::string& line) { std::fprintf(stderr, "%s\n", printable(line).c_str()); });
     } else {
         GWSetLogSink([](const std::string&) {});
     }

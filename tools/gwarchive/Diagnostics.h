@@ -2,10 +2,16 @@
 
 #include <optional>
 #include <string>
+#include <string_view>
 
 #include "GWArchiveSupport/GWArchiveSupport.h"
 
 namespace gwarchive {
+
+// `text` with every control character (C0, DEL and the C1 range in UTF-8)
+// written as a backslash and three octal digits, so that nothing read from
+// an archive can move the cursor or forge a line on the user's terminal.
+std::string printable(std::string_view text);
 
 enum ExitStatus : int { kExitSuccess = 0, kExitFailure = 1, kExitUsage = 2 };
 

@@ -87,6 +87,16 @@ std::optional<std::vector<std::size_t>> ToolArchive::selectPath(const std::strin
     return std::nullopt;
 }
 
+GWExtractOptions libraryExtractOptions(const ExtractOptions& options,
+                                       const std::string& archiveName) {
+    GWExtractOptions library = options.grants;
+    library.replaceExisting = options.overwrite;
+    library.withheld = [archiveName](const std::string& path, const std::string& what) {
+        reportFailure(archiveName, path, "warning: " + what);
+    };
+    return library;
+}
+
 void keepUntilExit(std::unique_ptr<ToolArchive> archive) {
     // In static storage the archive stays reachable, so leak checkers are quiet.
     static ToolArchive* kept = nullptr;

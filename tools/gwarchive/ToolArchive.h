@@ -59,7 +59,14 @@ struct ExtractOptions {
     GWURL directory;
     bool overwrite = false;
     ProgressSink progress;
+    // The switches for what an archive may grant (set-ID bits, devices,
+    // attributes outside "user.", pinning flags).
+    GWExtractOptions grants;
 };
+// The library's options for an extraction: the grants, --overwrite, and one
+// warning line on standard error for each device or attribute left out.
+GWExtractOptions libraryExtractOptions(const ExtractOptions& options,
+                                       const std::string& archiveName);
 
 // The verdict on one entry of `gwarchive test`.
 struct EntryProblem {

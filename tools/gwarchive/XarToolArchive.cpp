@@ -392,8 +392,7 @@ private:
         // Entries that fail are left out of the tree; each is reported under
         // its own path, and the rest stays extracted.
         bool reported = false;
-        GWExtractOptions extractOptions;
-        extractOptions.replaceExisting = options.overwrite;
+        GWExtractOptions extractOptions = libraryExtractOptions(options, archiveName);
         extractOptions.entryFailed = [&](const std::string& path, const GWErrorPtr& failure) {
             reportError(archiveName, path, failure);
             reported = true;

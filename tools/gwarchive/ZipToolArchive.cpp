@@ -248,8 +248,7 @@ bool ZipToolArchive::extract(const std::vector<std::size_t>& indexes, const Extr
             tops.push_back(files_[index]);
     }
     std::atomic<bool> reported{false};
-    GWExtractOptions batchOptions;
-    batchOptions.replaceExisting = options.overwrite;
+    GWExtractOptions batchOptions = libraryExtractOptions(options, archiveName);
     batchOptions.continueAfterFailure = true;
     batchOptions.entryFailed = [&](const std::string& path, const GWErrorPtr& error) {
         reportError(archiveName, path, error);
