@@ -14,6 +14,8 @@
 
 #include "GWLog.h"
 
+class GWOperationQueueCore;
+
 namespace {
 
 // Long enough that a batch of short operations reuses its workers.
@@ -23,6 +25,12 @@ std::size_t defaultWidth() {
     const unsigned processors = std::max(1u, std::thread::hardware_concurrency());
     return std::size_t(processors) * 4;
 }
+
+// The queue whose worker runs on this thread, and the operations of that
+// queue that finished here since the worker last took the lock: the worker
+// settles them when it takes its next operation, under the same lock.
+thread_local GWOperationQueueCore* tWorkerCore = nullptr;
+thread_local std::vector<GWOperation*> tFinishedHere;
 
 }  // namespace
 
@@ -60,6 +68,21 @@ public:
 
     void add(const GWOperationPtr& operation) {
         std::unique_lock<std::mutex> lock(mutex);
+        record(operation);
+        drain(lock);
+    }
+
+    // Many under one lock: workers already running would otherwise queue on
+    // it once per operation added.
+    void add(const std::vector<GWOperationPtr>& operations) {
+        std::unique_lock<std::mutex> lock(mutex);
+        for (const GWOperationPtr& operation : operations) {
+            record(operation);
+        }
+        drain(lock);
+    }
+
+    void record(const GWOperationPtr& operation) {
         // Finished by hand between attaching and here: its finish hook found
         // nothing to remove, so it must not be recorded now.
         if (operation->isFinished()) {
@@ -72,7 +95,6 @@ public:
         if (isReady) {
             readyOrder.emplace(sequence, operation.get());
         }
-        drain(lock);
     }
 
     void readinessChanged(GWOperation* operation) {
@@ -88,24 +110,35 @@ public:
     }
 
     void didFinish(GWOperation* operation) {
+        if (tWorkerCore == this) {
+            tFinishedHere.push_back(operation);
+            return;
+        }
         GWOperationPtr released;
         std::unique_lock<std::mutex> lock(mutex);
+        released = settle(operation);
+        drain(lock);
+        lock.unlock();
+    }
+
+    // Forgets a finished operation; called with the lock held. The operation
+    // is handed back so that it is destroyed once the lock is released.
+    GWOperationPtr settle(GWOperation* operation) {
         const auto found = members.find(operation);
         if (found == members.end()) {
-            return;
+            return nullptr;
         }
         if (found->second.phase == Phase::running) {
             --runningCount;
         } else if (found->second.phase == Phase::ready) {
             readyOrder.erase(found->second.sequence);
         }
-        released = std::move(found->second.operation);
+        GWOperationPtr released = std::move(found->second.operation);
         members.erase(found);
-        drain(lock);
         if (members.empty()) {
             allFinished.notify_all();
         }
-        lock.unlock();
+        return released;
     }
 
     std::vector<GWOperationPtr> snapshot() const {
@@ -170,13 +203,28 @@ public:
     void runWorker() {
         std::unique_lock<std::mutex> lock(mutex);
         --startingWorkerCount;
+        std::vector<GWOperationPtr> released;
         for (;;) {
             if (!handoff.empty()) {
                 GWOperationPtr operation = std::move(handoff.front());
                 handoff.pop_front();
                 lock.unlock();
+                released.clear();
+                tWorkerCore = this;
                 operation->start();
                 operation.reset();
+                tWorkerCore = nullptr;
+                lock.lock();
+                for (GWOperation* finished : tFinishedHere) {
+                    released.push_back(settle(finished));
+                }
+                tFinishedHere.clear();
+                drain(lock);
+                continue;
+            }
+            if (!released.empty()) {
+                lock.unlock();
+                released.clear();
                 lock.lock();
                 continue;
             }
@@ -207,7 +255,7 @@ void GWOperationQueue::setMaxConcurrentOperationCount(long count) {
     core_->drain(lock);
 }
 
-bool GWOperationQueue::addOperation(const GWOperationPtr& operation) {
+bool GWOperationQueue::attach(const GWOperationPtr& operation) {
     if (!operation) {
         return false;
     }
@@ -215,9 +263,12 @@ bool GWOperationQueue::addOperation(const GWOperationPtr& operation) {
     // operation lets go of them when it finishes.
     const std::shared_ptr<GWOperationQueueCore> core = core_;
     GWOperation* const key = operation.get();
-    GWOperation::QueueHooks hooks{[core, key] { core->readinessChanged(key); },
-                                  [core, key] { core->didFinish(key); }};
-    if (!operation->attachToQueue(std::move(hooks))) {
+    return operation->attachToQueue(
+        {[core, key] { core->readinessChanged(key); }, [core, key] { core->didFinish(key); }});
+}
+
+bool GWOperationQueue::addOperation(const GWOperationPtr& operation) {
+    if (!attach(operation)) {
         return false;
     }
     core_->add(operation);
@@ -228,10 +279,11 @@ void GWOperationQueue::addOperations(const std::vector<GWOperationPtr>& operatio
                                      bool waitUntilFinished) {
     std::vector<GWOperationPtr> added;
     for (const GWOperationPtr& operation : operations) {
-        if (addOperation(operation)) {
+        if (attach(operation)) {
             added.push_back(operation);
         }
     }
+    core_->add(added);
     if (waitUntilFinished) {
         for (const GWOperationPtr& operation : added) {
             operation->waitUntilFinished();

@@ -55,5 +55,8 @@ public:
     void setName(std::string name);
 
 private:
+    // Gives the operation the hooks that tell the core of it.
+    bool attach(const GWOperationPtr& operation);
+
     std::shared_ptr<GWOperationQueueCore> core_;
 };

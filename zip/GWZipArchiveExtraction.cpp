@@ -23,9 +23,13 @@ struct BatchState {
     std::function<void(const std::string&, const GWErrorPtr&)> entryFailed;
 
     void finished(GWZipExtractOperation& operation) {
-        std::lock_guard guard(mutex);
         GWErrorPtr error = operation.error();
-        if (!error && operation.isCancelled() && !firstError) {
+        // Most entries succeed; workers would otherwise queue on the lock.
+        if (!error && !operation.isCancelled()) {
+            return;
+        }
+        std::lock_guard guard(mutex);
+        if (!error && !firstError) {
             error = GWCocoaError(GWUserCancelledError);
         }
         if (!error) {
@@ -193,6 +197,8 @@ void GWZipArchive::extractFiles(const GWZipFileArray& files, const GWURL& direct
         }
     }
     auto finalOperation = std::make_shared<GWBlockOperation>();
+    std::vector<GWOperationPtr> queued;
+    queued.reserve(operations->size());
     for (const auto& operation : *operations) {
         std::weak_ptr<GWZipExtractOperation> weakOperation = operation;
         operation->setCompletionBlock([weakOperation, state] {
@@ -201,8 +207,9 @@ void GWZipArchive::extractFiles(const GWZipFileArray& files, const GWURL& direct
             }
         });
         finalOperation->addDependency(operation);
-        runQueue->addOperation(operation);
+        queued.push_back(operation);
     }
+    runQueue->addOperations(queued, false);
     finalOperation->addExecutionBlock(
         [runQueue, state, completion = std::move(completionHandler)]() mutable {
             state->applyDirectoryInfo();

@@ -22,18 +22,32 @@ GWErrorPtr corruptOffsetError(const GWZipFilePtr& file) {
                            {}, "entry %s: its data lies past any file", file->path().c_str());
 }
 
-// Reads and parses the 30 fixed bytes of the entry's local header.
+// An entry whose stored data is at most this long is read in one piece with
+// its local header, whose name and extra field rarely pass the slack.
+constexpr std::uint64_t kSmallEntryLength = 64 * 1024;
+constexpr std::uint64_t kLocalHeaderSlack = 512;
+
+// Reads and parses the 30 fixed bytes of the entry's local header, and as
+// much as `following` of what comes after them into `bytes` (less at the end
+// of the file).
 bool readLocalHeader(const GWZipWorkOperation& operation, const GWZipFilePtr& file,
                      GWRemoteFileHandle& handle, std::uint64_t headerOffset,
-                     GWZipLocalFileHeader* header, GWErrorPtr* error) {
+                     GWZipLocalFileHeader* header, GWErrorPtr* error, std::uint64_t following = 0,
+                     GWData* read = nullptr) {
     // A positioned read: no look at the file's size first.
-    GWData bytes(GWZipLocalFileHeader::kLength);
+    GWData bytes(std::size_t(GWZipLocalFileHeader::kLength + following));
     auto got = handle.readDataAtOffset(headerOffset, bytes, error);
     if (!got) {
         return false;
     }
     bytes.resize(*got);
-    if (!operation.readLocalHeaderRecord(header, bytes, error)) {
+    if (read) {
+        *read = bytes;
+    }
+    if (!operation.readLocalHeaderRecord(header,
+                                         std::span(bytes).first(std::min<std::size_t>(
+                                             bytes.size(), GWZipLocalFileHeader::kLength)),
+                                         error)) {
         GWLog("error reading local record for file %s", file->path().c_str());
         return false;
     }
@@ -209,12 +223,15 @@ void GWZipExtractOperation::unpackFile(const GWZipFilePtr& file,
         completion(nullptr);
         return;
     }
-    if (!readLocalHeader(*this, file, *handle, headerOffset, &header, &error)) {
+    // The central directory's size: a local header with a data descriptor has none.
+    const std::uint64_t compressedSize = file->compressedSize();
+    const std::uint64_t following =
+        compressedSize <= kSmallEntryLength ? kLocalHeaderSlack + compressedSize : 0;
+    GWData head;
+    if (!readLocalHeader(*this, file, *handle, headerOffset, &header, &error, following, &head)) {
         completion(error);
         return;
     }
-    // The central directory's size: a local header with a data descriptor has none.
-    const std::uint64_t compressedSize = file->compressedSize();
     if (file->moreInfoAvailableInLocalHeader() &&
         !loadExtraInfoFromLocalHeader(header, file, handle, &error)) {
         completion(error);
@@ -230,8 +247,14 @@ void GWZipExtractOperation::unpackFile(const GWZipFilePtr& file,
         completion(corruptOffsetError(file));
         return;
     }
-    extractFile(file, headerOffset + skip, compressedSize, std::nullopt, file->compressionMethod(),
-                handle, std::move(handler), std::move(completion));
+    // A small entry's data came with its header: one read, not two.
+    std::optional<GWData> data;
+    if (head.size() >= skip && head.size() - skip >= compressedSize) {
+        data.emplace(head.begin() + std::ptrdiff_t(skip),
+                     head.begin() + std::ptrdiff_t(skip + compressedSize));
+    }
+    extractFile(file, headerOffset + skip, compressedSize, data, file->compressionMethod(), handle,
+                std::move(handler), std::move(completion));
 }
 
 void GWZipExtractOperation::extractFile(const GWZipFilePtr& file, std::uint64_t offset,
