@@ -66,11 +66,12 @@ GWZipFilePtr GWZipFile::initWithName(
     file->compressedSize_ = compressedSize;
     file->uncompressedSize_ = uncompressedSize;
     file->storeChecksum(std::move(checksum));
-    file->checksumAlgorithm_ = checksumAlgorithm;
+    file->storeChecksumAlgorithm(checksumAlgorithm);
     file->owner_ = owner;
     file->groupOwner_ = groupOwner;
     file->permissionsMode_ = permissionsMode;
-    file->modificationDate_ = modificationDate;
+    file->hasModificationDate_ = modificationDate.has_value();
+    file->modificationDate_ = modificationDate.value_or(GWDate());
     if (symlinkDestination) {
         file->extras().symlinkDestination = std::move(symlinkDestination);
     }
@@ -88,16 +89,18 @@ GWZipFile::~GWZipFile() {
     // releasing it recursively could exhaust a worker thread's stack.
     std::vector<GWZipFilePtr> pending;
     auto detach = [&pending](GWZipFile& node) {
-        if (node.children_ && node.children_.use_count() == 1) {
-            for (auto& child : *node.children_) {
+        if (!node.structure_) {
+            return;
+        }
+        Structure& structure = *node.structure_;
+        if (structure.children && structure.children.use_count() == 1) {
+            for (auto& child : *structure.children) {
                 pending.push_back(std::move(child));
             }
         }
-        node.children_.reset();
-        if (node.companions_) {
-            pending.push_back(std::move(node.companions_->resourceFork));
-            pending.push_back(std::move(node.companions_->appleDoubleFile));
-        }
+        structure.children.reset();
+        pending.push_back(std::move(structure.resourceFork));
+        pending.push_back(std::move(structure.appleDoubleFile));
     };
     detach(*this);
     while (!pending.empty()) {
@@ -136,6 +139,20 @@ std::optional<GWData> GWZipFile::storedChecksum() const {
     }
 }
 
+std::uint64_t GWZipFile::storedChecksumAlgorithm() const {
+    return checksumAlgorithm_ == kLongChecksumAlgorithm ? extras_->longChecksumAlgorithm
+                                                        : checksumAlgorithm_;
+}
+
+void GWZipFile::storeChecksumAlgorithm(std::uint64_t algorithm) {
+    if (algorithm >= kLongChecksumAlgorithm) {
+        extras().longChecksumAlgorithm = algorithm;
+        checksumAlgorithm_ = kLongChecksumAlgorithm;
+    } else {
+        checksumAlgorithm_ = std::uint32_t(algorithm);
+    }
+}
+
 void GWZipFile::storeChecksum(std::optional<GWData> checksum) {
     if (checksumState_ == kLongChecksum && extras_) {
         extras_->longChecksum = GWData();
@@ -151,11 +168,11 @@ void GWZipFile::storeChecksum(std::optional<GWData> checksum) {
     }
 }
 
-GWZipFile::Companions& GWZipFile::companions() {
-    if (!companions_) {
-        companions_ = std::make_unique<Companions>();
+GWZipFile::Structure& GWZipFile::structure() {
+    if (!structure_) {
+        structure_ = std::make_unique<Structure>();
     }
-    return *companions_;
+    return *structure_;
 }
 
 namespace {
@@ -163,22 +180,22 @@ const GWZipFilePtr kNoFile;
 }
 
 const GWZipFilePtr& GWZipFile::resourceFork() const {
-    return companions_ ? companions_->resourceFork : kNoFile;
+    return structure_ ? structure_->resourceFork : kNoFile;
 }
 
 void GWZipFile::setResourceFork(GWZipFilePtr file) {
-    if (file || companions_) {
-        companions().resourceFork = std::move(file);
+    if (file || structure_) {
+        structure().resourceFork = std::move(file);
     }
 }
 
 const GWZipFilePtr& GWZipFile::appleDoubleFile() const {
-    return companions_ ? companions_->appleDoubleFile : kNoFile;
+    return structure_ ? structure_->appleDoubleFile : kNoFile;
 }
 
 void GWZipFile::setAppleDoubleFile(GWZipFilePtr file) {
-    if (file || companions_) {
-        companions().appleDoubleFile = std::move(file);
+    if (file || structure_) {
+        structure().appleDoubleFile = std::move(file);
     }
 }
 
@@ -241,12 +258,12 @@ void GWZipFile::setPrivateUncompressedChecksum(std::optional<GWData> checksum) {
 
 std::uint64_t GWZipFile::privateUncompressedChecksumAlgorithm() const {
     std::lock_guard lock(stateMutex());
-    return checksumAlgorithm_;
+    return storedChecksumAlgorithm();
 }
 
 void GWZipFile::setPrivateUncompressedChecksumAlgorithm(std::uint64_t algorithm) {
     std::lock_guard lock(stateMutex());
-    checksumAlgorithm_ = algorithm;
+    storeChecksumAlgorithm(algorithm);
 }
 
 GWDictionary GWZipFile::extraInfo() const {
@@ -289,74 +306,84 @@ std::optional<std::string> GWZipFile::filenameFromExtraInfo(const GWDictionary& 
 // --- Children ------------------------------------------------------------------
 
 void GWZipFile::setChildren(std::optional<GWZipFileArray> children) {
-    children_ = children ? std::make_shared<GWZipFileArray>(std::move(*children)) : nullptr;
-    ++childrenGeneration_;
+    if (!children && !structure_) {
+        return;
+    }
+    Structure& structure = this->structure();
+    structure.children =
+        children ? std::make_shared<GWZipFileArray>(std::move(*children)) : nullptr;
+    ++structure.childrenGeneration;
 }
 
 void GWZipFile::addChild(const GWZipFilePtr& child) {
-    if (!children_) {
-        children_ = std::make_shared<GWZipFileArray>(1, child);
-        ++childrenGeneration_;
+    Structure& structure = this->structure();
+    auto& children = structure.children;
+    if (!children) {
+        children = std::make_shared<GWZipFileArray>(1, child);
+        ++structure.childrenGeneration;
         return;
     }
-    if (children_.use_count() > 1) {
+    if (children.use_count() > 1) {
         // A caller holds a snapshot: it must not see the append.
         auto copy = std::make_shared<GWZipFileArray>();
-        copy->reserve(children_->size() + 1);
-        *copy = *children_;
+        copy->reserve(children->size() + 1);
+        *copy = *children;
         copy->push_back(child);
-        children_ = std::move(copy);
-        ++childrenGeneration_;
+        children = std::move(copy);
+        ++structure.childrenGeneration;
         return;
     }
-    children_->push_back(child);
+    children->push_back(child);
     NameIndex& index = nameIndex();
     std::lock_guard lock(index.mutex);
-    if (index.valid && index.childrenGeneration == childrenGeneration_ && child) {
-        index.first.emplace(child->name(), children_->size() - 1);
+    if (index.valid && index.childrenGeneration == structure.childrenGeneration && child) {
+        index.first.emplace(child->name(), children->size() - 1);
     }
 }
 
 GWZipFile::NameIndex& GWZipFile::nameIndex() const {
+    // Callers have children, hence the structure.
     std::lock_guard lock(stateMutex());
-    if (!index_) {
-        index_ = std::make_unique<NameIndex>();
+    if (!structure_->index) {
+        structure_->index = std::make_unique<NameIndex>();
     }
-    return *index_;
+    return *structure_->index;
 }
 
 void GWZipFile::removeChild(const GWZipFilePtr& child) {
-    if (!children_) {
+    if (!structure_ || !structure_->children) {
         return;
     }
+    auto& children = structure_->children;
     auto remaining = std::make_shared<GWZipFileArray>();
-    remaining->reserve(children_->size());
-    for (const auto& existing : *children_) {
+    remaining->reserve(children->size());
+    for (const auto& existing : *children) {
         if (existing != child) {
             remaining->push_back(existing);
         }
     }
-    children_ = std::move(remaining);
-    ++childrenGeneration_;
+    children = std::move(remaining);
+    ++structure_->childrenGeneration;
 }
 
 std::optional<std::size_t> GWZipFile::indexOfChildNamed(std::string_view name) const {
-    if (!children_) {
+    if (!structure_ || !structure_->children) {
         return std::nullopt;
     }
+    const GWZipFileArray& children = *structure_->children;
+    const std::uint64_t generation = structure_->childrenGeneration;
     NameIndex& index = nameIndex();
     std::lock_guard lock(index.mutex);
     const std::uint64_t epoch = gRenameEpoch.load(std::memory_order_relaxed);
-    if (!index.valid || index.childrenGeneration != childrenGeneration_ ||
-        index.renameEpoch != epoch) {
+    if (!index.valid || index.childrenGeneration != generation || index.renameEpoch != epoch) {
         index.first.clear();
-        index.first.reserve(children_->size());
-        for (std::size_t i = 0; i < children_->size(); ++i) {
-            if (const auto& child = (*children_)[i]) {
+        index.first.reserve(children.size());
+        for (std::size_t i = 0; i < children.size(); ++i) {
+            if (const auto& child = children[i]) {
                 index.first.emplace(child->name(), i);
             }
         }
-        index.childrenGeneration = childrenGeneration_;
+        index.childrenGeneration = generation;
         index.renameEpoch = epoch;
         index.valid = true;
     }
@@ -369,7 +396,7 @@ std::optional<std::size_t> GWZipFile::indexOfChildNamed(std::string_view name) c
 
 GWZipFilePtr GWZipFile::childNamed(std::string_view name) const {
     auto position = indexOfChildNamed(name);
-    return position ? (*children_)[*position] : nullptr;
+    return position ? (*structure_->children)[*position] : nullptr;
 }
 
 // --- Derived properties ----------------------------------------------------------
@@ -447,7 +474,7 @@ std::optional<GWDate> GWZipFile::modificationDate() const {
                                   kGWZipModificationDateKey)) {
         return date;
     }
-    return modificationDate_;
+    return hasModificationDate_ ? std::optional<GWDate>(modificationDate_) : std::nullopt;
 }
 
 std::optional<GWDate> GWZipFile::backupDate() const {
@@ -509,5 +536,5 @@ std::optional<GWData> GWZipFile::uncompressedChecksum() const {
 std::uint64_t GWZipFile::uncompressedChecksumAlgorithm() const {
     const bool macBinary = isMacBinaryEncoded();
     std::lock_guard lock(stateMutex());
-    return macBinary ? 0 : checksumAlgorithm_;
+    return macBinary ? 0 : storedChecksumAlgorithm();
 }

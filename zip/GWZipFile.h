@@ -62,7 +62,9 @@ public:
     std::uint32_t owner() const { return owner_; }
     std::uint32_t groupOwner() const { return groupOwner_; }
     // The date of the central directory record (see modificationDate()).
-    const std::optional<GWDate>& storedModificationDate() const { return modificationDate_; }
+    std::optional<GWDate> storedModificationDate() const {
+        return hasModificationDate_ ? std::optional<GWDate>(modificationDate_) : std::nullopt;
+    }
     // This entry's own size, without its companions (see uncompressedSize()).
     std::uint64_t storedUncompressedSize() const;
     void setUncompressedSize(std::uint64_t size);
@@ -96,7 +98,9 @@ public:
     // --- Children -------------------------------------------------------------
 
     // Null for a leaf. The snapshot stays as it is when the directory changes.
-    GWZipFileArrayPtr children() const { return children_; }
+    GWZipFileArrayPtr children() const {
+        return structure_ ? GWZipFileArrayPtr(structure_->children) : nullptr;
+    }
     // Replaces the children whole; std::nullopt makes the entry a leaf. Does
     // not touch the children's parent links.
     void setChildren(std::optional<GWZipFileArray> children);
@@ -207,49 +211,19 @@ private:
     struct Extras {
         std::optional<std::string> symlinkDestination;
         GWDictionary extraInfo;
-        GWData longChecksum;  // one longer than fits inline
+        GWData longChecksum;                      // one longer than fits inline
+        std::uint64_t longChecksumAlgorithm = 0;  // one wider than fits inline
     };
     Extras& extras();
     // The checksum, or none; under the state lock.
     std::optional<GWData> storedChecksum() const;
     void storeChecksum(std::optional<GWData> checksum);
+    std::uint64_t storedChecksumAlgorithm() const;
+    void storeChecksumAlgorithm(std::uint64_t algorithm);
 
-    // Companions are set while a tree is built, on one thread; few entries
-    // have any.
-    struct Companions {
-        GWZipFilePtr resourceFork;
-        GWZipFilePtr appleDoubleFile;
-    };
-    Companions& companions();
-
-    // checksumState_: a CRC-32 is kept inline; longer checksums (decoded
-    // from a coder) in the extras.
-    static constexpr std::size_t kInlineChecksumCapacity = 8;
-    static constexpr std::uint8_t kNoChecksum = 0xFF;
-    static constexpr std::uint8_t kLongChecksum = 0xFE;
-
-    std::uint16_t permissionsMode_ = 0;
-    std::uint16_t generalPurposeFlags_ = 0;
-    std::uint16_t compressionMethod_ = 0;
-    std::uint8_t checksumState_ = kNoChecksum;  // else the inline length
-    std::uint32_t owner_ = 0;
-    std::uint32_t groupOwner_ = 0;
-    std::uint8_t checksumBytes_[kInlineChecksumCapacity] = {};
-    std::optional<GWDate> modificationDate_;
-    std::uint64_t uncompressedSize_ = 0;
-    std::string name_;
-    // Copy-on-write: appended to in place while no snapshot is out.
-    std::shared_ptr<GWZipFileArray> children_;
-    std::uint64_t compressedSize_ = 0;
-    std::unique_ptr<Extras> extras_;  // null: none of them
-    std::unique_ptr<Companions> companions_;
-    std::weak_ptr<GWZipFile> parent_;
-    std::uint64_t localHeaderOffset_ = 0;
-    std::uint64_t checksumAlgorithm_ = 0;
-
-    // Name -> position of its first occurrence in children_, rebuilt when the
-    // children are replaced or any entry anywhere is renamed. Lookups may run
-    // on several threads over a finished tree, hence the lock.
+    // Name -> position of its first occurrence in the children, rebuilt when
+    // the children are replaced or any entry anywhere is renamed. Lookups may
+    // run on several threads over a finished tree, hence the lock.
     struct NameIndex {
         std::mutex mutex;
         std::unordered_map<std::string, std::size_t> first;
@@ -257,9 +231,44 @@ private:
         std::uint64_t renameEpoch = 0;
         bool valid = false;
     };
-    // Made when first needed (under the state lock), by directories only: an
-    // archive of 200,000 entries would otherwise carry 200,000 empty indexes.
+    // Children and companions are set while a tree is built, on one thread;
+    // few entries have either, and an archive of 200,000 entries pays for
+    // every byte a node carries.
+    struct Structure {
+        GWZipFilePtr resourceFork;
+        GWZipFilePtr appleDoubleFile;
+        // Copy-on-write: appended to in place while no snapshot is out.
+        std::shared_ptr<GWZipFileArray> children;
+        std::uint64_t childrenGeneration = 0;
+        // Made by the first lookup (under the state lock).
+        std::unique_ptr<NameIndex> index;
+    };
+    Structure& structure();
+    // Only directories with children ever need one.
     NameIndex& nameIndex() const;
-    mutable std::unique_ptr<NameIndex> index_;
-    std::uint64_t childrenGeneration_ = 0;
+
+    // checksumState_: a CRC-32 is kept inline; longer checksums (decoded
+    // from a coder) in the extras, as are algorithm numbers beyond 32 bits.
+    static constexpr std::size_t kInlineChecksumCapacity = 4;
+    static constexpr std::uint8_t kNoChecksum = 0xFF;
+    static constexpr std::uint8_t kLongChecksum = 0xFE;
+    static constexpr std::uint32_t kLongChecksumAlgorithm = UINT32_MAX;
+
+    std::uint16_t permissionsMode_ = 0;
+    std::uint16_t generalPurposeFlags_ = 0;
+    std::uint16_t compressionMethod_ = 0;
+    std::uint8_t checksumState_ = kNoChecksum;  // else the inline length
+    bool hasModificationDate_ = false;
+    std::uint32_t owner_ = 0;
+    std::uint32_t groupOwner_ = 0;
+    std::uint8_t checksumBytes_[kInlineChecksumCapacity] = {};
+    std::uint32_t checksumAlgorithm_ = 0;
+    GWDate modificationDate_;
+    std::uint64_t uncompressedSize_ = 0;
+    std::uint64_t compressedSize_ = 0;
+    std::uint64_t localHeaderOffset_ = 0;
+    std::string name_;
+    std::weak_ptr<GWZipFile> parent_;
+    std::unique_ptr<Extras> extras_;  // null: none of them
+    std::unique_ptr<Structure> structure_;
 };

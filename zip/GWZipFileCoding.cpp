@@ -31,14 +31,14 @@ void GWZipFile::encodeWithCoder(GWCoder& coder) const {
     std::unique_lock lock(stateMutex());
     coder.encodeValue(GWValue(name_), kNameKey);
     lock.unlock();
-    if (children_) {
-        coder.encodeArrayOfObjects(*children_, kChildrenKey);
+    if (auto children = this->children()) {
+        coder.encodeArrayOfObjects(*children, kChildrenKey);
     }
     lock.lock();
     coder.encodeUInt64(compressedSize_, kCompressedSizeKey);
     coder.encodeUInt64(uncompressedSize_, kUncompressedSizeKey);
     coder.encodeValue(storedChecksum(), kUncompressedChecksumKey);
-    coder.encodeInteger(std::int64_t(checksumAlgorithm_), kUncompressedChecksumAlgorithmKey);
+    coder.encodeInteger(std::int64_t(storedChecksumAlgorithm()), kUncompressedChecksumAlgorithmKey);
     const auto symlinkDestination =
         extras_ ? extras_->symlinkDestination : std::optional<std::string>();
     const GWDictionary extraInfo = storedExtraInfo();
@@ -46,7 +46,7 @@ void GWZipFile::encodeWithCoder(GWCoder& coder) const {
     coder.encodeInt32(std::int32_t(owner_), kOwnerKey);
     coder.encodeInt32(std::int32_t(groupOwner_), kGroupOwnerKey);
     coder.encodeInteger(permissionsMode_, kPermissionsModeKey);
-    coder.encodeValue(modificationDate_, kModificationDateKey);
+    coder.encodeValue(storedModificationDate(), kModificationDateKey);
     coder.encodeValue(symlinkDestination, kSymlinkDestinationKey);
     coder.encodeObject(resourceFork(), kResourceForkKey);
     coder.encodeObject(appleDoubleFile(), kAppleDoubleFileKey);
@@ -77,8 +77,8 @@ GWZipFilePtr GWZipFile::initWithCoder(GWCoder& coder) {
     file->setChildren(std::move(children));
     file->setResourceFork(coder.decodeObjectOfClass<GWZipFile>(kResourceForkKey));
     file->setAppleDoubleFile(coder.decodeObjectOfClass<GWZipFile>(kAppleDoubleFileKey));
-    if (file->children_) {
-        for (const auto& child : *file->children_) {
+    if (auto children = file->children()) {
+        for (const auto& child : *children) {
             child->parent_ = file;
         }
     }
@@ -102,7 +102,7 @@ void GWZipFile::copyFieldsTo(GWZipFile& target) const {
         extraInfo = extras_->extraInfo;
     }
     std::optional<GWData> checksum = storedChecksum();
-    const std::uint64_t checksumAlgorithm = checksumAlgorithm_;
+    const std::uint64_t checksumAlgorithm = storedChecksumAlgorithm();
     lock.unlock();
 
     std::lock_guard targetLock(target.stateMutex());
@@ -111,6 +111,7 @@ void GWZipFile::copyFieldsTo(GWZipFile& target) const {
     target.compressionMethod_ = compressionMethod_;
     target.owner_ = owner_;
     target.groupOwner_ = groupOwner_;
+    target.hasModificationDate_ = hasModificationDate_;
     target.modificationDate_ = modificationDate_;
     target.uncompressedSize_ = uncompressedSize;
     target.name_ = std::move(name);
@@ -123,7 +124,7 @@ void GWZipFile::copyFieldsTo(GWZipFile& target) const {
     }
     target.localHeaderOffset_ = localHeaderOffset_;
     target.storeChecksum(std::move(checksum));
-    target.checksumAlgorithm_ = checksumAlgorithm;
+    target.storeChecksumAlgorithm(checksumAlgorithm);
 }
 
 GWZipFilePtr GWZipFile::copy() const {
@@ -146,12 +147,13 @@ GWZipFilePtr GWZipFile::copy() const {
             target->setAppleDoubleFile(shallowCopy(*appleDouble));
             pending.emplace_back(appleDouble.get(), target->appleDoubleFile());
         }
-        if (!source->children_) {
+        const GWZipFileArrayPtr sourceChildren = source->children();
+        if (!sourceChildren) {
             continue;
         }
         auto children = std::make_shared<GWZipFileArray>();
-        children->reserve(source->children_->size());
-        for (const auto& child : *source->children_) {
+        children->reserve(sourceChildren->size());
+        for (const auto& child : *sourceChildren) {
             GWZipFilePtr childCopy;
             if (child) {
                 childCopy = shallowCopy(*child);
@@ -160,8 +162,9 @@ GWZipFilePtr GWZipFile::copy() const {
             }
             children->push_back(std::move(childCopy));
         }
-        target->children_ = std::move(children);
-        ++target->childrenGeneration_;
+        Structure& structure = target->structure();
+        structure.children = std::move(children);
+        ++structure.childrenGeneration;
     }
     return root;
 }

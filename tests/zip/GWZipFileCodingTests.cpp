@@ -48,6 +48,7 @@ GWZipFilePtr sampleTree() {
     auto link = makeNode("link", root, 0120755);
     link->setSymlinkDestination("target");
     link->setPrivateUncompressedChecksum(std::nullopt);
+    link->setPrivateUncompressedChecksumAlgorithm(0x1'0000'0001ull);  // wider than kept inline
     auto sub = makeNode("sub", root, 040700);
     sub->setChildren(GWZipFileArray{});
     makeNode("leaf", root, 040700);

@@ -141,7 +141,19 @@ int runList(const ParsedArguments& arguments) {
         return kExitFailure;
     bool allFound = true;
     std::vector<std::string> paths(arguments.operands.begin() + 1, arguments.operands.end());
-    std::vector<std::size_t> selected = selectEntries(*archive, operand, paths, &allFound);
+    std::vector<std::size_t> selected;
+    if (!paths.empty())
+        selected = selectEntries(*archive, operand, paths, &allFound);
+    // Without PATHs every entry, without an index array as long as the archive.
+    auto forEachSelected = [&](auto&& visit) {
+        if (paths.empty()) {
+            for (std::size_t index = 0; index < archive->entryCount(); ++index)
+                visit(index);
+        } else {
+            for (std::size_t index : selected)
+                visit(index);
+        }
+    };
     auto describe = [&](std::size_t index) {
         EntryRecord entry = archive->entry(index);
         if (entry.type == EntryType::symlink && !entry.linkTarget)
@@ -156,18 +168,17 @@ int runList(const ParsedArguments& arguments) {
         archive->writeArchiveFields(json);
         json.key("entries");
         json.beginArray();
-        for (std::size_t index : selected)
-            writeEntry(json, describe(index));
+        forEachSelected([&](std::size_t index) { writeEntry(json, describe(index)); });
         json.endArray();
         json.endObject();
         std::printf("%s\n", json.text().c_str());
     } else if (arguments.has("long")) {
-        for (std::size_t index : selected)
-            printLongEntry(describe(index));
+        forEachSelected([&](std::size_t index) { printLongEntry(describe(index)); });
     } else {
         flockfile(stdout);
-        for (std::size_t index : selected)
+        forEachSelected([&](std::size_t index) {
             printName(archive->entryPath(index), archive->entryType(index));
+        });
         funlockfile(stdout);
     }
     keepUntilExit(std::move(archive));

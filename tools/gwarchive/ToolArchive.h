@@ -15,7 +15,7 @@ namespace gwarchive {
 
 class JsonWriter;
 
-enum class EntryType {
+enum class EntryType : std::uint8_t {
     file,
     directory,
     symlink,
