@@ -10,7 +10,7 @@ packages=(
   libpugixml-dev libacl1-dev libplist-dev libcurl4-openssl-dev libisal-dev
   libgtest-dev libgmock-dev libbenchmark-dev
   unzip zip libarchive-tools 7zip unar macutils nginx
-  hyperfine time
+  hyperfine time strace
 )
 
 missing=()
