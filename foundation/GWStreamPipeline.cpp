@@ -20,8 +20,9 @@ bool GWStreamOutcome::decodedDigestMatches(const GWStreamCheck& check) const {
 }
 
 GWStreamPipeline::GWStreamPipeline(std::shared_ptr<GWDecompressor> decoder, GWStreamCheck check,
-                                   Sink sink)
+                                   Sink sink, std::unique_ptr<GWStreamDecryptor> decryptor)
     : decoder_(std::move(decoder)),
+      decryptor_(std::move(decryptor)),
       check_(std::move(check)),
       sink_(std::move(sink)),
       storedDigest_(GWChecksum::checksumWithAlgorithm(check_.storedAlgorithm)),
@@ -76,11 +77,23 @@ bool GWStreamPipeline::feed(std::span<const std::uint8_t> stored, bool isLast) {
     if (storedDigest_) {
         storedDigest_->update(stored);
     }
-    // Decryption, where an entry has it, belongs here: stored bytes in,
-    // plain compressed bytes out.
+    if (!decryptor_) {
+        return decode(stored, isLast);
+    }
+    GWErrorPtr decryptError;
+    if (!decryptor_->decrypt(
+            stored, isLast,
+            [this](std::span<const std::uint8_t> plain, bool last) { return decode(plain, last); },
+            &decryptError)) {
+        return ended_ ? false : end(GWStreamEnd::failed, decryptError);
+    }
+    return !ended_;
+}
+
+bool GWStreamPipeline::decode(std::span<const std::uint8_t> plain, bool isLast) {
     GWErrorPtr decodeError;
     if (!decoder_->decompressStreamWithInputData(
-            stored, isLast, [this](std::span<const std::uint8_t> piece) { return deliver(piece); },
+            plain, isLast, [this](std::span<const std::uint8_t> piece) { return deliver(piece); },
             &decodeError)) {
         return ended_ ? false : end(GWStreamEnd::failed, decodeError);
     }
@@ -95,8 +108,13 @@ const GWStreamOutcome& GWStreamPipeline::run(GWRemoteFileHandle& handle, std::ui
                                              std::uint64_t length,
                                              const std::function<bool()>& isCancelled) {
     if (length == 0) {
-        // An empty range is an empty stream whatever its nominal compression.
-        finish();
+        // An empty range is an empty stream whatever its nominal compression;
+        // a decryptor still has to find its header missing.
+        if (decryptor_) {
+            feed({}, true);
+        } else {
+            finish();
+        }
         return outcome_;
     }
     handle.readDataAtOffset(offset, length, UINT64_MAX,
