@@ -70,7 +70,7 @@ void GWStreamPipeline::finish() {
 }
 
 bool GWStreamPipeline::feed(std::span<const std::uint8_t> stored, bool isLast) {
-    if (ended_) {
+    if (ended_ && !draining_) {
         return false;
     }
     outcome_.storedBytes += stored.size();
@@ -81,13 +81,26 @@ bool GWStreamPipeline::feed(std::span<const std::uint8_t> stored, bool isLast) {
         return decode(stored, isLast);
     }
     GWErrorPtr decryptError;
-    if (!decryptor_->decrypt(
-            stored, isLast,
-            [this](std::span<const std::uint8_t> plain, bool last) { return decode(plain, last); },
-            &decryptError)) {
-        return ended_ ? false : end(GWStreamEnd::failed, decryptError);
+    const bool going = decryptor_->decrypt(
+        stored, isLast,
+        [this](std::span<const std::uint8_t> plain, bool last) {
+            return !ended_ && decode(plain, last);
+        },
+        &decryptError);
+    if (decryptError) {
+        // Forged bytes explain whatever the decoder said about them.
+        draining_ = false;
+        return end(GWStreamEnd::failed, decryptError);
     }
-    return !ended_;
+    if (!draining_ && ended_ && outcome_.end == GWStreamEnd::failed &&
+        decryptor_->authenticates()) {
+        draining_ = true;
+    }
+    if (draining_) {
+        draining_ = !isLast;
+        return draining_;
+    }
+    return going && !ended_;
 }
 
 bool GWStreamPipeline::decode(std::span<const std::uint8_t> plain, bool isLast) {

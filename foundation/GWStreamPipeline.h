@@ -61,6 +61,10 @@ public:
     // one when the sink stopped.
     virtual bool decrypt(std::span<const std::uint8_t> stored, bool isLast, const Sink& sink,
                          GWErrorPtr* error) = 0;
+    // Whether the end checks every byte: such a stage goes on checking the
+    // rest when the sink refuses more, so that a decoder's complaint about
+    // forged bytes can be told from damage.
+    virtual bool authenticates() const { return false; }
 };
 
 // The one path stored bytes take to a consumer, for both formats and for
@@ -104,4 +108,7 @@ private:
     std::unique_ptr<GWChecksum> decodedDigest_;
     GWStreamOutcome outcome_;
     bool ended_ = false;
+    // The decoder failed on authenticated bytes; the rest is read only to learn
+    // whether they were forged.
+    bool draining_ = false;
 };

@@ -157,7 +157,7 @@ public:
         }
         tail_.insert(tail_.end(), stored.begin(), stored.end());
         if (!isLast) {
-            return true;
+            return !refused_;
         }
         if (tail_.size() < kMACLength) {
             return GWFail(error, truncatedError(path_));
@@ -171,8 +171,10 @@ public:
                                                  "code: a wrong password or damaged data",
                                                  path_.c_str()));
         }
-        return sink({}, true);
+        return !refused_ && sink({}, true);
     }
+
+    bool authenticates() const override { return true; }
 
 private:
     bool cryptoFailure(GWErrorPtr* error) {
@@ -216,23 +218,24 @@ private:
         return ready || cryptoFailure(error);
     }
 
-    // Authenticates and decrypts ciphertext and hands it on.
+    // Authenticates and decrypts ciphertext and hands it on; once the sink
+    // refuses, the rest is only authenticated.
     bool process(std::span<const std::uint8_t> cipher, const Sink& sink, GWErrorPtr* error) {
         while (!cipher.empty()) {
             const std::size_t count = std::min(cipher.size(), kPieceSize);
             if (EVP_MAC_update(mac_, cipher.data(), count) != 1) {
                 return cryptoFailure(error);
             }
-            for (std::size_t i = 0; i < count; ++i) {
-                if (keystreamUsed_ == keystreamLength_ && !refillKeystream(count - i)) {
-                    return cryptoFailure(error);
+            if (!refused_) {
+                for (std::size_t i = 0; i < count; ++i) {
+                    if (keystreamUsed_ == keystreamLength_ && !refillKeystream(count - i)) {
+                        return cryptoFailure(error);
+                    }
+                    plain_[i] = cipher[i] ^ keystream_[keystreamUsed_++];
                 }
-                plain_[i] = cipher[i] ^ keystream_[keystreamUsed_++];
+                refused_ = !sink({plain_.data(), count}, false);
             }
             cipher = cipher.subspan(count);
-            if (!sink({plain_.data(), count}, false)) {
-                return false;
-            }
         }
         return true;
     }
@@ -267,6 +270,7 @@ private:
     EVP_CIPHER_CTX* cipher_ = nullptr;
     EVP_MAC_CTX* mac_ = nullptr;
     std::vector<std::uint8_t> tail_;
+    bool refused_ = false;
     std::uint64_t counter_ = 0;
     std::array<std::uint8_t, kPieceSize> counters_{};
     std::array<std::uint8_t, kPieceSize> keystream_{};

@@ -27,7 +27,7 @@ std::optional<std::string> promptForPassword(const std::string& operand) {
     if (quiet) {
         termios silent = saved;
         silent.c_lflag &= ~tcflag_t(ECHO);
-        ::tcsetattr(tty, TCSAFLUSH, &silent);
+        ::tcsetattr(tty, TCSANOW, &silent);  // keeps what was typed ahead
     }
     std::string line;
     char c = 0;
@@ -35,7 +35,7 @@ std::optional<std::string> promptForPassword(const std::string& operand) {
     while ((got = ::read(tty, &c, 1)) == 1 && c != '\n')
         line += c;
     if (quiet)
-        ::tcsetattr(tty, TCSAFLUSH, &saved);
+        ::tcsetattr(tty, TCSANOW, &saved);
     (void)!::write(tty, "\n", 1);
     ::close(tty);
     if (got < 0 || (got == 0 && line.empty()))
