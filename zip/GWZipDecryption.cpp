@@ -29,50 +29,63 @@ GWErrorPtr truncatedError(const std::string& path) {
                            {}, "entry %s: its data is too short for its encryption", path.c_str());
 }
 
-// Collects an encryption header that may arrive over several pieces; hands
-// back the rest of the piece once it is complete.
-class HeaderCollector {
+// A decryptor behind a fixed-length header, which may arrive over several
+// pieces and opens the data or refuses the password.
+class HeaderedDecryptor : public GWStreamDecryptor {
 public:
-    explicit HeaderCollector(std::size_t length) : length_(length) {}
-    bool complete() const { return bytes_.size() == length_; }
-    const std::vector<std::uint8_t>& bytes() const { return bytes_; }
-    std::span<const std::uint8_t> take(std::span<const std::uint8_t> stored) {
-        const std::size_t count = std::min(length_ - bytes_.size(), stored.size());
-        bytes_.insert(bytes_.end(), stored.begin(), stored.begin() + count);
-        return stored.subspan(count);
+    HeaderedDecryptor(std::size_t headerLength, std::string path)
+        : path_(std::move(path)), headerLength_(headerLength) {}
+
+    bool decrypt(std::span<const std::uint8_t> stored, bool isLast, const Sink& sink,
+                 GWErrorPtr* error) final {
+        if (header_.size() < headerLength_) {
+            const std::size_t count = std::min(headerLength_ - header_.size(), stored.size());
+            header_.insert(header_.end(), stored.begin(), stored.begin() + count);
+            stored = stored.subspan(count);
+            if (header_.size() < headerLength_) {
+                return isLast ? GWFail(error, truncatedError(path_)) : true;
+            }
+            if (!open(header_, error)) {
+                return false;
+            }
+        }
+        return decryptData(stored, isLast, sink, error);
     }
 
+protected:
+    virtual bool open(const std::vector<std::uint8_t>& header, GWErrorPtr* error) = 0;
+    virtual bool decryptData(std::span<const std::uint8_t> stored, bool isLast, const Sink& sink,
+                             GWErrorPtr* error) = 0;
+
+    const std::string path_;
+
 private:
-    std::size_t length_;
-    std::vector<std::uint8_t> bytes_;
+    const std::size_t headerLength_;
+    std::vector<std::uint8_t> header_;
 };
 
 // Traditional PKWARE encryption: a stream cipher of three CRC-driven keys,
 // behind a 12-byte header whose last byte checks the password.
-class TraditionalDecryptor final : public GWStreamDecryptor {
+class TraditionalDecryptor final : public HeaderedDecryptor {
 public:
     TraditionalDecryptor(const std::string& password, std::uint8_t checkByte, std::string path)
-        : checkByte_(checkByte), path_(std::move(path)), header_(12) {
+        : HeaderedDecryptor(12, std::move(path)), checkByte_(checkByte) {
         for (unsigned char c : password) {
             updateKeys(c);
         }
     }
 
-    bool decrypt(std::span<const std::uint8_t> stored, bool isLast, const Sink& sink,
-                 GWErrorPtr* error) override {
-        if (!header_.complete()) {
-            stored = header_.take(stored);
-            if (!header_.complete()) {
-                return isLast ? GWFail(error, truncatedError(path_)) : true;
-            }
-            std::uint8_t last = 0;
-            for (std::uint8_t byte : header_.bytes()) {
-                last = decryptByte(byte);
-            }
-            if (last != checkByte_) {
-                return GWFail(error, wrongPasswordError(path_));
-            }
+private:
+    bool open(const std::vector<std::uint8_t>& header, GWErrorPtr* error) override {
+        std::uint8_t last = 0;
+        for (std::uint8_t byte : header) {
+            last = decryptByte(byte);
         }
+        return last == checkByte_ || GWFail(error, wrongPasswordError(path_));
+    }
+
+    bool decryptData(std::span<const std::uint8_t> stored, bool isLast, const Sink& sink,
+                     GWErrorPtr*) override {
         do {
             const std::size_t count = std::min(stored.size(), kPieceSize);
             for (std::size_t i = 0; i < count; ++i) {
@@ -86,7 +99,6 @@ public:
         return true;
     }
 
-private:
     static std::uint32_t crc32Step(std::uint32_t crc, std::uint8_t byte) {
         static const z_crc_t* const table = get_crc_table();
         return (crc >> 8) ^ table[(crc ^ byte) & 0xFF];
@@ -105,23 +117,20 @@ private:
 
     std::array<std::uint32_t, 3> keys_{305419896u, 591751049u, 878082192u};
     std::uint8_t checkByte_;
-    std::string path_;
-    HeaderCollector header_;
     std::array<std::uint8_t, kPieceSize> plain_{};
 };
 
 // WinZip AES: salt and password verifier, then AES-CTR data with a
 // little-endian counter from 1, then 10 bytes of HMAC-SHA1 over the
 // ciphertext, which are held back until the end checks them.
-class AESDecryptor final : public GWStreamDecryptor {
+class AESDecryptor final : public HeaderedDecryptor {
 public:
     static constexpr std::size_t kMACLength = 10;
 
     AESDecryptor(std::string password, int strength, std::string path)
-        : password_(std::move(password)),
-          keyLength_(8 + 8 * std::size_t(strength)),
-          path_(std::move(path)),
-          header_(keyLength_ / 2 + 2) {}
+        : HeaderedDecryptor(6 + 4 * std::size_t(strength), std::move(path)),
+          password_(std::move(password)),
+          keyLength_(8 + 8 * std::size_t(strength)) {}
 
     ~AESDecryptor() override {
         EVP_CIPHER_CTX_free(cipher_);
@@ -129,17 +138,11 @@ public:
         OPENSSL_cleanse(password_.data(), password_.size());
     }
 
-    bool decrypt(std::span<const std::uint8_t> stored, bool isLast, const Sink& sink,
-                 GWErrorPtr* error) override {
-        if (!header_.complete()) {
-            stored = header_.take(stored);
-            if (!header_.complete()) {
-                return isLast ? GWFail(error, truncatedError(path_)) : true;
-            }
-            if (!deriveKeys(error)) {
-                return false;
-            }
-        }
+    bool authenticates() const override { return true; }
+
+private:
+    bool decryptData(std::span<const std::uint8_t> stored, bool isLast, const Sink& sink,
+                     GWErrorPtr* error) override {
         // Everything but the last 10 bytes seen so far is ciphertext.
         const std::size_t available = tail_.size() + stored.size();
         if (available > kMACLength) {
@@ -174,9 +177,6 @@ public:
         return !refused_ && sink({}, true);
     }
 
-    bool authenticates() const override { return true; }
-
-private:
     bool cryptoFailure(GWErrorPtr* error) {
         return GWFail(
             error,
@@ -184,8 +184,8 @@ private:
                             "entry %s: the AES decryption could not be set up", path_.c_str()));
     }
 
-    bool deriveKeys(GWErrorPtr* error) {
-        const std::vector<std::uint8_t>& header = header_.bytes();
+    // Derives the keys from the salt and checks the password verifier.
+    bool open(const std::vector<std::uint8_t>& header, GWErrorPtr* error) override {
         const std::size_t saltLength = keyLength_ / 2;
         std::vector<std::uint8_t> derived(2 * keyLength_ + 2);
         if (PKCS5_PBKDF2_HMAC(password_.data(), int(password_.size()), header.data(),
@@ -264,9 +264,7 @@ private:
     }
 
     std::string password_;
-    std::size_t keyLength_;
-    std::string path_;
-    HeaderCollector header_;
+    const std::size_t keyLength_;
     EVP_CIPHER_CTX* cipher_ = nullptr;
     EVP_MAC_CTX* mac_ = nullptr;
     std::vector<std::uint8_t> tail_;
