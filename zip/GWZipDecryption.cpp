@@ -109,7 +109,7 @@ private:
         keys_[2] = crc32Step(keys_[2], std::uint8_t(keys_[1] >> 24));
     }
     std::uint8_t decryptByte(std::uint8_t cipher) {
-        const std::uint16_t temp = std::uint16_t(keys_[2] | 2);
+        const std::uint32_t temp = (keys_[2] | 2) & 0xFFFF;
         const std::uint8_t plain = cipher ^ std::uint8_t((temp * (temp ^ 1)) >> 8);
         updateKeys(plain);
         return plain;
