@@ -36,4 +36,9 @@ struct GWExtractOptions {
     // Told of each device or attribute left out for want of its switch, with
     // the entry's path in the archive and what was left out.
     std::function<void(const std::string& entryPath, const std::string& what)> withheld;
+
+    // --- Encryption ---------------------------------------------------------
+    // What opens encrypted entries; none: the archive's own (ZIP), else they
+    // fail as needing a password. Formats without encryption ignore it.
+    std::optional<std::string> password;
 };

@@ -20,8 +20,9 @@ bool GWStreamOutcome::decodedDigestMatches(const GWStreamCheck& check) const {
 }
 
 GWStreamPipeline::GWStreamPipeline(std::shared_ptr<GWDecompressor> decoder, GWStreamCheck check,
-                                   Sink sink)
+                                   Sink sink, std::unique_ptr<GWStreamDecryptor> decryptor)
     : decoder_(std::move(decoder)),
+      decryptor_(std::move(decryptor)),
       check_(std::move(check)),
       sink_(std::move(sink)),
       storedDigest_(GWChecksum::checksumWithAlgorithm(check_.storedAlgorithm)),
@@ -69,18 +70,43 @@ void GWStreamPipeline::finish() {
 }
 
 bool GWStreamPipeline::feed(std::span<const std::uint8_t> stored, bool isLast) {
-    if (ended_) {
+    if (ended_ && !draining_) {
         return false;
     }
     outcome_.storedBytes += stored.size();
     if (storedDigest_) {
         storedDigest_->update(stored);
     }
-    // Decryption, where an entry has it, belongs here: stored bytes in,
-    // plain compressed bytes out.
+    if (!decryptor_) {
+        return decode(stored, isLast);
+    }
+    GWErrorPtr decryptError;
+    const bool going = decryptor_->decrypt(
+        stored, isLast,
+        [this](std::span<const std::uint8_t> plain, bool last) {
+            return !ended_ && decode(plain, last);
+        },
+        &decryptError);
+    if (decryptError) {
+        // Forged bytes explain whatever the decoder said about them.
+        draining_ = false;
+        return end(GWStreamEnd::failed, decryptError);
+    }
+    if (!draining_ && ended_ && outcome_.end == GWStreamEnd::failed &&
+        decryptor_->authenticates()) {
+        draining_ = true;
+    }
+    if (draining_) {
+        draining_ = !isLast;
+        return draining_;
+    }
+    return going && !ended_;
+}
+
+bool GWStreamPipeline::decode(std::span<const std::uint8_t> plain, bool isLast) {
     GWErrorPtr decodeError;
     if (!decoder_->decompressStreamWithInputData(
-            stored, isLast, [this](std::span<const std::uint8_t> piece) { return deliver(piece); },
+            plain, isLast, [this](std::span<const std::uint8_t> piece) { return deliver(piece); },
             &decodeError)) {
         return ended_ ? false : end(GWStreamEnd::failed, decodeError);
     }
@@ -95,8 +121,13 @@ const GWStreamOutcome& GWStreamPipeline::run(GWRemoteFileHandle& handle, std::ui
                                              std::uint64_t length,
                                              const std::function<bool()>& isCancelled) {
     if (length == 0) {
-        // An empty range is an empty stream whatever its nominal compression.
-        finish();
+        // An empty range is an empty stream whatever its nominal compression;
+        // a decryptor still has to find its header missing.
+        if (decryptor_) {
+            feed({}, true);
+        } else {
+            finish();
+        }
         return outcome_;
     }
     handle.readDataAtOffset(offset, length, UINT64_MAX,

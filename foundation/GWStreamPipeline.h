@@ -47,6 +47,26 @@ struct GWStreamOutcome {
     bool decodedDigestMatches(const GWStreamCheck& check) const;
 };
 
+// Turns stored bytes into the bytes a decoder reads, checking what it can as
+// they pass. A stage that authenticates the whole stream holds back its last
+// piece until the end checks out, so a decoder never finishes on forged data.
+class GWStreamDecryptor {
+public:
+    // (plain piece, is the last) -> go on? Exactly one call carries is-last.
+    using Sink = std::function<bool(std::span<const std::uint8_t> piece, bool isLast)>;
+
+    virtual ~GWStreamDecryptor() = default;
+    // False with an error when the stream cannot be decrypted (a wrong key, a
+    // failed authentication, a stream too short for its header), and without
+    // one when the sink stopped.
+    virtual bool decrypt(std::span<const std::uint8_t> stored, bool isLast, const Sink& sink,
+                         GWErrorPtr* error) = 0;
+    // Whether the end checks every byte: such a stage goes on checking the
+    // rest when the sink refuses more, so that a decoder's complaint about
+    // forged bytes can be told from damage.
+    virtual bool authenticates() const { return false; }
+};
+
 // The one path stored bytes take to a consumer, for both formats and for
 // extraction to disk and to data handlers alike:
 //     read window -> [decryption] -> decoder -> verifier -> sink.
@@ -57,7 +77,8 @@ public:
     // One decoded piece; it lives until the sink returns. False stops.
     using Sink = std::function<bool(std::span<const std::uint8_t> piece)>;
 
-    GWStreamPipeline(std::shared_ptr<GWDecompressor> decoder, GWStreamCheck check, Sink sink);
+    GWStreamPipeline(std::shared_ptr<GWDecompressor> decoder, GWStreamCheck check, Sink sink,
+                     std::unique_ptr<GWStreamDecryptor> decryptor = nullptr);
     ~GWStreamPipeline();
 
     // Reads [offset, offset + length) through the handle and runs it through.
@@ -75,13 +96,19 @@ public:
 private:
     bool end(GWStreamEnd how, GWErrorPtr error = nullptr);
     bool deliver(std::span<const std::uint8_t> piece);
+    // Plain compressed bytes into the decoder.
+    bool decode(std::span<const std::uint8_t> plain, bool isLast);
     void finish();
 
     std::shared_ptr<GWDecompressor> decoder_;
+    std::unique_ptr<GWStreamDecryptor> decryptor_;
     GWStreamCheck check_;
     Sink sink_;
     std::unique_ptr<GWChecksum> storedDigest_;
     std::unique_ptr<GWChecksum> decodedDigest_;
     GWStreamOutcome outcome_;
     bool ended_ = false;
+    // The decoder failed on authenticated bytes; the rest is read only to learn
+    // whether they were forged.
+    bool draining_ = false;
 };

@@ -2,7 +2,10 @@
 // made with the archive builders the tests use, so each target starts from
 // inputs that reach deep into its parser.
 
+#include <openssl/evp.h>
+#include <openssl/hmac.h>
 #include <sys/stat.h>
+#include <zlib.h>
 
 #include <cstdio>
 #include <cstring>
@@ -49,6 +52,70 @@ GWData macBinary(int version) {
     file.creationDate = 3000000000u;
     file.modificationDate = 3000000100u;
     return buildMacBinary(file);
+}
+
+// The password fuzz_zip_archive opens encrypted entries with.
+constexpr char kPassword[] = "secret";
+
+// Traditional PKWARE encryption behind its 12-byte header.
+GWData traditionalEncrypted(const GWData& plain, std::uint8_t checkByte) {
+    std::uint32_t keys[3] = {305419896u, 591751049u, 878082192u};
+    const z_crc_t* table = get_crc_table();
+    auto update = [&](std::uint8_t byte) {
+        keys[0] = (keys[0] >> 8) ^ table[(keys[0] ^ byte) & 0xFF];
+        keys[1] = (keys[1] + (keys[0] & 0xFF)) * 134775813u + 1;
+        keys[2] = (keys[2] >> 8) ^ table[(keys[2] ^ (keys[1] >> 24)) & 0xFF];
+    };
+    for (const char* c = kPassword; *c; ++c) {
+        update(std::uint8_t(*c));
+    }
+    GWData input(11, 0x5A);
+    input.push_back(checkByte);
+    input.insert(input.end(), plain.begin(), plain.end());
+    GWData out;
+    for (std::uint8_t byte : input) {
+        const std::uint32_t temp = (keys[2] | 2) & 0xFFFF;
+        out.push_back(byte ^ std::uint8_t((temp * (temp ^ 1)) >> 8));
+        update(byte);
+    }
+    return out;
+}
+
+// WinZip AES: salt, verifier, AES-CTR (little-endian counter from 1), then
+// 10 bytes of HMAC-SHA1 over the ciphertext.
+GWData aesEncrypted(const GWData& plain, int strength) {
+    const int keyLength = 8 + 8 * strength;
+    GWData out(std::size_t(keyLength / 2), 0x33);
+    std::uint8_t keys[66];
+    PKCS5_PBKDF2_HMAC(kPassword, int(sizeof kPassword - 1), out.data(), int(out.size()), 1000,
+                      EVP_sha1(), 2 * keyLength + 2, keys);
+    out.insert(out.end(), keys + 2 * keyLength, keys + 2 * keyLength + 2);
+    const EVP_CIPHER* cipher = strength == 1   ? EVP_aes_128_ecb()
+                               : strength == 2 ? EVP_aes_192_ecb()
+                                               : EVP_aes_256_ecb();
+    EVP_CIPHER_CTX* context = EVP_CIPHER_CTX_new();
+    EVP_EncryptInit_ex(context, cipher, nullptr, keys, nullptr);
+    EVP_CIPHER_CTX_set_padding(context, 0);
+    const std::size_t start = out.size();
+    for (std::size_t at = 0; at < plain.size(); at += 16) {
+        std::uint8_t counter[16] = {}, stream[16];
+        const std::uint64_t block = at / 16 + 1;
+        for (int i = 0; i < 8; ++i) {
+            counter[i] = std::uint8_t(block >> (8 * i));
+        }
+        int length = 0;
+        EVP_EncryptUpdate(context, stream, &length, counter, 16);
+        for (std::size_t i = at; i < plain.size() && i < at + 16; ++i) {
+            out.push_back(plain[i] ^ stream[i - at]);
+        }
+    }
+    EVP_CIPHER_CTX_free(context);
+    std::uint8_t code[20];
+    unsigned int codeLength = 0;
+    HMAC(EVP_sha1(), keys + keyLength, keyLength, out.data() + start, out.size() - start, code,
+         &codeLength);
+    out.insert(out.end(), code, code + 10);
+    return out;
 }
 
 Seeds zipSeeds() {
@@ -133,6 +200,29 @@ Seeds zipSeeds() {
         zip.entries()[0].centralLocalHeaderOffset = zip.localHeaderOffsets()[1];
         zip.entries()[1].centralLocalHeaderOffset = zip.localHeaderOffsets()[0];
         zip.entries()[2].centralLocalHeaderOffset = zip.localHeaderOffsets()[1];
+        seeds.push_back(zip.bytes());
+    }
+    {
+        // Encrypted entries: traditional (the check byte from the CRC, or
+        // from the time with a data descriptor) and AES of each strength.
+        ZipBuilder zip;
+        const GWData text = textBytes(300, 9);
+        const std::uint32_t crc = std::uint32_t(crc32(0, text.data(), uInt(text.size())));
+        auto& traditional = zip.addFile("traditional.txt", text);
+        traditional.flags = 0x0001;
+        traditional.stored = traditionalEncrypted(text, std::uint8_t(crc >> 24));
+        auto& described = zip.addFile("described.txt", text);
+        described.flags = 0x0001;
+        described.dataDescriptor = true;
+        described.stored = traditionalEncrypted(text, std::uint8_t(described.dosTime >> 8));
+        for (std::uint8_t strength : {1, 2, 3}) {
+            auto& aes = zip.addFile("aes" + std::to_string(strength) + ".txt", text, 99);
+            aes.flags = 0x0001;
+            aes.crc32 = 0;
+            aes.stored = aesEncrypted(text, strength);
+            aes.centralExtra = zipExtraBlock(0x9901, {2, 0, 'A', 'E', strength, 0, 0});
+            aes.localExtra = aes.centralExtra;
+        }
         seeds.push_back(zip.bytes());
     }
     return seeds;

@@ -75,6 +75,11 @@ public:
     // How many entries were recovered from local headers because the end
     // record or the central directory could not be read; 0 for a whole archive.
     std::uint64_t recoveredEntryCount() const { return recoveredEntryCount_; }
+    // What opens encrypted entries for every extraction and stream from this
+    // archive, unless a batch's options give another. Set it before
+    // extracting; it is neither archived nor copied.
+    const std::optional<std::string>& password() const { return password_; }
+    void setPassword(std::optional<std::string> password) { password_ = std::move(password); }
     // Never set by loading, so 0; neither archived nor copied.
     std::uint64_t compressedSize() const { return compressedSize_; }
     void setCompressedSize(std::uint64_t size) { compressedSize_ = size; }
@@ -108,6 +113,7 @@ private:
     std::uint64_t startOffset_ = 0;
     std::uint64_t recoveredEntryCount_ = 0;
     std::uint64_t compressedSize_ = 0;
+    std::optional<std::string> password_;
 
     // `files` is set from the loading queue while callers read it.
     mutable std::mutex filesMutex_;

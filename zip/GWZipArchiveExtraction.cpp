@@ -274,6 +274,7 @@ std::optional<std::vector<GWZipExtractOperationPtr>> GWZipArchive::operationsToE
         operation->setContainmentRoot(root);
         operation->setReplacesExistingItems(options.replaceExisting);
         operation->setExtractOptions(shared);
+        operation->setPassword(options.password ? options.password : password_);
         if (next.directoryOperation) {
             operation->addDependency(next.directoryOperation);
         }
@@ -301,6 +302,7 @@ void GWZipArchive::extractDataForkOfFile(const GWZipFilePtr& file, const GWOpera
     auto operation =
         GWZipExtractOperation::initForExtractingFile(file, URL(), startOffset(), handler, &error);
     if (operation) {
+        operation->setPassword(password_);
         runQueue->addOperation(operation);
     } else if (handler) {
         runQueue->addOperationWithBlock([handler, error] { handler(std::nullopt, true, error); });

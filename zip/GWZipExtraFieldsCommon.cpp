@@ -36,6 +36,20 @@ std::optional<GWDictionary> GWZipWorkOperation::infoFromNTFSExtraField(
     return info;
 }
 
+std::optional<GWDictionary> GWZipWorkOperation::infoFromWinZipAESExtraField(
+    std::span<const std::uint8_t> data, std::size_t length, GWErrorPtr*) const {
+    // Version, "AE", strength, method. Another vendor's block under this ID
+    // says nothing; extraction then refuses the entry for want of its keys.
+    const GWZipFieldReader field(data, length);
+    GWDictionary info;
+    if (field.size() >= 7 && field.u16le(2) == 0x4541) {
+        GWZipSetInfo(info, kGWZipAESVendorVersionKey, field.u16le(0));
+        GWZipSetInfo(info, kGWZipAESStrengthKey, field.u8(4));
+        GWZipSetInfo(info, kGWZipAESCompressionMethodKey, field.u16le(5));
+    }
+    return info;
+}
+
 std::optional<GWDictionary> GWZipWorkOperation::infoFromMSOpenPackagingGrowthHintField(
     std::span<const std::uint8_t>, std::size_t, GWErrorPtr*) const {
     return GWDictionary();

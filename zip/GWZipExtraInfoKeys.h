@@ -30,6 +30,13 @@ inline constexpr const char* kGWZipCRC32Key = "CRC32";
 inline constexpr const char* kGWZipMoreInfoAvailableInLocalHeaderKey =
     "MoreInfoAvailableInLocalHeader";
 
+// WinZip AES encryption (numbers): the vendor version (1: AE-1, whose CRC is
+// checked; 2: AE-2, whose CRC is left 0), the key strength (1, 2, 3: 128,
+// 192, 256 bits) and the compression method under the encryption.
+inline constexpr const char* kGWZipAESVendorVersionKey = "AESVendorVersion";
+inline constexpr const char* kGWZipAESStrengthKey = "AESStrength";
+inline constexpr const char* kGWZipAESCompressionMethodKey = "AESCompressionMethod";
+
 // Finder information.
 inline constexpr const char* kGWZipTypeCodeKey = "TypeCode";        // 4-character string
 inline constexpr const char* kGWZipCreatorCodeKey = "CreatorCode";  // 4-character string

@@ -67,8 +67,12 @@ GWZipExtractOperationPtr GWZipExtractOperation::initForExtractingFile(
         GWFail(error, missingArchiveError());
         return nullptr;
     }
-    return initForExtractingFile(file, archive->URL(), archive->startOffset(), toURL, atomically,
-                                 std::move(progressHandler), error);
+    auto operation = initForExtractingFile(file, archive->URL(), archive->startOffset(), toURL,
+                                           atomically, std::move(progressHandler), error);
+    if (operation) {
+        operation->setPassword(archive->password());
+    }
+    return operation;
 }
 
 GWZipExtractOperationPtr GWZipExtractOperation::initForExtractingFile(
@@ -78,8 +82,12 @@ GWZipExtractOperationPtr GWZipExtractOperation::initForExtractingFile(
         GWFail(error, missingArchiveError());
         return nullptr;
     }
-    return initForExtractingFile(file, archive->URL(), archive->startOffset(),
-                                 std::move(dataHandler), error);
+    auto operation = initForExtractingFile(file, archive->URL(), archive->startOffset(),
+                                           std::move(dataHandler), error);
+    if (operation) {
+        operation->setPassword(archive->password());
+    }
+    return operation;
 }
 
 GWErrorPtr GWZipExtractOperation::error() const {

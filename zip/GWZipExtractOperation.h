@@ -23,6 +23,7 @@ class GWRemoteFileHandle;
 class GWReplacementFolder;
 class GWDirectoryCache;
 class GWRemoteFileHandlePool;
+class GWStreamDecryptor;
 class GWZipExtractOperation;
 using GWZipExtractOperationPtr = std::shared_ptr<GWZipExtractOperation>;
 using GWRemoteFileHandlePtr = std::shared_ptr<GWRemoteFileHandle>;
@@ -90,6 +91,9 @@ public:
     // when writing in place. An existing directory is merged into either way.
     void setReplacesExistingItems(std::optional<bool> replaces) { replacesExisting_ = replaces; }
     bool replacesExistingItems() const { return replacesExisting_.value_or(!isAtomic_); }
+    // What opens encrypted entries; without one they fail with
+    // GWZipArchivePasswordRequiredError. Set before the operation starts.
+    void setPassword(std::optional<std::string> password) { password_ = std::move(password); }
     // A batch applies directory metadata itself once their contents are written.
     void setDefersDirectoryInfo(bool defers) { defersDirectoryInfo_ = defers; }
     // What the operations of a batch share so that an entry costs a few system
@@ -138,11 +142,12 @@ public:
     // Streams the entry's decoded data to `handler` after its local header.
     void unpackFile(const GWZipFilePtr& file, const GWRemoteFileHandlePtr& handle,
                     ChunkHandler handler, Completion completion);
-    // Decodes [offset, offset + length) of the archive, or `data` when given.
+    // Decodes [offset, offset + length) of the archive, or `data` when given,
+    // decrypting it first when there is a decryptor.
     void extractFile(const GWZipFilePtr& file, std::uint64_t offset, std::uint64_t length,
                      const std::optional<GWData>& data, std::uint16_t compressionMethod,
                      const GWRemoteFileHandlePtr& handle, ChunkHandler handler,
-                     Completion completion);
+                     Completion completion, std::unique_ptr<GWStreamDecryptor> decryptor = nullptr);
     // Takes sizes and checksum from a header without a data descriptor, and
     // the name and extra info the local header gives.
     bool loadExtraInfoFromLocalHeader(const GWZipLocalFileHeader& header, const GWZipFilePtr& file,
@@ -212,6 +217,7 @@ private:
     // through it.
     GWFileDescriptor targetFile_;
     std::shared_ptr<const GWExtractOptions> options_;
+    std::optional<std::string> password_;
 
     mutable std::mutex errorMutex_;
     GWErrorPtr error_;

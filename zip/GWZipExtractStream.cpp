@@ -3,6 +3,7 @@
 #include <cstring>
 
 #include "GWArchiveSupport/GWArchiveConstants.h"
+#include "GWZipDecryption.h"
 #include "GWZipErrors.h"
 #include "GWZipExtractOperation.h"
 #include "GWZipNames.h"
@@ -56,11 +57,18 @@ bool readLocalHeader(const GWZipWorkOperation& operation, const GWZipFilePtr& fi
 
 // What an entry's decoded data must come to: its declared size and, where
 // the directory has one, its CRC-32. A MacBinary member is checked as
-// stored, before it is decoded.
+// stored, before it is decoded. AE-2 encryption leaves the CRC out (its
+// authentication code covers the data), AE-1 keeps it.
 GWStreamCheck streamCheckForFile(const GWZipFile& file) {
     GWStreamCheck check;
     check.size = file.storedUncompressedSize();
-    if (file.privateUncompressedChecksumAlgorithm() == GWChecksumAlgorithmCRC32) {
+    const bool isAE2 = file.compressionMethod() == 99 && [&] {
+        const GWDictionary info = file.extraInfo();
+        const auto version = info.find(kGWZipAESVendorVersionKey);
+        return version != info.end() && version->second.isNumber() &&
+               version->second.unsignedValue() == 2;
+    }();
+    if (!isAE2 && file.privateUncompressedChecksumAlgorithm() == GWChecksumAlgorithmCRC32) {
         if (auto crc = file.privateUncompressedChecksum(); crc && crc->size() == 4) {
             check.decodedAlgorithm = GWChecksumAlgorithmCRC32;
             check.decodedDigest = std::move(crc);
@@ -237,7 +245,14 @@ void GWZipExtractOperation::unpackFile(const GWZipFilePtr& file,
         completion(error);
         return;
     }
-    if (compressedSize == 0) {
+    GWErrorPtr decryptError;
+    auto decryptor = GWZipDecryptorForFile(*file, header, password_, &decryptError);
+    if (decryptError) {
+        completion(decryptError);
+        return;
+    }
+    // An encrypted entry always has its header: the decryptor finds it missing.
+    if (compressedSize == 0 && !decryptor) {
         completion(emptyStreamError(*file));
         return;
     }
@@ -253,15 +268,16 @@ void GWZipExtractOperation::unpackFile(const GWZipFilePtr& file,
         data.emplace(head.begin() + std::ptrdiff_t(skip),
                      head.begin() + std::ptrdiff_t(skip + compressedSize));
     }
-    extractFile(file, headerOffset + skip, compressedSize, data, file->compressionMethod(), handle,
-                std::move(handler), std::move(completion));
+    extractFile(file, headerOffset + skip, compressedSize, data, file->dataCompressionMethod(),
+                handle, std::move(handler), std::move(completion), std::move(decryptor));
 }
 
 void GWZipExtractOperation::extractFile(const GWZipFilePtr& file, std::uint64_t offset,
                                         std::uint64_t length, const std::optional<GWData>& data,
                                         std::uint16_t compressionMethod,
                                         const GWRemoteFileHandlePtr& handle, ChunkHandler handler,
-                                        Completion completion) {
+                                        Completion completion,
+                                        std::unique_ptr<GWStreamDecryptor> decryptor) {
     GWErrorPtr error;
     auto decompressor = decompressorForFile(file, compressionMethod, &error);
     if (!decompressor) {
@@ -271,7 +287,8 @@ void GWZipExtractOperation::extractFile(const GWZipFilePtr& file, std::uint64_t 
     GWErrorPtr handlerError;
     GWStreamPipeline pipeline(
         decompressor, streamCheckForFile(*file),
-        [&](std::span<const std::uint8_t> piece) { return handler(piece, false, &handlerError); });
+        [&](std::span<const std::uint8_t> piece) { return handler(piece, false, &handlerError); },
+        std::move(decryptor));
     if (data) {
         pipeline.feed(*data, true);
     } else {

@@ -522,6 +522,17 @@ bool GWZipFile::isMacBinaryEncoded() const {
     return !isDirectory() && boolInfo(storedExtraInfo(), kGWZipIsMacBinaryEncodedKey);
 }
 
+std::uint16_t GWZipFile::dataCompressionMethod() const {
+    if (compressionMethod_ != 99) {
+        return compressionMethod_;
+    }
+    std::lock_guard lock(stateMutex());
+    const GWDictionary& info = storedExtraInfo();
+    return info.count(kGWZipAESCompressionMethodKey) == 0
+               ? compressionMethod_
+               : std::uint16_t(numberInfo(info, kGWZipAESCompressionMethodKey));
+}
+
 bool GWZipFile::moreInfoAvailableInLocalHeader() const {
     std::lock_guard lock(stateMutex());
     return boolInfo(storedExtraInfo(), kGWZipMoreInfoAvailableInLocalHeaderKey);

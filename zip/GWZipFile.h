@@ -139,6 +139,12 @@ public:
     std::uint16_t putAwayFolderID() const;
     std::optional<std::string> comment() const;
     bool isMacBinaryEncoded() const;
+    // General-purpose flag bit 0: the data is encrypted, traditionally or
+    // (method 99) with WinZip AES.
+    bool isEncrypted() const { return (generalPurposeFlags_ & 0x0001) != 0; }
+    // The method the data is compressed with: for an AES entry the one its
+    // 0x9901 block names (99 when it has none), else compressionMethod().
+    std::uint16_t dataCompressionMethod() const;
     bool moreInfoAvailableInLocalHeader() const;
     // The stored CRC of a MacBinary entry covers the MacBinary stream, not the
     // data fork extraction produces, so such an entry reports no checksum.

@@ -110,6 +110,7 @@ std::optional<GWDictionary> GWZipWorkOperation::infoFromExtraFieldBlock(
         case 0x756E: return infoFromASiUnixExtraField(block, length, error);
         case 0x7855: return infoFromInfoZipUnixExtraField(block, length, isLocalHeader, error);
         case 0x7875: return infoFromInfoZipUnix3GExtraField(block, length, isLocalHeader, error);
+        case 0x9901: return infoFromWinZipAESExtraField(block, length, error);
         case 0xA220: return infoFromMSOpenPackagingGrowthHintField(block, length, error);
         case 0xCAFE: return GWDictionary();  // marks a Java archive; nothing to decode
         case 0xD935: return GWDictionary();  // Android's alignment padding
@@ -133,8 +134,8 @@ std::optional<GWDictionary> GWZipWorkOperation::infoFromExtraFieldData(
         GWErrorPtr blockError;
         auto decoded = infoFromExtraFieldBlock(headerID, block, isLocalHeader, &known, &blockError);
         if (!known) {
-            // Android alignment, NT security descriptors, encryption headers
-            // and whatever comes next: an archive is no worse for a block
+            // Android alignment, NT security descriptors, strong-encryption
+            // headers and whatever comes next: an archive is no worse for a block
             // this reader has no use for.
             GWLog("unknown extra info signature: 0x%x", unsigned(headerID));
             continue;

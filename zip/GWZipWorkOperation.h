@@ -119,6 +119,10 @@ public:
     std::optional<GWDictionary> infoFromASiUnixExtraField(std::span<const std::uint8_t> data,
                                                           std::size_t length,
                                                           GWErrorPtr* error) const;
+    // 0x9901
+    std::optional<GWDictionary> infoFromWinZipAESExtraField(std::span<const std::uint8_t> data,
+                                                            std::size_t length,
+                                                            GWErrorPtr* error) const;
     // 0xA220
     std::optional<GWDictionary> infoFromMSOpenPackagingGrowthHintField(
         std::span<const std::uint8_t> data, std::size_t length, GWErrorPtr* error) const;

@@ -31,6 +31,18 @@ enum GWZipArchiveErrorCode : long {
     // local header, or ranges that cross): the shape of a zip bomb, refused
     // when the archive is opened. The detail holds the path.
     GWZipArchiveOverlappingEntriesError = 7,
+    // The entry is encrypted and no password was given. Nothing of it is
+    // written. The detail holds the path.
+    GWZipArchivePasswordRequiredError = 8,
+    // The password does not open the entry: the check byte of its
+    // encryption header or its AES password verifier does not match. A wrong
+    // password passes the one-byte check once in 256 times and then fails as
+    // damaged data. The detail holds the path.
+    GWZipArchiveWrongPasswordError = 9,
+    // An AES entry's data does not match its authentication code: changed
+    // after it was encrypted, or a wrong password that passed the verifier.
+    // Nothing of it is left on disk. The detail holds the path.
+    GWZipArchiveAuthenticationFailedError = 10,
 };
 
 // Codes of kGWXARArchiveErrorDomain. 0, 8, 9 and 18 are never raised.

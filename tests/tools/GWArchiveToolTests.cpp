@@ -418,6 +418,80 @@ TEST(GWArchiveTool, ControlCharactersInNamesAreEscapedExceptInJson) {
               expected + "t\x1b]0;title\x07");
 }
 
+TEST(GWArchiveTool, EncryptedEntriesTakeTheirPasswordFromAnOptionAFileOrTheTerminal) {
+    TemporaryDirectory directory;
+    const GWData content = textBytes(20000, 6);
+    writeFile(directory.file("a.txt"), content);
+    writeFile(directory.file("password"), bytesOf("secret\nnot this line\n"));
+    const std::string folder = shellQuote(directory.path());
+    const struct {
+        const char* tool;
+        const char* command;
+        bool checksPassword;  // a verifier that a wrong password cannot pass by chance
+    } archives[] = {{"zip", "zip -q -e -P secret e.zip a.txt", false},
+                    {"7zz", "7zz a -tzip -mem=AES256 -psecret e.zip a.txt >/dev/null", true}};
+    for (const auto& made : archives) {
+        if (!toolAvailable(made.tool))
+            continue;
+        SCOPED_TRACE(made.tool);
+        fs::remove(directory.file("e.zip"));
+        ASSERT_EQ(runCommand("cd " + folder + " && " + made.command).status, 0);
+        const std::string archive = shellQuote(directory.file("e.zip"));
+        EXPECT_EQ(pythonJSON(runTool("list --json " + archive).out,
+                             "print([(e['encrypted'], e['compression']) for e in d['entries']])"),
+                  "[(True, 'deflate')]\n");
+        EXPECT_NE(runTool("list -l " + archive).out.find(" a.txt  [encrypted]\n"),
+                  std::string::npos);
+        const std::string file = " --password-file " + shellQuote(directory.file("password"));
+        const std::string out = shellQuote(directory.file("out"));
+        const struct {
+            std::string arguments;
+            int status;
+            std::string errorCode;  // the end of the error line; empty: no error
+        } rows[] = {
+            {"cat --password secret " + archive + " a.txt", 0, ""},
+            {"cat" + file + " " + archive + " a.txt", 0, ""},
+            {"cat " + archive + " a.txt", 1, "(GWZipArchiveErrorDomain 8)\n"},
+            {"cat --password Secret " + archive + " a.txt", 1,
+             made.checksPassword ? "(GWZipArchiveErrorDomain 9)\n" : ""},
+            {"test " + archive, 1, ""},
+            {"test --password secret " + archive, 0, ""},
+            {"extract -C " + out + " " + archive, 1, "(GWZipArchiveErrorDomain 8)\n"},
+            {"extract -C " + out + file + " " + archive, 0, ""},
+            {"extract -C " + out + " --password-file /nonexistent " + archive, 1,
+             "(NSPOSIXErrorDomain 2)\n"},
+        };
+        for (const auto& row : rows) {
+            fs::remove_all(directory.file("out"));
+            ToolRun run = runTool(row.arguments);
+            EXPECT_EQ(run.status, row.status) << row.arguments << run.err;
+            if (row.status == 0 && row.arguments.starts_with("cat")) {
+                EXPECT_TRUE(bytesOf(run.out) == content) << row.arguments;
+            }
+            if (row.arguments.starts_with("extract")) {
+                EXPECT_TRUE(row.status == 0 ? readFile(directory.file("out/a.txt")) == content
+                                            : !fs::exists(directory.file("out/a.txt")))
+                    << row.arguments;
+            }
+            if (row.status == 0) {
+                EXPECT_EQ(run.err, "") << row.arguments;
+            } else if (!row.errorCode.empty()) {
+                EXPECT_TRUE(run.err.ends_with(row.errorCode)) << row.arguments << run.err;
+            }
+        }
+        if (toolAvailable("script")) {
+            // Asked once on the terminal, and not echoed once asked.
+            const std::string command = std::string(GW_TOOL_PATH) + " test " + archive;
+            CommandResult terminal = runCommand("(sleep 2; printf 'secret\\n') | script -qfec " +
+                                                shellQuote(command) + " /dev/null");
+            EXPECT_EQ(terminal.status, 0) << terminal.output;
+            EXPECT_NE(terminal.output.find("Password for "), std::string::npos) << terminal.output;
+            EXPECT_EQ(terminal.output.find("secret"), std::string::npos) << terminal.output;
+            EXPECT_NE(terminal.output.find("1 entries, 0 bad"), std::string::npos);
+        }
+    }
+}
+
 // --- XAR archives ---------------------------------------------------------------
 
 TEST(GWArchiveTool, BsdtarXarArchiveListsAndExtractsAsBsdtarDoes) {

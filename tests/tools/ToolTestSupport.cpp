@@ -13,8 +13,10 @@ ToolRun runTool(const std::string& arguments) {
     int descriptor = mkstemp(errorPath);
     if (descriptor >= 0)
         close(descriptor);
-    CommandResult result =
-        runCommand(std::string(GW_TOOL_PATH) + " " + arguments + " 2>" + shellQuote(errorPath));
+    // Never the test's terminal, where the tool would ask for passwords; an
+    // input redirection among the arguments comes later and wins.
+    CommandResult result = runCommand(std::string(GW_TOOL_PATH) + " </dev/null " + arguments +
+                                      " 2>" + shellQuote(errorPath));
     GWData error = readFile(errorPath);
     unlink(errorPath);
     return {result.status, result.output, std::string(error.begin(), error.end())};

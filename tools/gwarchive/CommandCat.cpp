@@ -25,6 +25,8 @@ int runCat(const ParsedArguments& arguments) {
         return kExitFailure;
     }
     std::size_t index = selected->front();
+    if (!usePasswordOptions(arguments, *archive, operand, {index}))
+        return kExitFailure;
     if (archive->entryType(index) == EntryType::directory) {
         reportError(operand, path, GWPOSIXError(EISDIR));
         return kExitFailure;
@@ -64,7 +66,8 @@ const Command kCatCommand = {
     "    gwarchive cat - write one entry's data to standard output\n"
     "\n"
     "SYNOPSIS\n"
-    "    gwarchive cat [--encoding NAME] [-v] ARCHIVE PATH\n"
+    "    gwarchive cat [--encoding NAME] [--password PW|--password-file FILE] [-v]\n"
+    "                  ARCHIVE PATH\n"
     "\n"
     "DESCRIPTION\n"
     "    Decodes the data fork of the entry PATH of ARCHIVE and writes it to\n"
@@ -73,11 +76,19 @@ const Command kCatCommand = {
     "    Finder information, extended attributes) is not part of the output.\n"
     "    ARCHIVE may be a path or an http(s) URL; from a server only the\n"
     "    directory and the entry's own bytes are fetched.\n"
+    "    Encrypted ZIP entries (traditional or AES) need a password: without\n"
+    "    --password or --password-file it is asked for, without echo, when\n"
+    "    standard input is a terminal; an entry then fails with \"password\n"
+    "    required\" or \"wrong password\" (GWZipArchiveErrorDomain 8, 9) and\n"
+    "    nothing of it is written.\n"
     "\n"
     "OPTIONS\n"
-    "    --encoding NAME  read ZIP names that do not say they are UTF-8 in the\n"
-    "                     encoding iconv calls NAME (e.g. CP437, CP866).\n"
-    "    -v, --verbose    show the library's log on standard error.\n"
+    "    --encoding NAME      read ZIP names that do not say they are UTF-8 in the\n"
+    "                         encoding iconv calls NAME (e.g. CP437, CP866).\n"
+    "    --password PW        the password of encrypted ZIP entries (other users\n"
+    "                         may see it in the process list).\n"
+    "    --password-file FILE the password is FILE's first line.\n"
+    "    -v, --verbose        show the library's log on standard error.\n"
     "\n"
     "EXIT STATUS\n"
     "    0 when all the data was written; 1 when ARCHIVE cannot be opened, PATH is\n"
@@ -87,7 +98,7 @@ const Command kCatCommand = {
     "\n"
     "EXAMPLE\n"
     "    gwarchive cat Archive.zip docs/README.txt | less\n",
-    {{0, "encoding", true}},
+    {{0, "encoding", true}, {0, "password", true}, {0, "password-file", true}},
     2,
     2,
     runCat,

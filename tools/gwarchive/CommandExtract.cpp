@@ -60,6 +60,8 @@ int runExtract(const ParsedArguments& arguments) {
     std::vector<std::size_t> selected = selectEntries(*archive, operand, paths, &allFound);
     if (selected.empty() && !paths.empty())
         return kExitFailure;
+    if (!usePasswordOptions(arguments, *archive, operand, selected))
+        return kExitFailure;
 
     ExtractOptions options{localURL(arguments.value("directory").value_or(".")),
                            arguments.has("overwrite"),
@@ -104,8 +106,9 @@ const Command kExtractCommand = {
     "    gwarchive extract [-C DIR] [--overwrite] [--ignore-checksum]\n"
     "                      [--encoding NAME] [--trust FILE] [--require-signature]\n"
     "                      [--keep-setuid] [--devices] [--privileged-xattrs]\n"
-    "                      [--keep-flags]\n"
-    "                      [--progress|--no-progress] [-v] ARCHIVE [PATH...]\n"
+    "                      [--keep-flags] [--progress|--no-progress]\n"
+    "                      [--password PW|--password-file FILE] [-v]\n"
+    "                      ARCHIVE [PATH...]\n"
     "\n"
     "DESCRIPTION\n"
     "    Extracts every entry of ARCHIVE, or the named PATHs and everything below\n"
@@ -115,6 +118,12 @@ const Command kExtractCommand = {
     "    partial file. An item that already exists is an error for that entry and\n"
     "    the other entries go on; existing directories are merged into. ARCHIVE\n"
     "    may be a path or an http(s) URL.\n"
+    "\n"
+    "    Encrypted ZIP entries (traditional or AES) need a password: without\n"
+    "    --password or --password-file it is asked for, without echo, when\n"
+    "    standard input is a terminal; an entry then fails with \"password\n"
+    "    required\" or \"wrong password\" (GWZipArchiveErrorDomain 8, 9) and\n"
+    "    nothing of it is written.\n"
     "\n"
     "    Mac metadata comes back as extended attributes: resource forks in\n"
     "    user.com.apple.ResourceFork, Finder information in user.com.apple.FinderInfo\n"
@@ -144,6 +153,9 @@ const Command kExtractCommand = {
     "    --require-signature  write nothing unless the archive's signature is\n"
     "                         valid (see gwarchive info --help).\n"
     "    --progress           always show the progress bar on standard error.\n"
+    "    --password PW        the password of encrypted ZIP entries (other users\n"
+    "                         may see it in the process list).\n"
+    "    --password-file FILE the password is FILE's first line.\n"
     "    --no-progress        never show it. By default it is shown when standard\n"
     "                         error is a terminal: bytes done and total, rate and\n"
     "                         time left.\n"
@@ -180,7 +192,9 @@ const Command kExtractCommand = {
      {0, "keep-setuid", false},
      {0, "devices", false},
      {0, "privileged-xattrs", false},
-     {0, "keep-flags", false}},
+     {0, "keep-flags", false},
+     {0, "password", true},
+     {0, "password-file", true}},
     1,
     kAnyNumber,
     runExtract,

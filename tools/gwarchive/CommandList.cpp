@@ -51,6 +51,8 @@ void writeEntry(JsonWriter& json, const EntryRecord& entry) {
     json.value(entry.appleDouble);
     json.key("macBinary");
     json.value(entry.macBinary);
+    json.key("encrypted");
+    json.value(entry.encrypted);
     json.key("xattrs");
     json.beginArray();
     for (const std::string& name : entry.xattrs)
@@ -98,6 +100,8 @@ std::string macNotes(const EntryRecord& entry) {
         add("AppleDouble");
     if (entry.macBinary)
         add("MacBinary");
+    if (entry.encrypted)
+        add("encrypted");
     if (!entry.xattrs.empty())
         add(std::to_string(entry.xattrs.size()) + " xattrs");
     return notes.empty() ? notes : notes + "]";
@@ -209,13 +213,14 @@ const Command kListCommand = {
     "    -l, --long  one line per entry like ls -l: mode, owner/group ids, size,\n"
     "                modification time (UTC), path, link target, and in brackets\n"
     "                the Mac type/creator, resource fork size, AppleDouble,\n"
-    "                MacBinary and the number of extended attributes.\n"
+    "                MacBinary, the number of extended attributes and encrypted.\n"
     "    --json      one JSON object {\"format\": \"zip\"|\"xar\", ..., \"entries\": [...]}.\n"
     "                Each entry has path, type (file, directory, symlink, hardlink,\n"
     "                char, block, fifo, socket, whiteout, unknown), mode (with the\n"
     "                type bits), size, compressedSize, mtime (RFC 3339, UTC), uid, gid,\n"
-    "                appleDouble, macBinary, xattrs, and where known linkTarget,\n"
-    "                typeCode, creatorCode, resourceForkSize and compression. ZIP\n"
+    "                appleDouble, macBinary, encrypted, xattrs, and where known\n"
+    "                linkTarget, typeCode, creatorCode, resourceForkSize and\n"
+    "                compression (under the encryption, for a ZIP AES entry). ZIP\n"
     "                archives add startOffset; XAR archives add checksum,\n"
     "                checksumIsValid, signatureIsValid, signature, signatureReason,\n"
     "                signatures and subdocuments (see the README).\n"

@@ -1,4 +1,5 @@
 #include <cstdio>
+#include <numeric>
 
 #include "Command.h"
 #include "Diagnostics.h"
@@ -80,6 +81,10 @@ int runTest(const ParsedArguments& arguments) {
             printJSON(operand, *archive, {}, integrity);
         return kExitFailure;
     }
+    std::vector<std::size_t> all(archive->entryCount());
+    std::iota(all.begin(), all.end(), std::size_t(0));
+    if (!usePasswordOptions(arguments, *archive, operand, all))
+        return kExitFailure;
     std::vector<EntryProblem> problems = archive->test();
     if (json) {
         printJSON(operand, *archive, problems, nullptr);
@@ -107,7 +112,7 @@ const Command kTestCommand = {
     "\n"
     "SYNOPSIS\n"
     "    gwarchive test [--json] [--encoding NAME] [--trust FILE] [--require-signature]\n"
-    "                   [-v] ARCHIVE\n"
+    "                   [--password PW|--password-file FILE] [-v] ARCHIVE\n"
     "\n"
     "DESCRIPTION\n"
     "    Decodes every entry of ARCHIVE, companions included, and compares what\n"
@@ -118,6 +123,11 @@ const Command kTestCommand = {
     "    could not be verified because the archive stores no checksum for them.\n"
     "    A XAR whose table of contents does not match its checksum fails at once.\n"
     "    ARCHIVE may be a path or an http(s) URL.\n"
+    "    Encrypted ZIP entries (traditional or AES) need a password: without\n"
+    "    --password or --password-file it is asked for, without echo, when\n"
+    "    standard input is a terminal; an entry then fails with \"password\n"
+    "    required\" or \"wrong password\" (GWZipArchiveErrorDomain 8, 9) and\n"
+    "    counts as bad.\n"
     "\n"
     "OPTIONS\n"
     "    --json               one JSON object instead: format, archive fields as\n"
@@ -129,6 +139,10 @@ const Command kTestCommand = {
     "    --trust FILE         PEM certificates that XAR signing chains may end at,\n"
     "                         besides the system's trusted roots.\n"
     "    --require-signature  fail unless the archive's signature is valid.\n"
+    "    --password PW        the password of encrypted ZIP entries (other users\n"
+    "                         may see it in the process list).\n"
+    "    --password-file FILE the password is FILE's first line.\n"
+
     "    -v, --verbose        show the library's log on standard error.\n"
     "\n"
     "EXIT STATUS\n"
@@ -141,7 +155,9 @@ const Command kTestCommand = {
     {{0, "json", false},
      {0, "encoding", true},
      {0, "trust", true},
-     {0, "require-signature", false}},
+     {0, "require-signature", false},
+     {0, "password", true},
+     {0, "password-file", true}},
     1,
     1,
     runTest,

@@ -46,6 +46,7 @@ struct EntryRecord {
     std::optional<std::uint64_t> resourceForkSize;
     bool appleDouble = false;
     bool macBinary = false;
+    bool encrypted = false;
     std::vector<std::string> xattrs;
     std::optional<std::string> compression;
 };
@@ -107,6 +108,9 @@ public:
     virtual std::string signatureVerdict() const { return "none"; }
     virtual std::string signatureSummary() const { return "none"; }
 
+    // What opens encrypted entries from now on; formats without encryption
+    // ignore it.
+    virtual void setPassword(const std::string&) {}
     // The decoded data fork of one entry (a link's text for a symbolic link).
     // All data reaches the sink before a stored checksum is found wrong.
     virtual bool stream(std::size_t index, const DataSink& sink, GWErrorPtr* error,
@@ -145,6 +149,13 @@ const std::string& namesEncoding();
 // With --require-signature, why an archive whose signature is anything but
 // valid is refused (XAR code 7 when untrusted, else 6); none otherwise.
 GWErrorPtr signatureRefusal(const ToolArchive& archive, const ParsedArguments& arguments);
+
+// Gives the archive the password of --password or --password-file; without
+// either, asks for one on the terminal (without echo) when standard input is
+// a terminal and one of `entries` is encrypted. False, said on standard
+// error, when the password file cannot be read.
+bool usePasswordOptions(const ParsedArguments& arguments, ToolArchive& archive,
+                        const std::string& operand, const std::vector<std::size_t>& entries);
 
 // Opens an ARCHIVE operand, or says why not on standard error and returns none.
 std::unique_ptr<ToolArchive> openArchiveOperand(const std::string& operand);

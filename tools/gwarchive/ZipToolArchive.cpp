@@ -72,8 +72,9 @@ public:
             record.resourceForkSize = file.resourceFork()->storedUncompressedSize();
         record.appleDouble = file.appleDoubleFile() != nullptr;
         record.macBinary = file.isMacBinaryEncoded();
+        record.encrypted = file.isEncrypted();
         if (!file.isDirectory())
-            record.compression = compressionName(file.compressionMethod());
+            record.compression = compressionName(file.dataCompressionMethod());
         return record;
     }
 
@@ -110,6 +111,8 @@ public:
     std::vector<std::string> infoLines() const override {
         return {"start offset: " + std::to_string(archive_->startOffset())};
     }
+
+    void setPassword(const std::string& password) override { archive_->setPassword(password); }
 
     bool stream(std::size_t index, const DataSink& sink, GWErrorPtr* error,
                 bool* checksumFailed) override {
