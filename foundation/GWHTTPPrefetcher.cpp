@@ -12,8 +12,9 @@ constexpr std::size_t kMostWorkers = 8;
 constexpr std::size_t kMostCursors = 16;
 // A stream that has not read for this long has ended.
 constexpr std::chrono::seconds kCursorLife{2};
-// A read that ends this close to its span's end has finished it: what lies
-// beyond is a gap, or room left for a local header longer than its entry's.
+// Reads that went through a span from its start, leaving no hole larger than
+// this, have finished it: what they skipped is a gap, a data descriptor, or
+// room left for a local header longer than its entry's.
 constexpr std::uint64_t kSpanTail = 4096;
 
 }  // namespace
@@ -104,7 +105,7 @@ void GWHTTPPrefetcher::willRead(std::span<const GWByteRange> ranges) {
         }
         for (; from < to; from += spanSize) {
             auto span = std::make_shared<Span>();
-            span->offset = from;
+            span->offset = span->readUpTo = from;
             span->length = std::min(spanSize, to - from);
             planned.push_back(std::move(span));
         }
@@ -189,7 +190,10 @@ bool GWHTTPPrefetcher::take(std::uint64_t offset, std::span<std::uint8_t> into) 
         const std::uint64_t to = std::min(end, span->offset + span->length);
         std::memcpy(into.data() + (from - offset), span->bytes.data() + (from - span->offset),
                     std::size_t(to - from));
-        if (end + kSpanTail >= span->offset + span->length && !span->dropped) {
+        if (from <= span->readUpTo + kSpanTail) {
+            span->readUpTo = std::max(span->readUpTo, to);
+        }
+        if (span->readUpTo + kSpanTail >= span->offset + span->length && !span->dropped) {
             span->dropped = true;
             held_ -= span->length;
             std::erase(spans_, span);

@@ -55,8 +55,9 @@ private:
         std::uint64_t offset = 0;
         std::uint64_t length = 0;
         enum State { queued, fetching, ready } state = queued;
-        bool dropped = false;  // no longer planned; a queued one is never fetched
-        bool wanted = false;   // a reader waits for it
+        bool dropped = false;        // no longer planned; a queued one is never fetched
+        bool wanted = false;         // a reader waits for it
+        std::uint64_t readUpTo = 0;  // how far reads have gone through it in order
         GWData bytes;
     };
     using SpanPtr = std::shared_ptr<Span>;
