@@ -19,6 +19,10 @@ constexpr std::uint64_t kSpanTail = 4096;
 
 }  // namespace
 
+bool GWHTTPPrefetcher::startsAfter(std::uint64_t offset, const SpanPtr& span) {
+    return offset < span->offset;
+}
+
 GWHTTPPrefetcher::GWHTTPPrefetcher(std::uint64_t sourceSize, Opener opener)
     : sourceSize_(sourceSize), opener_(std::move(opener)) {}
 
@@ -83,7 +87,7 @@ void GWHTTPPrefetcher::willRead(std::span<const GWByteRange> ranges) {
     std::sort(wanted.begin(), wanted.end(),
               [](const auto& a, const auto& b) { return a.offset < b.offset; });
     std::lock_guard lock(mutex_);
-    if (stopping_) {
+    if (stopping_ || failed_) {
         return;
     }
     const std::uint64_t spanSize = spanSizeLocked();
@@ -114,7 +118,14 @@ void GWHTTPPrefetcher::willRead(std::span<const GWByteRange> ranges) {
         // Only what no span planned already holds.
         std::uint64_t from = range.offset;
         const std::uint64_t to = range.offset + range.length;
-        for (const SpanPtr& span : spans_) {
+        // From the span that may hold `from`: a hostile archive announces
+        // many entries over the same bytes.
+        auto at = std::upper_bound(spans_.begin(), spans_.end(), from, startsAfter);
+        if (at != spans_.begin()) {
+            --at;
+        }
+        for (; at != spans_.end(); ++at) {
+            const SpanPtr& span = *at;
             if (span->offset >= to) {
                 break;
             }
@@ -130,10 +141,8 @@ void GWHTTPPrefetcher::willRead(std::span<const GWByteRange> ranges) {
         }
     }
     for (SpanPtr& span : planned) {
-        auto at = std::upper_bound(
-            spans_.begin(), spans_.end(), span->offset,
-            [](std::uint64_t offset, const SpanPtr& other) { return offset < other->offset; });
-        spans_.insert(at, std::move(span));
+        spans_.insert(std::upper_bound(spans_.begin(), spans_.end(), span->offset, startsAfter),
+                      std::move(span));
     }
     if (cursors_.empty() && !spans_.empty()) {
         cursors_.push_back({spans_.front()->offset, std::chrono::steady_clock::now()});
@@ -148,9 +157,7 @@ bool GWHTTPPrefetcher::take(std::uint64_t offset, std::span<std::uint8_t> into) 
     }
     const std::uint64_t end = offset + into.size();
     std::unique_lock lock(mutex_);
-    auto at = std::upper_bound(
-        spans_.begin(), spans_.end(), offset,
-        [](std::uint64_t value, const SpanPtr& span) { return value < span->offset; });
+    auto at = std::upper_bound(spans_.begin(), spans_.end(), offset, startsAfter);
     // Merged spans may overlap a little: the holder may be a few back.
     for (int look = 0; look < 3 && at != spans_.begin(); ++look) {
         --at;
@@ -176,8 +183,10 @@ bool GWHTTPPrefetcher::take(std::uint64_t offset, std::span<std::uint8_t> into) 
     dropBehindLocked();
     startWorkersLocked();
     changed_.notify_all();
-    const auto settled = [](const SpanPtr& span) {
-        return span->state == Span::ready || span->dropped;
+    // Once fetching ahead failed, a span not under way never will be.
+    const auto settled = [this](const SpanPtr& span) {
+        return span->state == Span::ready || span->dropped ||
+               (failed_ && span->state == Span::queued);
     };
     changed_.wait(lock, [&] { return std::all_of(holders.begin(), holders.end(), settled); });
     for (const SpanPtr& span : holders) {

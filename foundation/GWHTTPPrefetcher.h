@@ -61,6 +61,7 @@ private:
         GWData bytes;
     };
     using SpanPtr = std::shared_ptr<Span>;
+    static bool startsAfter(std::uint64_t offset, const SpanPtr& span);
     void work();
     void startWorkersLocked();
     void dropBehindLocked();
