@@ -45,7 +45,8 @@ public:
         const std::uint64_t size = reader_->size();
         const std::size_t length =
             offset < size ? std::size_t(std::min<std::uint64_t>(into.size(), size - offset)) : 0;
-        if (length > 0 && prefetcher_->take(offset, into.first(length))) {
+        GWErrorPtr failure;
+        if (length > 0 && prefetcher_->take(offset, into.first(length), &failure)) {
             got = length;
             return true;
         }
@@ -60,8 +61,7 @@ public:
             }
             return true;
         };
-        GWErrorPtr failure;
-        if (!blocks_->read(offset, into, reader_->size(), fetch, got, &failure)) {
+        if (failure || !blocks_->read(offset, into, reader_->size(), fetch, got, &failure)) {
             // What other handles know of it no longer holds.
             if (failure && failure->is(kGWPOSIXErrorDomain, ESTALE)) {
                 GWRecentHTTPResources::shared().forget(address_);

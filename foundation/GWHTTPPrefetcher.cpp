@@ -151,7 +151,8 @@ void GWHTTPPrefetcher::willRead(std::span<const GWByteRange> ranges) {
     changed_.notify_all();
 }
 
-bool GWHTTPPrefetcher::take(std::uint64_t offset, std::span<std::uint8_t> into) {
+bool GWHTTPPrefetcher::take(std::uint64_t offset, std::span<std::uint8_t> into,
+                            GWErrorPtr* failure) {
     if (into.empty() || offset > UINT64_MAX - into.size()) {
         return false;
     }
@@ -191,6 +192,9 @@ bool GWHTTPPrefetcher::take(std::uint64_t offset, std::span<std::uint8_t> into) 
     changed_.wait(lock, [&] { return std::all_of(holders.begin(), holders.end(), settled); });
     for (const SpanPtr& span : holders) {
         if (span->state != Span::ready) {
+            if (span->error) {
+                GWFail(failure, span->error);
+            }
             return false;
         }
     }
@@ -302,7 +306,8 @@ void GWHTTPPrefetcher::work() {
             reader = opener_();
         }
         GWData bytes(std::size_t(span->length));
-        const bool fetched = reader && reader->fetch(span->offset, bytes, nullptr);
+        GWErrorPtr error;
+        const bool fetched = reader && reader->fetch(span->offset, bytes, &error);
         const GWHTTPTiming timing = reader ? reader->lastTiming() : GWHTTPTiming{};
         if (fetched) {
             observe(timing);
@@ -314,8 +319,7 @@ void GWHTTPPrefetcher::work() {
             span->state = Span::ready;
         } else {
             held_ -= span->length;
-            // What failed here fails again for the reader, which reports it
-            // in its own terms; nothing more is fetched ahead.
+            span->error = error;
             failed_ = true;
             for (const SpanPtr& other : spans_) {
                 if (other->state != Span::ready && other != span) {

@@ -24,8 +24,8 @@ struct GWByteRange {
 // a time: over a link with latency, one request per read would cost a round
 // trip each. Ranges closer than a round trip's worth of bytes share a
 // request. Requests run on their own readers of the resource, so each one is
-// checked against its identity as any other; a failed one is dropped, and
-// its readers fetch the bytes themselves and meet the failure there.
+// checked against its identity as any other; its failure is its readers'
+// (the resource changed, the server stalled), and ends fetching ahead.
 //
 // Memory stays bounded: spans are fetched only within a window ahead of
 // where reads go on (a few streams at once, as when entries are extracted
@@ -42,8 +42,9 @@ public:
     // Plans the ranges not already planned; they are fetched as reads approach.
     void willRead(std::span<const GWByteRange> ranges);
     // Copies the bytes at `offset` when a planned span holds them all,
-    // waiting for one under way; false when the caller must fetch them.
-    bool take(std::uint64_t offset, std::span<std::uint8_t> into);
+    // waiting for one under way; false when the caller must fetch them, or
+    // with `failure` set when fetching the span that holds them failed.
+    bool take(std::uint64_t offset, std::span<std::uint8_t> into, GWErrorPtr* failure);
     // What a request of `bytes` took, to size the next spans and the window.
     void observe(const GWHTTPTiming& timing);
 
@@ -58,6 +59,7 @@ private:
         bool dropped = false;        // no longer planned; a queued one is never fetched
         bool wanted = false;         // a reader waits for it
         std::uint64_t readUpTo = 0;  // how far reads have gone through it in order
+        GWErrorPtr error;            // why fetching it failed
         GWData bytes;
     };
     using SpanPtr = std::shared_ptr<Span>;
