@@ -19,6 +19,10 @@ constexpr std::uint64_t kSpanTail = 4096;
 
 }  // namespace
 
+namespace {
+constexpr std::uint64_t kStragglers = 256 * 1024;
+}  // namespace
+
 bool GWHTTPPrefetcher::startsAfter(std::uint64_t offset, const SpanPtr& span) {
     return offset < span->offset;
 }
@@ -54,7 +58,8 @@ void GWHTTPPrefetcher::observe(const GWHTTPTiming& timing) {
 // part of it: four round trips' worth of one request's bytes.
 std::size_t GWHTTPPrefetcher::spanSizeLocked() const {
     if (bytesPerSecond_ == 0 || roundTrip_ == 0) {
-        return 1 << 20;
+        // Before any span came back: as if a request carried 64 MB/s.
+        return std::clamp<std::size_t>(std::size_t(4 * 64e6 * roundTrip_), 1 << 20, kLargestSpan);
     }
     return std::clamp<std::size_t>(std::size_t(4 * bytesPerSecond_ * roundTrip_), kSmallestSpan,
                                    kLargestSpan);
@@ -206,12 +211,18 @@ bool GWHTTPPrefetcher::take(std::uint64_t offset, std::span<std::uint8_t> into,
         if (from <= span->readUpTo + kSpanTail) {
             span->readUpTo = std::max(span->readUpTo, to);
         }
-        if (span->readUpTo + kSpanTail >= span->offset + span->length && !span->dropped) {
-            span->dropped = true;
-            held_ -= span->length;
-            std::erase(spans_, span);
-        }
+        span->finished = span->readUpTo + kSpanTail >= span->offset + span->length;
     }
+    // A finished span stays while reads of entries beside each other may
+    // still be a little behind.
+    std::erase_if(spans_, [&](const SpanPtr& span) {
+        if (!span->finished || span->offset + span->length + kStragglers > end) {
+            return false;
+        }
+        span->dropped = true;
+        held_ -= span->length;
+        return true;
+    });
     return true;
 }
 

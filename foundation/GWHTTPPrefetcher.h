@@ -60,6 +60,7 @@ private:
         bool wanted = false;         // a reader waits for it
         std::uint64_t readUpTo = 0;  // how far reads have gone through it in order
         GWErrorPtr error;            // why fetching it failed
+        bool finished = false;       // reads went through it
         GWData bytes;
     };
     using SpanPtr = std::shared_ptr<Span>;
