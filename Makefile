@@ -8,7 +8,7 @@ FUZZ_TARGETS := $(basename $(notdir $(wildcard fuzz/fuzz_*.cpp)))
 JOBS ?= $(shell nproc)
 CMAKE_FLAGS ?=
 
-.PHONY: all deps build run test test-asan fuzz bench format format-check clean
+.PHONY: all deps build run test test-asan fuzz bench bench-remote format format-check clean
 
 all: build
 
@@ -56,6 +56,10 @@ fuzz: deps
 # in $(BUILD_DIR)/bench-corpus); writes bench/RESULTS.md.
 bench: build
 	python3 bench/run.py --build $(BUILD_DIR)
+
+# Extraction and listing over HTTP behind 20 ms, beside the local file (root).
+bench-remote: build
+	bench/remote.sh $(BUILD_DIR)
 
 format:
 	git ls-files '*.h' '*.cpp' | xargs clang-format -i

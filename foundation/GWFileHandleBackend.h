@@ -5,6 +5,7 @@
 #include <span>
 
 #include "GWError.h"
+#include "GWHTTPPrefetcher.h"
 #include "GWURL.h"
 
 // Where a GWRemoteFileHandle's bytes live: a local file, nowhere (discarding
@@ -22,6 +23,8 @@ public:
     virtual std::uint64_t size() const = 0;
     virtual bool isSeekable() const = 0;
     virtual bool close(GWErrorPtr* error) = 0;
+    // The ranges about to be read, for a backend that gains by fetching ahead.
+    virtual void willRead(std::span<const GWByteRange>) {}
 };
 
 std::unique_ptr<GWFileHandleBackend> GWOpenLocalFileBackend(const GWURL& url, bool forWriting,

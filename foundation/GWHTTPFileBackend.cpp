@@ -25,6 +25,7 @@ public:
         : reader_(std::move(reader)),
           blocks_(resource.blocks),
           connectionFailure_(resource.connectionFailure),
+          prefetcher_(resource.prefetcher),
           address_(std::move(address)) {}
 
     bool readAt(std::uint64_t offset, std::span<std::uint8_t> into, std::size_t& got,
@@ -41,6 +42,14 @@ public:
                 return GWFail(error, connectionFailure_->error);
             }
         }
+        const std::uint64_t size = reader_->size();
+        const std::size_t length =
+            offset < size ? std::size_t(std::min<std::uint64_t>(into.size(), size - offset)) : 0;
+        GWErrorPtr failure;
+        if (length > 0 && prefetcher_->take(offset, into.first(length), &failure)) {
+            got = length;
+            return true;
+        }
         auto fetch = [this](std::uint64_t from, std::span<std::uint8_t> bytes,
                             GWErrorPtr* failure) {
             for (std::size_t done = 0; done < bytes.size(); done += kLargestRequest) {
@@ -52,8 +61,7 @@ public:
             }
             return true;
         };
-        GWErrorPtr failure;
-        if (!blocks_->read(offset, into, reader_->size(), fetch, got, &failure)) {
+        if (failure || !blocks_->read(offset, into, reader_->size(), fetch, got, &failure)) {
             // What other handles know of it no longer holds.
             if (failure && failure->is(kGWPOSIXErrorDomain, ESTALE)) {
                 GWRecentHTTPResources::shared().forget(address_);
@@ -78,6 +86,8 @@ public:
 
     bool isSeekable() const override { return true; }
 
+    void willRead(std::span<const GWByteRange> ranges) override { prefetcher_->willRead(ranges); }
+
     bool close(GWErrorPtr*) override {
         std::lock_guard lock(mutex_);
         reader_.reset();
@@ -89,6 +99,7 @@ private:
     std::unique_ptr<GWHTTPRangeReader> reader_;
     std::shared_ptr<GWBlockCache> blocks_;
     std::shared_ptr<GWHTTPConnectionFailure> connectionFailure_;
+    std::shared_ptr<GWHTTPPrefetcher> prefetcher_;
     std::string address_;
 };
 
@@ -98,14 +109,15 @@ std::unique_ptr<GWFileHandleBackend> GWOpenHTTPFileBackend(const GWURL& url, GWE
     const std::string address = url.absoluteString();
     auto& recent = GWRecentHTTPResources::shared();
     if (auto known = recent.find(address)) {
-        auto reader = GWHTTPRangeReader::attach(url, known->identity, error);
+        auto reader = GWHTTPRangeReader::attach(url, known->identity, known->connections, error);
         if (!reader) {
             return nullptr;
         }
         return std::make_unique<HTTPFileBackend>(std::move(reader), *known, address);
     }
     GWData firstBlock;
-    auto reader = GWHTTPRangeReader::open(url, kBlockSize, firstBlock, error);
+    auto connections = std::make_shared<GWHTTPConnectionPool>();
+    auto reader = GWHTTPRangeReader::open(url, kBlockSize, firstBlock, connections, error);
     if (!reader) {
         return nullptr;
     }
@@ -115,9 +127,14 @@ std::unique_ptr<GWFileHandleBackend> GWOpenHTTPFileBackend(const GWURL& url, GWE
             "while it is read is noticed only when its size changes",
             GWRedactedURLString(address).c_str());
     }
-    GWHTTPResource resource{reader->identity(),
-                            std::make_shared<GWBlockCache>(kBlockSize, kBlockCount),
-                            std::make_shared<GWHTTPConnectionFailure>()};
+    auto prefetcher = std::make_shared<GWHTTPPrefetcher>(
+        reader->size(), [url, identity = reader->identity(), connections] {
+            return GWHTTPRangeReader::attach(url, identity, connections, nullptr);
+        });
+    prefetcher->observe(reader->lastTiming());
+    GWHTTPResource resource{
+        reader->identity(), std::make_shared<GWBlockCache>(kBlockSize, kBlockCount),
+        std::make_shared<GWHTTPConnectionFailure>(), connections, std::move(prefetcher)};
     resource.blocks->store(0, firstBlock, reader->size());
     recent.remember(address, resource);
     return std::make_unique<HTTPFileBackend>(std::move(reader), resource, address);

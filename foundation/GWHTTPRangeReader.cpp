@@ -445,19 +445,43 @@ bool GWHTTPRangeReader::isEmptyResourceAnswer(CURL* curl, CURLcode code, const T
     return transfer.status == 200 && code == CURLE_OK && length == 0 && transfer.received == 0;
 }
 
-GWHTTPRangeReader::GWHTTPRangeReader(GWURL url)
+GWHTTPConnectionPool::Easy GWHTTPConnectionPool::take() {
+    std::lock_guard lock(mutex_);
+    if (idle_.empty()) {
+        return Easy(curl_easy_init());
+    }
+    Easy easy = std::move(idle_.back());
+    idle_.pop_back();
+    return easy;
+}
+
+void GWHTTPConnectionPool::give(Easy easy) {
+    // More idle connections than readers run at once would only hold sockets.
+    constexpr std::size_t kMostIdle = 16;
+    std::lock_guard lock(mutex_);
+    if (easy && idle_.size() < kMostIdle) {
+        idle_.push_back(std::move(easy));
+    }
+}
+
+GWHTTPRangeReader::GWHTTPRangeReader(GWURL url, std::shared_ptr<GWHTTPConnectionPool> pool)
     : url_(std::move(url)),
       shownAddress_(GWRedactedURLString(url_.absoluteString())),
-      curl_(curl_easy_init()) {
+      pool_(std::move(pool)),
+      curl_(pool_ ? pool_->take() : GWHTTPConnectionPool::Easy(curl_easy_init())) {
     identity_.address = url_.absoluteString();
 }
 
-GWHTTPRangeReader::~GWHTTPRangeReader() = default;
+GWHTTPRangeReader::~GWHTTPRangeReader() {
+    if (pool_) {
+        pool_->give(std::move(curl_));
+    }
+}
 
-std::unique_ptr<GWHTTPRangeReader> GWHTTPRangeReader::open(const GWURL& url,
-                                                           std::size_t probeLength, GWData& probe,
-                                                           GWErrorPtr* error) {
-    auto reader = attach(url, {}, error);
+std::unique_ptr<GWHTTPRangeReader> GWHTTPRangeReader::open(
+    const GWURL& url, std::size_t probeLength, GWData& probe,
+    std::shared_ptr<GWHTTPConnectionPool> pool, GWErrorPtr* error) {
+    auto reader = attach(url, {}, std::move(pool), error);
     if (!reader) {
         return nullptr;
     }
@@ -472,11 +496,11 @@ std::unique_ptr<GWHTTPRangeReader> GWHTTPRangeReader::open(const GWURL& url,
     return reader;
 }
 
-std::unique_ptr<GWHTTPRangeReader> GWHTTPRangeReader::attach(const GWURL& url,
-                                                             GWHTTPIdentity identity,
-                                                             GWErrorPtr* error) {
+std::unique_ptr<GWHTTPRangeReader> GWHTTPRangeReader::attach(
+    const GWURL& url, GWHTTPIdentity identity, std::shared_ptr<GWHTTPConnectionPool> pool,
+    GWErrorPtr* error) {
     initialiseCurlOnce();
-    std::unique_ptr<GWHTTPRangeReader> reader(new GWHTTPRangeReader(url));
+    std::unique_ptr<GWHTTPRangeReader> reader(new GWHTTPRangeReader(url, std::move(pool)));
     if (!reader->curl_) {
         GWFail(error, GWPOSIXError(ENOMEM, url));
         return nullptr;
@@ -543,6 +567,11 @@ CURLcode GWHTTPRangeReader::performOnce(const std::string& address, Transfer& tr
     curl_easy_setopt(curl, CURLOPT_WRITEDATA, &transfer);
     curl_easy_setopt(curl, CURLOPT_ERRORBUFFER, transfer.curlMessage);
     const CURLcode code = curl_easy_perform(curl);
+    curl_off_t sent = 0, firstByte = 0, total = 0;
+    curl_easy_getinfo(curl, CURLINFO_PRETRANSFER_TIME_T, &sent);
+    curl_easy_getinfo(curl, CURLINFO_STARTTRANSFER_TIME_T, &firstByte);
+    curl_easy_getinfo(curl, CURLINFO_TOTAL_TIME_T, &total);
+    timing_ = {double(firstByte - sent) / 1e6, double(total - sent) / 1e6, transfer.received};
     curl_easy_setopt(curl, CURLOPT_ERRORBUFFER, nullptr);
     curl_easy_setopt(curl, CURLOPT_HTTPHEADER, nullptr);
     return code;

@@ -4,9 +4,11 @@
 
 #include <cstdint>
 #include <memory>
+#include <mutex>
 #include <span>
 #include <string>
 #include <string_view>
+#include <vector>
 
 #include "GWError.h"
 #include "GWURL.h"
@@ -45,6 +47,31 @@ struct GWHTTPIdentity {
     bool validatorIsEntityTag = false;
 };
 
+// Idle easy handles of one resource, each with its kept-alive connection:
+// a reader made for every entry of an archive reuses one instead of
+// connecting again. Only readers of the resource whose identity they
+// learnt share them, so a connection never outlives the checks its
+// address passed.
+struct GWHTTPConnectionPool {
+    struct EasyDeleter {
+        void operator()(CURL* curl) const { curl_easy_cleanup(curl); }
+    };
+    using Easy = std::unique_ptr<CURL, EasyDeleter>;
+    Easy take();
+    void give(Easy easy);
+
+private:
+    std::mutex mutex_;
+    std::vector<Easy> idle_;
+};
+
+// How long the last request took: to its first byte, and to its end.
+struct GWHTTPTiming {
+    double firstByteSeconds = 0;
+    double totalSeconds = 0;
+    std::uint64_t bytes = 0;
+};
+
 // Ranged GET requests for one http(s) resource over one kept-alive
 // connection. Every response is checked against the range asked for and the
 // identity the first response fixed: a server that ignores ranges, a body
@@ -56,10 +83,13 @@ public:
     // which learns its identity and proves range support. `probe` receives
     // what came back (fewer bytes only for a shorter resource).
     static std::unique_ptr<GWHTTPRangeReader> open(const GWURL& url, std::size_t probeLength,
-                                                   GWData& probe, GWErrorPtr* error);
+                                                   GWData& probe,
+                                                   std::shared_ptr<GWHTTPConnectionPool> pool,
+                                                   GWErrorPtr* error);
     // A reader for a resource another reader opened: no request until the
     // first fetch, which checks that the identity still holds.
     static std::unique_ptr<GWHTTPRangeReader> attach(const GWURL& url, GWHTTPIdentity identity,
+                                                     std::shared_ptr<GWHTTPConnectionPool> pool,
                                                      GWErrorPtr* error);
     ~GWHTTPRangeReader();
     GWHTTPRangeReader(const GWHTTPRangeReader&) = delete;
@@ -69,13 +99,14 @@ public:
     bool fetch(std::uint64_t offset, std::span<std::uint8_t> into, GWErrorPtr* error);
     std::uint64_t size() const { return identity_.size; }
     const GWHTTPIdentity& identity() const { return identity_; }
+    const GWHTTPTiming& lastTiming() const { return timing_; }
 
     // Failures of the connection itself, which a later request would only repeat.
     static bool isConnectionFailure(const GWErrorPtr& error);
 
 private:
     struct Transfer;
-    explicit GWHTTPRangeReader(GWURL url);
+    GWHTTPRangeReader(GWURL url, std::shared_ptr<GWHTTPConnectionPool> pool);
     bool perform(Transfer& transfer, GWErrorPtr* error);
     CURLcode performOnce(const std::string& address, Transfer& transfer);
     bool nextHop(const std::string& from, Transfer& transfer, std::string& next, GWErrorPtr* error);
@@ -84,10 +115,9 @@ private:
 
     GWURL url_;
     std::string shownAddress_;  // without credentials
-    struct EasyDeleter {
-        void operator()(CURL* curl) const { curl_easy_cleanup(curl); }
-    };
-    std::unique_ptr<CURL, EasyDeleter> curl_;  // kept for its connection
+    std::shared_ptr<GWHTTPConnectionPool> pool_;
+    GWHTTPConnectionPool::Easy curl_;  // kept for its connection
     GWHTTPIdentity identity_;
+    GWHTTPTiming timing_;
     int originClass_ = -1;  // the address class of the host first asked, once known
 };

@@ -9,6 +9,7 @@
 #include <string>
 
 #include "GWBlockCache.h"
+#include "GWHTTPPrefetcher.h"
 #include "GWHTTPRangeReader.h"
 
 // A failure of the connection that every handle of a resource would meet
@@ -19,13 +20,16 @@ struct GWHTTPConnectionFailure {
 };
 
 // What the handles of one http(s) resource share: the identity the first of
-// them learnt, and the blocks read so far. Extraction opens a handle per
+// them learnt, the blocks read so far, idle connections and what is fetched
+// ahead of them. Extraction opens a handle per
 // entry; without this each would ask for the size and fetch the same blocks
 // again, and could meet another version of the file.
 struct GWHTTPResource {
     GWHTTPIdentity identity;
     std::shared_ptr<GWBlockCache> blocks;
     std::shared_ptr<GWHTTPConnectionFailure> connectionFailure;
+    std::shared_ptr<GWHTTPConnectionPool> connections;
+    std::shared_ptr<GWHTTPPrefetcher> prefetcher;
 };
 
 // The few resources handles were opened on lately. One not opened for a few

@@ -161,6 +161,12 @@ void GWRemoteFileHandle::readDataAtOffset(std::uint64_t offset, std::uint64_t le
     } while (done < length);
 }
 
+void GWRemoteFileHandle::willRead(std::span<const GWByteRange> ranges) {
+    if (!closed_) {
+        backend_->willRead(ranges);
+    }
+}
+
 bool GWRemoteFileHandle::writeData(std::span<const std::uint8_t> bytes, GWErrorPtr* error) {
     if (closed_) {
         return GWFail(error, GWPOSIXError(EBADF, url_));

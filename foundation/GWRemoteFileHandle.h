@@ -7,6 +7,7 @@
 #include <span>
 
 #include "GWError.h"
+#include "GWHTTPPrefetcher.h"
 #include "GWURL.h"
 #include "GWValue.h"
 
@@ -76,6 +77,10 @@ public:
     // before the range does is an error, never a short final piece.
     void readDataAtOffset(std::uint64_t offset, std::uint64_t length, std::uint64_t maxBufferSize,
                           const ReadHandler& handler);
+
+    // Announces ranges about to be read, in any order: a remote file
+    // fetches them ahead, several at a time, adjacent ones together.
+    void willRead(std::span<const GWByteRange> ranges);
 
     bool writeData(std::span<const std::uint8_t> bytes, GWErrorPtr* error);
     bool closeFileAndReturnError(GWErrorPtr* error);

@@ -112,7 +112,7 @@ extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size
     }
     const auto url = GWURL::URLWithString("http://127.0.0.1:" + std::to_string(port) + "/a");
     GWData probe;
-    auto reader = GWHTTPRangeReader::open(*url, 64, probe, nullptr);
+    auto reader = GWHTTPRangeReader::open(*url, 64, probe, nullptr, nullptr);
     if (!reader) {
         return 0;
     }

@@ -7,6 +7,7 @@
 #include "foundation/GWDispatch.h"
 #include "foundation/GWFileSystem.h"
 #include "foundation/GWFreeSpace.h"
+#include "foundation/GWRemoteFileHandle.h"
 #include "foundation/GWRemoteFileHandlePool.h"
 
 namespace {
@@ -19,6 +20,7 @@ struct BatchState {
     // In tree order, parents first; their metadata comes last, deepest first.
     std::vector<GWZipExtractOperationPtr> directories;
     std::shared_ptr<GWReplacementFolder> folder;
+    std::shared_ptr<GWRemoteFileHandle> fetchingAhead;  // keeps what it fetched until the end
     bool continueAfterFailure = false;
     std::function<void(const std::string&, const GWErrorPtr&)> entryFailed;
 
@@ -93,6 +95,37 @@ std::uint64_t declaredSize(const std::vector<GWZipExtractOperationPtr>& operatio
         }
     }
     return total;
+}
+
+// A remote archive's entries are fetched ahead, in file order and adjacent
+// ones together, instead of a round trip for each entry's reads.
+std::shared_ptr<GWRemoteFileHandle> fetchAhead(
+    const GWURL& url, std::uint64_t start,
+    const std::vector<GWZipExtractOperationPtr>& operations) {
+    if (url.scheme() != "http" && url.scheme() != "https") {
+        return nullptr;
+    }
+    auto handle = GWRemoteFileHandle::initForReadingFromURL(url, nullptr);
+    if (!handle) {
+        return nullptr;  // each entry meets the failure in its own terms
+    }
+    // The local header's name and extra field are known only once it is
+    // read; they are rarely longer than this. A longer one's bytes are read
+    // when needed.
+    constexpr std::uint64_t kHeaderAllowance = GWZipLocalFileHeader::kLength + 1024;
+    std::vector<GWByteRange> ranges;
+    for (const auto& operation : operations) {
+        const GWZipFilePtr& file = operation->file();
+        const std::uint64_t header = file->localHeaderOffset();
+        if (!file->isDirectory() && header <= UINT64_MAX - start) {
+            const std::uint64_t data = file->compressedSize();
+            ranges.push_back({start + header, data > UINT64_MAX - kHeaderAllowance
+                                                  ? UINT64_MAX
+                                                  : data + kHeaderAllowance});
+        }
+    }
+    handle->willRead(ranges);
+    return handle;
 }
 
 GWOperationQueuePtr extractionQueue() {
@@ -173,6 +206,7 @@ void GWZipArchive::extractFiles(const GWZipFileArray& files, const GWURL& direct
         return;
     }
     auto state = std::make_shared<BatchState>();
+    state->fetchingAhead = fetchAhead(URL(), startOffset(), *operations);
     state->continueAfterFailure = options.continueAfterFailure;
     state->entryFailed = options.entryFailed;
     const bool buildsFiles = std::any_of(operations->begin(), operations->end(),
@@ -214,6 +248,7 @@ void GWZipArchive::extractFiles(const GWZipFileArray& files, const GWURL& direct
         [runQueue, state, completion = std::move(completionHandler)]() mutable {
             state->applyDirectoryInfo();
             state->folder.reset();
+            state->fetchingAhead.reset();
             if (completion) {
                 runQueue->addOperationWithBlock(
                     [state, completion = std::move(completion)] { completion(state->firstError); });

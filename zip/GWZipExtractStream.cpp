@@ -292,6 +292,8 @@ void GWZipExtractOperation::extractFile(const GWZipFilePtr& file, std::uint64_t 
     if (data) {
         pipeline.feed(*data, true);
     } else {
+        const GWByteRange range{offset, length};
+        handle->willRead(std::span(&range, 1));
         pipeline.run(*handle, offset, length, [this] { return isCancelled(); });
     }
     if (auto failure = streamError(*file, pipeline, handlerError)) {

@@ -121,6 +121,22 @@ TEST_F(GWRemoteFileHandleHTTPTest, NearbySmallReadsCostOneRequestAndLargeOnesNoM
     EXPECT_EQ(requests[0].range, "bytes=100000-799999");
     // One kept-alive connection carries the handle's requests.
     EXPECT_EQ(requests[0].connection, requests[1].connection);
+
+    // Announced ranges, as an extraction's entries with their headers: those
+    // a small gap apart share requests, which every entry's own handle reads.
+    server_->forgetRequests();
+    std::vector<GWByteRange> entries;
+    for (std::uint64_t entry = 0; entry < 60; ++entry) {
+        entries.push_back({1000 + entry * 40000, 39000});
+    }
+    handle->willRead(entries);
+    for (const GWByteRange& entry : entries) {
+        auto reader = open("data.bin");
+        ASSERT_TRUE(reader && reader->seekToFileOffset(entry.offset, nullptr));
+        EXPECT_EQ(reader->readDataOfLength(entry.length, nullptr),
+                  slice(entry.offset, entry.length));
+    }
+    EXPECT_LE(server_->requests().size(), 6u);
 }
 
 TEST_F(GWRemoteFileHandleHTTPTest, HandlesOfOneResourceShareItsSizeAndBlocks) {
@@ -275,6 +291,7 @@ struct ServerCase {
     bool failsAtOpen = false;
     std::size_t replacementSize = 200000;
     const char* target = "archive";  // "refused": nobody listens; "unanswered": connect never ends
+    bool announced = false;          // the range is fetched ahead before it is read
 };
 
 }  // namespace
@@ -293,6 +310,20 @@ TEST(GWRemoteFileHandleMisbehavingServerTest, EachEndsInItsErrorWithinTheTimeLim
         {"replaced, no validator", {.replaceAt = 2}, ESTALE, false, 190000},
         {"replaced, weak tag", {.validators = Validators::weakTagAndDate, .replaceAt = 2}, ESTALE},
         {"replaced, strong tag", {.validators = Validators::strongTag, .replaceAt = 2}, ESTALE},
+        {"replaced while fetched ahead",
+         {.validators = Validators::strongTag, .replaceAt = 2},
+         ESTALE,
+         false,
+         200000,
+         "archive",
+         true},
+        {"stalls while fetched ahead",
+         {Behaviour::stallAt, 150000},
+         ETIMEDOUT,
+         false,
+         200000,
+         "archive",
+         true},
         {"strong tag dropped",
          {.validators = Validators::strongTagDroppedLater, .replaceAt = 2},
          ESTALE},
@@ -338,6 +369,10 @@ TEST(GWRemoteFileHandleMisbehavingServerTest, EachEndsInItsErrorWithinTheTimeLim
         auto handle = GWRemoteFileHandle::initForReadingFromURL(
             GWURL::URLWithString(address).value_or(GWURL()), &error);
         std::optional<GWData> bytes;
+        if (handle && row.announced) {
+            const GWByteRange whole{0, content.size()};
+            handle->willRead(std::span(&whole, 1));
+        }
         if (handle && handle->seekToFileOffset(100000, nullptr)) {
             bytes = handle->readDataOfLength(100000, &error);
         }

@@ -27,6 +27,10 @@ ZipBuilder mixedArchive() {
     zip.addFile("data/empty", {});
     zip.addFile("caf\xC3\xA9.txt", bytesOf("unicode name"), 8);
     zip.addSymlink("docs/link", "readme.txt");
+    // Stored entries each larger than a read-ahead block, side by side.
+    for (int index = 0; index < 40; ++index) {
+        zip.addFile("many/" + std::to_string(index), randomBytes(40000, 10 + index), 0);
+    }
     return zip;
 }
 
@@ -95,9 +99,12 @@ TEST_F(GWZipArchiveRemote, ListsStreamsAndExtractsAsTheLocalFile) {
     GWErrorPtr error;
     ASSERT_TRUE(
         local->extractFiles(local->files(), directory_.url("by-local"), false, nullptr, &error));
+    server_->forgetRequests();
     ASSERT_TRUE(
         remote->extractFiles(remote->files(), directory_.url("by-remote"), false, nullptr, &error))
         << error->localizedDescription();
+    // Adjacent entries are fetched together, not in a request each.
+    EXPECT_LE(server_->requests().size(), 6u);
     EXPECT_EQ(describeTree(directory_.file("by-remote")),
               describeTree(directory_.file("by-local")));
     EXPECT_NE(describeTree(directory_.file("by-remote")).find("random.bin"), std::string::npos);
