@@ -1,6 +1,7 @@
 #include "GWHTTPPrefetcher.h"
 
 #include <algorithm>
+#include <cerrno>
 #include <cmath>
 #include <cstring>
 
@@ -197,7 +198,11 @@ bool GWHTTPPrefetcher::take(std::uint64_t offset, std::span<std::uint8_t> into,
     changed_.wait(lock, [&] { return std::all_of(holders.begin(), holders.end(), settled); });
     for (const SpanPtr& span : holders) {
         if (span->state != Span::ready) {
-            if (span->error) {
+            // A connection cut somewhere in a long merged range says nothing
+            // of this reader's own bytes: it asks for them itself. Any other
+            // failure (a changed file, a refused redirect, a stall) it would
+            // meet as well.
+            if (span->error && !span->error->is(kGWPOSIXErrorDomain, ECONNRESET)) {
                 GWFail(failure, span->error);
             }
             return false;

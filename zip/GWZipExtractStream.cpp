@@ -233,8 +233,11 @@ void GWZipExtractOperation::unpackFile(const GWZipFilePtr& file,
     }
     // The central directory's size: a local header with a data descriptor has none.
     const std::uint64_t compressedSize = file->compressedSize();
+    // Only from a local file: a remote one's reads come from ranges fetched
+    // ahead, which a read past the entry's own bytes would upset.
+    const bool local = handle->URL() && handle->URL()->isFileURL();
     const std::uint64_t following =
-        compressedSize <= kSmallEntryLength ? kLocalHeaderSlack + compressedSize : 0;
+        local && compressedSize <= kSmallEntryLength ? kLocalHeaderSlack + compressedSize : 0;
     GWData head;
     if (!readLocalHeader(*this, file, *handle, headerOffset, &header, &error, following, &head)) {
         completion(error);
