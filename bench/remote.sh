@@ -27,7 +27,7 @@ skip() {
 }
 
 [ "$(id -u)" = 0 ] || skip "needs root for a network namespace"
-for tool in ip tc nginx; do
+for tool in ip tc nginx cc; do
     command -v $tool >/dev/null || skip "$tool is not installed"
 done
 [ -x "$GW" ] || skip "no $GW"
@@ -61,6 +61,7 @@ else
     LINK=forwarder
     ip tuntap add dev "$HOST_END" mode tun || skip "cannot make a tun device"
     ip netns exec "$NS" ip tuntap add dev "$NS_END" mode tun
+    cc -O2 -o "$SCRATCH/delay_link" "$(dirname "$0")/delay_link.c" || skip "cannot build the forwarder"
     ip link set "$HOST_END" mtu 9000
     ip netns exec "$NS" ip link set "$NS_END" mtu 9000
 fi
@@ -79,7 +80,7 @@ set_delay() {
     [ -n "$FORWARDER_PID" ] && kill "$FORWARDER_PID" && wait "$FORWARDER_PID" 2>/dev/null
     local seconds
     seconds=$(echo "${1%ms} / 2000" | bc -l)
-    python3 "$(dirname "$0")/delay_link.py" "$HOST_END" "$NS" "$NS_END" "$seconds" >"$SCRATCH/link" &
+    "$SCRATCH/delay_link" "$HOST_END" "$NS" "$NS_END" "$seconds" >"$SCRATCH/link" &
     FORWARDER_PID=$!
     for _ in $(seq 50); do
         grep -q ready "$SCRATCH/link" 2>/dev/null && return
