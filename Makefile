@@ -53,7 +53,8 @@ fuzz: deps
 	done
 
 # gwarchive against unzip, bsdtar, 7zz and unar on a generated corpus (kept
-# in $(BUILD_DIR)/bench-corpus); writes bench/RESULTS.md.
+# in $(BUILD_DIR)/bench-corpus), with the remote rows of bench/remote.sh
+# when run as root; writes bench/RESULTS.md.
 bench: build
 	python3 bench/run.py --build $(BUILD_DIR)
 

@@ -8,7 +8,7 @@
 #   bench/remote.sh [BUILD_DIR]      (as root; DELAY=20ms RUNS=3 by default)
 set -u
 BUILD=$(cd "${1:-build}" && pwd)
-GW=$BUILD/gwarchive
+GW=${GW:-$BUILD/gwarchive}
 CORPUS=$(readlink -f "$BUILD/bench-corpus")
 DELAY=${DELAY:-20ms}
 RUNS=${RUNS:-3}

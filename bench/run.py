@@ -4,6 +4,9 @@ bench/RESULTS.md.
 
     bench/run.py --build BUILD_DIR [--out bench/RESULTS.md] [--only NAME,...]
 
+NAME is a workload below, "syscalls" (system calls per extracted file) or
+"remote" (bench/remote.sh: over HTTP behind 20 ms, as root).
+
 Each workload is one hyperfine call holding every tool that can do it, so all
 of them see the same machine load. Every command runs under /usr/bin/time -v,
 which records its peak resident memory without an extra run."""
@@ -152,6 +155,27 @@ def syscalls_per_file(gw, corpus, scratch):
     return counts
 
 
+REMOTE_GOALS = {"extract large.zip": ("ratio", 1.5), "extract small.zip": ("ratio", 2.0),
+                "list list.zip": ("requests", 4)}
+
+
+def remote_rows(build, gw):
+    """bench/remote.sh's rows: local time, over HTTP without and with 20 ms, requests."""
+    done = subprocess.run(["bash", os.path.join(HERE, "remote.sh"), build], capture_output=True,
+                          text=True, env=dict(os.environ, GW=gw))
+    rows = []
+    for line in done.stdout.splitlines():
+        fields = line.split()
+        label = " ".join(fields[:-6])
+        if label in REMOTE_GOALS:
+            local, plain, plain_n, delayed, ratio, delayed_n = fields[-6:]
+            rows.append((label, float(local), float(plain), int(plain_n), float(delayed),
+                         float(ratio.rstrip("x")), int(delayed_n)))
+    if not rows:
+        log("remote: " + (done.stdout.strip().splitlines() or [done.stderr.strip()])[-1])
+    return rows, done.stdout.splitlines()[:1]
+
+
 def load_average():
     return " / ".join(f"{x:.2f}" for x in os.getloadavg())
 
@@ -166,7 +190,7 @@ def cpu_model():
     return platform.processor() or "unknown"
 
 
-def write_results(path, measured, load_before, load_after, notes, syscalls=None):
+def write_results(path, measured, load_before, load_after, notes, syscalls=None, remote=None):
     lines = [
         "# Benchmark results",
         "",
@@ -220,6 +244,20 @@ def write_results(path, measured, load_before, load_after, notes, syscalls=None)
                   "of all threads divided by the number of files. Goal for gwarchive: at most 15.",
                   "", "| tool | calls per file |", "|---|---|"]
         lines += [f"| {tool} | {count:.1f} |" for tool, count in syscalls.items()]
+    if remote and remote[0]:
+        rows, header = remote
+        lines += ["", "## Remote archives over 20 ms", "",
+                  "bench/remote.sh: nginx in a network namespace, 20 ms added to every round trip;",
+                  f"output to tmpfs on both sides; {' '.join(header)}.", "",
+                  "| workload | local file | HTTP, no delay | HTTP, +20 ms | ratio to local "
+                  "| requests (+20 ms) | goal |", "|---|---|---|---|---|---|---|"]
+        for label, local, plain, plain_n, delayed, ratio, delayed_n in rows:
+            kind, limit = REMOTE_GOALS[label]
+            value = ratio if kind == "ratio" else delayed_n
+            verdict = "met" if value <= limit else "not met"
+            goal = f"≤ {limit}×" if kind == "ratio" else f"≤ {limit} requests"
+            lines.append(f"| {label} | {local:.3f} s | {plain:.3f} s | {delayed:.3f} s | {ratio:.2f} "
+                         f"| {delayed_n} | {goal}: {verdict} |")
     if notes:
         lines += ["", "## Notes", "", open(notes).read().strip()]
     with open(path, "w") as f:
@@ -251,9 +289,10 @@ def main():
     measured = [(w, run_workload(w, gw, corpus, scratch)) for w in selected]
     wanted = options.only.split(",") if options.only else []
     syscalls = syscalls_per_file(gw, corpus, scratch) if not wanted or "syscalls" in wanted else {}
+    remote = remote_rows(build, gw) if not wanted or "remote" in wanted else None
     load_after = load_average()
     notes = options.notes if os.path.exists(options.notes) else None
-    write_results(options.out, measured, load_before, load_after, notes, syscalls)
+    write_results(options.out, measured, load_before, load_after, notes, syscalls, remote)
     log(f"results in {options.out}")
     print(open(options.out).read())
 
