@@ -8,7 +8,7 @@ FUZZ_TARGETS := $(basename $(notdir $(wildcard fuzz/fuzz_*.cpp)))
 JOBS ?= $(shell nproc)
 CMAKE_FLAGS ?=
 
-.PHONY: all deps build run test test-asan fuzz bench bench-remote format format-check clean
+.PHONY: all deps build run test test-asan fuzz bench bench-remote package check-install install format format-check clean
 
 all: build
 
@@ -61,6 +61,17 @@ bench: build
 # Extraction and listing over HTTP behind 20 ms, beside the local file (root).
 bench-remote: build
 	bench/remote.sh $(BUILD_DIR)
+
+# A .deb of the library, its headers, the tool and its manual, in $(BUILD_DIR).
+package: build
+	cd $(BUILD_DIR) && cpack -G DEB
+
+install: build
+	cmake --install $(BUILD_DIR)
+
+# Installs into a temporary prefix and builds examples/ from there both ways.
+check-install: build
+	bash scripts/check-install.sh $(BUILD_DIR)
 
 format:
 	git ls-files '*.h' '*.cpp' | xargs clang-format -i

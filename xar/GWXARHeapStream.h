@@ -9,13 +9,6 @@
 #include "foundation/GWError.h"
 #include "foundation/GWURL.h"
 
-// (decoded piece or none, last call, stored digests did not match, error)
-// -> go on? The last call of a stream alone carries `isDone`; the checksum
-// verdict arrives with it.
-using GWXARDataHandler =
-    std::function<bool(std::optional<std::span<const std::uint8_t>> data, bool isDone,
-                       bool checksumFailed, const GWErrorPtr& error)>;
-
 // The archive-wide state one stream reads and sets: the archive's location
 // and its shared cancellation flag.
 struct GWXARStreamContext {

@@ -1,16 +1,18 @@
 #pragma once
 
+#include "GWExport.h"
+
 // Version and the constants of the library's own error domains.
 
-extern const double GWArchiveSupportVersionNumber;
-extern const char* const GWArchiveSupportVersionString;
+extern GW_EXPORT const double GWArchiveSupportVersionNumber;
+extern GW_EXPORT const char* const GWArchiveSupportVersionString;
 
-extern const char* const kGWZipArchiveErrorDomain;
-extern const char* const kGWZipArchiveUnknownEntityErrorKey;
+extern GW_EXPORT const char* const kGWZipArchiveErrorDomain;
+extern GW_EXPORT const char* const kGWZipArchiveUnknownEntityErrorKey;
 
-extern const char* const kGWXARArchiveErrorDomain;
-extern const char* const kGWXARArchiveUnknownEntityErrorKey;
-extern const char* const kGWXARArchiveAffectedXMLNodeErrorKey;
+extern GW_EXPORT const char* const kGWXARArchiveErrorDomain;
+extern GW_EXPORT const char* const kGWXARArchiveUnknownEntityErrorKey;
+extern GW_EXPORT const char* const kGWXARArchiveAffectedXMLNodeErrorKey;
 
 // Codes of kGWZipArchiveErrorDomain.
 enum GWZipArchiveErrorCode : long {

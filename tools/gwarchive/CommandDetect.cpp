@@ -12,16 +12,6 @@ namespace gwarchive {
 
 namespace {
 
-const char* formatOf(const GWURL& url) {
-    if (GWXARArchive::isXARArchiveAtURL(url))
-        return "xar";
-    if (GWZipArchive::isSelfExtractingZipArchiveAtURL(url))
-        return "zip (self-extracting)";
-    if (GWZipArchive::isZipArchiveAtURL(url))
-        return "zip";
-    return "unknown";
-}
-
 int runDetect(const ParsedArguments& arguments) {
     int status = kExitSuccess;
     for (const std::string& operand : arguments.operands) {
@@ -33,7 +23,8 @@ int runDetect(const ParsedArguments& arguments) {
             status = kExitFailure;
             continue;
         }
-        std::printf("%s: %s\n", GWRedactedURLString(operand).c_str(), formatOf(url));
+        std::printf("%s: %s\n", GWRedactedURLString(operand).c_str(),
+                    GWArchiveFormatName(GWArchiveFormatAtURL(url)));
     }
     return status;
 }

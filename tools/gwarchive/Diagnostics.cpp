@@ -1,5 +1,6 @@
 #include "Diagnostics.h"
 #include "foundation/GWHTTPRangeReader.h"
+#include "foundation/GWLog.h"
 
 #include <cstdio>
 

@@ -10,6 +10,7 @@
 #include "Locations.h"
 #include "foundation/GWHTTPRangeReader.h"
 #include "foundation/GWRecentHTTPResources.h"
+#include "foundation/GWRemoteFileHandle.h"
 #include "foundation/GWStringEncoding.h"
 
 namespace gwarchive {

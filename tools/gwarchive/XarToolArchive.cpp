@@ -6,6 +6,7 @@
 #include "FormatAdapters.h"
 #include "JsonWriter.h"
 #include "foundation/GWContainment.h"
+#include "foundation/GWDispatch.h"
 #include "foundation/GWFileSystem.h"
 
 namespace gwarchive {
