@@ -2,7 +2,6 @@
 #include "foundation/GWHTTPRangeReader.h"
 
 #include <cstdio>
-#include <cstring>
 
 namespace gwarchive {
 
@@ -51,11 +50,7 @@ std::string plainDescription(const GWError& error) {
             case ENOENT: return "not found";
             case EEXIST: return "already exists (use --overwrite or --skip-existing)";
             case EISDIR: return "is a directory";
-            default: {
-                // The entry is named already; the item on disk may be another.
-                std::string text = std::strerror(static_cast<int>(code));
-                return error.URL() ? text + " (" + error.URL()->path() + ")" : text;
-            }
+            default: break;
         }
     }
     if (domain == kGWZipArchiveErrorDomain) {
