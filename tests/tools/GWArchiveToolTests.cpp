@@ -90,6 +90,7 @@ TEST(GWArchiveTool, UsageErrorsExitTwoAndHelpExitsZero) {
     EXPECT_EQ(runTool("cat a.zip").status, 2);
     EXPECT_EQ(runTool("extract -C").status, 2);
     EXPECT_EQ(runTool("list --encoding NO-SUCH-CHARSET a.zip").status, 2);
+    EXPECT_EQ(runTool("extract --strip-components -1 a.zip").status, 2);
     for (const char* command :
          {"list", "extract", "cat", "test", "info", "detect", "macbinary", "appledouble"}) {
         ToolRun help = runTool(std::string(command) + " --help");

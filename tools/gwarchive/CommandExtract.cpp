@@ -45,21 +45,9 @@ std::uint64_t declaredSize(const ToolArchive& archive, const std::vector<std::si
 int runExtract(const ParsedArguments& arguments) {
     if (int status = useOpeningOptions(arguments); status != kExitSuccess)
         return status;
-    const std::string& operand = arguments.operands[0];
-    auto archive = openArchiveOperand(operand);
-    if (!archive)
-        return kExitFailure;
-    if (GWErrorPtr refusal = signatureRefusal(*archive, arguments)) {
-        reportError(operand, std::nullopt, refusal);
-        return kExitFailure;
-    }
-    if (GWErrorPtr integrity = archive->integrityError();
-        integrity && !arguments.has("ignore-checksum")) {
-        reportError(operand, std::nullopt, integrity);
-        return kExitFailure;
-    }
     if (arguments.has("overwrite") && arguments.has("skip-existing")) {
-        reportFailure(operand, std::nullopt, "--overwrite and --skip-existing exclude each other");
+        reportFailure("extract", std::nullopt,
+                      "--overwrite and --skip-existing exclude each other");
         return kExitUsage;
     }
     ExtractOptions options;
@@ -75,6 +63,19 @@ int runExtract(const ParsedArguments& arguments) {
             return kExitUsage;
         }
         options.stripComponents = static_cast<std::size_t>(count);
+    }
+    const std::string& operand = arguments.operands[0];
+    auto archive = openArchiveOperand(operand);
+    if (!archive)
+        return kExitFailure;
+    if (GWErrorPtr refusal = signatureRefusal(*archive, arguments)) {
+        reportError(operand, std::nullopt, refusal);
+        return kExitFailure;
+    }
+    if (GWErrorPtr integrity = archive->integrityError();
+        integrity && !arguments.has("ignore-checksum")) {
+        reportError(operand, std::nullopt, integrity);
+        return kExitFailure;
     }
     bool allFound = true;
     std::vector<std::size_t> selected =
