@@ -1,4 +1,5 @@
 #include <algorithm>
+#include <cerrno>
 #include <mutex>
 #include <thread>
 
@@ -23,11 +24,15 @@ struct BatchState {
     std::shared_ptr<GWRemoteFileHandle> fetchingAhead;  // keeps what it fetched until the end
     bool continueAfterFailure = false;
     std::function<void(const std::string&, const GWErrorPtr&)> entryFailed;
+    std::function<void(const std::string&)> entryWritten;
 
     void finished(GWZipExtractOperation& operation) {
         GWErrorPtr error = operation.error();
         // Most entries succeed; workers would otherwise queue on the lock.
         if (!error && !operation.isCancelled()) {
+            if (entryWritten) {
+                entryWritten(operation.file()->path());
+            }
             return;
         }
         std::lock_guard guard(mutex);
@@ -209,6 +214,7 @@ void GWZipArchive::extractFiles(const GWZipFileArray& files, const GWURL& direct
     state->fetchingAhead = fetchAhead(URL(), startOffset(), *operations);
     state->continueAfterFailure = options.continueAfterFailure;
     state->entryFailed = options.entryFailed;
+    state->entryWritten = options.entryWritten;
     const bool buildsFiles = std::any_of(operations->begin(), operations->end(),
                                          [](const auto& op) { return !op->file()->isDirectory(); });
     if (atomically && buildsFiles) {
@@ -266,7 +272,16 @@ std::optional<std::vector<GWZipExtractOperationPtr>> GWZipArchive::operationsToE
             GWFail(error, GWCocoaError(GWFileWriteUnknownError));
             return std::nullopt;
         }
-        auto more = operationsToExtractFile(file, GWZipEntryDestinationURL(directory, file->path()),
+        std::string path = file->path();
+        for (std::size_t stripped = 0; stripped < options.strippedComponents; ++stripped) {
+            const std::size_t slash = path.find('/');
+            if (slash == std::string::npos) {
+                GWFail(error, GWPOSIXError(EINVAL));
+                return std::nullopt;
+            }
+            path.erase(0, slash + 1);
+        }
+        auto more = operationsToExtractFile(file, GWZipEntryDestinationURL(directory, path),
                                             atomically, progressHandler, error, options);
         if (!more) {
             return std::nullopt;

@@ -1,5 +1,6 @@
 #pragma once
 
+#include <cstddef>
 #include <functional>
 #include <optional>
 #include <string>
@@ -20,6 +21,11 @@ struct GW_EXPORT GWExtractOptions {
     bool continueAfterFailure = false;
     // Told of each entry that fails, with its path in the archive, as it happens.
     std::function<void(const std::string& entryPath, const GWErrorPtr& error)> entryFailed;
+    // Told of each entry once it is written, with its path in the archive.
+    std::function<void(const std::string& entryPath)> entryWritten;
+    // Leading components of the entries' paths not recreated below the
+    // destination; an entry named with no more components than this fails.
+    std::size_t strippedComponents = 0;
 
     // What an archive may grant on disk. Each is off by default: archives
     // from strangers are unpacked as root too, and none of these should come

@@ -61,8 +61,8 @@ TEST_P(GWArchiveToolContainment, ExtractStaysInsideTheFolder) {
         const std::string path = archives.file("hostile." + test.extension);
         writeFile(path, test.archive.build(sandbox.parent()));
         const auto before = sandbox.outside();
-        ToolRun run = runTool(std::string("extract ") + (overwrite ? "--overwrite " : "") + "-C " +
-                              shellQuote(sandbox.out()) + " " + shellQuote(path));
+        ToolRun run = runTool(std::string("extract -v ") + (overwrite ? "--overwrite " : "") +
+                              "-C " + shellQuote(sandbox.out()) + " " + shellQuote(path));
         EXPECT_EQ(sandbox.outside(), before) << run.err;
         EXPECT_EQ(readFile(sandbox.canary()), bytesOf(ContainmentSandbox::kCanaryText));
         if (!test.archive.refusedPath.empty()) {
@@ -284,7 +284,7 @@ TEST(GWArchiveToolContainment, PathBelowALinkInTheFolderIsRefused) {
         const std::string path = directory.file("a." + extension);
         writeFile(path, bytes);
         const auto before = sandbox.outside();
-        ToolRun run = runTool("extract --overwrite -C " + shellQuote(sandbox.out()) + " " +
+        ToolRun run = runTool("extract -v --overwrite -C " + shellQuote(sandbox.out()) + " " +
                               shellQuote(path) + " d/canary");
         EXPECT_EQ(run.status, 1) << extension;
         EXPECT_NE(run.err.find(extension == "zip" ? "GWZipArchiveErrorDomain 4"

@@ -205,7 +205,7 @@ TEST_P(GWArchiveToolDroppedConnection, AnEntryCutShortIsAnErrorNotAShortFile) {
     // Each retry of the cut read meets the same cut.
     setenv("GWARCHIVE_HTTP_TIMEOUTS", "retry=1", 1);
 
-    ToolRun cat = runTool("cat " + address + " cut.bin");
+    ToolRun cat = runTool("cat -v " + address + " cut.bin");
     EXPECT_EQ(cat.status, 1);
     EXPECT_NE(cat.err.find("(NSPOSIXErrorDomain 104)"), std::string::npos) << cat.err;
     EXPECT_LT(cat.out.size(), 400000u);
@@ -310,7 +310,8 @@ TEST(GWArchiveToolMisbehavingServer, EachEndsInItsErrorWithoutWrongBytesOrSecret
             row.command == std::string("extract") ? " -C " + shellQuote(directory.path()) : "";
 
         const auto started = std::chrono::steady_clock::now();
-        ToolRun run = runTool(std::string(row.command) + destination + " " + shellQuote(address));
+        ToolRun run =
+            runTool(std::string(row.command) + " -v" + destination + " " + shellQuote(address));
         EXPECT_LT(std::chrono::steady_clock::now() - started, std::chrono::seconds(10));
         EXPECT_EQ(run.status, 1) << run.out;
         const std::string code = "NSPOSIXErrorDomain " + std::to_string(row.expected) + ")";

@@ -25,11 +25,11 @@ namespace fs = std::filesystem;
 
 namespace {
 
-// "gwarchive: ARCHIVE[: PATH]: description (domain code)"
+// "gwarchive: ARCHIVE[: PATH]: description", the domain and code left to -v.
 ::testing::AssertionResult isErrorLine(const std::string& text, const std::string& archive) {
     std::regex line("^gwarchive: " +
                     std::regex_replace(archive, std::regex(R"([.^$|()\[\]{}*+?\\])"), R"(\$&)") +
-                    ": .+ \\([A-Za-z]+ -?[0-9]+\\)\n$");
+                    ": (?:(?!ErrorDomain).)+\n$");
     if (std::regex_match(text, line))
         return ::testing::AssertionSuccess();
     return ::testing::AssertionFailure() << "not one error line: " << text;
@@ -90,12 +90,28 @@ TEST(GWArchiveTool, UsageErrorsExitTwoAndHelpExitsZero) {
     EXPECT_EQ(runTool("cat a.zip").status, 2);
     EXPECT_EQ(runTool("extract -C").status, 2);
     EXPECT_EQ(runTool("list --encoding NO-SUCH-CHARSET a.zip").status, 2);
+    EXPECT_EQ(runTool("extract --strip-components -1 a.zip").status, 2);
     for (const char* command :
          {"list", "extract", "cat", "test", "info", "detect", "macbinary", "appledouble"}) {
         ToolRun help = runTool(std::string(command) + " --help");
         EXPECT_EQ(help.status, 0) << command;
         EXPECT_NE(help.out.find("SYNOPSIS"), std::string::npos) << command;
         EXPECT_NE(help.out.find("EXIT STATUS"), std::string::npos) << command;
+        // Every option has an example (-h and -v aside).
+        const std::size_t options = help.out.find("\nOPTIONS\n");
+        const std::size_t examples = help.out.find("\nEXAMPLE");
+        if (options == std::string::npos)
+            continue;
+        const std::string listed = help.out.substr(options, help.out.find("\nEXIT") - options);
+        std::smatch option;
+        for (auto at = listed.cbegin();
+             std::regex_search(at, listed.cend(), option, std::regex("--[a-z-]+"));
+             at = option[0].second) {
+            const std::string name = option.str();
+            if (name != "--help" && name != "--verbose" && name != "--long") {
+                EXPECT_NE(help.out.find(name, examples), std::string::npos) << command << name;
+            }
+        }
     }
     EXPECT_EQ(runTool("--help").status, 0);
 }
@@ -126,7 +142,7 @@ TEST(GWArchiveTool, MissingNonArchiveAndTruncatedFilesGiveOneErrorLine) {
         }
     }
     EXPECT_EQ(readFile(directory.file("out/a.txt")), textBytes(5000, 4));
-    ToolRun notThere = runTool("list " + shellQuote(directory.file("missing.zip")));
+    ToolRun notThere = runTool("list -v " + shellQuote(directory.file("missing.zip")));
     EXPECT_NE(notThere.err.find("(NSPOSIXErrorDomain 2)"), std::string::npos) << notThere.err;
 }
 
@@ -176,10 +192,6 @@ TEST(GWArchiveTool, InfoZipArchiveListsExtractsAndCatsAsUnzipDoes) {
     ASSERT_EQ(cat.status, 0) << cat.err;
     EXPECT_EQ(cat.out,
               runCommand("unzip -p " + shellQuote(archive) + " docs/deep/er/data.bin").output);
-
-    ToolRun missing = runTool("cat " + shellQuote(archive) + " docs/nothing");
-    EXPECT_EQ(missing.status, 1);
-    EXPECT_TRUE(isErrorLine(missing.err, archive + ": docs/nothing"));
 }
 
 // Hidden build folders anywhere below `root`.
@@ -391,7 +403,7 @@ TEST(GWArchiveTool, ControlCharactersInNamesAreEscapedExceptInJson) {
     const std::string out = shellQuote(directory.file("out"));
     // Lines on both streams: every entry, or every bad one (and test's summary).
     for (const auto& [command, lines] : {std::pair<std::string, int>{"list", 6},
-                                         {"list -l", 6},
+                                         {"list -l", 7},
                                          {"test", 6},
                                          {"extract --no-progress -C " + out, 5}}) {
         ToolRun run = runTool(command + " " + shellQuote(directory.file("t.zip")));
@@ -451,15 +463,16 @@ TEST(GWArchiveTool, EncryptedEntriesTakeTheirPasswordFromAnOptionAFileOrTheTermi
         } rows[] = {
             {"cat --password secret " + archive + " a.txt", 0, ""},
             {"cat" + file + " " + archive + " a.txt", 0, ""},
-            {"cat " + archive + " a.txt", 1, "(GWZipArchiveErrorDomain 8)\n"},
+            {"cat " + archive + " a.txt", 1,
+             "a.txt: encrypted: password required (--password or --password-file)\n"},
             {"cat --password Secret " + archive + " a.txt", 1,
-             made.checksPassword ? "(GWZipArchiveErrorDomain 9)\n" : ""},
+             made.checksPassword ? "a.txt: wrong password\n" : ""},
             {"test " + archive, 1, ""},
             {"test --password secret " + archive, 0, ""},
-            {"extract -C " + out + " " + archive, 1, "(GWZipArchiveErrorDomain 8)\n"},
+            {"extract -v -C " + out + " " + archive, 1, "(GWZipArchiveErrorDomain 8)\n"},
             {"extract -C " + out + file + " " + archive, 0, ""},
             {"extract -C " + out + " --password-file /nonexistent " + archive, 1,
-             "(NSPOSIXErrorDomain 2)\n"},
+             "/nonexistent: not found\n"},
         };
         for (const auto& row : rows) {
             fs::remove_all(directory.file("out"));
@@ -528,34 +541,151 @@ TEST(GWArchiveTool, BsdtarXarArchiveListsAndExtractsAsBsdtarDoes) {
     EXPECT_EQ(bytesOf(cat.out), readFile(directory.file("src/docs/readme.txt")));
 }
 
-// --- test ----------------------------------------------------------------------
+// --- habits: selection, existing items, quiet and verbose, messages -------------
 
-TEST(GWArchiveTool, TestFindsAFlippedByteInAStoredZipEntryAndInAXarFile) {
-    TemporaryDirectory directory;
-    ZipBuilder zip;
-    zip.addFile("good.txt", bytesOf("all fine"), 0);
-    zip.addFile("bad.txt", bytesOf("flip me here"), 0);
-    writeFile(directory.file("good.zip"), zip.bytes());
-    GWData bytes = zip.bytes();
-    std::string text(bytes.begin(), bytes.end());
-    bytes[text.find("flip me")] ^= 0x01;
-    writeFile(directory.file("bad.zip"), bytes);
+namespace {
 
-    ToolRun good = runTool("test " + shellQuote(directory.file("good.zip")));
-    EXPECT_EQ(good.status, 0) << good.out << good.err;
-    ToolRun bad = runTool("test " + shellQuote(directory.file("bad.zip")));
-    EXPECT_EQ(bad.status, 1);
-    EXPECT_NE(bad.out.find("bad.txt: "), std::string::npos) << bad.out;
-    EXPECT_EQ(bad.out.find("good.txt: "), std::string::npos) << bad.out;
-    EXPECT_NE(bad.out.find("2 entries, 1 bad"), std::string::npos) << bad.out;
-    ToolRun json = runTool("test --json " + shellQuote(directory.file("bad.zip")));
-    EXPECT_EQ(json.status, 1);
-    EXPECT_EQ(pythonJSON(json.out,
-                         "print(d['passed'], [(b['path'], b['error']['domain']) for b "
-                         "in d['bad']], d['error'])"),
-              "False [('bad.txt', 'GWZipArchiveErrorDomain')] None\n")
-        << json.out;
+// `pattern` with "*" for any text without a comma or line break, "**" for any
+// text without a line break, "***" for anything at all.
+bool matchesLoosely(const std::string& pattern, const std::string& text) {
+    std::string expression;
+    for (std::size_t at = 0; at < pattern.size();) {
+        if (pattern.compare(at, 3, "***") == 0) {
+            expression += "[\\s\\S]*";
+            at += 3;
+        } else if (pattern.compare(at, 2, "**") == 0) {
+            expression += "[^\\n]*";
+            at += 2;
+        } else if (pattern[at] == '*') {
+            expression += "[^,\\n]*";
+            ++at;
+        } else {
+            expression += std::regex_replace(std::string(1, pattern[at++]),
+                                             std::regex(R"([.^$|()\[\]{}+?\\])"), R"(\$&)");
+        }
+    }
+    return std::regex_match(text, std::regex(expression));
 }
+
+}  // namespace
+
+TEST(GWArchiveTool, CommandLineHabitsTable) {
+    TemporaryDirectory directory;
+    ScopedEnvironment zone("TZ", "UTC");
+    ZipBuilder zip;
+    zip.addDirectory("docs/");
+    zip.addFile("docs/a.txt", bytesOf("alpha"));
+    zip.addFile("docs/b.md", bytesOf("bravo"));
+    zip.addFile("docs/sub/c.txt", bytesOf("charlie"));  // docs/sub is implied
+    zip.addFile("lib/x.txt", bytesOf("xray")).dosDate = zipDOSDate(2021, 6, 1);
+    zip.addFile("top.txt", bytesOf("top"));
+    zip.addFile("bad.txt", bytesOf("damaged")).crc32 = 1;
+    writeFile(directory.file("z.zip"), zip.bytes());
+    ZipBuilder mac;
+    mac.addDirectory("d/");
+    mac.addFile("d/f", bytesOf("f"));
+    mac.addFile("__MACOSX/d/._f", buildAppleDouble({}));
+    writeFile(directory.file("mac.zip"), mac.bytes());
+    ZipBuilder sfx;
+    sfx.prefix = bytesOf("#!/bin/sh\nexit 0\n");
+    sfx.offsetsIncludePrefix = true;
+    sfx.addFile("s", bytesOf("s"));
+    writeFile(directory.file("sfx.zip"), sfx.bytes());
+    XarBuilder xar;
+    xar.setFiles(
+        "<file id=\"1\"><name>d</name><type>directory</type><file id=\"2\"><name>e</name>"
+        "<type>file</type>" +
+        xar.dataElement("data", bytesOf("e"), XarEncoding::none) +
+        "</file><file id=\"3\"><name>f</name><type>file</type>" +
+        xar.dataElement("data", bytesOf("f"), XarEncoding::none) + "</file></file>");
+    writeFile(directory.file("x.xar"), xar.bytes());
+
+    const struct {
+        std::string command;  // Z, M, S, X: the archives; OUT: a folder
+        int status;
+        std::string out;  // patterns for matchesLoosely
+        std::string err;
+    } rows[] = {
+        // Selection by name, glob, folder, --include and --exclude; an unmatched PATH.
+        {"list Z 'docs/*.txt'", 0, "docs/a.txt\n", ""},
+        {"list Z nope 'docs/**.txt' top.txt", 1, "docs/a.txt\ndocs/sub/c.txt\ntop.txt\n",
+         "gwarchive: Z: nope: no entry matches\n"},
+        {"list Z docs --include '**.txt' --exclude docs/sub", 0, "docs/a.txt\n", ""},
+        {"list Z --include '*.txt'", 0, "top.txt\nbad.txt\n", ""},
+        // A made-up folder: the newest date below it, none in JSON, no Finder note.
+        {"list -l Z lib", 0,
+         "d** 2021-06-01 12:00 lib/\n-** 2021-06-01 12:00 lib/x.txt\n"
+         "2 entries, 4 bytes, 4 compressed, 0% saved\n",
+         ""},
+        {"list --json Z lib", 0,
+         "{\"format\":\"zip\",\"startOffset\":0,\"dataOffset\":0,\"entries\":[{\"path\":\"lib\","
+         "\"type\":\"directory\",\"mode\":16877,\"size\":0,\"compressedSize\":0,\"mtime\":null,"
+         "\"uid\":*,\"gid\":*,\"appleDouble\":false,**\n",
+         ""},
+        {"list -l M", 0, "d** d/  [fold/MACS]\n-** d/f  [AppleDouble]\n**saved\n", ""},
+        // cat: PATHs in order, folders by their files, damage said plainly.
+        {"cat Z top.txt 'docs/*.txt' top.txt", 0, "topalphatop", ""},
+        {"cat Z docs/sub nope", 1, "charlie", "gwarchive: Z: nope: no entry matches\n"},
+        {"cat Z bad.txt", 1, "damaged",
+         "gwarchive: Z: bad.txt: checksum mismatch (data damaged)\n"},
+        {"cat -v Z bad.txt", 1, "damaged",
+         "***gwarchive: Z: bad.txt: checksum mismatch (data damaged) (GWZipArchiveErrorDomain "
+         "5)\n"},
+        // test: selected entries only; -q keeps the problems; JSON names domain and code.
+        {"test Z 'docs/**'", 0, "Z: 4 entries, 0 bad\n", ""},
+        {"test -q Z", 1, "bad.txt: checksum mismatch (data damaged)\n", ""},
+        {"test --json Z bad.txt", 1,
+         "**\"entries\":1,\"unverified\":0,\"bad\":[{\"path\":\"bad.txt\",\"error\":{\"domain\":"
+         "\"GWZipArchiveErrorDomain\",\"code\":5,\"message\":\"checksum mismatch (data "
+         "damaged)\"}}],\"error\":null,\"passed\":false}\n",
+         ""},
+        // Existing items: refused with a hint, kept, replaced; -v names what is written.
+        {"extract -C OUT Z --exclude bad.txt", 0, "", ""},
+        {"extract -C OUT Z top.txt", 1, "",
+         "gwarchive: Z: top.txt: already exists (use --overwrite or --skip-existing)\n"},
+        {"extract -v --skip-existing -C OUT Z --exclude bad.txt", 0,
+         "Z: 0 written, 5 skipped (already there)\n", "***"},
+        {"extract -v --overwrite -C OUT Z top.txt", 0,
+         "top.txt\nZ: 1 written, 0 skipped (already there)\n", "***"},
+        {"extract -q --progress --overwrite -C OUT Z top.txt", 0, "", ""},
+        {"extract --overwrite --skip-existing -C OUT Z", 2, "", "**exclude each other\n"},
+        // --strip-components: what has no more components is left out.
+        {"extract -v --strip-components 2 -C OUT/s Z docs && ls OUT/s", 0,
+         "c.txt\nZ: 1 written, 0 skipped (already there)\nc.txt\n", "***"},
+        {"extract -v --strip-components 1 -C OUT/x X && ls OUT/x", 0,
+         "e\nf\nX: 2 written, 0 skipped (already there)\ne\nf\n", "***"},
+        {"extract -v --skip-existing --strip-components 1 -C OUT/x X", 0,
+         "X: 0 written, 2 skipped (already there)\n", "***"},
+        {"extract --strip-components 1 -C OUT/x X d/e", 1, "",
+         "gwarchive: X: d/e: already exists (use --overwrite or --skip-existing)\n"},
+        // Where a self-extractor's ZIP data begins, its offsets counted from the file's start.
+        {"info S", 0,
+         "archive: S\nformat: zip\nstart offset: 0\ndata begins at: 17 (17 bytes precede it)\n"
+         "entries: 1 (0 directories, 1 others)\nbytes: 1 (1 compressed)\n",
+         ""},
+    };
+    const std::pair<std::string, std::string> names[] = {
+        {"Z", directory.file("z.zip")},   {"M", directory.file("mac.zip")},
+        {"S", directory.file("sfx.zip")}, {"X", directory.file("x.xar")},
+        {"OUT", directory.file("out")},
+    };
+    auto substitute = [&](std::string text) {
+        for (const auto& [name, path] : names)
+            text = std::regex_replace(text, std::regex("\\b" + name + "\\b"), path);
+        return text;
+    };
+    for (const auto& row : rows) {
+        ToolRun run = runTool(substitute(row.command));
+        EXPECT_EQ(run.status, row.status) << row.command << "\n" << run.err;
+        EXPECT_TRUE(matchesLoosely(substitute(row.out), run.out)) << row.command << "\n" << run.out;
+        EXPECT_TRUE(matchesLoosely(substitute(row.err), run.err)) << row.command << "\n" << run.err;
+    }
+    // Nothing in a listing depends on when it is made.
+    EXPECT_EQ(runTool("list --json " + directory.file("z.zip")).out,
+              runTool("list --json " + directory.file("z.zip")).out);
+}
+
+// --- test ----------------------------------------------------------------------
 
 TEST(GWArchiveTool, InfoAndTestJsonCarryTheVerdicts) {
     XarSigning& signing = sharedSigning();
@@ -595,7 +725,7 @@ TEST(GWArchiveTool, InfoAndTestJsonCarryTheVerdicts) {
                          "for b in d['bad']: print(b['path'], b['error']['domain'], "
                          "b['error']['code'], b['error']['message'])"),
               "False 2 valid None\n"
-              "bad NSCocoaErrorDomain 259 the data does not match its stored checksum\n");
+              "bad NSCocoaErrorDomain 259 checksum mismatch (data damaged)\n");
 
     // Refused before any entry is read: the reason is the object's error.
     ToolRun refused = runTool("test --require-signature --json " + shellQuote(archive));
@@ -615,7 +745,7 @@ struct XarVerdict {
     std::string arguments;
     int status;
     const char* out;  // part of standard output
-    const char* err;  // the one error line's description and code; "" for none
+    const char* err;  // the end of the one error line; "" for none
     bool writes;      // x.txt appears in OUT
 };
 
@@ -670,7 +800,7 @@ TEST_P(GWArchiveToolXarVerdict, FollowsTheChecksums) {
 }
 
 const char* const kTOCMismatch =
-    "The table of contents does not match its checksum (GWXARArchiveErrorDomain 5)";
+    "table of contents does not match its checksum (archive damaged)\n";
 
 INSTANTIATE_TEST_SUITE_P(
     Archives, GWArchiveToolXarVerdict,
@@ -678,7 +808,7 @@ INSTANTIATE_TEST_SUITE_P(
         XarVerdict{"TestPassesAGoodArchive", XarDamage::none, "test ARCHIVE", 0,
                    "1 entries, 0 bad\n", "", false},
         XarVerdict{"TestNamesAFlippedByte", XarDamage::flippedData, "test ARCHIVE", 1,
-                   "x.txt: the data does not match its stored checksum", "", false},
+                   "x.txt: checksum mismatch (data damaged)", "", false},
         XarVerdict{"TestFailsABadTableOfContents", XarDamage::tocChecksum, "test ARCHIVE", 1, "",
                    kTOCMismatch, false},
         XarVerdict{"ExtractWritesNothingFromABadTableOfContents", XarDamage::tocChecksum,
@@ -706,12 +836,12 @@ INSTANTIATE_TEST_SUITE_P(
         XarVerdict{"ExtractRefusesAnUntrustedSignature", XarDamage::signedRSA,
                    "extract --require-signature -C OUT ARCHIVE", 1, "",
                    "Refused: the signature is untrusted (unknown issuer, GW Test RSA Signer, GW "
-                   "Test Intermediate CA) (GWXARArchiveErrorDomain 7)",
+                   "Test Intermediate CA)\n",
                    false},
         XarVerdict{"ExtractTakesATrustedSignature", XarDamage::signedRSA,
                    "extract --require-signature --trust ROOT -C OUT ARCHIVE", 0, "", "", true},
         XarVerdict{"TestRequiresASignature", XarDamage::none, "test --require-signature ARCHIVE", 1,
-                   "", "Refused: the signature is none (GWXARArchiveErrorDomain 6)", false},
+                   "", "Refused: the signature is none\n", false},
         XarVerdict{"TrustNeedsCertificates", XarDamage::none, "list --trust ARCHIVE ARCHIVE", 1, "",
                    "The trusted certificates hold no PEM certificate", false}),
     [](const auto& info) { return std::string(info.param.name); });

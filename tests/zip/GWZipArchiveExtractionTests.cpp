@@ -195,7 +195,7 @@ TEST_F(GWZipArchiveExtraction, ABatchThatCannotFitIsRefusedBeforeAnythingIsWritt
         << error->localizedDescription();
     EXPECT_FALSE(fileExists(small.path() + "/out"));
 
-    ToolRun run = runTool("extract -C " + shellQuote(out.path()) + " " +
+    ToolRun run = runTool("extract -v -C " + shellQuote(out.path()) + " " +
                           shellQuote(directory.file("archive.zip")));
     EXPECT_EQ(run.status, 1);
     EXPECT_NE(run.err.find("(NSPOSIXErrorDomain 28)"), std::string::npos) << run.err;

@@ -1,6 +1,8 @@
 #include <unistd.h>
 
+#include <atomic>
 #include <cstdio>
+#include <cstdlib>
 #include <memory>
 
 #include "Command.h"
@@ -9,6 +11,7 @@
 #include "ProgressBar.h"
 #include "ToolArchive.h"
 #include "foundation/GWFreeSpace.h"
+#include "foundation/GWHTTPRangeReader.h"
 
 namespace gwarchive {
 
@@ -22,14 +25,14 @@ bool wantsProgressBar(const ParsedArguments& arguments) {
     return isatty(STDERR_FILENO) == 1;
 }
 
-// What the selected entries will write: the data of each regular file and its
+// What the entries will write: the data of each regular file and its
 // resource fork; hard links share their target's.
-std::uint64_t declaredSize(const ToolArchive& archive, const std::vector<std::size_t>& selected) {
+std::uint64_t declaredSize(const ToolArchive& archive, const std::vector<std::size_t>& entries) {
     std::uint64_t total = 0;
     auto add = [&total](std::uint64_t size) {
         total = size > UINT64_MAX - total ? UINT64_MAX : total + size;
     };
-    for (std::size_t index : selected) {
+    for (std::size_t index : entries) {
         if (archive.entryType(index) != EntryType::file)
             continue;
         const EntryRecord record = archive.entry(index);
@@ -42,6 +45,25 @@ std::uint64_t declaredSize(const ToolArchive& archive, const std::vector<std::si
 int runExtract(const ParsedArguments& arguments) {
     if (int status = useOpeningOptions(arguments); status != kExitSuccess)
         return status;
+    if (arguments.has("overwrite") && arguments.has("skip-existing")) {
+        reportFailure("extract", std::nullopt,
+                      "--overwrite and --skip-existing exclude each other");
+        return kExitUsage;
+    }
+    ExtractOptions options;
+    options.directory = localURL(arguments.value("directory").value_or("."));
+    options.overwrite = arguments.has("overwrite");
+    options.quiet = arguments.has("quiet");
+    if (auto strip = arguments.value("strip-components")) {
+        char* end = nullptr;
+        const unsigned long long count = std::strtoull(strip->c_str(), &end, 10);
+        if (strip->empty() || *end != '\0' || (*strip)[0] == '-' || count > 4096) {
+            reportFailure("--strip-components " + *strip, std::nullopt,
+                          "not a number of components");
+            return kExitUsage;
+        }
+        options.stripComponents = static_cast<std::size_t>(count);
+    }
     const std::string& operand = arguments.operands[0];
     auto archive = openArchiveOperand(operand);
     if (!archive)
@@ -56,31 +78,40 @@ int runExtract(const ParsedArguments& arguments) {
         return kExitFailure;
     }
     bool allFound = true;
-    std::vector<std::string> paths(arguments.operands.begin() + 1, arguments.operands.end());
-    std::vector<std::size_t> selected = selectEntries(*archive, operand, paths, &allFound);
-    if (selected.empty() && !paths.empty())
+    std::vector<std::size_t> selected =
+        selectEntries(*archive, operand, Selection::fromArguments(arguments, 1), &allFound);
+    std::size_t skipped = 0;
+    const std::vector<std::size_t> roots =
+        extractionRoots(*archive, selected, options, arguments.has("skip-existing"), &skipped);
+    std::vector<std::size_t> entries;
+    for (std::size_t root : roots) {
+        for (std::size_t index = root, end = archive->subtreeEnd(root); index < end; ++index)
+            entries.push_back(index);
+    }
+    if (!usePasswordOptions(arguments, *archive, operand, entries))
         return kExitFailure;
-    if (!usePasswordOptions(arguments, *archive, operand, selected))
-        return kExitFailure;
-
-    ExtractOptions options{localURL(arguments.value("directory").value_or(".")),
-                           arguments.has("overwrite"),
-                           nullptr,
-                           {}};
+    std::atomic<std::size_t> written{0};
+    if (isVerbose()) {
+        options.written = [&](const std::string& path) {
+            ++written;
+            const auto shown = strippedPath(path, options.stripComponents);
+            std::printf("%s\n", printable(shown ? *shown : path).c_str());
+        };
+    }
     options.grants.keepSetIDBits = arguments.has("keep-setuid");
     options.grants.createDevices = arguments.has("devices");
     options.grants.privilegedAttributes = arguments.has("privileged-xattrs");
     options.grants.keepPinningFlags = arguments.has("keep-flags");
     // Refused before anything is written: a hostile archive fills no disk.
     GWErrorPtr spaceError;
-    if (!GWCheckFreeSpace(options.directory, declaredSize(*archive, selected), &spaceError)) {
+    if (!GWCheckFreeSpace(options.directory, declaredSize(*archive, entries), &spaceError)) {
         reportError(operand, std::nullopt, spaceError);
         return kExitFailure;
     }
     std::unique_ptr<ProgressBar> bar;
-    if (wantsProgressBar(arguments)) {
+    if (!options.quiet && wantsProgressBar(arguments)) {
         std::uint64_t total = 0;
-        for (std::size_t index : selected)
+        for (std::size_t index : entries)
             total += archive->entry(index).size;
         bar = std::make_unique<ProgressBar>(stderr, total);
         options.progress = [&bar](std::uint64_t bytes) {
@@ -88,9 +119,13 @@ int runExtract(const ParsedArguments& arguments) {
             return true;
         };
     }
-    bool extracted = archive->extract(selected, options, operand);
+    bool extracted = archive->extract(roots, options, operand);
     if (bar)
         bar->finish();
+    if (isVerbose()) {
+        std::printf("%s: %zu written, %zu skipped (already there)\n",
+                    GWRedactedURLString(operand).c_str(), written.load(), skipped);
+    }
     return extracted && allFound ? kExitSuccess : kExitFailure;
 }
 
@@ -103,7 +138,9 @@ const Command kExtractCommand = {
     "    gwarchive extract - extract entries of a ZIP or XAR archive\n"
     "\n"
     "SYNOPSIS\n"
-    "    gwarchive extract [-C DIR] [--overwrite] [--ignore-checksum]\n"
+    "    gwarchive extract [-C DIR] [--overwrite|--skip-existing]\n"
+    "                      [--strip-components N] [--include GLOB] [--exclude GLOB]\n"
+    "                      [-q] [--ignore-checksum]\n"
     "                      [--encoding NAME] [--trust FILE] [--require-signature]\n"
     "                      [--keep-setuid] [--devices] [--privileged-xattrs]\n"
     "                      [--keep-flags] [--progress|--no-progress]\n"
@@ -118,6 +155,13 @@ const Command kExtractCommand = {
     "    partial file. An item that already exists is an error for that entry and\n"
     "    the other entries go on; existing directories are merged into. ARCHIVE\n"
     "    may be a path or an http(s) URL.\n"
+    "    A PATH is an entry's name or a shell pattern: * and ? stay within one\n"
+    "    component, ** crosses \"/\", [...] as for fnmatch; a folder brings what\n"
+    "    lies below it. A PATH that matches nothing is an error, said once the\n"
+    "    rest is done.\n"
+    "    A folder only part of which is written (some of its entries left out\n"
+    "    by a pattern, --strip-components or --skip-existing) is made as a\n"
+    "    plain folder, without its stored mode and date.\n"
     "\n"
     "    Encrypted ZIP entries (traditional or AES) need a password: without\n"
     "    --password or --password-file it is asked for, without echo, when\n"
@@ -144,6 +188,13 @@ const Command kExtractCommand = {
     "OPTIONS\n"
     "    -C, --directory DIR  extract beneath DIR.\n"
     "    --overwrite          replace existing items instead of failing.\n"
+    "    --skip-existing      keep existing items and write nothing in their\n"
+    "                         place, without an error (-v counts them).\n"
+    "    --strip-components N leave the first N components off every path; an\n"
+    "                         entry with no more than N is not written.\n"
+    "    --include GLOB       only what GLOB matches; repeatable.\n"
+    "    --exclude GLOB       not what GLOB matches; repeatable, before --include.\n"
+    "    -q, --quiet          print nothing but errors: no warnings, no progress.\n"
     "    --ignore-checksum    extract a XAR whose table of contents does not match\n"
     "                         its checksum; without it nothing is written.\n"
     "    --encoding NAME      read ZIP names that do not say they are UTF-8 in the\n"
@@ -171,7 +222,9 @@ const Command kExtractCommand = {
     "    --keep-flags         set immutable and append-only flags; off because\n"
     "                         they make items that even root cannot remove or\n"
     "                         replace without clearing them first.\n"
-    "    -v, --verbose        show the library's log on standard error.\n"
+    "    -v, --verbose        print each item's path as it is written and a count\n"
+    "                         at the end; errors carry their domain and code,\n"
+    "                         and the library's log goes to standard error.\n"
     "\n"
     "EXIT STATUS\n"
     "    0 when every entry was extracted; 1 when ARCHIVE cannot be opened, its\n"
@@ -180,9 +233,28 @@ const Command kExtractCommand = {
     "\n"
     "EXAMPLES\n"
     "    gwarchive extract -C ~/Restored Photos.zip\n"
-    "    gwarchive extract --overwrite Installer.pkg Payload\n",
+    "    gwarchive extract --overwrite Installer.pkg Payload\n"
+    "    gwarchive extract --skip-existing -v Photos.zip       # resume\n"
+    "    gwarchive extract --strip-components 1 project-1.2.zip\n"
+    "    gwarchive extract Site.zip 'docs/**.html' --exclude 'docs/old'\n"
+    "    gwarchive extract --include '*.txt' Notes.zip\n"
+    "    gwarchive extract --quiet --directory /srv/www Site.zip\n"
+    "    gwarchive extract -q --no-progress Big.zip\n"
+    "    gwarchive extract --progress Big.zip 2>progress.log\n"
+    "    gwarchive extract --ignore-checksum Damaged.xar\n"
+    "    gwarchive extract --encoding CP866 Russian.zip\n"
+    "    gwarchive extract --require-signature --trust ca.pem Installer.pkg\n"
+    "    gwarchive extract --password-file pw.txt Secret.zip\n"
+    "    gwarchive extract --password 'open sesame' Secret.zip\n"
+    "    sudo gwarchive extract -C / --keep-setuid --keep-flags System.xar\n"
+    "    sudo gwarchive extract -C /mnt --devices --privileged-xattrs Root.xar\n",
     {{'C', "directory", true},
      {0, "overwrite", false},
+     {0, "skip-existing", false},
+     {0, "strip-components", true},
+     {'q', "quiet", false},
+     {0, "include", true},
+     {0, "exclude", true},
      {0, "ignore-checksum", false},
      {0, "encoding", true},
      {0, "trust", true},

@@ -77,8 +77,10 @@ const Command kInfoCommand = {
     "    gwarchive info [--json] [--trust FILE] [-v] ARCHIVE\n"
     "\n"
     "DESCRIPTION\n"
-    "    Prints one \"key: value\" line each for: the format; for ZIP the offset at\n"
-    "    which the ZIP data starts (not 0 for self-extractors); for XAR whether the\n"
+    "    Prints one \"key: value\" line each for: the format; for ZIP the offset\n"
+    "    its directory counts from (not 0 for self-extractors whose offsets were\n"
+    "    not adjusted) and where the first entry begins, which is how many bytes\n"
+    "    precede the ZIP data (a self-extractor's program); for XAR whether the\n"
     "    table-of-contents checksum is valid (\"none\" when the archive has no\n"
     "    checksums at all), the signature verdict, each signature's kind, verdict\n"
     "    and certificates' common names, and the names of the sub-documents;\n"
@@ -97,14 +99,17 @@ const Command kInfoCommand = {
     "                  compressedBytes.\n"
     "    --trust FILE  PEM certificates that signing chains may end at, besides\n"
     "                  the system's trusted roots (SSL_CERT_FILE, SSL_CERT_DIR).\n"
-    "    -v, --verbose show the library's log on standard error.\n"
+    "    -v, --verbose errors carry their domain and code; the library's log\n"
+    "                  goes to standard error.\n"
     "\n"
     "EXIT STATUS\n"
     "    0 on success, 1 when ARCHIVE cannot be opened, 2 on wrong usage. An\n"
     "    invalid checksum or signature is reported, not a failure.\n"
     "\n"
-    "EXAMPLE\n"
-    "    gwarchive info Installer.pkg\n",
+    "EXAMPLES\n"
+    "    gwarchive info Installer.pkg\n"
+    "    gwarchive info --json setup.exe\n"
+    "    gwarchive info -v --trust ca.pem Installer.pkg\n",
     {{0, "json", false}, {0, "trust", true}},
     1,
     1,

@@ -11,6 +11,13 @@ std::optional<std::string> ParsedArguments::value(const std::string& name) const
     return found->second;
 }
 
+std::vector<std::string> ParsedArguments::values(const std::string& name) const {
+    std::vector<std::string> found;
+    for (auto [at, end] = everyOption.equal_range(name); at != end; ++at)
+        found.push_back(at->second);
+    return found;
+}
+
 namespace {
 
 const OptionDefinition* findLong(const std::vector<OptionDefinition>& definitions,
@@ -39,6 +46,10 @@ std::optional<ParsedArguments> parseArguments(const std::vector<std::string>& wo
             *message = std::move(text);
         return std::nullopt;
     };
+    auto set = [&parsed](const std::string& name, std::string value) {
+        parsed.everyOption.emplace(name, value);
+        parsed.options[name] = std::move(value);
+    };
     for (std::size_t index = 0; index < words.size(); ++index) {
         const std::string& word = words[index];
         if (word == "--") {
@@ -62,11 +73,11 @@ std::optional<ParsedArguments> parseArguments(const std::vector<std::string>& wo
             if (!option->takesValue) {
                 if (inlineValue)
                     return fail("option '--" + name + "' takes no value");
-                parsed.options[name] = "";
+                set(name, "");
             } else if (inlineValue) {
-                parsed.options[name] = *inlineValue;
+                set(name, *inlineValue);
             } else if (index + 1 < words.size()) {
-                parsed.options[name] = words[++index];
+                set(name, words[++index]);
             } else {
                 return fail("option '--" + name + "' needs a value");
             }
@@ -77,13 +88,13 @@ std::optional<ParsedArguments> parseArguments(const std::vector<std::string>& wo
             if (!option)
                 return fail(std::string("unknown option '-") + word[position] + "'");
             if (!option->takesValue) {
-                parsed.options[option->longName] = "";
+                set(option->longName, "");
                 continue;
             }
             if (position + 1 < word.size()) {
-                parsed.options[option->longName] = word.substr(position + 1);
+                set(option->longName, word.substr(position + 1));
             } else if (index + 1 < words.size()) {
-                parsed.options[option->longName] = words[++index];
+                set(option->longName, words[++index]);
             } else {
                 return fail(std::string("option '-") + word[position] + "' needs a value");
             }

@@ -18,10 +18,13 @@ struct OptionDefinition {
 // (a flag maps to ""), then the operands in order.
 struct ParsedArguments {
     std::map<std::string, std::string> options;
+    std::multimap<std::string, std::string> everyOption;  // repeats included, in order
     std::vector<std::string> operands;
 
     bool has(const std::string& name) const { return options.count(name) != 0; }
     std::optional<std::string> value(const std::string& name) const;
+    // Every value an option that may be repeated was given, in order.
+    std::vector<std::string> values(const std::string& name) const;
 };
 
 // Getopt-style parsing: "-l", grouped "-lv", "-C DIR", "-CDIR", "--long",

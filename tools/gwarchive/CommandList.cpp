@@ -25,7 +25,7 @@ void writeEntry(JsonWriter& json, const EntryRecord& entry) {
     json.key("compressedSize");
     json.value(entry.compressedSize);
     json.key("mtime");
-    if (entry.modificationDate) {
+    if (entry.modificationDate && !entry.madeUp) {
         json.value(entry.modificationDate->ISO8601String());
     } else {
         json.null();
@@ -136,6 +136,15 @@ void printLongEntry(const EntryRecord& entry) {
                 printable(macNotes(entry)).c_str());
 }
 
+// The closing line of a long listing, as column-listing archivers end theirs.
+void printTotals(std::uint64_t entries, std::uint64_t bytes, std::uint64_t compressed) {
+    const double saved =
+        bytes == 0 || compressed >= bytes ? 0.0 : 100.0 * (bytes - compressed) / bytes;
+    std::printf("%llu entries, %llu bytes, %llu compressed, %.0f%% saved\n",
+                static_cast<unsigned long long>(entries), static_cast<unsigned long long>(bytes),
+                static_cast<unsigned long long>(compressed), saved);
+}
+
 int runList(const ParsedArguments& arguments) {
     if (int status = useOpeningOptions(arguments); status != kExitSuccess)
         return status;
@@ -144,13 +153,13 @@ int runList(const ParsedArguments& arguments) {
     if (!archive)
         return kExitFailure;
     bool allFound = true;
-    std::vector<std::string> paths(arguments.operands.begin() + 1, arguments.operands.end());
+    const Selection selection = Selection::fromArguments(arguments, 1);
     std::vector<std::size_t> selected;
-    if (!paths.empty())
-        selected = selectEntries(*archive, operand, paths, &allFound);
+    if (!selection.choosesAll())
+        selected = selectEntries(*archive, operand, selection, &allFound);
     // Without PATHs every entry, without an index array as long as the archive.
     auto forEachSelected = [&](auto&& visit) {
-        if (paths.empty()) {
+        if (selection.choosesAll()) {
             for (std::size_t index = 0; index < archive->entryCount(); ++index)
                 visit(index);
         } else {
@@ -177,7 +186,15 @@ int runList(const ParsedArguments& arguments) {
         json.endObject();
         std::printf("%s\n", json.text().c_str());
     } else if (arguments.has("long")) {
-        forEachSelected([&](std::size_t index) { printLongEntry(describe(index)); });
+        std::uint64_t entries = 0, bytes = 0, compressed = 0;
+        forEachSelected([&](std::size_t index) {
+            const EntryRecord entry = describe(index);
+            printLongEntry(entry);
+            ++entries;
+            bytes += entry.size;
+            compressed += entry.compressedSize;
+        });
+        printTotals(entries, bytes, compressed);
     } else {
         flockfile(stdout);
         forEachSelected([&](std::size_t index) {
@@ -198,12 +215,17 @@ const Command kListCommand = {
     "    gwarchive list - list the entries of a ZIP or XAR archive\n"
     "\n"
     "SYNOPSIS\n"
-    "    gwarchive list [-l|--long] [--json] [--encoding NAME] [--trust FILE] [-v]\n"
-    "                   ARCHIVE [PATH...]\n"
+    "    gwarchive list [-l|--long] [--json] [--include GLOB] [--exclude GLOB]\n"
+    "                   [--encoding NAME] [--trust FILE] [-v] ARCHIVE [PATH...]\n"
     "\n"
     "DESCRIPTION\n"
     "    Lists the entries of ARCHIVE depth-first in tree order, each directory\n"
-    "    before its contents, or only the named PATHs and what lies below them.\n"
+    "    before its contents, or only the entries the PATHs match and what lies\n"
+    "    below them. A PATH is a name or a shell pattern: * and ? do not cross\n"
+    "    \"/\", ** does (\"docs/**.txt\"), [...] as for fnmatch. A PATH that\n"
+    "    matches nothing is an error, said after the rest is listed. A folder\n"
+    "    made up for entries stored without it dates from the newest of what it\n"
+    "    holds (mtime null in JSON).\n"
     "    AppleDouble companions (\"__MACOSX/._name\"), resource-fork members and\n"
     "    MacBinary wrappers are not listed as entries of their own: they belong to\n"
     "    the entry they describe, and the long and JSON forms say so. ARCHIVE may\n"
@@ -213,7 +235,11 @@ const Command kListCommand = {
     "    -l, --long  one line per entry like ls -l: mode, owner/group ids, size,\n"
     "                modification time (UTC), path, link target, and in brackets\n"
     "                the Mac type/creator, resource fork size, AppleDouble,\n"
-    "                MacBinary, the number of extended attributes and encrypted.\n"
+    "                MacBinary, the number of extended attributes and encrypted;\n"
+    "                then a totals line: entries, bytes, compressed bytes and the\n"
+    "                share saved.\n"
+    "    --include GLOB  only what GLOB matches; repeatable.\n"
+    "    --exclude GLOB  not what GLOB matches; repeatable, before --include.\n"
     "    --json      one JSON object {\"format\": \"zip\"|\"xar\", ..., \"entries\": [...]}.\n"
     "                Each entry has path, type (file, directory, symlink, hardlink,\n"
     "                char, block, fifo, socket, whiteout, unknown), mode (with the\n"
@@ -221,22 +247,33 @@ const Command kListCommand = {
     "                appleDouble, macBinary, encrypted, xattrs, and where known\n"
     "                linkTarget, typeCode, creatorCode, resourceForkSize and\n"
     "                compression (under the encryption, for a ZIP AES entry). ZIP\n"
-    "                archives add startOffset; XAR archives add checksum,\n"
+    "                archives add startOffset and dataOffset (where the first\n"
+    "                entry begins; null when there is none); XAR archives add checksum,\n"
     "                checksumIsValid, signatureIsValid, signature, signatureReason,\n"
     "                signatures and subdocuments (see the README).\n"
     "    --encoding NAME  read ZIP names that do not say they are UTF-8 in the\n"
     "                encoding iconv calls NAME (e.g. CP437, CP866).\n"
     "    --trust FILE  PEM certificates that XAR signing chains may end at.\n"
-    "    -v, --verbose  show the library's log on standard error.\n"
+    "    -v, --verbose  errors carry their domain and code; the library's log goes\n"
+    "                to standard error.\n"
     "\n"
     "EXIT STATUS\n"
-    "    0 on success; 1 when ARCHIVE cannot be opened or a PATH is not in it; 2 on\n"
+    "    0 on success; 1 when ARCHIVE cannot be opened or a PATH matches nothing; 2 on\n"
     "    wrong usage.\n"
     "\n"
     "EXAMPLES\n"
     "    gwarchive list -l Photos.zip\n"
-    "    gwarchive list --json Installer.pkg | python3 -m json.tool\n",
-    {{'l', "long", false}, {0, "json", false}, {0, "encoding", true}, {0, "trust", true}},
+    "    gwarchive list --json Installer.pkg | python3 -m json.tool\n"
+    "    gwarchive list Site.zip 'docs/**.html' images\n"
+    "    gwarchive list --include '*.txt' --exclude 'old' Notes.zip\n"
+    "    gwarchive list --encoding CP437 Old.zip\n"
+    "    gwarchive list -v --trust ca.pem Installer.pkg\n",
+    {{'l', "long", false},
+     {0, "json", false},
+     {0, "encoding", true},
+     {0, "trust", true},
+     {0, "include", true},
+     {0, "exclude", true}},
     1,
     kAnyNumber,
     runList,

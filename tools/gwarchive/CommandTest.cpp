@@ -1,5 +1,4 @@
 #include <cstdio>
-#include <numeric>
 
 #include "Command.h"
 #include "Diagnostics.h"
@@ -24,7 +23,7 @@ void writeError(JsonWriter& json, const std::string& domain, long code, const st
 }
 
 // The whole verdict as one object; `failure` is what stopped the test before its entries.
-void printJSON(const std::string& operand, const ToolArchive& archive,
+void printJSON(const std::string& operand, const ToolArchive& archive, std::size_t entries,
                const std::vector<EntryProblem>& problems, const GWErrorPtr& failure) {
     JsonWriter json;
     json.beginObject();
@@ -34,7 +33,7 @@ void printJSON(const std::string& operand, const ToolArchive& archive,
     json.value(archive.formatName());
     archive.writeArchiveFields(json);
     json.key("entries");
-    json.value(static_cast<std::uint64_t>(archive.entryCount()));
+    json.value(static_cast<std::uint64_t>(entries));
     json.key("unverified");
     json.value(static_cast<std::uint64_t>(archive.unverifiedCount()));
     json.key("bad");
@@ -50,7 +49,7 @@ void printJSON(const std::string& operand, const ToolArchive& archive,
     json.endArray();
     json.key("error");
     if (failure) {
-        writeError(json, failure->domain(), failure->code(), failure->localizedDescription());
+        writeError(json, failure->domain(), failure->code(), describeError(failure));
     } else {
         json.null();
     }
@@ -71,35 +70,39 @@ int runTest(const ParsedArguments& arguments) {
     if (GWErrorPtr refusal = signatureRefusal(*archive, arguments)) {
         reportError(operand, std::nullopt, refusal);
         if (json)
-            printJSON(operand, *archive, {}, refusal);
+            printJSON(operand, *archive, 0, {}, refusal);
         return kExitFailure;
     }
     // Digests listed in a table of contents that fails its own check prove nothing.
     if (GWErrorPtr integrity = archive->integrityError()) {
         reportError(operand, std::nullopt, integrity);
         if (json)
-            printJSON(operand, *archive, {}, integrity);
+            printJSON(operand, *archive, 0, {}, integrity);
         return kExitFailure;
     }
-    std::vector<std::size_t> all(archive->entryCount());
-    std::iota(all.begin(), all.end(), std::size_t(0));
-    if (!usePasswordOptions(arguments, *archive, operand, all))
+    bool allFound = true;
+    const std::vector<std::size_t> selected =
+        selectEntries(*archive, operand, Selection::fromArguments(arguments, 1), &allFound);
+    if (!usePasswordOptions(arguments, *archive, operand, selected))
         return kExitFailure;
-    std::vector<EntryProblem> problems = archive->test();
+    std::vector<EntryProblem> problems = archive->test(selected);
+    const int status = problems.empty() && allFound ? kExitSuccess : kExitFailure;
     if (json) {
-        printJSON(operand, *archive, problems, nullptr);
-        return problems.empty() ? kExitSuccess : kExitFailure;
+        printJSON(operand, *archive, selected.size(), problems, nullptr);
+        return status;
     }
     for (const EntryProblem& problem : problems) {
         std::printf("%s: %s\n", printable(problem.path).c_str(),
                     printable(problem.message).c_str());
     }
-    std::printf("%s: %zu entries, %zu bad", GWRedactedURLString(operand).c_str(),
-                archive->entryCount(), problems.size());
+    if (arguments.has("quiet"))
+        return status;
+    std::printf("%s: %zu entries, %zu bad", GWRedactedURLString(operand).c_str(), selected.size(),
+                problems.size());
     if (std::size_t unverified = archive->unverifiedCount())
         std::printf(", %zu not verified (no stored checksum)", unverified);
     std::printf("\n");
-    return problems.empty() ? kExitSuccess : kExitFailure;
+    return status;
 }
 
 }  // namespace
@@ -111,11 +114,13 @@ const Command kTestCommand = {
     "    gwarchive test - check an archive's data without writing anything\n"
     "\n"
     "SYNOPSIS\n"
-    "    gwarchive test [--json] [--encoding NAME] [--trust FILE] [--require-signature]\n"
-    "                   [--password PW|--password-file FILE] [-v] ARCHIVE\n"
+    "    gwarchive test [--json] [-q] [--include GLOB] [--exclude GLOB]\n"
+    "                   [--encoding NAME] [--trust FILE] [--require-signature]\n"
+    "                   [--password PW|--password-file FILE] [-v] ARCHIVE [PATH...]\n"
     "\n"
     "DESCRIPTION\n"
-    "    Decodes every entry of ARCHIVE, companions included, and compares what\n"
+    "    Decodes every entry of ARCHIVE, or those the PATHs match, companions\n"
+    "    included, and compares what\n"
     "    comes out with what the archive stored: the CRC-32 and size of ZIP\n"
     "    entries, the archived and extracted digests of XAR entries. Prints one\n"
     "    line \"PATH: problem\" per bad entry on standard output, then a summary\n"
@@ -123,6 +128,10 @@ const Command kTestCommand = {
     "    could not be verified because the archive stores no checksum for them.\n"
     "    A XAR whose table of contents does not match its checksum fails at once.\n"
     "    ARCHIVE may be a path or an http(s) URL.\n"
+    "    A PATH is an entry's name or a shell pattern: * and ? stay within one\n"
+    "    component, ** crosses \"/\", [...] as for fnmatch; a folder brings what\n"
+    "    lies below it. A PATH that matches nothing is an error, said once the\n"
+    "    rest is done.\n"
     "    Encrypted ZIP entries (traditional or AES) need a password: without\n"
     "    --password or --password-file it is asked for, without echo, when\n"
     "    standard input is a terminal; an entry then fails with \"password\n"
@@ -134,6 +143,9 @@ const Command kTestCommand = {
     "                         for list --json, entries, unverified, bad (each with\n"
     "                         path and error {domain, code, message}), error (what\n"
     "                         stopped the test, or null) and passed.\n"
+    "    -q, --quiet          only the bad entries, no summary line.\n"
+    "    --include GLOB       only what GLOB matches; repeatable.\n"
+    "    --exclude GLOB       not what GLOB matches; repeatable.\n"
     "    --encoding NAME      read ZIP names that do not say they are UTF-8 in the\n"
     "                         encoding iconv calls NAME (e.g. CP437, CP866).\n"
     "    --trust FILE         PEM certificates that XAR signing chains may end at,\n"
@@ -142,24 +154,35 @@ const Command kTestCommand = {
     "    --password PW        the password of encrypted ZIP entries (other users\n"
     "                         may see it in the process list).\n"
     "    --password-file FILE the password is FILE's first line.\n"
-
-    "    -v, --verbose        show the library's log on standard error.\n"
+    "    -v, --verbose        problems carry their domain and code; the library's\n"
+    "                         log goes to standard error.\n"
     "\n"
     "EXIT STATUS\n"
     "    0 when no entry is bad (unverified ones included); 1 when ARCHIVE cannot\n"
     "    be opened, its table of contents is damaged, its signature is required\n"
-    "    and not valid, or any entry is bad; 2 on wrong usage.\n"
+    "    and not valid, a PATH matches nothing or any entry is bad; 2 on wrong\n"
+    "    usage.\n"
     "\n"
-    "EXAMPLE\n"
-    "    gwarchive test Backup.zip\n",
+    "EXAMPLES\n"
+    "    gwarchive test Backup.zip\n"
+    "    gwarchive test --quiet Backup.zip 'photos/**.jpg' || echo damaged\n"
+    "    gwarchive test --exclude '*.tmp' --include 'src' Backup.zip\n"
+    "    gwarchive test --json Installer.pkg | python3 -m json.tool\n"
+    "    gwarchive test --require-signature --trust ca.pem Installer.pkg\n"
+    "    gwarchive test --encoding CP866 Russian.zip\n"
+    "    gwarchive test --password-file pw.txt Secret.zip\n"
+    "    gwarchive test --password 'open sesame' -v Secret.zip\n",
     {{0, "json", false},
      {0, "encoding", true},
      {0, "trust", true},
      {0, "require-signature", false},
      {0, "password", true},
-     {0, "password-file", true}},
+     {0, "password-file", true},
+     {'q', "quiet", false},
+     {0, "include", true},
+     {0, "exclude", true}},
     1,
-    1,
+    kAnyNumber,
     runTest,
 };
 

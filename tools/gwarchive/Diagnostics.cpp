@@ -36,6 +36,47 @@ std::string printable(std::string_view text) {
 
 namespace {
 
+bool gVerbose = false;
+
+// The library's descriptions are written for a Mac user's alert; on a
+// command line the entry and archive are named already and what counts is
+// what failed and why, so the common causes get a phrase of their own.
+std::string plainDescription(const GWError& error) {
+    static const char* const kSizeMismatch = "size differs from the one stored (data damaged)";
+    static const char* const kOutside = "refused: it would be written outside the destination";
+    const std::string& domain = error.domain();
+    const long code = error.code();
+    if (domain == kGWPOSIXErrorDomain) {
+        switch (code) {
+            case ENOENT: return "not found";
+            case EEXIST: return "already exists (use --overwrite or --skip-existing)";
+            case EISDIR: return "is a directory";
+            default: break;
+        }
+    }
+    if (domain == kGWZipArchiveErrorDomain) {
+        switch (code) {
+            case GWZipArchiveChecksumMismatchError: return "checksum mismatch (data damaged)";
+            case GWZipArchiveSizeMismatchError: return kSizeMismatch;
+            case GWZipArchiveEntryOutsideDestinationError: return kOutside;
+            case GWZipArchivePasswordRequiredError:
+                return "encrypted: password required (--password or --password-file)";
+            case GWZipArchiveWrongPasswordError: return "wrong password";
+            default: break;
+        }
+    }
+    if (domain == kGWXARArchiveErrorDomain) {
+        switch (code) {
+            case GWXARArchiveSizeMismatchError: return kSizeMismatch;
+            case GWXARArchiveEntryOutsideDestinationError: return kOutside;
+            case GWXARArchiveInvalidTOCChecksumError:
+                return "table of contents does not match its checksum (archive damaged)";
+            default: break;
+        }
+    }
+    return error.localizedDescription();
+}
+
 std::string prefix(const std::string& archive, const std::optional<std::string>& path) {
     std::string line = "gwarchive: " + printable(GWRedactedURLString(archive));
     if (path)
@@ -52,9 +93,17 @@ void reportError(const std::string& archive, const std::optional<std::string>& p
         return;
     }
     // Descriptions name entries too.
-    std::fprintf(stderr, "%s: %s (%s %ld)\n", prefix(archive, path).c_str(),
-                 printable(error->localizedDescription()).c_str(), error->domain().c_str(),
-                 error->code());
+    std::fprintf(stderr, "%s: %s\n", prefix(archive, path).c_str(),
+                 printable(describeError(error)).c_str());
+}
+
+std::string describeError(const GWErrorPtr& error) {
+    if (!error)
+        return "unknown error";
+    std::string text = plainDescription(*error);
+    if (gVerbose)
+        text += " (" + error->domain() + " " + std::to_string(error->code()) + ")";
+    return text;
 }
 
 void reportFailure(const std::string& archive, const std::optional<std::string>& path,
@@ -75,7 +124,12 @@ int exitStatusAfterDamage(int status) {
     return status == kExitSuccess && damaged ? kExitFailure : status;
 }
 
+bool isVerbose() {
+    return gVerbose;
+}
+
 void setVerbose(bool verbose) {
+    gVerbose = verbose;
     if (verbose) {
         // Log lines name entries too.
         GWSetLogSink(

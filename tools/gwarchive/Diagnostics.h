@@ -15,7 +15,9 @@ std::string printable(std::string_view text);
 
 enum ExitStatus : int { kExitSuccess = 0, kExitFailure = 1, kExitUsage = 2 };
 
-// "gwarchive: ARCHIVE[: PATH]: description (domain code)" on standard error.
+// What went wrong in plain words, with " (domain code)" after it when verbose.
+std::string describeError(const GWErrorPtr& error);
+// "gwarchive: ARCHIVE[: PATH]: what went wrong" on standard error.
 void reportError(const std::string& archive, const std::optional<std::string>& path,
                  const GWErrorPtr& error);
 // The same line for a failure that has no library error behind it.
@@ -30,5 +32,6 @@ int exitStatusAfterDamage(int status);
 // The library logs only when asked to: its lines are for debugging, not for
 // people reading the tool's errors.
 void setVerbose(bool verbose);
+bool isVerbose();
 
 }  // namespace gwarchive

@@ -14,6 +14,7 @@
 namespace gwarchive {
 
 class JsonWriter;
+class ToolArchive;
 
 enum class EntryType : std::uint8_t {
     file,
@@ -38,6 +39,7 @@ struct EntryRecord {
     std::uint64_t size = 0;  // the entry's own bytes, without companions
     std::uint64_t compressedSize = 0;
     std::optional<GWDate> modificationDate;
+    bool madeUp = false;  // implied by other entries, not stored
     std::uint32_t uid = 0;
     std::uint32_t gid = 0;
     std::optional<std::string> linkTarget;
@@ -59,6 +61,10 @@ using ProgressSink = std::function<bool(std::uint64_t bytes)>;
 struct ExtractOptions {
     GWURL directory;
     bool overwrite = false;
+    bool quiet = false;  // no warnings, only errors
+    std::size_t stripComponents = 0;
+    // Told of each item once written, with its path in the archive.
+    std::function<void(const std::string& path)> written;
     ProgressSink progress;
     // The switches for what an archive may grant (set-ID bits, devices,
     // attributes outside "user.", pinning flags).
@@ -68,6 +74,19 @@ struct ExtractOptions {
 // warning line on standard error for each device or attribute left out.
 GWExtractOptions libraryExtractOptions(const ExtractOptions& options,
                                        const std::string& archiveName);
+
+// `path` without its first `count` components; none when it has no more.
+std::optional<std::string_view> strippedPath(std::string_view path, std::size_t count);
+
+// The entries to name to extract(): of those selected, the tops of the
+// subtrees that are to be written whole. An entry that --strip-components
+// leaves nothing of is not written, nor with --skip-existing one whose place
+// is taken (counted in `skipped`); a folder they are missing from is not
+// named either, and is made, if need be, as a plain folder.
+std::vector<std::size_t> extractionRoots(const ToolArchive& archive,
+                                         const std::vector<std::size_t>& selected,
+                                         const ExtractOptions& options, bool skipExisting,
+                                         std::size_t* skipped);
 
 // The verdict on one entry of `gwarchive test`.
 struct EntryProblem {
@@ -96,8 +115,6 @@ public:
     virtual EntryRecord entry(std::size_t index) const = 0;
     // A link target that only the entry's data can tell; none for others.
     virtual std::optional<std::string> readLinkTarget(std::size_t) { return std::nullopt; }
-    // The indexes of `path` and everything below it; none when it is not in the archive.
-    std::optional<std::vector<std::size_t>> selectPath(const std::string& path) const;
 
     // Archive-wide fields of `list --json` and `info --json`.
     virtual void writeArchiveFields(JsonWriter& json) const = 0;
@@ -115,8 +132,8 @@ public:
     // All data reaches the sink before a stored checksum is found wrong.
     virtual bool stream(std::size_t index, const DataSink& sink, GWErrorPtr* error,
                         bool* checksumFailed) = 0;
-    // Decodes every regular entry and checks its stored checksum.
-    virtual std::vector<EntryProblem> test() = 0;
+    // Decodes the given regular entries and checks their stored checksums.
+    virtual std::vector<EntryProblem> test(const std::vector<std::size_t>& indexes) = 0;
     // How many streams the last test() read without a stored checksum to check.
     virtual std::size_t unverifiedCount() const { return 0; }
     // What makes every entry untrustworthy, such as a XAR table of contents
@@ -125,13 +142,17 @@ public:
     // What was lost before the archive could be read, such as a missing
     // central directory whose entries were recovered; none for a whole archive.
     virtual std::optional<std::string> damageNote() const { return std::nullopt; }
-    // Extracts the given entries (all when empty); each failure is reported
-    // on standard error as it happens. Returns whether all succeeded.
+    // Extracts the given entries, each with everything below it; each failure
+    // is reported on standard error as it happens. Returns whether all succeeded.
     virtual bool extract(const std::vector<std::size_t>& indexes, const ExtractOptions& options,
                          const std::string& archiveName) = 0;
 
 protected:
     std::vector<std::size_t> subtree(std::size_t index) const;
+
+public:
+    // One past the last index of the subtree at `index`.
+    std::size_t subtreeEnd(std::size_t index) const;
 };
 
 // Keeps the archive until the process ends, which is right after a command:
@@ -160,10 +181,25 @@ bool usePasswordOptions(const ParsedArguments& arguments, ToolArchive& archive,
 // Opens an ARCHIVE operand, or says why not on standard error and returns none.
 std::unique_ptr<ToolArchive> openArchiveOperand(const std::string& operand);
 
-// The entries the PATH operands name, each with everything below it, in
-// listing order without repeats; every entry when there are no PATHs. A PATH
-// that is not in the archive is reported on standard error and clears `allFound`.
+// Whether `path` matches the shell pattern: "*" and "?" stay within one
+// component, "**" crosses "/" (and "**/" also matches no folder at all),
+// "[...]" and "\\" as for fnmatch.
+bool globMatches(std::string_view pattern, std::string_view path);
+
+// What the PATH operands and --include/--exclude ask for. A pattern that
+// matches a folder selects everything below it.
+struct Selection {
+    std::vector<std::string> paths;  // none: every entry
+    std::vector<std::string> includes;
+    std::vector<std::string> excludes;
+
+    static Selection fromArguments(const ParsedArguments& arguments, std::size_t firstPath);
+    bool choosesAll() const { return paths.empty() && includes.empty() && excludes.empty(); }
+};
+
+// The entries chosen, in listing order without repeats. A PATH that matches
+// nothing is reported on standard error and clears `allFound`.
 std::vector<std::size_t> selectEntries(const ToolArchive& archive, const std::string& operand,
-                                       const std::vector<std::string>& paths, bool* allFound);
+                                       const Selection& selection, bool* allFound);
 
 }  // namespace gwarchive

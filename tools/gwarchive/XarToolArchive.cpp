@@ -164,7 +164,7 @@ public:
 
     std::size_t unverifiedCount() const override { return unverified_; }
 
-    std::vector<EntryProblem> test() override {
+    std::vector<EntryProblem> test(const std::vector<std::size_t>& indexes) override {
         std::vector<EntryProblem> problems;
         unverified_ = 0;
         auto check = [&](const GWXARDataReferencePtr& reference, const GWXARFilePtr& file,
@@ -178,16 +178,16 @@ public:
             // only something that could not be checked.
             const GWXARDataReferencePtr stream = reference ? reference : dataForkOf(file);
             if (!read) {
-                problems.push_back({label, describe(error), error ? error->domain() : "",
+                problems.push_back({label, describeError(error), error ? error->domain() : "",
                                     error ? error->code() : 0});
             } else if (stream && !stream->compressedChecksum() && !stream->uncompressedChecksum()) {
                 ++unverified_;
             } else if (checksumFailed) {
-                problems.push_back({label, "the data does not match its stored checksum",
-                                    kGWCocoaErrorDomain, GWFileReadCorruptFileError});
+                problems.push_back({label, "checksum mismatch (data damaged)", kGWCocoaErrorDomain,
+                                    GWFileReadCorruptFileError});
             }
         };
-        for (std::size_t index = 0; index < files_.size(); ++index) {
+        for (std::size_t index : indexes) {
             EntryType type = records_[index].type;
             if (type != EntryType::file && type != EntryType::hardlink)
                 continue;
@@ -203,34 +203,38 @@ public:
 
     bool extract(const std::vector<std::size_t>& indexes, const ExtractOptions& options,
                  const std::string& archiveName) override {
-        std::vector<bool> selected(files_.size(), false);
-        for (std::size_t index : indexes)
-            selected[index] = true;
         bool allGood = true;
         std::error_code ignored;  // a folder that cannot be made fails each entry below
         std::filesystem::create_directories(options.directory.path(), ignored);
         for (std::size_t index : indexes) {
-            std::optional<std::size_t> parent = parents_[index];
-            if ((parent && selected[*parent]) || superseded_[index])
-                continue;  // extracted with its parent, or replaced by a later namesake
-            GWURL url = options.directory.URLByAppendingPathComponent(records_[index].path);
+            if (superseded_[index])
+                continue;  // replaced by a later namesake
+            // Roots keep at least one component past the stripped ones.
+            const std::string path(
+                strippedPath(records_[index].path, options.stripComponents).value_or(""));
+            GWURL url = options.directory.URLByAppendingPathComponent(path);
             if (refused(index, url, options, archiveName)) {
                 allGood = false;
                 continue;
             }
             // The folders on the way are made by a walk no link can redirect.
-            const std::string& path = records_[index].path;
             const std::size_t slash = path.rfind('/');
             GWErrorPtr failure;
             if (!GWOpenDirectoryBelow(options.directory.path(),
                                       slash == std::string::npos ? "" : path.substr(0, slash), true,
                                       &failure)
                      .isValid()) {
-                reportError(archiveName, path, failure);
+                reportError(archiveName, records_[index].path, failure);
                 allGood = false;
                 continue;
             }
-            allGood &= extractItem(index, url, options, archiveName);
+            const bool extracted = extractItem(index, url, options, archiveName);
+            const std::size_t end = extracted && options.written ? subtreeEnd(index) : index;
+            for (std::size_t member = index; member < end; ++member) {
+                if (!superseded_[member])
+                    options.written(records_[member].path);
+            }
+            allGood &= extracted;
         }
         return allGood;
     }
@@ -293,19 +297,11 @@ private:
         std::size_t index = records_.size();
         records_.push_back(std::move(record));
         files_.push_back(file);
-        parents_.push_back(parent);
         children_.emplace_back();
         if (parent)
             children_[*parent].push_back(index);
         for (const GWXARFilePtr& child : file->children())
             add(child, index);
-    }
-
-    static std::string describe(const GWErrorPtr& error) {
-        if (!error)
-            return "unknown error";
-        return error->localizedDescription() + " (" + error->domain() + " " +
-               std::to_string(error->code()) + ")";
     }
 
     // The archive streams on its own threads; the tool waits for the last call.
@@ -429,7 +425,6 @@ private:
     std::size_t unverified_ = 0;
     std::vector<EntryRecord> records_;
     std::vector<GWXARFilePtr> files_;
-    std::vector<std::optional<std::size_t>> parents_;
     std::vector<std::vector<std::size_t>> children_;
     std::vector<bool> superseded_;
 };

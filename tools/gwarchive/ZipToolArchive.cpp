@@ -6,7 +6,6 @@
 #include <filesystem>
 #include <mutex>
 #include <thread>
-#include <unordered_set>
 
 #include "Diagnostics.h"
 #include "FormatAdapters.h"
@@ -60,13 +59,23 @@ public:
         record.type = types_[index];
         record.size = file.storedUncompressedSize();
         record.compressedSize = file.compressedSize();
-        record.modificationDate = file.modificationDate();
         record.uid = file.owner();
         record.gid = file.groupOwner();
         record.linkTarget = file.symlinkDestination();
-        if (file.typeCode() != 0)
+        // The library dates what it makes up by the clock; a listing should
+        // not change from one run to the next.
+        record.madeUp = isMadeUp(file);
+        if (!record.madeUp) {
+            record.modificationDate = file.modificationDate();
+        } else if (file.isDirectory()) {
+            record.modificationDate = newestDateBelow(index);
+        } else if (file.appleDoubleFile()) {
+            record.modificationDate = file.appleDoubleFile()->modificationDate();
+        }
+        // Every folder has a Finder type; worth showing only where Macs were involved.
+        if (file.typeCode() != 0 && (!file.isDirectory() || carriesMacMetadata()))
             record.typeCode = file.type();
-        if (file.creatorCode() != 0)
+        if (file.creatorCode() != 0 && (!file.isDirectory() || carriesMacMetadata()))
             record.creatorCode = file.creator();
         if (file.resourceFork())
             record.resourceForkSize = file.resourceFork()->storedUncompressedSize();
@@ -99,6 +108,12 @@ public:
     void writeArchiveFields(JsonWriter& json) const override {
         json.key("startOffset");
         json.value(archive_->startOffset());
+        json.key("dataOffset");
+        if (auto offset = dataOffset()) {
+            json.value(*offset);
+        } else {
+            json.null();
+        }
     }
 
     std::optional<std::string> damageNote() const override {
@@ -109,7 +124,12 @@ public:
     }
 
     std::vector<std::string> infoLines() const override {
-        return {"start offset: " + std::to_string(archive_->startOffset())};
+        std::vector<std::string> lines{"start offset: " + std::to_string(archive_->startOffset())};
+        if (auto offset = dataOffset()) {
+            lines.push_back("data begins at: " + std::to_string(*offset) + " (" +
+                            std::to_string(*offset) + " bytes precede it)");
+        }
+        return lines;
     }
 
     void setPassword(const std::string& password) override { archive_->setPassword(password); }
@@ -119,9 +139,9 @@ public:
         return streamFile(entryFile(index), sink, error, checksumFailed);
     }
 
-    std::vector<EntryProblem> test() override {
+    std::vector<EntryProblem> test(const std::vector<std::size_t>& indexes) override {
         std::vector<EntryProblem> problems;
-        for (std::size_t index = 0; index < files_.size(); ++index) {
+        for (std::size_t index : indexes) {
             const GWZipFilePtr& file = entryFile(index);
             if (file->isDirectory())
                 continue;
@@ -196,6 +216,55 @@ private:
 
     const GWZipFilePtr& entryFile(std::size_t index) const { return *files_[index]; }
 
+    // What the loader made up rather than read: a folder that entries imply,
+    // or a companion's missing entry. Only those have no stored checksum.
+    static bool isMadeUp(const GWZipFile& file) {
+        return file.uncompressedChecksumAlgorithm() == 0 && !file.isMacBinaryEncoded();
+    }
+
+    std::optional<GWDate> newestDateBelow(std::size_t index) const {
+        std::optional<GWDate> newest;
+        for (std::size_t member = index + 1, end = subtreeEnd(index); member < end; ++member) {
+            const GWZipFile& file = *entryFile(member);
+            if (isMadeUp(file))
+                continue;
+            const std::optional<GWDate> date = file.modificationDate();
+            if (date && (!newest || *newest < *date))
+                newest = date;
+        }
+        return newest;
+    }
+
+    bool carriesMacMetadata() const {
+        std::call_once(macMetadataChecked_, [this] {
+            carriesMacMetadata_ = std::any_of(files_.begin(), files_.end(), [](const auto* file) {
+                const GWZipFile& entry = **file;
+                return entry.appleDoubleFile() || entry.resourceFork() ||
+                       entry.isMacBinaryEncoded() ||
+                       (!entry.isDirectory() && entry.typeCode() != 0);
+            });
+        });
+        return carriesMacMetadata_;
+    }
+
+    // Where the first local header is in the file, whatever the offsets in
+    // the directory are counted from; none without entries.
+    std::optional<std::uint64_t> dataOffset() const {
+        std::optional<std::uint64_t> first;
+        auto consider = [&first](const GWZipFile& file) {
+            if (!isMadeUp(file) && (!first || file.localHeaderOffset() < *first))
+                first = file.localHeaderOffset();
+        };
+        for (const GWZipFilePtr* file : files_) {
+            consider(**file);
+            if ((*file)->appleDoubleFile())
+                consider(*(*file)->appleDoubleFile());
+        }
+        if (first && *first > UINT64_MAX - archive_->startOffset())
+            return std::nullopt;
+        return first ? std::optional(*first + archive_->startOffset()) : std::nullopt;
+    }
+
     // The library checks CRC-32 and size as the bytes pass; a mismatch is an error.
     bool streamFile(const GWZipFilePtr& file, const DataSink& sink, GWErrorPtr* error,
                     bool* checksumFailed) {
@@ -228,11 +297,8 @@ private:
         GWErrorPtr error;
         if (!streamFile(
                 file, [](const std::uint8_t*, std::size_t) { return true; }, &error, nullptr)) {
-            problems.push_back({path,
-                                error ? error->localizedDescription() + " (" + error->domain() +
-                                            " " + std::to_string(error->code()) + ")"
-                                      : "unknown error",
-                                error ? error->domain() : "", error ? error->code() : 0});
+            problems.push_back({path, describeError(error), error ? error->domain() : "",
+                                error ? error->code() : 0});
         }
     }
 
@@ -244,24 +310,20 @@ private:
     // updates in an archive of 200,000 entries.
     std::vector<GWZipFileArrayPtr> levels_;
     std::vector<const GWZipFilePtr*> files_;
+    mutable std::once_flag macMetadataChecked_;
+    mutable bool carriesMacMetadata_ = false;
 };
 
 bool ZipToolArchive::extract(const std::vector<std::size_t>& indexes, const ExtractOptions& options,
                              const std::string& archiveName) {
-    // The library brings each directory's subtree; only the selected entries
-    // whose parent is not selected are named to it.
-    std::unordered_set<const GWZipFile*> selected;
-    for (std::size_t index : indexes)
-        selected.insert(entryFile(index).get());
+    // The library brings each directory's subtree.
     GWZipFileArray tops;
-    for (std::size_t index : indexes) {
-        const GWZipFilePtr parent = entryFile(index)->parent();
-        if (!parent || !selected.count(parent.get()))
-            tops.push_back(entryFile(index));
-    }
+    for (std::size_t index : indexes)
+        tops.push_back(entryFile(index));
     std::atomic<bool> reported{false};
     GWExtractOptions batchOptions = libraryExtractOptions(options, archiveName);
     batchOptions.continueAfterFailure = true;
+    batchOptions.entryWritten = options.written;
     batchOptions.entryFailed = [&](const std::string& path, const GWErrorPtr& error) {
         reportError(archiveName, path, error);
         reported = true;

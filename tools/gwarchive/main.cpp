@@ -39,8 +39,9 @@ void printToolHelp(std::FILE* stream) {
     }
     std::fputs(
         "\n"
-        "Every command takes -h/--help for its manual and -v/--verbose to show the\n"
-        "library's log. Exit status: 0 success, 1 failure, 2 wrong usage.\n",
+        "Every command takes -h/--help for its manual and -v/--verbose for more:\n"
+        "error domains and codes, the library's log. Exit status: 0 success, 1\n"
+        "failure, 2 wrong usage.\n",
         stream);
 }
 
