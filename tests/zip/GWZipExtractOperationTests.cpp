@@ -120,38 +120,6 @@ INSTANTIATE_TEST_SUITE_P(EveryDecoder, GWZipExtractMethods,
                                            MethodCase{"Zstd", 93, 0}, MethodCase{"XZ", 95, 0}),
                          [](const auto& info) { return std::string(info.param.label); });
 
-TEST_F(GWZipExtractOperationTest, SevenZipArchivesOfEveryMethodExtractAsSevenZipDoes) {
-    if (!toolAvailable("7zz")) {
-        GTEST_SKIP() << "7zz is not installed";
-    }
-    // Runs of a 40000-byte block reach Deflate64's far distances and long lengths.
-    GWData content = textBytes(1 << 20, 5);
-    const GWData block = randomBytes(40000, 6);
-    for (int copies = 0; copies < 5; ++copies) {
-        content.insert(content.end(), block.begin(), block.end());
-    }
-    writeFile(directory.file("member.bin"), content);
-    for (const char* method : {"Deflate64", "LZMA", "xz"}) {
-        std::filesystem::remove(archivePath);
-        const std::string folder = shellQuote(directory.path());
-        ASSERT_EQ(runCommand("cd " + folder + " && 7zz a -tzip -mm=" + method +
-                             " archive.zip member.bin >/dev/null")
-                      .status,
-                  0);
-        const CommandResult peer = runCommand("cd " + folder + " && 7zz x -so archive.zip");
-        ASSERT_EQ(peer.output, std::string(content.begin(), content.end())) << method;
-        GWErrorPtr error;
-        auto archive = GWZipArchive::initWithURL(archiveURL, &error);
-        ASSERT_TRUE(archive) << method;
-        std::filesystem::remove(directory.file("out.bin"));
-        auto operation = toDisk(archive->fileWithPath("member.bin"), "out.bin", true);
-        runToEnd(operation);
-        ASSERT_FALSE(operation->error())
-            << method << ": " << operation->error()->localizedDescription();
-        EXPECT_TRUE(readFile(directory.file("out.bin")) == content) << method;
-    }
-}
-
 // --- Encryption: archives that zip and 7zz make ---------------------------------
 
 struct EncryptionCase {
