@@ -107,18 +107,18 @@ TEST_P(GWZipExtractMethods, WritesTheDecodedBytes) {
     EXPECT_EQ(readFile(directory.file("out.txt")), content);
 }
 
-INSTANTIATE_TEST_SUITE_P(EveryDecoder, GWZipExtractMethods,
-                         ::testing::Values(MethodCase{"Stored", 0, 0}, MethodCase{"Shrunk", 1, 0},
-                                           MethodCase{"ShrunkWithCompanion", 1, 0, true},
-                                           MethodCase{"Imploded", 6, 0},
-                                           MethodCase{"ImplodedWithCompanion", 6, 0, true},
-                                           MethodCase{"ImplodedLargeWithTree", 6, 6},
-                                           MethodCase{"Deflated", 8, 0}, MethodCase{"Bzip2", 12, 0},
-                                           // The end marker is allowed, not needed, without bit 1.
-                                           MethodCase{"LZMA", 14, 2},
-                                           MethodCase{"LZMASized", 14, 0},
-                                           MethodCase{"Zstd", 93, 0}, MethodCase{"XZ", 95, 0}),
-                         [](const auto& info) { return std::string(info.param.label); });
+INSTANTIATE_TEST_SUITE_P(
+    EveryDecoder, GWZipExtractMethods,
+    ::testing::Values(MethodCase{"Stored", 0, 0}, MethodCase{"Shrunk", 1, 0},
+                      MethodCase{"ShrunkWithCompanion", 1, 0, true}, MethodCase{"Imploded", 6, 0},
+                      MethodCase{"ImplodedWithCompanion", 6, 0, true},
+                      MethodCase{"ImplodedLarge", 6, 2}, MethodCase{"ImplodedWithTree", 6, 4},
+                      MethodCase{"ImplodedLargeWithTree", 6, 6}, MethodCase{"Deflated", 8, 0},
+                      MethodCase{"Bzip2", 12, 0},
+                      // The end marker is allowed, not needed, without bit 1.
+                      MethodCase{"LZMA", 14, 2}, MethodCase{"LZMASized", 14, 0},
+                      MethodCase{"Zstd", 93, 0}, MethodCase{"XZ", 95, 0}),
+    [](const auto& info) { return std::string(info.param.label); });
 
 // --- Encryption: archives that zip and 7zz make ---------------------------------
 
@@ -260,20 +260,33 @@ INSTANTIATE_TEST_SUITE_P(
     [](const auto& info) { return std::string(info.param.label); });
 
 TEST_F(GWZipExtractOperationTest, UnsupportedMethodsAreRefusedWithTheirNumber) {
-    ZipBuilder zip;
-    zip.addFile("a.bin", bytesOf("data"), 98);
-    write(zip);
-    DataHandlerLog log;
-    auto operation = toHandler(zipEntryFromBuilder(zip, 0), log);
-    runToEnd(operation);
-    ASSERT_TRUE(operation->error());
-    EXPECT_TRUE(operation->error()->is(kGWZipArchiveErrorDomain, 1));
-    EXPECT_EQ(operation->error()->detailString(kGWZipArchiveUnknownEntityErrorKey), "98");
-    // The handler hears of the failure once, with no data.
-    ASSERT_EQ(log.doneFlags.size(), 1u);
-    EXPECT_TRUE(log.doneFlags[0]);
-    EXPECT_FALSE(log.hadData[0]);
-    EXPECT_EQ(log.errors[0], operation->error());
+    ZipLogCapture capture;
+    for (std::uint16_t method : {2, 5, 7, 98, 99, 0xFFFF}) {
+        ZipBuilder zip;
+        zip.addFile("a.bin", bytesOf("data"), method);
+        write(zip);
+        DataHandlerLog log;
+        auto operation = toHandler(zipEntryFromBuilder(zip, 0), log);
+        runToEnd(operation);
+        ASSERT_TRUE(operation->error());
+        EXPECT_TRUE(operation->error()->is(kGWZipArchiveErrorDomain,
+                                           GWZipArchiveUnsupportedCompressionMethodError));
+        EXPECT_EQ(operation->error()->detailString(kGWZipArchiveUnknownEntityErrorKey),
+                  std::to_string(method));
+        EXPECT_TRUE(capture.contains("unsupported compression method: " + std::to_string(method)));
+        // The handler hears of the failure once, with no data.
+        ASSERT_EQ(log.doneFlags.size(), 1u);
+        EXPECT_TRUE(log.doneFlags[0]);
+        EXPECT_FALSE(log.hadData[0]);
+        EXPECT_EQ(log.errors[0], operation->error());
+    }
+    // Shrink and implode need the entry's size and flags.
+    for (std::uint16_t method : {1, 6}) {
+        GWErrorPtr error;
+        EXPECT_EQ(GWZipWorkOperation().decompressorForFile(nullptr, method, &error), nullptr);
+        ASSERT_NE(error, nullptr);
+        EXPECT_TRUE(error->is(kGWPOSIXErrorDomain, EINVAL));
+    }
 }
 
 // --- Integrity: what is written is what the archive holds, or an error --------
@@ -576,11 +589,28 @@ TEST_F(GWZipExtractOperationTest, ACancelledOperationEndsWithoutTouchingTheDisk)
 
 // --- Local headers -----------------------------------------------------------------
 
-TEST_F(GWZipExtractOperationTest, AForeignLocalHeaderIsCorruptAndLogged) {
+TEST_F(GWZipExtractOperationTest, ShortOrForeignLocalHeadersAreCorruptAndLogged) {
     ZipBuilder zip;
     zip.prefix = GWData(64, 0);
     zip.addFile("a.txt", bytesOf("abc"));
     write(zip);
+    const GWData bytes = zip.bytes();
+    const GWData exact(bytes.begin() + 64, bytes.begin() + 64 + 30);
+    GWZipLocalFileHeader record;
+    GWZipWorkOperation reader;
+    EXPECT_TRUE(reader.readLocalHeaderRecord(&record, exact, nullptr));
+    std::vector<GWData> bad = {GWData(exact.begin(), exact.end() - 1), {}};
+    for (std::size_t i = 0; i < 4; ++i) {
+        bad.push_back(exact);
+        bad.back()[i] ^= 0x20;
+    }
+    for (const GWData& header : bad) {
+        GWErrorPtr error;
+        EXPECT_FALSE(reader.readLocalHeaderRecord(&record, header, &error));
+        ASSERT_NE(error, nullptr);
+        EXPECT_TRUE(error->is(kGWCocoaErrorDomain, GWFileReadCorruptFileError));
+    }
+
     auto entry = zipEntryFromBuilder(zip, 0);
     entry->setLocalHeaderOffset(entry->localHeaderOffset() + 1);
     ZipLogCapture capture;
