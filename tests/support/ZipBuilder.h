@@ -149,24 +149,4 @@ private:
     std::vector<std::uint64_t> storedSizes_;
 };
 
-// A minimal reader for archives made by other tools: the central records
-// and the local extra fields, enough to check what they wrote. No Zip64; a
-// prefix before the archive is allowed.
-struct ZipRecord {
-    std::string name;
-    std::uint16_t versionMadeBy = 0;
-    std::uint16_t flags = 0;
-    std::uint16_t method = 0;
-    std::uint32_t crc32 = 0;
-    std::uint32_t compressedSize = 0;
-    std::uint32_t uncompressedSize = 0;
-    std::uint32_t externalAttributes = 0;
-    std::uint32_t localHeaderOffset = 0;
-    GWData centralExtra;
-    GWData localExtra;
-    GWData localHeader;  // the 30 fixed bytes
-};
-// Empty when the bytes are not a ZIP this reader understands.
-std::vector<ZipRecord> readZipRecords(const GWData& archive);
-
 }  // namespace gwtest
