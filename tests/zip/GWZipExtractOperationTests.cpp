@@ -280,6 +280,17 @@ TEST_F(GWZipExtractOperationTest, UnsupportedMethodsAreRefusedWithTheirNumber) {
         EXPECT_FALSE(log.hadData[0]);
         EXPECT_EQ(log.errors[0], operation->error());
     }
+    // Strong encryption is refused the same way, whatever the method.
+    ZipBuilder strong;
+    strong.addFile("s.bin", bytesOf("data"), 8).flags = 0x0041;
+    write(strong);
+    DataHandlerLog log;
+    auto operation = toHandler(zipEntryFromBuilder(strong, 0), log);
+    runToEnd(operation);
+    ASSERT_TRUE(operation->error());
+    EXPECT_TRUE(operation->error()->is(kGWZipArchiveErrorDomain,
+                                       GWZipArchiveUnsupportedCompressionMethodError))
+        << operation->error()->localizedDescription();
     // Shrink and implode need the entry's size and flags.
     for (std::uint16_t method : {1, 6}) {
         GWErrorPtr error;
