@@ -8,8 +8,8 @@
 #include "foundation/GWDecompressor.h"
 #include "foundation/decoders/GWStreamDecoder.h"
 #include "support/DecoderTestSupport.h"
-#include "support/MinimalZip.h"
 #include "support/TestSupport.h"
+#include "support/ZipBuilder.h"
 #include "support/ZipLegacyEncoders.h"
 
 namespace {
@@ -405,30 +405,25 @@ TEST(GWLegacyDecoders, PeerToolsAcceptEncoderOutput) {
     const GWData binary = binaryBytes(120000, 62);
     const GWData random = gwtest::randomBytes(90000, 63);
     gwtest::ShrinkStats stats;
-    std::vector<gwtest::MinimalZipEntry> entries = {
-        gwtest::minimalZipEntry("shrunk-text", kShrunk, 0, gwtest::shrinkBytes(text, {9}, &stats),
-                                text),
-        gwtest::minimalZipEntry("shrunk-random", kShrunk, 0, gwtest::shrinkBytes(random), random),
-        gwtest::minimalZipEntry("shrunk-byte", kShrunk, 0, gwtest::shrinkBytes({'q'}), {'q'}),
-        // The stream of CodesMayBuildOnTheSlotTheyComplete.
-        gwtest::minimalZipEntry("shrunk-by-hand", kShrunk, 0,
-                                shrinkCodes({'a', 'b', 'c', 258, 256, 2, 'x', 257}),
-                                gwtest::bytesOf("abcbcxxxx")),
-    };
+    gwtest::ZipBuilder zip;
+    zip.addEncoded("shrunk-text", text, kShrunk, gwtest::shrinkBytes(text, {9}, &stats));
+    zip.addEncoded("shrunk-random", random, kShrunk, gwtest::shrinkBytes(random));
+    zip.addEncoded("shrunk-byte", {'q'}, kShrunk, gwtest::shrinkBytes({'q'}));
+    // The stream of CodesMayBuildOnTheSlotTheyComplete.
+    zip.addEncoded("shrunk-by-hand", gwtest::bytesOf("abcbcxxxx"), kShrunk,
+                   shrinkCodes({'a', 'b', 'c', 258, 256, 2, 'x', 257}));
     ASSERT_GT(stats.partialClears, 0);
     for (const ImplodeSettings& settings : kImplodeSettings) {
         const std::string suffix = std::string(settings.largeDictionary ? "-8k" : "-4k") +
                                    (settings.literalTree ? "-3" : "-2");
-        entries.push_back(gwtest::minimalZipEntry("imploded-text" + suffix, kImploded,
-                                                  settings.flags(),
-                                                  gwtest::implodeBytes(text, settings), text));
-        entries.push_back(gwtest::minimalZipEntry("imploded-binary" + suffix, kImploded,
-                                                  settings.flags(),
-                                                  gwtest::implodeBytes(binary, settings), binary));
+        zip.addEncoded("imploded-text" + suffix, text, kImploded,
+                       gwtest::implodeBytes(text, settings), settings.flags());
+        zip.addEncoded("imploded-binary" + suffix, binary, kImploded,
+                       gwtest::implodeBytes(binary, settings), settings.flags());
     }
     gwtest::TemporaryDirectory directory;
     const std::string path = directory.file("legacy.zip");
-    gwtest::writeMinimalZip(path, entries);
+    zip.write(path);
 
     const std::tuple<bool, const char*, const char*> checks[] = {
         {haveUnzip, "unzip -t ", "No errors detected"}, {have7zz, "7zz t ", "Everything is Ok"}};

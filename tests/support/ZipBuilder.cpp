@@ -3,6 +3,7 @@
 #include <bzlib.h>
 #include <zlib.h>
 
+#include <algorithm>
 #include <stdexcept>
 
 #include "TestSupport.h"
@@ -113,6 +114,14 @@ ZipEntry& ZipBuilder::addFile(const std::string& name, GWData content, std::uint
     return add(std::move(entry));
 }
 
+ZipEntry& ZipBuilder::addEncoded(const std::string& name, GWData content, std::uint16_t method,
+                                 GWData stored, std::uint16_t flags) {
+    ZipEntry& entry = addFile(name, std::move(content), method);
+    entry.stored = std::move(stored);
+    entry.flags = flags;
+    return entry;
+}
+
 ZipEntry& ZipBuilder::addDirectory(const std::string& name) {
     ZipEntry entry;
     entry.name = bytesOf(name);
@@ -128,128 +137,152 @@ ZipEntry& ZipBuilder::addSymlink(const std::string& name, const std::string& tar
     return add(std::move(entry));
 }
 
-GWData ZipBuilder::bytes() const {
-    GWData out = prefix;
-    const std::uint64_t base = offsetsIncludePrefix ? 0 : prefix.size();
-    GWData directory;
-    offsets_.clear();
-    for (const ZipEntry& entry : entries_) {
-        const GWData stored = entry.storedBytes();
-        const std::uint32_t crc = entry.effectiveCRC32();
-        const std::uint64_t compressed = entry.compressedSize.value_or(stored.size());
-        const std::uint64_t uncompressed = entry.uncompressedSize.value_or(entry.content.size());
-        const std::uint16_t flags = entry.flags | (entry.dataDescriptor ? 0x0008 : 0);
-        const std::uint64_t offset = out.size() - base;
-        offsets_.push_back(out.size());
+namespace {
 
-        if (!entry.omitLocalHeader) {
-            const GWData& localName = entry.localName ? *entry.localName : entry.name;
-            GWData localExtra = entry.localExtra;
-            const std::uint64_t localCompressed = entry.localCompressedSize.value_or(compressed);
-            const std::uint64_t localUncompressed =
-                entry.localUncompressedSize.value_or(uncompressed);
-            if (entry.zip64Sizes) {
-                append(localExtra, zip64Block({localUncompressed, localCompressed}));
-            }
-            put32(out, 0x04034B50);
-            put16(out, entry.versionNeeded);
-            put16(out, flags);
-            put16(out, entry.method);
-            put16(out, entry.dosTime);
-            put16(out, entry.dosDate);
-            if (entry.dataDescriptor) {
-                put32(out, entry.localCRC32.value_or(0));
-                put32(out, entry.localCompressedSize.value_or(0));
-                put32(out, entry.localUncompressedSize.value_or(0));
-            } else {
-                put32(out, entry.localCRC32.value_or(crc));
-                put32(out, entry.zip64Sizes ? kEscaped32 : localCompressed);
-                put32(out, entry.zip64Sizes ? kEscaped32 : localUncompressed);
-            }
-            put16(out, localName.size());
-            put16(out, localExtra.size());
-            append(out, localName);
-            append(out, localExtra);
-            append(out, stored);
-            if (entry.dataDescriptor) {
-                if (entry.dataDescriptorSignature) {
-                    put32(out, 0x08074B50);
-                }
-                put32(out, crc);
-                if (entry.zip64Sizes) {
-                    put64(out, compressed);
-                    put64(out, uncompressed);
-                } else {
-                    put32(out, compressed);
-                    put32(out, uncompressed);
-                }
-            }
-        }
+// Appends the member's local header, data and descriptor to `out` and its
+// central record, saying the local header is at `offset`, to `directory`.
+void appendZipEntry(const ZipEntry& entry, std::uint64_t offset, GWData& out, GWData& directory) {
+    const GWData stored = entry.storedBytes();
+    const std::uint32_t crc = entry.effectiveCRC32();
+    const std::uint64_t compressed = entry.compressedSize.value_or(stored.size());
+    const std::uint64_t uncompressed = entry.uncompressedSize.value_or(entry.content.size());
+    const std::uint16_t flags = entry.flags | (entry.dataDescriptor ? 0x0008 : 0);
 
-        GWData centralExtra = entry.centralExtra;
-        std::vector<std::uint64_t> escaped;
+    if (!entry.omitLocalHeader) {
+        const GWData& localName = entry.localName ? *entry.localName : entry.name;
+        GWData localExtra = entry.localExtra;
+        const std::uint64_t localCompressed = entry.localCompressedSize.value_or(compressed);
+        const std::uint64_t localUncompressed = entry.localUncompressedSize.value_or(uncompressed);
         if (entry.zip64Sizes) {
-            escaped = {uncompressed, compressed};
+            append(localExtra, zip64Block({localUncompressed, localCompressed}));
         }
-        const std::uint64_t recordedOffset = entry.centralLocalHeaderOffset.value_or(offset);
-        if (entry.zip64Offset) {
-            escaped.push_back(recordedOffset);
+        put32(out, 0x04034B50);
+        put16(out, entry.versionNeeded);
+        put16(out, flags);
+        put16(out, entry.method);
+        put16(out, entry.dosTime);
+        put16(out, entry.dosDate);
+        if (entry.dataDescriptor) {
+            put32(out, entry.localCRC32.value_or(0));
+            put32(out, entry.localCompressedSize.value_or(0));
+            put32(out, entry.localUncompressedSize.value_or(0));
+        } else {
+            put32(out, entry.localCRC32.value_or(crc));
+            put32(out, entry.zip64Sizes ? kEscaped32 : localCompressed);
+            put32(out, entry.zip64Sizes ? kEscaped32 : localUncompressed);
         }
-        if (!escaped.empty()) {
-            append(centralExtra, zip64Block(escaped));
+        put16(out, localName.size());
+        put16(out, localExtra.size());
+        append(out, localName);
+        append(out, localExtra);
+        append(out, stored);
+        if (entry.dataDescriptor) {
+            if (entry.dataDescriptorSignature) {
+                put32(out, 0x08074B50);
+            }
+            put32(out, crc);
+            if (entry.zip64Sizes) {
+                put64(out, compressed);
+                put64(out, uncompressed);
+            } else {
+                put32(out, compressed);
+                put32(out, uncompressed);
+            }
         }
-        put32(directory, 0x02014B50);
-        put16(directory, std::uint16_t(entry.host) << 8 | entry.madeByVersion);
-        put16(directory, entry.versionNeeded);
-        put16(directory, flags);
-        put16(directory, entry.method);
-        put16(directory, entry.dosTime);
-        put16(directory, entry.dosDate);
-        put32(directory, crc);
-        put32(directory, entry.zip64Sizes ? kEscaped32 : compressed);
-        put32(directory, entry.zip64Sizes ? kEscaped32 : uncompressed);
-        put16(directory, entry.name.size());
-        put16(directory, centralExtra.size());
-        put16(directory, entry.comment.size());
-        put16(directory, entry.diskNumberStart);
-        put16(directory, entry.internalAttributes);
-        put32(directory, entry.externalAttributes);
-        put32(directory, entry.zip64Offset ? kEscaped32 : recordedOffset);
-        append(directory, entry.name);
-        append(directory, centralExtra);
-        append(directory, entry.comment);
     }
 
-    const std::uint64_t directoryOffset = out.size() - base;
-    append(out, directory);
-    const std::uint64_t count = entries_.size();
-    if (zip64EndRecord) {
-        const std::uint64_t recordOffset = out.size() - base;
+    GWData centralExtra = entry.centralExtra;
+    std::vector<std::uint64_t> escaped;
+    if (entry.zip64Sizes) {
+        escaped = {uncompressed, compressed};
+    }
+    const std::uint64_t recordedOffset = entry.centralLocalHeaderOffset.value_or(offset);
+    if (entry.zip64Offset) {
+        escaped.push_back(recordedOffset);
+    }
+    if (!escaped.empty()) {
+        append(centralExtra, zip64Block(escaped));
+    }
+    put32(directory, 0x02014B50);
+    put16(directory, std::uint16_t(entry.host) << 8 | entry.madeByVersion);
+    put16(directory, entry.versionNeeded);
+    put16(directory, flags);
+    put16(directory, entry.method);
+    put16(directory, entry.dosTime);
+    put16(directory, entry.dosDate);
+    put32(directory, crc);
+    put32(directory, entry.zip64Sizes ? kEscaped32 : compressed);
+    put32(directory, entry.zip64Sizes ? kEscaped32 : uncompressed);
+    put16(directory, entry.name.size());
+    put16(directory, centralExtra.size());
+    put16(directory, entry.comment.size());
+    put16(directory, entry.diskNumberStart);
+    put16(directory, entry.internalAttributes);
+    put32(directory, entry.externalAttributes);
+    put32(directory, entry.zip64Offset ? kEscaped32 : recordedOffset);
+    append(directory, entry.name);
+    append(directory, centralExtra);
+    append(directory, entry.comment);
+}
+
+// The Zip64 end record and locator when asked for, then the classic end
+// record; `recordOffset` is where the Zip64 record begins.
+struct EndRecords {
+    std::uint64_t count = 0;
+    std::uint64_t directorySize = 0;
+    std::uint64_t directoryOffset = 0;
+    std::uint64_t recordOffset = 0;
+    bool zip64 = false;
+    std::optional<std::uint16_t> entryCount;
+    std::optional<std::uint32_t> size;
+    std::optional<std::uint32_t> offset;
+};
+
+void appendEndRecords(const EndRecords& end, GWData& out) {
+    if (end.zip64) {
         put32(out, 0x06064B50);
         put64(out, 44);  // size of the rest of the record
         put16(out, kZipHostUnix << 8 | 45);
         put16(out, 45);
         put32(out, 0);
         put32(out, 0);
-        put64(out, count);
-        put64(out, count);
-        put64(out, directory.size());
-        put64(out, directoryOffset);
+        put64(out, end.count);
+        put64(out, end.count);
+        put64(out, end.directorySize);
+        put64(out, end.directoryOffset);
         put32(out, 0x07064B50);
         put32(out, 0);
-        put64(out, recordOffset + (offsetsIncludePrefix ? 0 : prefix.size()));
+        put64(out, end.recordOffset);
         put32(out, 1);
     }
     put32(out, 0x06054B50);
     put16(out, 0);
     put16(out, 0);
-    const std::uint16_t shortCount = zip64EndRecord ? 0xFFFF : std::uint16_t(count);
-    put16(out, endRecordEntryCount.value_or(shortCount));
-    put16(out, endRecordEntryCount.value_or(shortCount));
-    put32(out,
-          endRecordCentralDirectorySize.value_or(zip64EndRecord ? kEscaped32 : directory.size()));
-    put32(out,
-          endRecordCentralDirectoryOffset.value_or(zip64EndRecord ? kEscaped32 : directoryOffset));
+    const std::uint16_t shortCount = end.zip64 ? 0xFFFF : std::uint16_t(end.count);
+    put16(out, end.entryCount.value_or(shortCount));
+    put16(out, end.entryCount.value_or(shortCount));
+    put32(out, end.size.value_or(end.zip64 ? kEscaped32 : end.directorySize));
+    put32(out, end.offset.value_or(end.zip64 ? kEscaped32 : end.directoryOffset));
+}
+
+}  // namespace
+
+GWData ZipBuilder::bytes() const {
+    GWData out = prefix;
+    const std::uint64_t base = offsetsIncludePrefix ? 0 : prefix.size();
+    GWData directory;
+    offsets_.clear();
+    for (const ZipEntry& entry : entries_) {
+        offsets_.push_back(out.size());
+        appendZipEntry(entry, out.size() - base, out, directory);
+    }
+    const std::uint64_t directoryOffset = out.size() - base;
+    append(out, directory);
+    appendEndRecords(
+        {entries_.size(), directory.size(), directoryOffset,
+         out.size() - base + (offsetsIncludePrefix ? 0 : prefix.size()), zip64EndRecord,
+         endRecordEntryCount, endRecordCentralDirectorySize, endRecordCentralDirectoryOffset},
+        out);
     put16(out, archiveComment.size());
     append(out, archiveComment);
     return out;
@@ -259,61 +292,60 @@ void ZipBuilder::write(const std::string& path) const {
     writeFile(path, bytes());
 }
 
-std::vector<ZipRecord> readZipRecords(const GWData& archive) {
-    auto u16 = [&](std::size_t at) -> std::uint32_t {
-        return at + 2 <= archive.size() ? archive[at] | archive[at + 1] << 8 : 0;
-    };
-    auto u32 = [&](std::size_t at) -> std::uint32_t { return u16(at) | u16(at + 2) << 16; };
-    auto slice = [&](std::size_t at, std::size_t length) {
-        return at + length <= archive.size()
-                   ? GWData(archive.begin() + at, archive.begin() + at + length)
-                   : GWData();
-    };
-    if (archive.size() < 22) {
-        return {};
+StreamingZipWriter::StreamingZipWriter(const std::string& path)
+    : out_(path, std::ios::binary | std::ios::trunc) {}
+
+void StreamingZipWriter::writeHeaders(const ZipEntry& entry, std::uint64_t storedSize) {
+    GWData local;
+    appendZipEntry(entry, offset_, local, directory_);
+    out_.write(reinterpret_cast<const char*>(local.data()), std::streamsize(local.size()));
+    offset_ += local.size() - (entry.stored ? entry.stored->size() : 0) + storedSize;
+    storedSizes_.push_back(storedSize);
+}
+
+void StreamingZipWriter::add(const std::string& name, const GWData& content, std::uint16_t method) {
+    ZipEntry entry;
+    entry.name = bytesOf(name);
+    entry.content = content;
+    entry.method = method;
+    entry.stored = zipCompress(content, method);
+    writeHeaders(entry, entry.stored->size());
+}
+
+void StreamingZipWriter::addZeros(const std::string& name, std::uint64_t size) {
+    const GWData zeros(1 << 20, 0);
+    uLong crc = ::crc32(0, nullptr, 0);
+    for (std::uint64_t done = 0; done < size;) {
+        const std::size_t piece = std::size_t(std::min<std::uint64_t>(zeros.size(), size - done));
+        crc = ::crc32(crc, zeros.data(), uInt(piece));
+        done += piece;
     }
-    std::size_t end = archive.size() - 22;
-    while (u32(end) != 0x06054B50) {
-        if (end == 0) {
-            return {};
-        }
-        --end;
-    }
-    // Offsets count from the archive's start, which a prefix moves.
-    const std::size_t directorySize = u32(end + 12), directoryOffset = u32(end + 16);
-    if (directorySize + directoryOffset > end) {
-        return {};
-    }
-    const std::size_t shift = end - directorySize - directoryOffset;
-    std::vector<ZipRecord> records;
-    std::size_t at = directoryOffset + shift;
-    for (std::uint32_t i = 0, count = u16(end + 10); i < count; ++i) {
-        if (u32(at) != 0x02014B50 || at + 46 > archive.size()) {
-            return {};
-        }
-        ZipRecord record;
-        record.versionMadeBy = std::uint16_t(u16(at + 4));
-        record.flags = std::uint16_t(u16(at + 8));
-        record.method = std::uint16_t(u16(at + 10));
-        record.crc32 = u32(at + 16);
-        record.compressedSize = u32(at + 20);
-        record.uncompressedSize = u32(at + 24);
-        const std::size_t nameLength = u16(at + 28), extraLength = u16(at + 30);
-        const std::size_t commentLength = u16(at + 32);
-        record.externalAttributes = u32(at + 38);
-        record.localHeaderOffset = u32(at + 42);
-        const GWData name = slice(at + 46, nameLength);
-        record.name.assign(name.begin(), name.end());
-        record.centralExtra = slice(at + 46 + nameLength, extraLength);
-        const std::size_t local = record.localHeaderOffset + shift;
-        record.localHeader = slice(local, 30);
-        if (u32(local) == 0x04034B50) {
-            record.localExtra = slice(local + 30 + u16(local + 26), u16(local + 28));
-        }
-        records.push_back(std::move(record));
-        at += 46 + nameLength + extraLength + commentLength;
-    }
-    return records;
+    ZipEntry entry;
+    entry.name = bytesOf(name);
+    entry.stored = GWData();
+    entry.crc32 = std::uint32_t(crc);
+    entry.compressedSize = entry.uncompressedSize = size;
+    writeHeaders(entry, size);
+    // Skipping over the data leaves a hole that reads back as zeros.
+    out_.seekp(std::streamoff(offset_));
+}
+
+bool StreamingZipWriter::finish() {
+    const std::uint64_t directoryOffset = offset_;
+    GWData end = directory_;
+    appendEndRecords({storedSizes_.size(),
+                      directory_.size(),
+                      directoryOffset,
+                      directoryOffset + directory_.size(),
+                      storedSizes_.size() > 0xFFFF,
+                      {},
+                      {},
+                      {}},
+                     end);
+    put16(end, 0);
+    out_.write(reinterpret_cast<const char*>(end.data()), std::streamsize(end.size()));
+    out_.close();
+    return !out_.fail();
 }
 
 }  // namespace gwtest

@@ -1,6 +1,7 @@
 #pragma once
 
 #include <cstdint>
+#include <fstream>
 #include <optional>
 #include <string>
 #include <vector>
@@ -89,6 +90,9 @@ class ZipBuilder {
 public:
     ZipEntry& add(ZipEntry entry);
     ZipEntry& addFile(const std::string& name, GWData content, std::uint16_t method = 0);
+    // `stored` is what an encoder of `method` (with its `flags`) made of `content`.
+    ZipEntry& addEncoded(const std::string& name, GWData content, std::uint16_t method,
+                         GWData stored, std::uint16_t flags = 0);
     // Name should end in "/"; a Unix directory mode.
     ZipEntry& addDirectory(const std::string& name);
     // A Unix symbolic link whose data is the target.
@@ -119,24 +123,30 @@ private:
     mutable std::vector<std::uint64_t> offsets_;
 };
 
-// A minimal reader for archives made by other tools: the central records
-// and the local extra fields, enough to check what they wrote. No Zip64; a
-// prefix before the archive is allowed.
-struct ZipRecord {
-    std::string name;
-    std::uint16_t versionMadeBy = 0;
-    std::uint16_t flags = 0;
-    std::uint16_t method = 0;
-    std::uint32_t crc32 = 0;
-    std::uint32_t compressedSize = 0;
-    std::uint32_t uncompressedSize = 0;
-    std::uint32_t externalAttributes = 0;
-    std::uint32_t localHeaderOffset = 0;
-    GWData centralExtra;
-    GWData localExtra;
-    GWData localHeader;  // the 30 fixed bytes
+// Writes large archives straight to disk, member by member, for tests that
+// need more entries or bytes than a ZipBuilder should hold in memory. More
+// than 65535 members get a Zip64 end record.
+class StreamingZipWriter {
+public:
+    explicit StreamingZipWriter(const std::string& path);
+
+    // `content` stored (method 0) or deflated (8).
+    void add(const std::string& name, const GWData& content, std::uint16_t method = 0);
+    // A stored member of `size` zero bytes, left as a hole in the file.
+    void addZeros(const std::string& name, std::uint64_t size);
+    // Writes the central directory and the end records; false on a write error.
+    bool finish();
+
+    std::uint64_t centralDirectorySize() const { return directory_.size(); }
+    std::uint64_t storedSize(std::size_t index) const { return storedSizes_[index]; }
+
+private:
+    void writeHeaders(const ZipEntry& entry, std::uint64_t storedSize);
+
+    std::ofstream out_;
+    std::uint64_t offset_ = 0;
+    GWData directory_;
+    std::vector<std::uint64_t> storedSizes_;
 };
-// Empty when the bytes are not a ZIP this reader understands.
-std::vector<ZipRecord> readZipRecords(const GWData& archive);
 
 }  // namespace gwtest

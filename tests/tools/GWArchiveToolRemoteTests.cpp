@@ -14,7 +14,6 @@
 #include "ToolTestSupport.h"
 #include "support/ScriptedHTTPServer.h"
 #include "support/ServedFolderTest.h"
-#include "support/StreamingZipWriter.h"
 #include "support/XarBuilder.h"
 #include "support/ZipBuilder.h"
 #include "xar/XarTestSupport.h"

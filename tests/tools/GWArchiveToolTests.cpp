@@ -14,7 +14,6 @@
 #include "ToolTestSupport.h"
 #include "support/AppleDoubleBuilder.h"
 #include "support/MacBinaryBuilder.h"
-#include "support/StreamingZipWriter.h"
 #include "support/XarBuilder.h"
 #include "support/XarSigning.h"
 #include "support/ZipBuilder.h"

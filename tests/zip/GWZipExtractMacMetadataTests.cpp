@@ -51,30 +51,6 @@ protected:
     std::string archivePath = directory.file("archive.zip");
 };
 
-TEST_F(GWZipExtractMacMetadata, AnAppleDoubleCompanionGivesFinderInfoForkAndAttributes) {
-    AppleDoubleFile companion;
-    companion.finderInfo = finderInfoBytes("TEXT", "R*ch", 0x0100, 12, 34);
-    companion.attributes = {{"com.example.label", bytesOf("blue")}};
-    companion.resourceFork = randomBytes(3000, 4);
-    ZipBuilder zip;
-    zip.addFile("Document.txt", bytesOf("the data fork"), 8);
-    zip.addFile("__MACOSX/._Document.txt", buildAppleDouble(companion), 8);
-    zip.write(archivePath);
-    auto file = zipEntryFromBuilder(zip, 0);
-    file->setAppleDoubleFile(zipEntryFromBuilder(zip, 1));
-
-    auto operation = extract(file, "Document.txt");
-    ASSERT_FALSE(operation->error()) << operation->error()->localizedDescription();
-    EXPECT_EQ(readFile(directory.file("Document.txt")), bytesOf("the data fork"));
-    EXPECT_EQ(attribute("Document.txt", "com.apple.ResourceFork"), companion.resourceFork);
-    EXPECT_EQ(attribute("Document.txt", "com.example.label"), bytesOf("blue"));
-    auto info = GWFileInfo::initWithURL(directory.url("Document.txt"), nullptr);
-    ASSERT_TRUE(info);
-    EXPECT_EQ(info->typeCode(), GWFourCharCode("TEXT"));
-    EXPECT_EQ(info->creatorCode(), GWFourCharCode("R*ch"));
-    EXPECT_EQ(info->finderFlags(), 0x0100);
-}
-
 TEST_F(GWZipExtractMacMetadata, AnUnmergeableCompanionIsNoFailure) {
     ZipBuilder zip;
     zip.addFile("a.txt", bytesOf("data"));
@@ -88,8 +64,9 @@ TEST_F(GWZipExtractMacMetadata, AnUnmergeableCompanionIsNoFailure) {
 }
 
 // --- A resource fork arrives whole, whichever way it travels -----------------
+// With it come the Finder information and attributes its carrier holds.
 
-enum class ForkCarrier { resourceForkMember, appleDouble, macBinary };
+enum class ForkCarrier { resourceForkMember, appleDouble, macBinary, macBinarySmartZip };
 
 struct ForkCase {
     const char* label;
@@ -109,19 +86,37 @@ TEST_P(GWZipExtractForks, TheForkIsWholeOrWarnedAbout) {
     const GWData fork = randomBytes(200000, 9);
     const GWData data = bytesOf("the data fork");
     const std::string name = c.longName ? std::string(NAME_MAX - 1, 'n') : "Icon";
+    const bool macBinary =
+        c.carrier == ForkCarrier::macBinary || c.carrier == ForkCarrier::macBinarySmartZip;
+    const bool finderInfo = !c.longName && c.carrier != ForkCarrier::resourceForkMember;
     ZipBuilder zip;
-    if (c.carrier == ForkCarrier::macBinary) {
+    if (macBinary) {
         MacBinaryFile mac;
+        mac.type = "TEXT";
+        mac.creator = "R*ch";
+        mac.finderFlags = 0x0100;
         mac.dataFork = data;
         mac.resourceFork = fork;
         ZipEntry& entry = zip.addFile(name, buildMacBinary(mac), 8);
-        entry.centralExtra =
-            zipExtraBlock(0x2605, zipItPayload(std::string("Icon"), "TEXT", "ttxt", 0));
+        if (c.carrier == ForkCarrier::macBinarySmartZip) {
+            SmartZipInfo info;
+            info.type = "TEXT";
+            info.creator = "R*ch";
+            info.finderFlags = 0x0100;
+            entry.centralExtra = zipExtraBlock(0x4D63, smartZipPayload(info));
+        } else {
+            entry.centralExtra =
+                zipExtraBlock(0x2605, zipItPayload(std::string("Icon"), "TEXT", "R*ch", 0x0100));
+        }
     } else {
         zip.addFile(name, data, 8);
         if (c.carrier == ForkCarrier::appleDouble) {
             AppleDoubleFile companion;
             companion.resourceFork = fork;
+            if (finderInfo) {
+                companion.finderInfo = finderInfoBytes("TEXT", "R*ch", 0x0100, 12, 34);
+                companion.attributes = {{"com.example.label", bytesOf("blue")}};
+            }
             zip.addFile("__MACOSX/._" + name, buildAppleDouble(companion), 8);
         } else {
             zip.addFile("XtraStuf.mac/" + name, fork, 8);
@@ -148,6 +143,16 @@ TEST_P(GWZipExtractForks, TheForkIsWholeOrWarnedAbout) {
     EXPECT_EQ(attribute(name, "com.apple.ResourceFork"),
               c.longName ? std::nullopt : std::optional(fork));
     EXPECT_EQ(logged.size(), c.longName ? 1u : 0u);
+    if (finderInfo) {
+        auto info = GWFileInfo::initWithURL(directory.url(name), nullptr);
+        ASSERT_TRUE(info);
+        EXPECT_EQ(info->typeCode(), GWFourCharCode("TEXT"));
+        EXPECT_EQ(info->creatorCode(), GWFourCharCode("R*ch"));
+        EXPECT_EQ(info->finderFlags(), 0x0100);
+    }
+    if (finderInfo && !macBinary) {
+        EXPECT_EQ(attribute(name, "com.example.label"), bytesOf("blue"));
+    }
     // Nothing but the archive and the file: no temporary copy, no stray side file.
     std::size_t items = 0;
     for (const auto& item : std::filesystem::directory_iterator(directory.path())) {
@@ -162,47 +167,11 @@ INSTANTIATE_TEST_SUITE_P(
                       ForkCase{"ResourceForkMemberInPlace", ForkCarrier::resourceForkMember, false},
                       ForkCase{"AppleDouble", ForkCarrier::appleDouble},
                       ForkCase{"MacBinary", ForkCarrier::macBinary},
+                      ForkCase{"MacBinarySmartZip", ForkCarrier::macBinarySmartZip},
                       ForkCase{"LongNameAtomically", ForkCarrier::resourceForkMember, true, true},
                       ForkCase{"LongNameInPlace", ForkCarrier::resourceForkMember, false, true},
                       ForkCase{"LongNameAppleDouble", ForkCarrier::appleDouble, false, true}),
     [](const auto& info) { return std::string(info.param.label); });
-
-TEST_F(GWZipExtractMacMetadata, AMacBinaryMemberBecomesItsDataForkWithForkAndFinderInfo) {
-    MacBinaryFile mac;
-    mac.type = "APPL";
-    mac.creator = "CARO";
-    mac.finderFlags = 0x2000;
-    mac.dataFork = textBytes(1000, 3);
-    mac.resourceFork = randomBytes(700, 5);
-    for (bool smartZip : {false, true}) {
-        SCOPED_TRACE(smartZip ? "SmartZIP" : "ZipIt");
-        ZipBuilder zip;
-        ZipEntry& entry = zip.addFile("Program.bin", buildMacBinary(mac), 8);
-        if (smartZip) {
-            SmartZipInfo info;
-            info.type = "APPL";
-            info.creator = "CARO";
-            info.finderFlags = 0x2000;
-            entry.centralExtra = zipExtraBlock(0x4D63, smartZipPayload(info));
-        } else {
-            entry.centralExtra =
-                zipExtraBlock(0x2605, zipItPayload(std::string("Program"), "APPL", "CARO", 0x2000));
-        }
-        zip.write(archivePath);
-        auto file = zipEntryFromBuilder(zip, 0);
-        ASSERT_TRUE(file->isMacBinaryEncoded());
-        const std::string name = smartZip ? "smart" : "zipit";
-        auto operation = extract(file, name);
-        ASSERT_FALSE(operation->error()) << operation->error()->localizedDescription();
-        EXPECT_EQ(readFile(directory.file(name)), mac.dataFork);
-        EXPECT_EQ(attribute(name, "com.apple.ResourceFork"), mac.resourceFork);
-        auto info = GWFileInfo::initWithURL(directory.url(name), nullptr);
-        ASSERT_TRUE(info);
-        EXPECT_EQ(info->typeCode(), GWFourCharCode("APPL"));
-        EXPECT_EQ(info->creatorCode(), GWFourCharCode("CARO"));
-        EXPECT_EQ(info->finderFlags(), 0x2000);
-    }
-}
 
 TEST_F(GWZipExtractMacMetadata, ABrokenMacBinaryMemberFailsAndLeavesNoDecodedFile) {
     ZipBuilder zip;

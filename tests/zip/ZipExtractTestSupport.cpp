@@ -30,19 +30,6 @@ GWZipFilePtr zipEntryFromBuilder(const ZipBuilder& zip, std::size_t index,
     return file;
 }
 
-GWZipFilePtr zipEntryFromRecord(const ZipRecord& record) {
-    const std::uint32_t crc = record.crc32;
-    GWData checksum{std::uint8_t(crc), std::uint8_t(crc >> 8), std::uint8_t(crc >> 16),
-                    std::uint8_t(crc >> 24)};
-    GWZipWorkOperation decoder;
-    auto info = decoder.infoFromExtraFieldData(record.centralExtra, false, nullptr);
-    return GWZipFile::initWithName(std::string(GWZipLastPOSIXPathComponent(record.name)), nullptr,
-                                   record.compressedSize, record.uncompressedSize, checksum, 1, 0,
-                                   0, std::uint16_t(record.externalAttributes >> 16),
-                                   GWDate(1577880000), std::nullopt, record.localHeaderOffset,
-                                   record.flags, record.method, info.value_or(GWDictionary()));
-}
-
 void runToEnd(const GWZipExtractOperationPtr& operation) {
     ASSERT_TRUE(operation);
     operation->start();

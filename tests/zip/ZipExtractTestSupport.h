@@ -17,9 +17,6 @@ namespace gwtest {
 GWZipFilePtr zipEntryFromBuilder(const ZipBuilder& zip, std::size_t index,
                                  const GWZipFilePtr& parent = nullptr);
 
-// The same for a member of an archive another tool wrote.
-GWZipFilePtr zipEntryFromRecord(const ZipRecord& record);
-
 // Starts the operation on the calling thread and waits for it to finish,
 // wherever its pipeline ends.
 void runToEnd(const GWZipExtractOperationPtr& operation);

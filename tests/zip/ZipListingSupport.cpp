@@ -10,6 +10,8 @@
 
 namespace gwtest {
 
+namespace {
+
 std::string zipinfoModeString(std::uint16_t mode) {
     std::string text(10, '-');
     switch (mode & 0170000) {
@@ -36,6 +38,8 @@ std::string zipinfoTimeString(const GWDate& date) {
     return buffer;
 }
 
+}  // namespace
+
 Listing listingOfTree(const GWZipFileArray& roots) {
     Listing listing;
     std::vector<GWZipFilePtr> pending(roots.rbegin(), roots.rend());
@@ -52,20 +56,6 @@ Listing listingOfTree(const GWZipFileArray& roots) {
         }
     }
     return listing;
-}
-
-std::size_t countNodes(const GWZipFileArray& roots) {
-    std::size_t count = 0;
-    std::vector<GWZipFilePtr> pending(roots.begin(), roots.end());
-    while (!pending.empty()) {
-        GWZipFilePtr node = pending.back();
-        pending.pop_back();
-        ++count;
-        if (auto children = node->children()) {
-            pending.insert(pending.end(), children->begin(), children->end());
-        }
-    }
-    return count;
 }
 
 Listing zipinfoListing(const std::string& archivePath) {

@@ -19,14 +19,10 @@ struct ListedEntry {
 // Path (directories end in "/") -> entry.
 using Listing = std::map<std::string, ListedEntry>;
 
-std::string zipinfoModeString(std::uint16_t mode);
-std::string zipinfoTimeString(const GWDate& date);
 // Every node below the roots, companions not included.
 Listing listingOfTree(const GWZipFileArray& roots);
 // What zipinfo -T says; empty when it fails.
 Listing zipinfoListing(const std::string& archivePath);
-// Number of nodes in the tree (companions not included).
-std::size_t countNodes(const GWZipFileArray& roots);
 
 std::ostream& operator<<(std::ostream& stream, const ListedEntry& entry);
 

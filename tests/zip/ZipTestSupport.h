@@ -7,7 +7,6 @@
 #include <vector>
 
 #include "foundation/GWLog.h"
-#include "foundation/GWValue.h"
 #include "zip/GWZipWorkOperation.h"
 
 namespace gwtest {
@@ -39,17 +38,5 @@ public:
 private:
     std::optional<std::string> previous_;
 };
-
-// The value under `key`, for assertions: none when absent.
-std::optional<std::uint64_t> unsignedInfo(const GWDictionary& info, const char* key);
-std::optional<std::int64_t> signedInfo(const GWDictionary& info, const char* key);
-std::optional<std::string> stringInfo(const GWDictionary& info, const char* key);
-std::optional<double> dateInfo(const GWDictionary& info, const char* key);  // seconds since 1970
-std::optional<bool> boolInfo(const GWDictionary& info, const char* key);
-
-// Seconds since 1970 for a UTC calendar time.
-double utcSeconds(int year, int month, int day, int hour, int minute, int second);
-// NTFS ticks for seconds since 1970.
-std::uint64_t ntfsTicks(double secondsSince1970);
 
 }  // namespace gwtest
