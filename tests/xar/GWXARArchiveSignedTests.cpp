@@ -49,33 +49,15 @@ protected:
     static XarSigning& signing() { return gwtest::sharedSigning(); }
 
     // An archive signed once in `style` by `identity`, written to the directory.
-    GWURL signedArchive(const std::string& style, const gwtest::XarSigningIdentity& identity,
-                        bool corruptChecksum = false) {
+    GWURL signedArchive(const std::string& style, const gwtest::XarSigningIdentity& identity) {
         gwtest::XarBuilder builder;
-        builder.corruptStoredChecksum = corruptChecksum;
         builder.setFiles(kFiles);
         EXPECT_TRUE(signing().signArchive(builder, {{style, identity}}));
-        bytes_ = builder.bytes();
-        gwtest::writeFile(directory_.file("signed.xar"), bytes_);
+        gwtest::writeFile(directory_.file("signed.xar"), builder.bytes());
         return directory_.url("signed.xar");
     }
 
-    // The same archive with one byte of its signature flipped.
-    GWURL withDamagedSignature() {
-        auto toc = gwtest::readXarTOC(bytes_);
-        EXPECT_TRUE(toc);
-        const pugi::xml_node signature = toc->toc().child("signature");
-        const std::size_t offset =
-            std::size_t(toc->heapStart) + std::size_t(std::stoull(signature.child_value("offset")));
-        const std::size_t size = std::size_t(std::stoull(signature.child_value("size")));
-        GWData damaged = bytes_;
-        damaged.at(offset + size / 2) ^= 0x10;
-        gwtest::writeFile(directory_.file("damaged.xar"), damaged);
-        return directory_.url("damaged.xar");
-    }
-
     gwtest::TemporaryDirectory directory_;
-    GWData bytes_;
 };
 
 // Who signs, and what becomes of the archive afterwards.
@@ -255,26 +237,6 @@ TEST_F(GWXARArchiveSigned, ThreeHundredSignaturesOpenQuickly) {
     RecordProperty("openMilliseconds",
                    int(std::chrono::duration_cast<std::chrono::milliseconds>(elapsed).count()));
     EXPECT_LT(elapsed, std::chrono::milliseconds(500 * kSanitizerFactor));
-}
-
-TEST_F(GWXARArchiveSigned, ADamagedSignatureFailsACheckedOpen) {
-    gwtest::TrustedRootScope trust(signing().rootCertificateFile());
-    signedArchive("RSA", signing().leaf(XarKeyType::rsa));
-    const GWURL damaged = withDamagedSignature();
-
-    GWErrorPtr error;
-    EXPECT_FALSE(GWXARArchive::initWithURL(damaged, true, &error));
-    ASSERT_TRUE(error);
-    EXPECT_TRUE(error->is(kGWXARArchiveErrorDomain, 6)) << describe(error);
-
-    error = nullptr;
-    auto lenient = GWXARArchive::initWithURL(damaged, false, &error);
-    ASSERT_TRUE(lenient) << describe(error);
-    EXPECT_TRUE(lenient->checksumIsValid());
-    EXPECT_FALSE(lenient->signatureIsValid());
-    ASSERT_TRUE(lenient->signatureValidationError());
-    EXPECT_TRUE(lenient->signatureValidationError()->is(kGWXARArchiveErrorDomain, 6));
-    EXPECT_EQ(lenient->signatures().size(), 1u);
 }
 
 TEST_F(GWXARArchiveSigned, TheAsynchronousOpenReportsAValidSignature) {
