@@ -135,70 +135,69 @@ TEST_F(GWXARSignatureVerification, CMSSignerNotTrustedIsASecurityError) {
     EXPECT_FALSE(error->URL());
 }
 
-TEST_F(GWXARSignatureVerification, CMSBytesThatAreNoMessageAreASecurityError) {
-    SignedTOCFixture fixture({{"CMS", bytesOf("not DER at all"),
-                               XarSigning::keyInfoElement(signing().leaf(XarKeyType::rsa).chain)}},
-                             checksum_);
-    GWErrorPtr error;
-    EXPECT_FALSE(fixture.verify(&error));
-    ASSERT_TRUE(error);
-    EXPECT_EQ(error->domain(), GWSecurityErrorDomain);
-    EXPECT_NE(error->code(), 0);
-}
-
-TEST_F(GWXARSignatureVerification, CertificateTextThatIsNoCertificate) {
-    const std::string text = gwtest::base64Encode(bytesOf("this is not a certificate"));
-    const std::string keyInfo =
-        "<KeyInfo><X509Data><X509Certificate>" + text + "</X509Certificate></X509Data></KeyInfo>";
-    SignedTOCFixture fixture({{"RSA", bytesOf("sig"), keyInfo}}, checksum_);
-    GWErrorPtr error;
-    EXPECT_FALSE(fixture.verify(&error));
-    expectXARError(error, GWXARArchiveUntrustedCertificateError);
-    EXPECT_EQ(unknownEntity(error), text);
-    EXPECT_EQ(affectedNode(error), "<X509Certificate>" + text + "</X509Certificate>");
-    EXPECT_FALSE(fixture.operation().signatures());
-
-    // A certificate followed by stray bytes is not a certificate either.
+// Signature elements that cannot be checked: each fails with its error, the
+// entity it names and (a prefix of) the element it names.
+TEST_F(GWXARSignatureVerification, UncheckableSignaturesAreRefused) {
+    const std::string notCertificate = gwtest::base64Encode(bytesOf("not a certificate"));
+    const auto certificates = [](const std::string& text) {
+        return "<KeyInfo><X509Data><X509Certificate>" + text +
+               "</X509Certificate></X509Data></KeyInfo>";
+    };
     GWData padded = signing().leaf(XarKeyType::rsa).chain.front();
     padded.push_back(0);
-    SignedTOCFixture trailing({{"RSA", bytesOf("sig"), XarSigning::keyInfoElement({padded})}},
-                              checksum_);
-    EXPECT_FALSE(trailing.verify(&error));
-    expectXARError(error, GWXARArchiveUntrustedCertificateError);
-}
-
-TEST_F(GWXARSignatureVerification, CertificateTextThatIsNoBase64) {
-    const std::string keyInfo =
-        "<KeyInfo><X509Data><X509Certificate>***</X509Certificate></X509Data></KeyInfo>";
-    SignedTOCFixture fixture({{"RSA", bytesOf("sig"), keyInfo}}, checksum_);
-    GWErrorPtr error;
-    EXPECT_FALSE(fixture.verify(&error));
-    ASSERT_TRUE(error);
-    EXPECT_TRUE(error->is(kGWCocoaErrorDomain, GWFileReadCorruptFileError));
-}
-
-TEST_F(GWXARSignatureVerification, SignaturesWithoutCertificates) {
-    const GWData bytes = signedBy("RSA", XarKeyType::rsa, checksum_).bytes;
-    // KeyInfo without X509Data loads, then fails the check; so does no KeyInfo at all.
-    for (const std::string& keyInfo :
-         {std::string("<KeyInfo><KeyName>k</KeyName></KeyInfo>"), std::string()}) {
-        SignedTOCFixture fixture({{"RSA", bytes, keyInfo}}, checksum_);
+    const std::string chain = XarSigning::keyInfoElement(signing().leaf(XarKeyType::rsa).chain);
+    const std::string xar = kGWXARArchiveErrorDomain;
+    const struct {
+        std::string style, keyInfo, element;  // `element` instead of a signature with heap bytes
+        std::string domain;
+        long code;  // 0: any
+        std::string entity = {}, node = {};
+    } cases[] = {
+        {"RSA", certificates(notCertificate), "", xar, GWXARArchiveUntrustedCertificateError,
+         notCertificate, "<X509Certificate>" + notCertificate + "</X509Certificate>"},
+        // A certificate followed by stray bytes is not a certificate either.
+        {"RSA", XarSigning::keyInfoElement({padded}), "", xar,
+         GWXARArchiveUntrustedCertificateError, gwtest::base64Encode(padded)},
+        {"RSA", certificates("***"), "", kGWCocoaErrorDomain, GWFileReadCorruptFileError},
+        {"CMS", chain, "", GWSecurityErrorDomain, 0},
+        // Without certificates nothing vouches for the key.
+        {"RSA", "<KeyInfo><KeyName>k</KeyName></KeyInfo>", "", xar,
+         GWXARArchiveMissingCertificateError},
+        {"RSA", "", "", xar, GWXARArchiveMissingCertificateError},
+        {"RSA", "<KeyInfo><X509Data/></KeyInfo>", "", xar, GWXARArchiveMissingCertificateError, "",
+         "<signature style=\"RSA\">"},
+        {"SHA1withFOO", "", "", xar, GWXARArchiveUnknownSignatureStyleError, "SHA1withFOO",
+         "<signature"},
+        {"CMSwithRSA ", "", "", xar, GWXARArchiveUnknownSignatureStyleError, "CMSwithRSA "},
+        {"withrsa2", "", "", xar, GWXARArchiveUnknownSignatureStyleError, "withrsa2"},
+        {"", "", "", xar, GWXARArchiveUnknownSignatureStyleError, "", "<signature"},
+        {"", "", "<signature><offset>0</offset></signature>", xar,
+         GWXARArchiveUnknownSignatureStyleError},
+        {"", "", "<signature style=\"RSA\"><offset>twelve</offset></signature>", xar,
+         GWXARArchiveMalformedValueError, "twelve", "<offset>twelve</offset>"},
+        {"", "", "<signature style=\"RSA\"><size>-</size></signature>", xar,
+         GWXARArchiveMalformedValueError, "-", "<size>-</size>"},
+        {"", "", "<signature style=\"RSA\"><offset>99999999999999999999999</offset></signature>",
+         xar, GWXARArchiveMalformedValueError, "99999999999999999999999"},
+        // A signature larger than 16 KiB is no signature: nothing is read for it.
+        {"", "", "<signature style=\"RSA\"><size>16385</size></signature>", xar,
+         GWXARArchiveMalformedValueError, "16385", "<size>16385</size>"},
+    };
+    for (const auto& c : cases) {
+        SCOPED_TRACE(c.style + " " + c.keyInfo + c.element);
+        std::vector<TOCSignature> signatures;
+        if (c.element.empty()) {
+            signatures.push_back({c.style, bytesOf("sig"), c.keyInfo});
+        }
+        SignedTOCFixture fixture(signatures, checksum_, c.element);
         GWErrorPtr error;
-        ASSERT_TRUE(fixture.operation().loadSignaturesWithTOC(fixture.toc(), &error));
-        const auto& certificates = fixture.operation().signatures()->front()->certificates();
-        EXPECT_EQ(certificates.has_value(), !keyInfo.empty());
         EXPECT_FALSE(fixture.verify(&error));
-        expectXARError(error, GWXARArchiveMissingCertificateError);
-        EXPECT_EQ(unknownEntity(error), "");
-        EXPECT_EQ(affectedNode(error), "");
+        ASSERT_TRUE(error);
+        EXPECT_EQ(error->domain(), c.domain) << error->localizedDescription();
+        EXPECT_TRUE(c.code ? error->code() == c.code : error->code() != 0) << error->code();
+        EXPECT_EQ(unknownEntity(error), c.entity);
+        EXPECT_EQ(affectedNode(error).rfind(c.node, 0), 0u) << affectedNode(error);
     }
-
-    // X509Data without a certificate fails the load and names the signature element.
-    SignedTOCFixture empty({{"RSA", bytes, "<KeyInfo><X509Data/></KeyInfo>"}}, checksum_);
-    GWErrorPtr error;
-    EXPECT_FALSE(empty.operation().loadSignaturesWithTOC(empty.toc(), &error));
-    expectXARError(error, GWXARArchiveMissingCertificateError);
-    EXPECT_EQ(affectedNode(error).rfind("<signature style=\"RSA\">", 0), 0u) << affectedNode(error);
 }
 
 TEST_F(GWXARSignatureVerification, StylesMapToTypesWhateverTheirCase) {
@@ -213,36 +212,6 @@ TEST_F(GWXARSignatureVerification, StylesMapToTypesWhateverTheirCase) {
         GWErrorPtr error;
         ASSERT_TRUE(fixture.operation().loadSignaturesWithTOC(fixture.toc(), &error)) << style;
         EXPECT_EQ(fixture.operation().signatures()->front()->type(), type) << style;
-    }
-}
-
-TEST_F(GWXARSignatureVerification, UnknownStylesAreRefusedWithTheStyleAsWritten) {
-    for (const std::string style : {"SHA1withFOO", "CMSwithRSA ", "withrsa2", ""}) {
-        SignedTOCFixture fixture({{style, bytesOf("sig"), ""}}, checksum_);
-        GWErrorPtr error;
-        EXPECT_FALSE(fixture.verify(&error)) << style;
-        expectXARError(error, GWXARArchiveUnknownSignatureStyleError);
-        EXPECT_EQ(unknownEntity(error), style);
-        EXPECT_NE(affectedNode(error).find("<signature"), std::string::npos);
-    }
-    SignedTOCFixture noStyle({}, checksum_, "<signature><offset>0</offset></signature>");
-    GWErrorPtr error;
-    EXPECT_FALSE(noStyle.verify(&error));
-    expectXARError(error, GWXARArchiveUnknownSignatureStyleError);
-    EXPECT_FALSE(error->userInfo().count(kGWXARArchiveUnknownEntityErrorKey));
-}
-
-TEST_F(GWXARSignatureVerification, MalformedNumbersAreRefused) {
-    // A signature larger than 16 KiB is no signature: nothing is read for it.
-    for (const std::string child :
-         {"<offset>twelve</offset>", "<size>-</size>", "<offset>99999999999999999999999</offset>",
-          "<size>16385</size>"}) {
-        SignedTOCFixture fixture({}, checksum_,
-                                 "<signature style=\"RSA\">" + child + "</signature>");
-        GWErrorPtr error;
-        EXPECT_FALSE(fixture.verify(&error)) << child;
-        expectXARError(error, GWXARArchiveMalformedValueError);
-        EXPECT_EQ(affectedNode(error), child);
     }
 }
 
