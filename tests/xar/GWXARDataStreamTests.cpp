@@ -11,10 +11,48 @@
 
 namespace {
 
-using gwtest::StreamCalls;
 using gwtest::XarBuilder;
 using gwtest::XarEncoding;
 using gwtest::xarFileElement;
+
+// Everything a data handler was told, call by call.
+struct StreamCalls {
+    struct Call {
+        std::optional<GWData> data;
+        bool isDone = false;
+        bool checksumFailed = false;
+        GWErrorPtr error;
+    };
+    std::vector<Call> calls;
+
+    GWData bytes() const {
+        GWData joined;
+        for (const auto& call : calls) {
+            if (call.data) {
+                joined.insert(joined.end(), call.data->begin(), call.data->end());
+            }
+        }
+        return joined;
+    }
+    const Call& last() const { return calls.back(); }
+};
+
+// A handler that records each call into `calls` and refuses the call with
+// index `refuseAt` (never when negative).
+GWXARDataHandler recordingHandler(StreamCalls& calls, int refuseAt = -1) {
+    return [&calls, refuseAt](std::optional<std::span<const std::uint8_t>> data, bool isDone,
+                              bool checksumFailed, const GWErrorPtr& error) {
+        StreamCalls::Call call;
+        if (data) {
+            call.data = GWData(data->begin(), data->end());
+        }
+        call.isDone = isDone;
+        call.checksumFailed = checksumFailed;
+        call.error = error;
+        calls.calls.push_back(std::move(call));
+        return int(calls.calls.size()) - 1 != refuseAt;
+    };
+}
 
 // More than one decoder piece, so that the stream really comes in parts.
 const GWData kLargeContent = gwtest::randomBytes(3 * 1024 * 1024 + 17, 7);
@@ -36,8 +74,7 @@ TEST_P(DataStream, PiecesJoinToTheContentAndOnlyTheLastIsDone) {
     ASSERT_TRUE(archive);
 
     StreamCalls calls;
-    archive->extractDataForkOfFile(archive->fileWithPath("big"), nullptr,
-                                   gwtest::recordingHandler(calls));
+    archive->extractDataForkOfFile(archive->fileWithPath("big"), nullptr, recordingHandler(calls));
     ASSERT_GE(calls.calls.size(), 2u);
     for (std::size_t i = 0; i + 1 < calls.calls.size(); ++i) {
         EXPECT_FALSE(calls.calls[i].isDone) << i;
@@ -60,7 +97,7 @@ TEST_P(DataStream, ExtendedAttributeIsFoundByName) {
 
     StreamCalls calls;
     archive->extractExtendedAttribute("user.two", archive->fileWithPath("f"), nullptr,
-                                      gwtest::recordingHandler(calls));
+                                      recordingHandler(calls));
     ASSERT_FALSE(calls.calls.empty());
     EXPECT_EQ(calls.bytes(), gwtest::bytesOf("second"));
     EXPECT_TRUE(calls.last().isDone);
@@ -86,7 +123,7 @@ protected:
                          int refuseAt = -1) {
         StreamCalls calls;
         archive->extractDataForkOfFile(archive->fileWithPath(path), nullptr,
-                                       gwtest::recordingHandler(calls, refuseAt));
+                                       recordingHandler(calls, refuseAt));
         return calls;
     }
 
@@ -245,8 +282,7 @@ TEST_F(DataStreamContract, ItemKindsResolveBeforeReading) {
     StreamCalls attributeOfLink;
     auto link = archive->fileWithPath("s");
     auto reference = GWXARDataReference::init();
-    archive->extractDataReference(reference, link, nullptr,
-                                  gwtest::recordingHandler(attributeOfLink));
+    archive->extractDataReference(reference, link, nullptr, recordingHandler(attributeOfLink));
     EXPECT_EQ(attributeOfLink.bytes(), gwtest::bytesOf("f"));
 
     auto chainCalls = dataFork(archive, "h2");
@@ -273,15 +309,14 @@ TEST_F(DataStreamContract, EntriesOfAnotherArchiveAndMissingAttributesAreRefused
     ASSERT_TRUE(other);
 
     StreamCalls foreign;
-    archive->extractDataForkOfFile(other->fileWithPath("f"), nullptr,
-                                   gwtest::recordingHandler(foreign));
+    archive->extractDataForkOfFile(other->fileWithPath("f"), nullptr, recordingHandler(foreign));
     ASSERT_EQ(foreign.calls.size(), 1u);
     EXPECT_TRUE(foreign.last().error->is(kGWXARArchiveErrorDomain, 3));
     EXPECT_TRUE(foreign.last().isDone);
 
     StreamCalls missing;
     archive->extractExtendedAttribute("user.none", archive->fileWithPath("f"), nullptr,
-                                      gwtest::recordingHandler(missing));
+                                      recordingHandler(missing));
     ASSERT_EQ(missing.calls.size(), 1u);
     EXPECT_TRUE(missing.last().error->is(kGWXARArchiveErrorDomain, 4));
     EXPECT_EQ(missing.last().error->URL(), archive->URL());

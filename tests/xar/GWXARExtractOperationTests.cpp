@@ -633,7 +633,6 @@ TEST_F(XarExtraction, FailedAttributeCostsTheItemNothingElse) {
     auto archive = open(xarFileElement(1, "f", "file", "0604", inner));
     ASSERT_TRUE(archive);
     archive->fileWithPath("f")->extendedAttributes().front()->setCompressionType(7);
-    gwtest::LogCapture log;
     bool invalid = false;
     GWErrorPtr error;
     ASSERT_TRUE(extract(archive, "f", "f", &invalid, &error));

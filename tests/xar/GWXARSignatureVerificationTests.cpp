@@ -8,16 +8,68 @@
 #include "GWArchiveSupport/GWArchiveConstants.h"
 #include "XarSignatureTestSupport.h"
 #include "foundation/GWChecksum.h"
+#include "xar/GWXARLoadOperation.h"
 
 namespace {
 
-using gwtest::affectedNode;
-using gwtest::bytesOf;
-using gwtest::SignedTOCFixture;
-using gwtest::TOCSignature;
-using gwtest::unknownEntity;
-using gwtest::XarKeyType;
-using gwtest::XarSigning;
+using namespace gwtest;
+
+// A signature element to place in a table of contents: its bytes go to the heap.
+struct TOCSignature {
+    std::string style;
+    GWData bytes;
+    std::string keyInfoXML;
+    bool extended = false;
+};
+
+// A table of contents holding `signatures` (and any `extraXML`), a heap file
+// holding their bytes behind a few bytes of header, and a load operation
+// reading that file with `checksum` as the table-of-contents checksum.
+class SignedTOCFixture {
+public:
+    SignedTOCFixture(const std::vector<TOCSignature>& signatures, const GWData& checksum,
+                     const std::string& extraXML = "") {
+        // Bytes before the heap, so that offsets are seen to count from the heap's start.
+        const std::string header = "HEADER+TOC";
+        GWData file = bytesOf(header);
+        std::string elements;
+        for (const TOCSignature& signature : signatures) {
+            elements += XarSigning::signatureElement(signature.style, file.size() - header.size(),
+                                                     signature.bytes.size(), signature.keyInfoXML,
+                                                     signature.extended);
+            file.insert(file.end(), signature.bytes.begin(), signature.bytes.end());
+        }
+        writeFile(folder_.file("heap"), file);
+        const std::string text = "<xar><toc>" + elements + extraXML + "</toc></xar>";
+        document_.load_string(text.c_str(), GWXARLoadOperation::kTOCParseOptions);
+        operation_->setArchiveURL(folder_.url("heap"));
+        operation_->setFileHandle(
+            GWRemoteFileHandle::initForReadingFromURL(folder_.url("heap"), nullptr));
+        operation_->setHeapStart(header.size());
+        operation_->setTOCChecksum(checksum);
+    }
+
+    pugi::xml_node toc() const { return document_.child("xar").child("toc"); }
+    GWXARLoadOperation& operation() { return *operation_; }
+    // verifySignaturesWithTOC with the header's algorithm (a GWChecksum number).
+    bool verify(GWErrorPtr* error, int checksumAlgorithm = 5) {
+        return operation_->verifySignaturesWithTOC(toc(), checksumAlgorithm, error);
+    }
+
+private:
+    TemporaryDirectory folder_;
+    pugi::xml_document document_;
+    GWXARLoadOperationPtr operation_ = GWXARLoadOperation::initWithArchive(nullptr, false);
+};
+
+// The XAR-domain detail texts of an error; "(no error)" without one.
+std::string unknownEntity(const GWErrorPtr& error) {
+    return error ? error->detailString(kGWXARArchiveUnknownEntityErrorKey) : "(no error)";
+}
+
+std::string affectedNode(const GWErrorPtr& error) {
+    return error ? error->detailString(kGWXARArchiveAffectedXMLNodeErrorKey) : "(no error)";
+}
 
 class GWXARSignatureVerification : public ::testing::Test {
 protected:
@@ -26,7 +78,7 @@ protected:
         trust_.emplace(signing().rootCertificateFile());
     }
 
-    static XarSigning& signing() { return gwtest::sharedSigning(); }
+    static XarSigning& signing() { return sharedSigning(); }
 
     // A signature of `style` by the leaf of `type` over `checksum`, carrying its chain.
     static TOCSignature signedBy(const std::string& style, XarKeyType type,
@@ -44,7 +96,7 @@ protected:
 
     const GWData checksum_ =
         GWChecksum::checksumForData(bytesOf("a table of contents"), GWChecksumAlgorithmSHA1);
-    std::optional<gwtest::TrustedRootScope> trust_;
+    std::optional<TrustedRootScope> trust_;
 };
 
 // Every key type and CMS, over SHA-1 and MD5 checksums; then with the
@@ -105,7 +157,7 @@ TEST_F(GWXARSignatureVerification, CertificatesWithoutATrustedRootAreNotTrusted)
 
     // A chain that is sound but whose root the store does not hold.
     trust_.reset();
-    gwtest::TrustedRootScope otherRoot(selfSigned.certificateFile);
+    TrustedRootScope otherRoot(selfSigned.certificateFile);
     SignedTOCFixture unanchored({signedBy("RSA", XarKeyType::rsa, checksum_)}, checksum_);
     EXPECT_FALSE(unanchored.verify(&error));
     expectXARError(error, GWXARArchiveUntrustedCertificateError);
@@ -118,7 +170,7 @@ TEST_F(GWXARSignatureVerification, CMSSignerNotTrustedIsASecurityError) {
                              checksum_);
     {
         // With the self-signed certificate as the root, KeyInfo and the signer are trusted.
-        gwtest::TrustedRootScope both(selfSigned.certificateFile);
+        TrustedRootScope both(selfSigned.certificateFile);
         GWErrorPtr error;
         EXPECT_TRUE(fixture.verify(&error)) << (error ? error->localizedDescription() : "");
     }
@@ -138,7 +190,7 @@ TEST_F(GWXARSignatureVerification, CMSSignerNotTrustedIsASecurityError) {
 // Signature elements that cannot be checked: each fails with its error, the
 // entity it names and (a prefix of) the element it names.
 TEST_F(GWXARSignatureVerification, UncheckableSignaturesAreRefused) {
-    const std::string notCertificate = gwtest::base64Encode(bytesOf("not a certificate"));
+    const std::string notCertificate = base64Encode(bytesOf("not a certificate"));
     const auto certificates = [](const std::string& text) {
         return "<KeyInfo><X509Data><X509Certificate>" + text +
                "</X509Certificate></X509Data></KeyInfo>";
@@ -157,7 +209,7 @@ TEST_F(GWXARSignatureVerification, UncheckableSignaturesAreRefused) {
          notCertificate, "<X509Certificate>" + notCertificate + "</X509Certificate>"},
         // A certificate followed by stray bytes is not a certificate either.
         {"RSA", XarSigning::keyInfoElement({padded}), "", xar,
-         GWXARArchiveUntrustedCertificateError, gwtest::base64Encode(padded)},
+         GWXARArchiveUntrustedCertificateError, base64Encode(padded)},
         {"RSA", certificates("***"), "", kGWCocoaErrorDomain, GWFileReadCorruptFileError},
         {"CMS", chain, "", GWSecurityErrorDomain, 0},
         // Without certificates nothing vouches for the key.
