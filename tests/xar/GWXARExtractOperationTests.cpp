@@ -202,6 +202,22 @@ TEST_F(XarExtraction, ResourceForkMayNotPassFourGiB) {
     EXPECT_EQ(position, 4u + 0x10);
 }
 
+TEST_F(XarExtraction, MetadataFailureKeepsTheItemAndFlagsTheChecksum) {
+    // Linux keeps user attributes off symbolic links.
+    auto archive =
+        open(xarFileElement(1, "s", "symlink", "0777",
+                            "<link type=\"broken\">x</link>" +
+                                xar.dataElement("ea", gwtest::bytesOf("v"), XarEncoding::none,
+                                                "sha1", "<name>user.on-a-link</name>")));
+    ASSERT_TRUE(archive);
+    bool invalid = false;
+    GWErrorPtr error;
+    ASSERT_TRUE(extract(archive, "s", "s", &invalid, &error));
+    EXPECT_FALSE(error);
+    EXPECT_TRUE(invalid);
+    EXPECT_EQ(gwtest::snapshotTree(outputPath("s")).at("").linkText, "x");
+}
+
 TEST_F(XarExtraction, ChecksumMismatchStillExtracts) {
     const GWData content = gwtest::bytesOf("content");
     auto archive = open(xarFileElement(1, "f", "file", "0644",
