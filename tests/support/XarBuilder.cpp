@@ -174,7 +174,7 @@ GWData XarBuilder::bytes() const {
     appendBigEndian(out, version.value_or(1), 2);
     appendBigEndian(out, compressedTOCLength.value_or(stored.size()), 8);
     appendBigEndian(out, uncompressedTOCLength.value_or(plain.size()), 8);
-    appendBigEndian(out, headerChecksumField.value_or(headerChecksum_), 4);
+    appendBigEndian(out, headerChecksum_, 4);
     out.insert(out.end(), extraHeaderBytes.begin(), extraHeaderBytes.end());
     out.insert(out.end(), stored.begin(), stored.end());
     out.insert(out.end(), digest.begin(), digest.end());

@@ -57,8 +57,7 @@ public:
     std::optional<std::uint16_t> version;
     std::optional<std::uint64_t> compressedTOCLength;
     std::optional<std::uint64_t> uncompressedTOCLength;
-    std::optional<std::uint32_t> headerChecksumField;  // overrides the number written
-    GWData extraHeaderBytes;                           // after the 28 interpreted bytes
+    GWData extraHeaderBytes;  // after the 28 interpreted bytes
 
     // Length of the digest at the heap's start (0 without one).
     std::size_t digestLength() const;

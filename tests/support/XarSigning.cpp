@@ -1,10 +1,7 @@
 #include "XarSigning.h"
 
-#include <cstdlib>
-
 #include <openssl/evp.h>
 #include <openssl/pem.h>
-#include <openssl/x509v3.h>
 
 #include "xar/GWOpenSSL.h"
 
@@ -40,29 +37,10 @@ std::string lowered(std::string text) {
     return text;
 }
 
-std::optional<std::string> environmentValue(const char* name) {
-    const char* value = std::getenv(name);
-    return value ? std::optional<std::string>(value) : std::nullopt;
-}
-
-void restoreEnvironment(const char* name, const std::optional<std::string>& value) {
-    if (value) {
-        setenv(name, value->c_str(), 1);
-    } else {
-        unsetenv(name);
-    }
-}
-
 GWOpenSSLPtr<EVP_PKEY> readKey(const std::string& file) {
     GWOpenSSLPtr<BIO> bio(BIO_new_file(file.c_str(), "r"));
     return GWOpenSSLPtr<EVP_PKEY>(
         bio ? PEM_read_bio_PrivateKey(bio.get(), nullptr, nullptr, nullptr) : nullptr);
-}
-
-GWOpenSSLPtr<X509> readCertificate(const std::string& file) {
-    GWOpenSSLPtr<BIO> bio(BIO_new_file(file.c_str(), "r"));
-    return GWOpenSSLPtr<X509>(bio ? PEM_read_bio_X509(bio.get(), nullptr, nullptr, nullptr)
-                                  : nullptr);
 }
 
 }  // namespace
@@ -98,7 +76,10 @@ XarSigning::XarSigning() {
         return;
     }
     rootCertificate_ = derOf(rootCertificateFile_);
-    intermediateCertificate_ = derOf(folder_.file("intermediate.pem"));
+    intermediate_.keyFile = intermediate;
+    intermediate_.certificateFile = folder_.file("intermediate.pem");
+    intermediate_.chain = {derOf(intermediate_.certificateFile)};
+    intermediate_.commonNames = {"GW Test Intermediate CA"};
 }
 
 bool XarSigning::run(const std::string& command) {
@@ -123,37 +104,46 @@ GWData XarSigning::derOf(const std::string& pemFile) {
 
 std::optional<XarSigningIdentity> XarSigning::makeIdentity(const std::string& name, XarKeyType type,
                                                            const std::string& keyFile,
-                                                           bool selfSigned) {
+                                                           const XarSigningIdentity* issuer,
+                                                           int days) {
     XarSigningIdentity identity;
     identity.keyType = type;
     identity.keyFile = keyFile;
     identity.certificateFile = folder_.file(name + ".pem");
     const std::string commonName = "GW Test " + name + " Signer";
     const std::string subject = shellQuote("/CN=" + commonName);
-    if (selfSigned) {
+    const std::string request = folder_.file(name + ".csr");
+    if (!issuer) {
         if (!run("openssl req -x509 -new -config " + shellQuote(config_) +
                  " -extensions leaf_ext -key " + shellQuote(keyFile) + " -subj " + subject +
                  " -days 3650 -sha256 -out " + shellQuote(identity.certificateFile))) {
             return std::nullopt;
         }
-        identity.chain = {derOf(identity.certificateFile)};
-        identity.commonNames = {commonName};
-        return ok() ? std::optional(identity) : std::nullopt;
-    }
-    const std::string request = folder_.file(name + ".csr");
-    if (!run("openssl req -new -config " + shellQuote(config_) + " -key " + shellQuote(keyFile) +
-             " -subj " + subject + " -out " + shellQuote(request)) ||
-        !run("openssl x509 -req -in " + shellQuote(request) + " -CA " +
-             shellQuote(folder_.file("intermediate.pem")) + " -CAkey " +
-             shellQuote(folder_.file("intermediate.key")) + " -set_serial " +
-             std::to_string(serial_++) + " -extfile " + shellQuote(config_) +
-             " -extensions leaf_ext -days 3650 -sha256 -out " +
-             shellQuote(identity.certificateFile))) {
+    } else if (!run("openssl req -new -config " + shellQuote(config_) + " -key " +
+                    shellQuote(keyFile) + " -subj " + subject + " -out " + shellQuote(request)) ||
+               // Negative days make a certificate whose validity has already ended.
+               !run("openssl x509 -req -in " + shellQuote(request) + " -CA " +
+                    shellQuote(issuer->certificateFile) + " -CAkey " + shellQuote(issuer->keyFile) +
+                    " -set_serial " + std::to_string(serial_++) + " -extfile " +
+                    shellQuote(config_) + " -extensions leaf_ext -days " + std::to_string(days) +
+                    " -sha256 -out " + shellQuote(identity.certificateFile))) {
         return std::nullopt;
     }
-    identity.chainFile = folder_.file("intermediate.pem");
-    identity.chain = {derOf(identity.certificateFile), intermediateCertificate_};
-    identity.commonNames = {commonName, "GW Test Intermediate CA"};
+    identity.chain = {derOf(identity.certificateFile)};
+    identity.commonNames = {commonName};
+    if (issuer) {
+        // The issuer and what vouches for it, for CMS signing.
+        identity.chainFile = folder_.file(name + "-chain.pem");
+        GWData chain = readFile(issuer->certificateFile);
+        if (!issuer->chainFile.empty()) {
+            const GWData more = readFile(issuer->chainFile);
+            chain.insert(chain.end(), more.begin(), more.end());
+        }
+        writeFile(identity.chainFile, chain);
+        identity.chain.insert(identity.chain.end(), issuer->chain.begin(), issuer->chain.end());
+        identity.commonNames.insert(identity.commonNames.end(), issuer->commonNames.begin(),
+                                    issuer->commonNames.end());
+    }
     return ok() ? std::optional(identity) : std::nullopt;
 }
 
@@ -181,7 +171,7 @@ const XarSigningIdentity& XarSigning::leaf(XarKeyType type) {
     } else {
         made = run("openssl genpkey " + std::string(kECKey) + " -out " + shellQuote(key));
     }
-    auto identity = made ? makeIdentity(name, type, key, false) : std::nullopt;
+    auto identity = made ? makeIdentity(name, type, key, &intermediate_, 3650) : std::nullopt;
     if (!identity) {
         return empty_;
     }
@@ -193,83 +183,18 @@ const XarSigningIdentity& XarSigning::selfSignedLeaf() {
         const std::string key = folder_.file("SelfSigned.key");
         if (run("openssl genpkey -algorithm RSA -pkeyopt rsa_keygen_bits:2048 -out " +
                 shellQuote(key))) {
-            selfSigned_ = makeIdentity("SelfSigned", XarKeyType::rsa, key, true);
+            selfSigned_ = makeIdentity("SelfSigned", XarKeyType::rsa, key, nullptr, 3650);
         }
     }
     return selfSigned_ ? *selfSigned_ : empty_;
 }
 
-std::optional<XarSigningIdentity> XarSigning::issue(const std::string& name,
-                                                    const XarSigningIdentity& issuer,
-                                                    bool expired) {
-    auto issuerKey = readKey(issuer.keyFile);
-    auto issuerCertificate = readCertificate(issuer.certificateFile);
-    GWOpenSSLPtr<EVP_PKEY> key(EVP_EC_gen("P-256"));
-    GWOpenSSLPtr<X509> certificate(X509_new());
-    if (!issuerKey || !issuerCertificate || !key || !certificate) {
-        problem_ = "issue " + name + ": no key or certificate";
-        return std::nullopt;
-    }
-    X509* made = certificate.get();
-    const std::string commonName = "GW Test " + name + " Signer";
-    X509_set_version(made, X509_VERSION_3);
-    ASN1_INTEGER_set(X509_get_serialNumber(made), serial_++);
-    X509_NAME_add_entry_by_txt(X509_get_subject_name(made), "CN", MBSTRING_UTF8,
-                               reinterpret_cast<const unsigned char*>(commonName.c_str()), -1, -1,
-                               0);
-    X509_set_issuer_name(made, X509_get_subject_name(issuerCertificate.get()));
-    const long day = 24 * 60 * 60;
-    X509_gmtime_adj(X509_getm_notBefore(made), expired ? -2 * day : -day);
-    X509_gmtime_adj(X509_getm_notAfter(made), expired ? -day : 3650 * day);
-    X509_set_pubkey(made, key.get());
-    X509V3_CTX context;
-    X509V3_set_ctx(&context, issuerCertificate.get(), made, nullptr, nullptr, 0);
-    for (const auto& [nid, value] : {std::pair{NID_basic_constraints, "critical,CA:FALSE"},
-                                     std::pair{NID_key_usage, "critical,digitalSignature"}}) {
-        X509_EXTENSION* extension = X509V3_EXT_conf_nid(nullptr, &context, nid, value);
-        X509_add_ext(made, extension, -1);
-        X509_EXTENSION_free(extension);
-    }
-    XarSigningIdentity identity;
-    identity.keyType = XarKeyType::ecdsa;
-    identity.keyFile = folder_.file(name + ".key");
-    identity.certificateFile = folder_.file(name + ".pem");
-    GWOpenSSLPtr<BIO> keyOut(BIO_new_file(identity.keyFile.c_str(), "w"));
-    GWOpenSSLPtr<BIO> certificateOut(BIO_new_file(identity.certificateFile.c_str(), "w"));
-    if (X509_sign(made, issuerKey.get(), EVP_sha256()) <= 0 || !keyOut || !certificateOut ||
-        PEM_write_bio_PrivateKey(keyOut.get(), key.get(), nullptr, nullptr, 0, nullptr, nullptr) !=
-            1 ||
-        PEM_write_bio_X509(certificateOut.get(), made) != 1) {
-        problem_ = "issue " + name + ": signing or writing failed";
-        return std::nullopt;
-    }
-    keyOut.reset();
-    certificateOut.reset();
-    // The issuer and what vouches for it, for CMS signing.
-    identity.chainFile = folder_.file(name + "-chain.pem");
-    GWData chain = readFile(issuer.certificateFile);
-    if (!issuer.chainFile.empty() && issuer.chainFile != issuer.certificateFile) {
-        const GWData more = readFile(issuer.chainFile);
-        chain.insert(chain.end(), more.begin(), more.end());
-    }
-    writeFile(identity.chainFile, chain);
-    identity.chain = {derOf(identity.certificateFile)};
-    identity.commonNames = {commonName};
-    identity.chain.insert(identity.chain.end(), issuer.chain.begin(), issuer.chain.end());
-    identity.commonNames.insert(identity.commonNames.end(), issuer.commonNames.begin(),
-                                issuer.commonNames.end());
-    return ok() ? std::optional(identity) : std::nullopt;
-}
-
 const XarSigningIdentity& XarSigning::expiredLeaf() {
     if (!expired_ && ok()) {
-        // The intermediate as an issuer: its chain is only itself.
-        XarSigningIdentity intermediate;
-        intermediate.keyFile = folder_.file("intermediate.key");
-        intermediate.certificateFile = folder_.file("intermediate.pem");
-        intermediate.chain = {intermediateCertificate_};
-        intermediate.commonNames = {"GW Test Intermediate CA"};
-        expired_ = issue("Expired", intermediate, true);
+        const std::string key = folder_.file("Expired.key");
+        if (run("openssl genpkey " + std::string(kECKey) + " -out " + shellQuote(key))) {
+            expired_ = makeIdentity("Expired", XarKeyType::ecdsa, key, &intermediate_, -1);
+        }
     }
     return expired_ ? *expired_ : empty_;
 }
@@ -277,7 +202,10 @@ const XarSigningIdentity& XarSigning::expiredLeaf() {
 const XarSigningIdentity& XarSigning::leafIssuedByLeaf() {
     if (!issuedByLeaf_ && ok()) {
         const XarSigningIdentity& rsa = leaf(XarKeyType::rsa);
-        issuedByLeaf_ = ok() ? issue("Leaf-Issued", rsa, false) : std::nullopt;
+        const std::string key = folder_.file("Leaf-Issued.key");
+        if (ok() && run("openssl genpkey " + std::string(kECKey) + " -out " + shellQuote(key))) {
+            issuedByLeaf_ = makeIdentity("Leaf-Issued", XarKeyType::ecdsa, key, &rsa, 3650);
+        }
     }
     return issuedByLeaf_ ? *issuedByLeaf_ : empty_;
 }
@@ -408,15 +336,6 @@ std::string XarSigning::signatureElement(const std::string& style, std::uint64_t
 }
 
 TrustedRootScope::TrustedRootScope(const std::string& certificateFile)
-    : previousFile_(environmentValue("SSL_CERT_FILE")),
-      previousDirectory_(environmentValue("SSL_CERT_DIR")) {
-    setenv("SSL_CERT_FILE", certificateFile.c_str(), 1);
-    setenv("SSL_CERT_DIR", emptyFolder_.path().c_str(), 1);
-}
-
-TrustedRootScope::~TrustedRootScope() {
-    restoreEnvironment("SSL_CERT_FILE", previousFile_);
-    restoreEnvironment("SSL_CERT_DIR", previousDirectory_);
-}
+    : file_("SSL_CERT_FILE", certificateFile), directory_("SSL_CERT_DIR", emptyFolder_.path()) {}
 
 }  // namespace gwtest

@@ -100,18 +100,19 @@ public:
 
 private:
     bool run(const std::string& command);
+    // A certificate for the key valid for `days` (negative: already expired), issued
+    // by `issuer` or self-signed without one.
     std::optional<XarSigningIdentity> makeIdentity(const std::string& name, XarKeyType type,
-                                                   const std::string& keyFile, bool selfSigned);
+                                                   const std::string& keyFile,
+                                                   const XarSigningIdentity* issuer, int days);
     GWData derOf(const std::string& pemFile);
-    std::optional<XarSigningIdentity> issue(const std::string& name,
-                                            const XarSigningIdentity& issuer, bool expired);
 
     TemporaryDirectory folder_;
     std::string problem_;
     std::string config_;
     std::string rootCertificateFile_;
     GWData rootCertificate_;
-    GWData intermediateCertificate_;
+    XarSigningIdentity intermediate_;  // as an issuer: its chain is only itself
     std::map<int, XarSigningIdentity> leaves_;
     std::optional<XarSigningIdentity> selfSigned_;
     std::optional<XarSigningIdentity> expired_;
@@ -126,14 +127,10 @@ private:
 class TrustedRootScope {
 public:
     explicit TrustedRootScope(const std::string& certificateFile);
-    ~TrustedRootScope();
-    TrustedRootScope(const TrustedRootScope&) = delete;
-    TrustedRootScope& operator=(const TrustedRootScope&) = delete;
 
 private:
     TemporaryDirectory emptyFolder_;
-    std::optional<std::string> previousFile_;
-    std::optional<std::string> previousDirectory_;
+    ScopedEnvironment file_, directory_;
 };
 
 std::string base64Encode(const GWData& bytes);

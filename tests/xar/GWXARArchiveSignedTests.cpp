@@ -9,9 +9,9 @@
 #include <optional>
 
 #include "GWArchiveSupport/GWArchiveConstants.h"
+#include "GWArchiveSupport/GWXARSignature.h"
 #include "XarSignatureTestSupport.h"
 #include "XarTestSupport.h"
-#include "support/CoderTestSupport.h"
 #include "support/XarSigning.h"
 #include "xar/GWXARArchive.h"
 #include "xar/GWXARTrust.h"
@@ -49,33 +49,15 @@ protected:
     static XarSigning& signing() { return gwtest::sharedSigning(); }
 
     // An archive signed once in `style` by `identity`, written to the directory.
-    GWURL signedArchive(const std::string& style, const gwtest::XarSigningIdentity& identity,
-                        bool corruptChecksum = false) {
+    GWURL signedArchive(const std::string& style, const gwtest::XarSigningIdentity& identity) {
         gwtest::XarBuilder builder;
-        builder.corruptStoredChecksum = corruptChecksum;
         builder.setFiles(kFiles);
         EXPECT_TRUE(signing().signArchive(builder, {{style, identity}}));
-        bytes_ = builder.bytes();
-        gwtest::writeFile(directory_.file("signed.xar"), bytes_);
+        gwtest::writeFile(directory_.file("signed.xar"), builder.bytes());
         return directory_.url("signed.xar");
     }
 
-    // The same archive with one byte of its signature flipped.
-    GWURL withDamagedSignature() {
-        auto toc = gwtest::readXarTOC(bytes_);
-        EXPECT_TRUE(toc);
-        const pugi::xml_node signature = toc->toc().child("signature");
-        const std::size_t offset =
-            std::size_t(toc->heapStart) + std::size_t(std::stoull(signature.child_value("offset")));
-        const std::size_t size = std::size_t(std::stoull(signature.child_value("size")));
-        GWData damaged = bytes_;
-        damaged.at(offset + size / 2) ^= 0x10;
-        gwtest::writeFile(directory_.file("damaged.xar"), damaged);
-        return directory_.url("damaged.xar");
-    }
-
     gwtest::TemporaryDirectory directory_;
-    GWData bytes_;
 };
 
 // Who signs, and what becomes of the archive afterwards.
@@ -91,144 +73,49 @@ struct VerdictCase {
     GWXARSignatureVerdict withAnchor;
     const char* reason;
     std::vector<std::string> chain;
-    GWXARSignatureVerdict withoutAnchor;
-    const char* reasonWithoutAnchor;
+    GWXARSignatureVerdict withoutAnchor = GWXARSignatureVerdictUntrusted;
+    const char* reasonWithoutAnchor = "unknown issuer";
 };
 
-const std::string kRSA = "GW Test RSA Signer";
-const std::string kIntermediate = "GW Test Intermediate CA";
-const std::string kRoot = "GW Test Root CA";
-const char* const kMismatch = "the signature does not match the checksum";
+const char *const kRSA = "GW Test RSA Signer", *const kCA = "GW Test Intermediate CA",
+                  *const kRoot = "GW Test Root CA",
+                  *const kMismatch = "the signature does not match the checksum",
+                  *const kCMSMismatch = "a signer's signature does not match the checksum",
+                  *const kBadChecksum = "the checksum does not match the table of contents";
+const auto kValid = GWXARSignatureVerdictValid, kUntrusted = GWXARSignatureVerdictUntrusted,
+           kInvalid = GWXARSignatureVerdictInvalid;
+using Chain = std::vector<std::string>;
 
+// Without an anchor every signature that matches is untrusted: its issuer is unknown.
 const VerdictCase kVerdictCases[] = {
-    {"RSA",
-     Signer::rsa,
-     "RSA",
-     Change::none,
-     GWXARSignatureVerdictValid,
-     "",
-     {kRSA, kIntermediate, kRoot},
-     GWXARSignatureVerdictUntrusted,
-     "unknown issuer"},
-    {"DSA",
-     Signer::dsa,
-     "SHA1withDSA",
-     Change::none,
-     GWXARSignatureVerdictValid,
-     "",
-     {"GW Test DSA Signer", kIntermediate, kRoot},
-     GWXARSignatureVerdictUntrusted,
-     "unknown issuer"},
-    {"ECDSA",
-     Signer::ecdsa,
-     "ECDSA",
-     Change::none,
-     GWXARSignatureVerdictValid,
-     "",
-     {"GW Test ECDSA Signer", kIntermediate, kRoot},
-     GWXARSignatureVerdictUntrusted,
-     "unknown issuer"},
-    {"CMS",
-     Signer::rsa,
-     "CMS",
-     Change::none,
-     GWXARSignatureVerdictValid,
-     "",
-     {kRSA, kIntermediate, kRoot},
-     GWXARSignatureVerdictUntrusted,
-     "unknown issuer"},
-    {"ExpiredLeaf",
-     Signer::expired,
-     "ECDSA",
-     Change::none,
-     GWXARSignatureVerdictUntrusted,
-     "expired",
-     {"GW Test Expired Signer"},
-     GWXARSignatureVerdictUntrusted,
-     "unknown issuer"},
-    {"ExpiredCMSSigner",
-     Signer::expired,
-     "CMS",
-     Change::none,
-     GWXARSignatureVerdictUntrusted,
-     "expired",
-     {"GW Test Expired Signer"},
-     GWXARSignatureVerdictUntrusted,
-     "unknown issuer"},
-    {"LeafUsedAsCA",
-     Signer::issuedByLeaf,
-     "ECDSA",
-     Change::none,
-     GWXARSignatureVerdictUntrusted,
-     "not a CA",
-     {"GW Test Leaf-Issued Signer", kRSA},
-     GWXARSignatureVerdictUntrusted,
-     "unknown issuer"},
-    {"MissingIntermediate",
-     Signer::rsa,
-     "RSA",
-     Change::withoutIntermediate,
-     GWXARSignatureVerdictUntrusted,
-     "unknown issuer",
-     {kRSA},
-     GWXARSignatureVerdictUntrusted,
-     "unknown issuer"},
-    {"SelfSigned",
-     Signer::selfSigned,
-     "RSA",
-     Change::none,
-     GWXARSignatureVerdictUntrusted,
-     "unknown issuer",
-     {"GW Test SelfSigned Signer"},
-     GWXARSignatureVerdictUntrusted,
-     "unknown issuer"},
+    {"RSA", Signer::rsa, "RSA", Change::none, kValid, "", Chain{kRSA, kCA, kRoot}},
+    {"DSA", Signer::dsa, "SHA1withDSA", Change::none, kValid, "",
+     Chain{"GW Test DSA Signer", kCA, kRoot}},
+    {"ECDSA", Signer::ecdsa, "ECDSA", Change::none, kValid, "",
+     Chain{"GW Test ECDSA Signer", kCA, kRoot}},
+    {"CMS", Signer::rsa, "CMS", Change::none, kValid, "", Chain{kRSA, kCA, kRoot}},
+    {"ExpiredLeaf", Signer::expired, "ECDSA", Change::none, kUntrusted, "expired",
+     Chain{"GW Test Expired Signer"}},
+    {"ExpiredCMSSigner", Signer::expired, "CMS", Change::none, kUntrusted, "expired",
+     Chain{"GW Test Expired Signer"}},
+    {"LeafUsedAsCA", Signer::issuedByLeaf, "ECDSA", Change::none, kUntrusted, "not a CA",
+     Chain{"GW Test Leaf-Issued Signer", kRSA}},
+    {"MissingIntermediate", Signer::rsa, "RSA", Change::withoutIntermediate, kUntrusted,
+     "unknown issuer", Chain{kRSA}},
+    {"SelfSigned", Signer::selfSigned, "RSA", Change::none, kUntrusted, "unknown issuer",
+     Chain{"GW Test SelfSigned Signer"}},
     // Without signers a message vouches for nothing, whatever certificates ride along.
-    {"CMSWithoutSigners",
-     Signer::rsa,
-     "CMS",
-     Change::withoutSigners,
-     GWXARSignatureVerdictInvalid,
-     "no signers",
-     {},
-     GWXARSignatureVerdictInvalid,
-     "no signers"},
+    {"CMSWithoutSigners", Signer::rsa, "CMS", Change::withoutSigners, kInvalid, "no signers",
+     Chain{}, kInvalid, "no signers"},
     // The forgery that needed no key: a root every Debian system trusts, and no signer.
-    {"CMSWithoutSignersUnderAPublicRoot",
-     Signer::publicRoot,
-     "CMS",
-     Change::withoutSigners,
-     GWXARSignatureVerdictInvalid,
-     "no signers",
-     {},
-     GWXARSignatureVerdictInvalid,
-     "no signers"},
-    {"TamperedTOC",
-     Signer::rsa,
-     "RSA",
-     Change::tamperedTOC,
-     GWXARSignatureVerdictInvalid,
-     kMismatch,
-     {},
-     GWXARSignatureVerdictInvalid,
+    {"CMSWithoutSignersUnderAPublicRoot", Signer::publicRoot, "CMS", Change::withoutSigners,
+     kInvalid, "no signers", Chain{}, kInvalid, "no signers"},
+    {"TamperedTOC", Signer::rsa, "RSA", Change::tamperedTOC, kInvalid, kMismatch, Chain{}, kInvalid,
      kMismatch},
-    {"TamperedCMSTOC",
-     Signer::ecdsa,
-     "CMS",
-     Change::tamperedTOC,
-     GWXARSignatureVerdictInvalid,
-     "a signer's signature does not match the checksum",
-     {},
-     GWXARSignatureVerdictInvalid,
-     "a signer's signature does not match the checksum"},
-    {"TamperedChecksum",
-     Signer::rsa,
-     "RSA",
-     Change::tamperedChecksum,
-     GWXARSignatureVerdictInvalid,
-     "the checksum does not match the table of contents",
-     {kRSA, kIntermediate, kRoot},
-     GWXARSignatureVerdictInvalid,
-     "the checksum does not match the table of contents"},
+    {"TamperedCMSTOC", Signer::ecdsa, "CMS", Change::tamperedTOC, kInvalid, kCMSMismatch, Chain{},
+     kInvalid, kCMSMismatch},
+    {"TamperedChecksum", Signer::rsa, "RSA", Change::tamperedChecksum, kInvalid, kBadChecksum,
+     Chain{kRSA, kCA, kRoot}, kInvalid, kBadChecksum},
 };
 
 class GWXARArchiveVerdict : public GWXARArchiveSigned,
@@ -352,26 +239,6 @@ TEST_F(GWXARArchiveSigned, ThreeHundredSignaturesOpenQuickly) {
     EXPECT_LT(elapsed, std::chrono::milliseconds(500 * kSanitizerFactor));
 }
 
-TEST_F(GWXARArchiveSigned, ADamagedSignatureFailsACheckedOpen) {
-    gwtest::TrustedRootScope trust(signing().rootCertificateFile());
-    signedArchive("RSA", signing().leaf(XarKeyType::rsa));
-    const GWURL damaged = withDamagedSignature();
-
-    GWErrorPtr error;
-    EXPECT_FALSE(GWXARArchive::initWithURL(damaged, true, &error));
-    ASSERT_TRUE(error);
-    EXPECT_TRUE(error->is(kGWXARArchiveErrorDomain, 6)) << describe(error);
-
-    error = nullptr;
-    auto lenient = GWXARArchive::initWithURL(damaged, false, &error);
-    ASSERT_TRUE(lenient) << describe(error);
-    EXPECT_TRUE(lenient->checksumIsValid());
-    EXPECT_FALSE(lenient->signatureIsValid());
-    ASSERT_TRUE(lenient->signatureValidationError());
-    EXPECT_TRUE(lenient->signatureValidationError()->is(kGWXARArchiveErrorDomain, 6));
-    EXPECT_EQ(lenient->signatures().size(), 1u);
-}
-
 TEST_F(GWXARArchiveSigned, TheAsynchronousOpenReportsAValidSignature) {
     gwtest::TrustedRootScope trust(signing().rootCertificateFile());
     const GWURL url = signedArchive("RSA", signing().leaf(XarKeyType::rsa));
@@ -401,12 +268,6 @@ TEST_F(GWXARArchiveSigned, SignaturesSurvivePersistenceAndCopying) {
     ASSERT_TRUE(archive) << describe(error);
     const auto original = archive->signatures().at(0);
 
-    gwtest::RecordingCoder keys(true);
-    archive->encodeWithCoder(keys);
-    EXPECT_EQ(keys.keys,
-              (std::vector<std::string>{"GWRef", "Files", "TOCChecksum", "ChecksumIsValid",
-                                        "Signatures", "SignatureIsValid"}));
-
     auto decoded = GWKeyedUnarchiver::unarchiveObjectWithData<GWXARArchive>(
         GWKeyedArchiver::archivedDataWithRootObject(*archive, &error), &error);
     ASSERT_TRUE(decoded) << describe(error);
@@ -426,6 +287,102 @@ TEST_F(GWXARArchiveSigned, SignaturesSurvivePersistenceAndCopying) {
         EXPECT_EQ(signature->chainCommonNames(), original->chainCommonNames());
         EXPECT_EQ(signature->chainCommonNames().size(), 3u);
     }
+}
+
+GWCertificateArray certificatesOf(const std::vector<GWData>& ders) {
+    GWCertificateArray certificates;
+    for (const GWData& der : ders) {
+        certificates.push_back(GWCertificate::createWithData(der));
+    }
+    return certificates;
+}
+
+std::vector<GWData> encodingsOf(const std::optional<GWCertificateArray>& certificates) {
+    std::vector<GWData> ders;
+    for (const auto& certificate : certificates.value_or(GWCertificateArray())) {
+        ders.push_back(certificate->data());
+    }
+    return ders;
+}
+
+TEST_F(GWXARArchiveSigned, CertificatesAreWholeDERAndNameTheirChain) {
+    const auto& chain = signing().leaf(XarKeyType::ecdsa).chain;
+    auto certificate = GWCertificate::createWithData(chain.front());
+    ASSERT_TRUE(certificate);
+    EXPECT_EQ(certificate->data(), chain.front());
+    GWData truncated(chain.front().begin(), chain.front().end() - 1), padded = chain.front();
+    padded.push_back(0);
+    for (const GWData& bad : {truncated, padded, GWData{}, gwtest::bytesOf("0\x82garbage")}) {
+        EXPECT_FALSE(GWCertificate::createWithData(bad)) << gwtest::hex(bad);
+    }
+    EXPECT_EQ(GWXARSignature::initWithType(GWXARSignatureTypeECDSA, gwtest::bytesOf("sig"),
+                                           certificatesOf(chain), false)
+                  ->certificateCommonNames(),
+              (std::vector<std::string>{"GW Test ECDSA Signer", "GW Test Intermediate CA"}));
+    EXPECT_FALSE(
+        GWXARSignature::initWithType(1, {}, std::nullopt, false)->certificateCommonNames());
+
+    // One certificate without a common name leaves the chain without names.
+    const auto result = gwtest::runCommand(
+        "openssl req -x509 -new -newkey ec -pkeyopt ec_paramgen_curve:P-256 -nodes -keyout " +
+        gwtest::shellQuote(directory_.file("key")) + " -subj /O=Nameless -days 1 -outform DER " +
+        "-out " + gwtest::shellQuote(directory_.file("cert")) + " 2>&1");
+    ASSERT_EQ(result.status, 0) << result.output;
+    auto nameless = GWCertificate::createWithData(gwtest::readFile(directory_.file("cert")));
+    ASSERT_TRUE(nameless);
+    EXPECT_FALSE(nameless->commonName());
+    GWCertificateArray certificates = certificatesOf(chain);
+    certificates.push_back(nameless);
+    EXPECT_FALSE(
+        GWXARSignature::initWithType(1, {}, certificates, false)->certificateCommonNames());
+}
+
+// Writes what a signature would, with bytes of its choosing as a certificate.
+class ForgedSignature : public GWCoding {
+public:
+    explicit ForgedSignature(GWValue certificate) : certificate_(std::move(certificate)) {}
+    std::string className() const override { return GWXARSignature::kClassName; }
+    void encodeWithCoder(GWCoder& coder) const override {
+        coder.encodeInteger(1, "Type");
+        coder.encodeValue(GWValue(GWArray{certificate_}), "Certificates");
+    }
+
+private:
+    GWValue certificate_;
+};
+
+TEST_F(GWXARArchiveSigned, SignatureValuesRoundTripAndStoredNonCertificatesAreRefused) {
+    const auto& chain = signing().leaf(XarKeyType::ecdsa).chain;
+    for (const bool extended : {false, true}) {
+        auto signature =
+            GWXARSignature::initWithType(GWXARSignatureTypeCMS, gwtest::bytesOf("signature bytes"),
+                                         certificatesOf(chain), extended);
+        auto decoded = GWKeyedUnarchiver::unarchiveObjectWithData<GWXARSignature>(
+            GWKeyedArchiver::archivedDataWithRootObject(signature));
+        ASSERT_TRUE(decoded);
+        EXPECT_EQ(decoded->type(), GWXARSignatureTypeCMS);
+        EXPECT_EQ(decoded->signatureData(), gwtest::bytesOf("signature bytes"));
+        EXPECT_EQ(decoded->isExtended(), extended);
+        EXPECT_EQ(encodingsOf(decoded->certificates()), chain);
+        EXPECT_EQ(encodingsOf(signature->copy()->certificates()), chain);
+    }
+    // No certificates stay no certificates, not an empty list.
+    auto bare = GWKeyedUnarchiver::unarchiveObjectWithData<GWXARSignature>(
+        GWKeyedArchiver::archivedDataWithRootObject(
+            GWXARSignature::initWithType(GWXARSignatureTypeRSA, {}, std::nullopt, false)));
+    ASSERT_TRUE(bare);
+    EXPECT_FALSE(bare->certificates());
+
+    GWCodingRegistry::registerClass<GWXARSignature>();
+    for (const GWValue& stored :
+         {GWValue(gwtest::bytesOf("not DER")), GWValue(std::string("text"))}) {
+        EXPECT_FALSE(GWKeyedUnarchiver::unarchiveObjectWithData<GWXARSignature>(
+            GWKeyedArchiver::archivedDataWithRootObject(ForgedSignature(stored))));
+    }
+    auto good = GWKeyedUnarchiver::unarchiveObjectWithData<GWXARSignature>(
+        GWKeyedArchiver::archivedDataWithRootObject(ForgedSignature(GWValue(chain.front()))));
+    ASSERT_TRUE(good);
+    EXPECT_EQ(encodingsOf(good->certificates()), std::vector<GWData>{chain.front()});
 }
 
 }  // namespace

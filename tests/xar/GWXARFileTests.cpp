@@ -1,9 +1,15 @@
+// The entry and archive model: types, paths, ordering, ACLs, keyed
+// persistence and copying.
+
 #include <gtest/gtest.h>
 
+#include <sstream>
+
+#include "XarTestSupport.h"
 #include "foundation/GWCoder.h"
-#include "foundation/GWFormat.h"
-#include "support/CoderTestSupport.h"
-#include "xar/GWXARFile.h"
+#include "support/TestSupport.h"
+#include "support/XarBuilder.h"
+#include "xar/GWXARArchive.h"
 
 namespace {
 
@@ -12,22 +18,6 @@ GWXARFilePtr entry(const std::string& name, std::uint16_t mode = 0100644) {
     file->setName(name);
     file->setPermissionsMode(mode);
     return file;
-}
-
-std::string pointer(const void* p) {
-    return GWFormat("%p", p);
-}
-
-// `text` with every "\n" followed by `indent`.
-std::string indentLines(const std::string& text, const std::string& indent) {
-    std::string out;
-    for (char c : text) {
-        out += c;
-        if (c == '\n') {
-            out += indent;
-        }
-    }
-    return out;
 }
 
 // A description with the object addresses blanked: equal exactly when every
@@ -114,9 +104,6 @@ struct SampleTree {
     }
 };
 
-// Records the keys an object writes, in order.
-using gwtest::RecordingCoder;
-
 TEST(GWXARFileType, FollowsTheModeAndTheResolvedHardLink) {
     const std::pair<std::uint16_t, GWXARFileType> cases[] = {
         {0100644, GWXARFileTypeRegular},      {0040755, GWXARFileTypeDirectory},
@@ -136,9 +123,12 @@ TEST(GWXARFileType, FollowsTheModeAndTheResolvedHardLink) {
     }
     // The link is weak: with the target gone the entry is a plain file again.
     EXPECT_EQ(link->type(), GWXARFileTypeRegular);
+    // Compression numbers 4 and 5 were once named one off.
+    EXPECT_EQ(GWXARDataReference::stringFromCompressionType(4), "XZ");
+    EXPECT_EQ(GWXARDataReference::stringFromCompressionType(5), "Unknown");
 }
 
-TEST(GWXARFileTree, PathsAndHardLinkPaths) {
+TEST(GWXARFileTree, PathsHardLinkPathsAndTheArchive) {
     auto x = entry("x", 0040755), y = entry("y");
     x->setChildren({y});
     auto a = entry("a", 0040755), b = entry("b", 0040755), c = entry("c", 0040755);
@@ -154,6 +144,15 @@ TEST(GWXARFileTree, PathsAndHardLinkPaths) {
     EXPECT_EQ(deep->hardlinkPath(), "../../../x/y");
     EXPECT_EQ(shallow->hardlinkPath(), "../x/y");
     EXPECT_EQ(top->hardlinkPath(), "x/y");
+
+    // The archive comes from the nearest ancestor that has one.
+    auto archive = standInArchive(), other = standInArchive();
+    auto root = GWXARFile::initWithArchive(archive);
+    root->setChildren({a});
+    EXPECT_EQ(deep->archive(), archive);
+    b->setArchive(other);
+    EXPECT_EQ(deep->archive(), other);
+    EXPECT_EQ(entry("alone")->archive(), nullptr);
 }
 
 TEST(GWXARFileTree, ChildrenSortCaseInsensitivelyWithNumbersByValue) {
@@ -168,18 +167,6 @@ TEST(GWXARFileTree, ChildrenSortCaseInsensitivelyWithNumbersByValue) {
     auto huge = entry("v100000000000000000000000"), big = entry("v99999999999999999999999");
     directory->setChildren({huge, same1, same2, file2, zero, big});
     EXPECT_EQ(directory->children(), (GWXARFileArray{file2, zero, same1, same2, big, huge}));
-}
-
-TEST(GWXARFileTree, ArchiveComesFromTheNearestAncestorThatHasOne) {
-    auto archive = standInArchive(), other = standInArchive();
-    auto top = GWXARFile::initWithArchive(archive);
-    auto middle = entry("m", 0040755), leaf = entry("l");
-    top->setChildren({middle});
-    middle->setChildren({leaf});
-    EXPECT_EQ(leaf->archive(), archive);
-    middle->setArchive(other);
-    EXPECT_EQ(leaf->archive(), other);
-    EXPECT_EQ(entry("alone")->archive(), nullptr);
 }
 
 TEST(GWXARFileACL, SlotsOwnTheirCopies) {
@@ -198,7 +185,7 @@ TEST(GWXARFileACL, SlotsOwnTheirCopies) {
     EXPECT_EQ(file->accessACL(), nullptr);
 }
 
-TEST(GWXARFileACL, TextIsPOSIXOrMacExtendedOrAnError) {
+TEST(GWXARFileACL, TextAndPersistentFormRoundTripAndRefuseDamage) {
     EXPECT_FALSE(aclFromText("user::rwx,group::r-x,other::r--").isMacExtended());
     EXPECT_TRUE(
         aclFromText("!#acl 1 defer_inherit\n"
@@ -211,9 +198,6 @@ TEST(GWXARFileACL, TextIsPOSIXOrMacExtendedOrAnError) {
         EXPECT_FALSE(GWACL::fromText(bad, &error)) << bad;
         EXPECT_TRUE(error && error->is(kGWPOSIXErrorDomain, EINVAL)) << bad;
     }
-}
-
-TEST(GWXARFileACL, PersistentFormRoundTripsAndRefusesDamage) {
     for (const char* text : {"u::rw-,u:1000:r--,g::r--,g:50:rw-,m::rw-,o::---", kMacACL}) {
         auto bytes = GWXARFile::dataFromACL(aclFromText(text), nullptr);
         ASSERT_TRUE(bytes);
@@ -236,117 +220,6 @@ TEST(GWXARFileACL, PersistentFormRoundTripsAndRefusesDamage) {
     }
 }
 
-TEST(GWXARFileText, TypeNames) {
-    EXPECT_EQ(GWXARDataReference::stringFromChecksumType(0), "None");
-    EXPECT_EQ(GWXARDataReference::stringFromChecksumType(1), "Unknown");
-    EXPECT_EQ(GWXARDataReference::stringFromChecksumType(2), "Unknown");
-    EXPECT_EQ(GWXARDataReference::stringFromChecksumType(3), "MD2");
-    EXPECT_EQ(GWXARDataReference::stringFromChecksumType(9), "SHA512");
-    EXPECT_EQ(GWXARDataReference::stringFromCompressionType(3), "LZMA");
-    EXPECT_EQ(GWXARDataReference::stringFromCompressionType(4), "XZ");
-    EXPECT_EQ(GWXARDataReference::stringFromCompressionType(5), "Unknown");
-    EXPECT_EQ(GWXARFile::stringFromFileType(GWXARFileTypeCharacterSpecial), "character special");
-}
-
-TEST(GWXARFileText, DescriptionOfALeafWithItsDataFork) {
-    auto file = entry("f");
-    file->setOwnerID(501);
-    file->setGroupOwnerID(20);
-    file->setOwnerName("me");
-    file->setModificationDate(GWDate::dateWithISO8601String("2010-01-02T03:04:05"));
-    file->setPosixFlags(0x20000);
-    file->setInode(7);
-    file->setDeviceNumber(-1);
-    file->setDeviceMinorNumber(3);
-    GWACL access = aclFromText("u::rw-,g::r--,o::---");
-    file->setAccessACL(&access);
-    auto reference = sampleReference();
-    file->setDataFork(reference);
-    EXPECT_EQ(
-        file->description(),
-        "<GWXARFile " + pointer(file.get()) +
-            "\n\tname=f\n\tparent=0x0 (null)\n\ttype=regular\n\tmode=100644\n\townerID=501\n\t"
-            "groupOwnerID=20\n\townerName=me\n\tgroupOwnerName=(null)\n\tcreationDate=(null)\n\t"
-            "modificationDate=2010-01-02T03:04:05Z\n\taccessDate=(null)\n\t"
-            "statusChangeDate=(null)\n\tposixFlags=131072\n\tdefaultACL='(null)'\n\t"
-            "accessACL='user::rw-\n\tgroup::r--\n\tother::---\n\t'\n\textendedACL='(null)'\n\t"
-            "inode=7\n\tdeviceNumber=4294967295\n\tsymlinkDestination='(null)'\n\t"
-            "hardlinkDestination=0x0 (null)\n\tdeviceMajorNumber=0\n\tdeviceMinorNumber=3\n\t"
-            "dataFork=<GWXARDataReference " +
-            pointer(reference.get()) +
-            "\n\t\tname=(null)\n\t\toffset=0x1c\n\t\tcompressedSize=11 bytes\n\t\t"
-            "uncompressedSize=3 bytes\n\t\tcompressedChecksum=<abcdef01 23> (SHA1)\n\t\t"
-            "uncompressedChecksum=(null) (Unknown)\n\t\tcompressionType=GZip\n\t>\n>");
-}
-
-TEST(GWXARFileText, DescriptionNestsAttributesAndChildren) {
-    auto directory = entry("d", 0040755);
-    auto a = entry("a"), b = entry("b");
-    directory->setChildren({b, a});
-    auto attribute = GWXARDataReference::init();
-    directory->addExtendedAttribute(attribute);
-    directory->addExtendedAttribute(attribute);
-    auto target = entry("t");
-    a->setHardlinkDestination(target);
-
-    auto twice = [](const std::string& text) { return indentLines(text, "\t\t"); };
-    const std::string tail =
-        "dataFork=(null)\n\textendedAttributes={\n\t\t" + twice(attribute->description()) +
-        ",\n\t\t" + twice(attribute->description()) + "\n\t}\n\tchildren={\n\t\t" +
-        twice(a->description()) + ",\n\t\t" + twice(b->description()) + "\n\t}\n>";
-    EXPECT_TRUE(directory->description().ends_with(tail)) << directory->description();
-    EXPECT_NE(
-        a->description().find("\n\tparent=" + pointer(directory.get()) + " d\n\ttype=hard link\n"),
-        std::string::npos);
-    EXPECT_NE(a->description().find("\n\thardlinkDestination=" + pointer(target.get()) + " t\n"),
-              std::string::npos);
-}
-
-TEST(GWXARFileCoding, WritesItsKeysInOrderAndNothingWithoutKeys) {
-    SampleTree tree;
-    RecordingCoder link(true);
-    tree.link->encodeWithCoder(link);
-    EXPECT_EQ(link.keys, (std::vector<std::string>{
-                             "Name", "PermissionsMode", "OwnerID", "GroupOwnerID", "POSIXFlags",
-                             "Inode", "DeviceNumber", "ItemID", "HardlinkDestinationID",
-                             "HardlinkPath", "DeviceMajorNumber", "DeviceMinorNumber"}));
-    // The resolved target's identifier, not the one the entry recorded.
-    EXPECT_EQ(*link.values["HardlinkDestinationID"].string(), "2");
-    EXPECT_EQ(*link.values["HardlinkPath"].string(), "../dir/file");
-
-    RecordingCoder file(true);
-    tree.file->encodeWithCoder(file);
-    EXPECT_EQ(file.keys, (std::vector<std::string>{"Name",
-                                                   "PermissionsMode",
-                                                   "OwnerID",
-                                                   "GroupOwnerID",
-                                                   "OwnerName",
-                                                   "GroupOwnerName",
-                                                   "CreationDate",
-                                                   "ModificationDate",
-                                                   "AccessDate",
-                                                   "AttributeModificationDate",
-                                                   "POSIXFlags",
-                                                   "DefaultACL",
-                                                   "AccessACL",
-                                                   "ExtendedACL",
-                                                   "Inode",
-                                                   "DeviceNumber",
-                                                   "ItemID",
-                                                   "DeviceMajorNumber",
-                                                   "DeviceMinorNumber",
-                                                   "DataFork",
-                                                   "ExtendedAttributes"}));
-
-    RecordingCoder plain(false);
-    tree.directory->encodeWithCoder(plain);
-    tree.file->dataFork()->encodeWithCoder(plain);
-    EXPECT_TRUE(plain.keys.empty());
-    GWNonKeyedCoder nonKeyed;
-    EXPECT_EQ(GWXARFile::initWithCoder(nonKeyed), nullptr);
-    EXPECT_EQ(GWXARDataReference::initWithCoder(nonKeyed), nullptr);
-}
-
 TEST(GWXARFileCoding, KeyedRoundTripKeepsValuesButNotTheWeakLinks) {
     SampleTree tree;
     GWErrorPtr error;
@@ -362,9 +235,12 @@ TEST(GWXARFileCoding, KeyedRoundTripKeepsValuesButNotTheWeakLinks) {
     auto link = decoded->children()[1];
     EXPECT_EQ(file->parent(), decoded);
     EXPECT_EQ(file->itemID(), "2");
+    // The resolved target's identifier, not the stale one the entry recorded.
     EXPECT_EQ(link->hardlinkDestinationID(), "2");
     EXPECT_EQ(file->extendedACL()->macExtendedText(), kMacACL);
     EXPECT_EQ(file->extendedAttributes()[0]->uncompressedChecksum(), GWData{});
+    GWNonKeyedCoder nonKeyed;
+    EXPECT_EQ(GWXARFile::initWithCoder(nonKeyed), nullptr);
 }
 
 TEST(GWXARFileCopy, IsDeepAndLeavesTheChildrensParentAtTheSource) {
@@ -379,12 +255,108 @@ TEST(GWXARFileCopy, IsDeepAndLeavesTheChildrensParentAtTheSource) {
     EXPECT_EQ(copy->archive(), nullptr);
     EXPECT_EQ(link->hardlinkDestination(), nullptr);
     EXPECT_EQ(link->hardlinkDestinationID(), "stale");
-    EXPECT_EQ(link->itemID(), "3");
     // Owned parts are the copy's own.
     EXPECT_NE(file->accessACL()->handle(), tree.file->accessACL()->handle());
     EXPECT_NE(file->extendedAttributes()[0], tree.file->extendedAttributes()[0]);
     tree.file->dataFork()->setOffset(1);
     EXPECT_EQ(file->dataFork()->offset(), 0x1cu);
+}
+
+// A linked pair, a nested file, and a subdocument, with a checksum that fails.
+GWXARArchivePtr loadedArchive(const gwtest::TemporaryDirectory& directory) {
+    gwtest::XarBuilder builder;
+    builder.corruptStoredChecksum = true;
+    builder.setTOCDocument(
+        "<xar><subdoc subdoc_name=\"info\"><about kind=\"test\">text</about></subdoc><toc>"
+        "<checksum style=\"sha1\"><offset>0</offset><size>20</size></checksum>"
+        "<file id=\"1\"><name>dir</name><type>directory</type>"
+        "<file id=\"2\"><name>original</name><type>file</type></file></file>"
+        "<file id=\"3\"><name>link</name><type link=\"2\">hardlink</type></file>"
+        "</toc></xar>");
+    gwtest::writeFile(directory.file("a.xar"), builder.bytes());
+    GWErrorPtr error;
+    auto archive = GWXARArchive::initWithURL(directory.url("a.xar"), false, &error);
+    EXPECT_TRUE(archive) << (error ? error->localizedDescription() : "");
+    return archive;
+}
+
+std::string xmlText(const std::shared_ptr<pugi::xml_document>& document) {
+    std::ostringstream stream;
+    document->save(stream, "", pugi::format_raw | pugi::format_no_declaration);
+    return stream.str();
+}
+
+void expectLinkedWithin(const GWXARArchivePtr& archive) {
+    auto link = archive->fileWithPath("link");
+    auto original = archive->fileWithPath("dir/original");
+    ASSERT_TRUE(link && original);
+    EXPECT_EQ(link->hardlinkDestination(), original);
+    EXPECT_EQ(link->archive(), archive);
+    EXPECT_EQ(original->archive(), archive);
+    EXPECT_EQ(original->parent(), archive->fileWithPath("dir"));
+}
+
+TEST(GWXARArchiveCoding, KeyedRoundTripRestoresEverythingButTheQueue) {
+    gwtest::TemporaryDirectory directory;
+    const GWXARArchivePtr source = loadedArchive(directory);
+    ASSERT_TRUE(source);
+    source->setChecksumValidationError(GWCocoaError(GWFileReadCorruptFileError));
+    source->setPrivateSignatureIsValid(true);
+    source->setIsCancelled(true);
+
+    GWErrorPtr error;
+    auto decoded = GWKeyedUnarchiver::unarchiveObjectWithData<GWXARArchive>(
+        GWKeyedArchiver::archivedDataWithRootObject(*source, &error), &error);
+    ASSERT_TRUE(decoded) << (error ? error->localizedDescription() : "");
+    EXPECT_EQ(decoded->URL(), source->URL());
+    EXPECT_EQ(gwtest::namesOf(decoded->files()), gwtest::namesOf(source->files()));
+    EXPECT_EQ(decoded->tocChecksum(), source->tocChecksum());
+    EXPECT_EQ(decoded->tocChecksum().size(), 20u);
+    EXPECT_FALSE(decoded->checksumIsValid());
+    EXPECT_TRUE(decoded->privateSignatureIsValid());
+    EXPECT_FALSE(decoded->signatureIsValid());  // the checksum still fails
+    ASSERT_TRUE(decoded->checksumValidationError());
+    EXPECT_TRUE(decoded->checksumValidationError()->is(kGWCocoaErrorDomain, 259));
+    // Without an error of its own, the signature reports the checksum's.
+    EXPECT_EQ(decoded->signatureValidationError(), decoded->checksumValidationError());
+    ASSERT_EQ(decoded->subdocuments().size(), 1u);
+    EXPECT_EQ(xmlText(decoded->subdocuments().at("info")),
+              xmlText(source->subdocuments().at("info")));
+    EXPECT_FALSE(decoded->operationQueue());
+    EXPECT_FALSE(decoded->isCancelled());
+    expectLinkedWithin(decoded);
+
+    auto empty = GWKeyedUnarchiver::unarchiveObjectWithData<GWXARArchive>(
+        GWKeyedArchiver::archivedDataWithRootObject(*GWXARArchive::init()));
+    ASSERT_TRUE(empty);
+    EXPECT_TRUE(empty->files().empty() && empty->tocChecksum().empty());
+    GWNonKeyedCoder nonKeyed;
+    EXPECT_FALSE(GWXARArchive::initWithCoder(nonKeyed));
+}
+
+TEST(GWXARArchiveCopy, IsDeepAndLinkedWithinItself) {
+    gwtest::TemporaryDirectory directory;
+    const GWXARArchivePtr source = loadedArchive(directory);
+    ASSERT_TRUE(source);
+    source->setPrivateSignatureValidationError(GWCocoaError(GWFileReadUnknownError));
+    auto copy = source->copy();
+
+    EXPECT_TRUE(copy->operationQueue());
+    EXPECT_NE(copy->operationQueue(), source->operationQueue());
+    EXPECT_EQ(copy->URL(), source->URL());
+    EXPECT_NE(copy->ref(), source->ref());
+    EXPECT_EQ(copy->tocChecksum(), source->tocChecksum());
+    EXPECT_EQ(copy->checksumIsValid(), source->checksumIsValid());
+    EXPECT_EQ(copy->privateSignatureValidationError(), source->privateSignatureValidationError());
+    EXPECT_NE(copy->files()[0], source->files()[0]);
+    expectLinkedWithin(source);
+    auto link = copy->fileWithPath("link");
+    ASSERT_TRUE(link);
+    EXPECT_EQ(link->hardlinkDestination(), copy->fileWithPath("dir/original"));
+    EXPECT_EQ(link->archive(), copy);
+    // Subdocuments are the copy's own.
+    copy->subdocuments().at("info")->document_element().set_name("changed");
+    EXPECT_STREQ(source->subdocuments().at("info")->document_element().name(), "about");
 }
 
 }  // namespace

@@ -8,16 +8,68 @@
 #include "GWArchiveSupport/GWArchiveConstants.h"
 #include "XarSignatureTestSupport.h"
 #include "foundation/GWChecksum.h"
+#include "xar/GWXARLoadOperation.h"
 
 namespace {
 
-using gwtest::affectedNode;
-using gwtest::bytesOf;
-using gwtest::SignedTOCFixture;
-using gwtest::TOCSignature;
-using gwtest::unknownEntity;
-using gwtest::XarKeyType;
-using gwtest::XarSigning;
+using namespace gwtest;
+
+// A signature element to place in a table of contents: its bytes go to the heap.
+struct TOCSignature {
+    std::string style;
+    GWData bytes;
+    std::string keyInfoXML;
+    bool extended = false;
+};
+
+// A table of contents holding `signatures` (and any `extraXML`), a heap file
+// holding their bytes behind a few bytes of header, and a load operation
+// reading that file with `checksum` as the table-of-contents checksum.
+class SignedTOCFixture {
+public:
+    SignedTOCFixture(const std::vector<TOCSignature>& signatures, const GWData& checksum,
+                     const std::string& extraXML = "") {
+        // Bytes before the heap, so that offsets are seen to count from the heap's start.
+        const std::string header = "HEADER+TOC";
+        GWData file = bytesOf(header);
+        std::string elements;
+        for (const TOCSignature& signature : signatures) {
+            elements += XarSigning::signatureElement(signature.style, file.size() - header.size(),
+                                                     signature.bytes.size(), signature.keyInfoXML,
+                                                     signature.extended);
+            file.insert(file.end(), signature.bytes.begin(), signature.bytes.end());
+        }
+        writeFile(folder_.file("heap"), file);
+        const std::string text = "<xar><toc>" + elements + extraXML + "</toc></xar>";
+        document_.load_string(text.c_str(), GWXARLoadOperation::kTOCParseOptions);
+        operation_->setArchiveURL(folder_.url("heap"));
+        operation_->setFileHandle(
+            GWRemoteFileHandle::initForReadingFromURL(folder_.url("heap"), nullptr));
+        operation_->setHeapStart(header.size());
+        operation_->setTOCChecksum(checksum);
+    }
+
+    pugi::xml_node toc() const { return document_.child("xar").child("toc"); }
+    GWXARLoadOperation& operation() { return *operation_; }
+    // verifySignaturesWithTOC with the header's algorithm (a GWChecksum number).
+    bool verify(GWErrorPtr* error, int checksumAlgorithm = 5) {
+        return operation_->verifySignaturesWithTOC(toc(), checksumAlgorithm, error);
+    }
+
+private:
+    TemporaryDirectory folder_;
+    pugi::xml_document document_;
+    GWXARLoadOperationPtr operation_ = GWXARLoadOperation::initWithArchive(nullptr, false);
+};
+
+// The XAR-domain detail texts of an error; "(no error)" without one.
+std::string unknownEntity(const GWErrorPtr& error) {
+    return error ? error->detailString(kGWXARArchiveUnknownEntityErrorKey) : "(no error)";
+}
+
+std::string affectedNode(const GWErrorPtr& error) {
+    return error ? error->detailString(kGWXARArchiveAffectedXMLNodeErrorKey) : "(no error)";
+}
 
 class GWXARSignatureVerification : public ::testing::Test {
 protected:
@@ -26,7 +78,7 @@ protected:
         trust_.emplace(signing().rootCertificateFile());
     }
 
-    static XarSigning& signing() { return gwtest::sharedSigning(); }
+    static XarSigning& signing() { return sharedSigning(); }
 
     // A signature of `style` by the leaf of `type` over `checksum`, carrying its chain.
     static TOCSignature signedBy(const std::string& style, XarKeyType type,
@@ -44,72 +96,46 @@ protected:
 
     const GWData checksum_ =
         GWChecksum::checksumForData(bytesOf("a table of contents"), GWChecksumAlgorithmSHA1);
-    std::optional<gwtest::TrustedRootScope> trust_;
+    std::optional<TrustedRootScope> trust_;
 };
 
-TEST_F(GWXARSignatureVerification, RawSignaturesOfEveryKeyTypeVerify) {
-    const std::pair<std::string, XarKeyType> cases[] = {
-        {"RSA", XarKeyType::rsa}, {"DSA", XarKeyType::dsa}, {"ECDSA", XarKeyType::ecdsa}};
+// Every key type and CMS, over SHA-1 and MD5 checksums; then with the
+// signature's last byte (its value, in all four encodings) flipped, and signed
+// over another checksum.
+TEST_F(GWXARSignatureVerification, SignaturesVerifyAndAlteredOnesDoNot) {
+    const GWData md5 = GWChecksum::checksumForData(bytesOf("toc"), GWChecksumAlgorithmMD5);
+    GWData other = checksum_;
+    other[7] ^= 0x80;
+    const std::pair<std::string, XarKeyType> cases[] = {{"RSA", XarKeyType::rsa},
+                                                        {"DSA", XarKeyType::dsa},
+                                                        {"ECDSA", XarKeyType::ecdsa},
+                                                        {"CMS", XarKeyType::rsa}};
     for (const auto& [style, type] : cases) {
+        SCOPED_TRACE(style);
         const TOCSignature signature = signedBy(style, type, checksum_);
         SignedTOCFixture fixture({signature}, checksum_);
         GWErrorPtr error;
-        EXPECT_TRUE(fixture.verify(&error)) << style << ": " << gwtest::unknownEntity(error)
-                                            << (error ? error->localizedDescription() : "");
-        ASSERT_TRUE(fixture.operation().signatures());
+        EXPECT_TRUE(fixture.verify(&error)) << (error ? error->localizedDescription() : "");
         ASSERT_EQ(fixture.operation().signatures()->size(), 1u);
         const auto& loaded = *fixture.operation().signatures()->front();
-        EXPECT_EQ(loaded.signatureData(), signature.bytes) << style;
+        EXPECT_EQ(loaded.signatureData(), signature.bytes);
         EXPECT_FALSE(loaded.isExtended());
         EXPECT_EQ(loaded.certificateCommonNames(), signing().leaf(type).commonNames);
-    }
-}
+        if (type != XarKeyType::dsa) {
+            SignedTOCFixture overMD5({signedBy(style, type, md5)}, md5);
+            EXPECT_TRUE(overMD5.verify(&error, GWChecksumAlgorithmMD5))
+                << (error ? error->localizedDescription() : "");
+        }
 
-TEST_F(GWXARSignatureVerification, CMSSignatureVerifies) {
-    SignedTOCFixture fixture({signedBy("CMS", XarKeyType::rsa, checksum_)}, checksum_);
-    GWErrorPtr error;
-    EXPECT_TRUE(fixture.verify(&error)) << (error ? error->localizedDescription() : "");
-    EXPECT_EQ(fixture.operation().signatures()->front()->type(), GWXARSignatureTypeCMS);
-}
-
-TEST_F(GWXARSignatureVerification, MD5ChecksumsAreSignedAsMD5Digests) {
-    const GWData md5 = GWChecksum::checksumForData(bytesOf("toc"), GWChecksumAlgorithmMD5);
-    for (const auto& [style, type] :
-         {std::pair{"RSA", XarKeyType::rsa}, std::pair{"ECDSA", XarKeyType::ecdsa},
-          std::pair{"CMS", XarKeyType::ecdsa}}) {
-        SignedTOCFixture fixture({signedBy(style, type, md5)}, md5);
-        GWErrorPtr error;
-        EXPECT_TRUE(fixture.verify(&error, GWChecksumAlgorithmMD5))
-            << style << ": " << (error ? error->localizedDescription() : "");
-    }
-}
-
-TEST_F(GWXARSignatureVerification, AlteredSignatureBytesDoNotVerify) {
-    for (const auto& [style, type] :
-         {std::pair{"RSA", XarKeyType::rsa}, std::pair{"DSA", XarKeyType::dsa},
-          std::pair{"ECDSA", XarKeyType::ecdsa}, std::pair{"CMS", XarKeyType::rsa}}) {
-        TOCSignature signature = signedBy(style, type, checksum_);
-        ASSERT_FALSE(signature.bytes.empty());
-        // The last byte lies in the signature value for all four encodings.
-        signature.bytes.back() ^= 0x01;
-        SignedTOCFixture fixture({signature}, checksum_);
-        GWErrorPtr error;
-        EXPECT_FALSE(fixture.verify(&error)) << style;
-        expectXARError(error, GWXARArchiveInvalidSignatureError);
-        EXPECT_EQ(unknownEntity(error), "") << style;
-        EXPECT_EQ(affectedNode(error), "") << style;
-    }
-}
-
-TEST_F(GWXARSignatureVerification, SignaturesOverAnotherChecksumDoNotVerify) {
-    GWData other = checksum_;
-    other[7] ^= 0x80;
-    for (const auto& [style, type] :
-         {std::pair{"RSA", XarKeyType::rsa}, std::pair{"CMS", XarKeyType::rsa}}) {
-        SignedTOCFixture fixture({signedBy(style, type, other)}, checksum_);
-        GWErrorPtr error;
-        EXPECT_FALSE(fixture.verify(&error)) << style;
-        expectXARError(error, GWXARArchiveInvalidSignatureError);
+        TOCSignature altered = signature;
+        altered.bytes.back() ^= 0x01;
+        for (const TOCSignature& bad : {altered, signedBy(style, type, other)}) {
+            SignedTOCFixture refused({bad}, checksum_);
+            EXPECT_FALSE(refused.verify(&error));
+            expectXARError(error, GWXARArchiveInvalidSignatureError);
+            EXPECT_EQ(unknownEntity(error), "");
+            EXPECT_EQ(affectedNode(error), "");
+        }
     }
 }
 
@@ -131,7 +157,7 @@ TEST_F(GWXARSignatureVerification, CertificatesWithoutATrustedRootAreNotTrusted)
 
     // A chain that is sound but whose root the store does not hold.
     trust_.reset();
-    gwtest::TrustedRootScope otherRoot(selfSigned.certificateFile);
+    TrustedRootScope otherRoot(selfSigned.certificateFile);
     SignedTOCFixture unanchored({signedBy("RSA", XarKeyType::rsa, checksum_)}, checksum_);
     EXPECT_FALSE(unanchored.verify(&error));
     expectXARError(error, GWXARArchiveUntrustedCertificateError);
@@ -144,7 +170,7 @@ TEST_F(GWXARSignatureVerification, CMSSignerNotTrustedIsASecurityError) {
                              checksum_);
     {
         // With the self-signed certificate as the root, KeyInfo and the signer are trusted.
-        gwtest::TrustedRootScope both(selfSigned.certificateFile);
+        TrustedRootScope both(selfSigned.certificateFile);
         GWErrorPtr error;
         EXPECT_TRUE(fixture.verify(&error)) << (error ? error->localizedDescription() : "");
     }
@@ -161,81 +187,69 @@ TEST_F(GWXARSignatureVerification, CMSSignerNotTrustedIsASecurityError) {
     EXPECT_FALSE(error->URL());
 }
 
-TEST_F(GWXARSignatureVerification, CMSMessageWithoutSignersIsInvalid) {
-    const auto& identity = signing().leaf(XarKeyType::rsa);
-    SignedTOCFixture fixture({{"CMS", signing().certificatesOnlyCMS(identity),
-                               XarSigning::keyInfoElement(identity.chain)}},
-                             checksum_);
-    GWErrorPtr error;
-    EXPECT_FALSE(fixture.verify(&error));
-    expectXARError(error, GWXARArchiveInvalidSignatureError);
-    EXPECT_EQ(fixture.operation().signatures()->front()->verdictReason(), "no signers");
-}
-
-TEST_F(GWXARSignatureVerification, CMSBytesThatAreNoMessageAreASecurityError) {
-    SignedTOCFixture fixture({{"CMS", bytesOf("not DER at all"),
-                               XarSigning::keyInfoElement(signing().leaf(XarKeyType::rsa).chain)}},
-                             checksum_);
-    GWErrorPtr error;
-    EXPECT_FALSE(fixture.verify(&error));
-    ASSERT_TRUE(error);
-    EXPECT_EQ(error->domain(), GWSecurityErrorDomain);
-    EXPECT_NE(error->code(), 0);
-}
-
-TEST_F(GWXARSignatureVerification, CertificateTextThatIsNoCertificate) {
-    const std::string text = gwtest::base64Encode(bytesOf("this is not a certificate"));
-    const std::string keyInfo =
-        "<KeyInfo><X509Data><X509Certificate>" + text + "</X509Certificate></X509Data></KeyInfo>";
-    SignedTOCFixture fixture({{"RSA", bytesOf("sig"), keyInfo}}, checksum_);
-    GWErrorPtr error;
-    EXPECT_FALSE(fixture.verify(&error));
-    expectXARError(error, GWXARArchiveUntrustedCertificateError);
-    EXPECT_EQ(unknownEntity(error), text);
-    EXPECT_EQ(affectedNode(error), "<X509Certificate>" + text + "</X509Certificate>");
-    EXPECT_FALSE(fixture.operation().signatures());
-
-    // A certificate followed by stray bytes is not a certificate either.
+// Signature elements that cannot be checked: each fails with its error, the
+// entity it names and (a prefix of) the element it names.
+TEST_F(GWXARSignatureVerification, UncheckableSignaturesAreRefused) {
+    const std::string notCertificate = base64Encode(bytesOf("not a certificate"));
+    const auto certificates = [](const std::string& text) {
+        return "<KeyInfo><X509Data><X509Certificate>" + text +
+               "</X509Certificate></X509Data></KeyInfo>";
+    };
     GWData padded = signing().leaf(XarKeyType::rsa).chain.front();
     padded.push_back(0);
-    SignedTOCFixture trailing({{"RSA", bytesOf("sig"), XarSigning::keyInfoElement({padded})}},
-                              checksum_);
-    EXPECT_FALSE(trailing.verify(&error));
-    expectXARError(error, GWXARArchiveUntrustedCertificateError);
-}
-
-TEST_F(GWXARSignatureVerification, CertificateTextThatIsNoBase64) {
-    const std::string keyInfo =
-        "<KeyInfo><X509Data><X509Certificate>***</X509Certificate></X509Data></KeyInfo>";
-    SignedTOCFixture fixture({{"RSA", bytesOf("sig"), keyInfo}}, checksum_);
-    GWErrorPtr error;
-    EXPECT_FALSE(fixture.verify(&error));
-    ASSERT_TRUE(error);
-    EXPECT_TRUE(error->is(kGWCocoaErrorDomain, GWFileReadCorruptFileError));
-}
-
-TEST_F(GWXARSignatureVerification, SignaturesWithoutCertificates) {
-    const GWData bytes = signedBy("RSA", XarKeyType::rsa, checksum_).bytes;
-    // KeyInfo without X509Data loads, then fails the check; so does no KeyInfo at all.
-    for (const std::string& keyInfo :
-         {std::string("<KeyInfo><KeyName>k</KeyName></KeyInfo>"), std::string()}) {
-        SignedTOCFixture fixture({{"RSA", bytes, keyInfo}}, checksum_);
+    const std::string chain = XarSigning::keyInfoElement(signing().leaf(XarKeyType::rsa).chain);
+    const std::string xar = kGWXARArchiveErrorDomain;
+    const struct {
+        std::string style, keyInfo, element;  // `element` instead of a signature with heap bytes
+        std::string domain;
+        long code;  // 0: any
+        std::string entity = {}, node = {};
+    } cases[] = {
+        {"RSA", certificates(notCertificate), "", xar, GWXARArchiveUntrustedCertificateError,
+         notCertificate, "<X509Certificate>" + notCertificate + "</X509Certificate>"},
+        // A certificate followed by stray bytes is not a certificate either.
+        {"RSA", XarSigning::keyInfoElement({padded}), "", xar,
+         GWXARArchiveUntrustedCertificateError, base64Encode(padded)},
+        {"RSA", certificates("***"), "", kGWCocoaErrorDomain, GWFileReadCorruptFileError},
+        {"CMS", chain, "", GWSecurityErrorDomain, 0},
+        // Without certificates nothing vouches for the key.
+        {"RSA", "<KeyInfo><KeyName>k</KeyName></KeyInfo>", "", xar,
+         GWXARArchiveMissingCertificateError},
+        {"RSA", "", "", xar, GWXARArchiveMissingCertificateError},
+        {"RSA", "<KeyInfo><X509Data/></KeyInfo>", "", xar, GWXARArchiveMissingCertificateError, "",
+         "<signature style=\"RSA\">"},
+        {"SHA1withFOO", "", "", xar, GWXARArchiveUnknownSignatureStyleError, "SHA1withFOO",
+         "<signature"},
+        {"CMSwithRSA ", "", "", xar, GWXARArchiveUnknownSignatureStyleError, "CMSwithRSA "},
+        {"withrsa2", "", "", xar, GWXARArchiveUnknownSignatureStyleError, "withrsa2"},
+        {"", "", "", xar, GWXARArchiveUnknownSignatureStyleError, "", "<signature"},
+        {"", "", "<signature><offset>0</offset></signature>", xar,
+         GWXARArchiveUnknownSignatureStyleError},
+        {"", "", "<signature style=\"RSA\"><offset>twelve</offset></signature>", xar,
+         GWXARArchiveMalformedValueError, "twelve", "<offset>twelve</offset>"},
+        {"", "", "<signature style=\"RSA\"><size>-</size></signature>", xar,
+         GWXARArchiveMalformedValueError, "-", "<size>-</size>"},
+        {"", "", "<signature style=\"RSA\"><offset>99999999999999999999999</offset></signature>",
+         xar, GWXARArchiveMalformedValueError, "99999999999999999999999"},
+        // A signature larger than 16 KiB is no signature: nothing is read for it.
+        {"", "", "<signature style=\"RSA\"><size>16385</size></signature>", xar,
+         GWXARArchiveMalformedValueError, "16385", "<size>16385</size>"},
+    };
+    for (const auto& c : cases) {
+        SCOPED_TRACE(c.style + " " + c.keyInfo + c.element);
+        std::vector<TOCSignature> signatures;
+        if (c.element.empty()) {
+            signatures.push_back({c.style, bytesOf("sig"), c.keyInfo});
+        }
+        SignedTOCFixture fixture(signatures, checksum_, c.element);
         GWErrorPtr error;
-        ASSERT_TRUE(fixture.operation().loadSignaturesWithTOC(fixture.toc(), &error));
-        const auto& certificates = fixture.operation().signatures()->front()->certificates();
-        EXPECT_EQ(certificates.has_value(), !keyInfo.empty());
         EXPECT_FALSE(fixture.verify(&error));
-        expectXARError(error, GWXARArchiveMissingCertificateError);
-        EXPECT_EQ(unknownEntity(error), "");
-        EXPECT_EQ(affectedNode(error), "");
+        ASSERT_TRUE(error);
+        EXPECT_EQ(error->domain(), c.domain) << error->localizedDescription();
+        EXPECT_TRUE(c.code ? error->code() == c.code : error->code() != 0) << error->code();
+        EXPECT_EQ(unknownEntity(error), c.entity);
+        EXPECT_EQ(affectedNode(error).rfind(c.node, 0), 0u) << affectedNode(error);
     }
-
-    // X509Data without a certificate fails the load and names the signature element.
-    SignedTOCFixture empty({{"RSA", bytes, "<KeyInfo><X509Data/></KeyInfo>"}}, checksum_);
-    GWErrorPtr error;
-    EXPECT_FALSE(empty.operation().loadSignaturesWithTOC(empty.toc(), &error));
-    expectXARError(error, GWXARArchiveMissingCertificateError);
-    EXPECT_EQ(affectedNode(error).rfind("<signature style=\"RSA\">", 0), 0u) << affectedNode(error);
 }
 
 TEST_F(GWXARSignatureVerification, StylesMapToTypesWhateverTheirCase) {
@@ -250,36 +264,6 @@ TEST_F(GWXARSignatureVerification, StylesMapToTypesWhateverTheirCase) {
         GWErrorPtr error;
         ASSERT_TRUE(fixture.operation().loadSignaturesWithTOC(fixture.toc(), &error)) << style;
         EXPECT_EQ(fixture.operation().signatures()->front()->type(), type) << style;
-    }
-}
-
-TEST_F(GWXARSignatureVerification, UnknownStylesAreRefusedWithTheStyleAsWritten) {
-    for (const std::string style : {"SHA1withFOO", "CMSwithRSA ", "withrsa2", ""}) {
-        SignedTOCFixture fixture({{style, bytesOf("sig"), ""}}, checksum_);
-        GWErrorPtr error;
-        EXPECT_FALSE(fixture.verify(&error)) << style;
-        expectXARError(error, GWXARArchiveUnknownSignatureStyleError);
-        EXPECT_EQ(unknownEntity(error), style);
-        EXPECT_NE(affectedNode(error).find("<signature"), std::string::npos);
-    }
-    SignedTOCFixture noStyle({}, checksum_, "<signature><offset>0</offset></signature>");
-    GWErrorPtr error;
-    EXPECT_FALSE(noStyle.verify(&error));
-    expectXARError(error, GWXARArchiveUnknownSignatureStyleError);
-    EXPECT_FALSE(error->userInfo().count(kGWXARArchiveUnknownEntityErrorKey));
-}
-
-TEST_F(GWXARSignatureVerification, MalformedNumbersAreRefused) {
-    // A signature larger than 16 KiB is no signature: nothing is read for it.
-    for (const std::string child :
-         {"<offset>twelve</offset>", "<size>-</size>", "<offset>99999999999999999999999</offset>",
-          "<size>16385</size>"}) {
-        SignedTOCFixture fixture({}, checksum_,
-                                 "<signature style=\"RSA\">" + child + "</signature>");
-        GWErrorPtr error;
-        EXPECT_FALSE(fixture.verify(&error)) << child;
-        expectXARError(error, GWXARArchiveMalformedValueError);
-        EXPECT_EQ(affectedNode(error), child);
     }
 }
 
@@ -361,19 +345,6 @@ TEST_F(GWXARSignatureVerification, SignaturesReadFromTheHeapOffset) {
     // Ranges read once are not read again: no file is needed the second time.
     fixture.operation().setFileHandle(nullptr);
     EXPECT_TRUE(fixture.operation().loadSignaturesWithTOC(fixture.toc(), &error));
-}
-
-TEST(GWXARTrustedRootScope, RestoresTheEnvironment) {
-    setenv("SSL_CERT_FILE", "/before", 1);
-    unsetenv("SSL_CERT_DIR");
-    {
-        gwtest::TrustedRootScope scope("/during");
-        EXPECT_STREQ(std::getenv("SSL_CERT_FILE"), "/during");
-        EXPECT_NE(std::getenv("SSL_CERT_DIR"), nullptr);
-    }
-    EXPECT_STREQ(std::getenv("SSL_CERT_FILE"), "/before");
-    EXPECT_EQ(std::getenv("SSL_CERT_DIR"), nullptr);
-    unsetenv("SSL_CERT_FILE");
 }
 
 }  // namespace

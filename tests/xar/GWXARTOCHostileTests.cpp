@@ -1,11 +1,8 @@
 #include <gtest/gtest.h>
 
-#include <random>
-
 #include "GWArchiveSupport/GWArchiveConstants.h"
 #include "XarTestSupport.h"
 #include "support/TestSupport.h"
-#include "support/XarBuilder.h"
 
 namespace {
 
@@ -121,6 +118,9 @@ INSTANTIATE_TEST_SUITE_P(
         HostileTOC{"DeviceMinorTooLarge",
                    withProperty("<device><major>0</major><minor>256</minor></device>"), kXAR,
                    GWXARArchiveMalformedValueError, "256"},
+        HostileTOC{"DeviceMinorNegative",
+                   withProperty("<device><major>0</major><minor>-1</minor></device>"), kXAR,
+                   GWXARArchiveMalformedValueError, "-1"},
         HostileTOC{"CreationWithoutTime", withProperty("<FinderCreateTime></FinderCreateTime>"),
                    kXAR, GWXARArchiveMissingElementError, "time"},
         HostileTOC{"DeepFailureSurfaces", nested(10, withProperty("<type>portal</type>")), kXAR,
@@ -135,6 +135,12 @@ INSTANTIATE_TEST_SUITE_P(
                    "NSCocoaErrorDomain", GWFileReadCorruptFileError, ""},
         HostileTOC{"EmptyID", "<file id=\"\"><name>f</name></file>", nullptr, 0, ""},
         HostileTOC{"BadDate", withProperty("<atime>yesterday</atime>"), nullptr, 0, ""},
+        HostileTOC{"DateWithFraction", withProperty("<mtime>2010-01-02T03:04:05.5Z</mtime>"),
+                   nullptr, 0, ""},
+        HostileTOC{"DateWithTwoZones", withProperty("<mtime>2010-01-02T03:04:05ZZ</mtime>"),
+                   nullptr, 0, ""},
+        HostileTOC{"NameNotUTF8", "<file id=\"1\"><name enctype=\"base64\">Yf8=</name></file>",
+                   nullptr, 0, ""},
         HostileTOC{"BadDateDeepDown", nested(3, withProperty("<ctime>2010-13-01T00:00:00</ctime>")),
                    nullptr, 0, ""}),
     [](const testing::TestParamInfo<HostileTOC>& info) { return std::string(info.param.name); });
@@ -162,63 +168,6 @@ TEST(GWXARTOCHostileLimits, ManyDroppedEntriesStayCheap) {
         "</file><file id=\"l\"><name>l</name><type link=\"c19999\">hardlink</type></file>");
     ASSERT_TRUE(parsed.files);
     EXPECT_TRUE(gwtest::entryAtPath(*parsed.files, "top")->children().empty());
-}
-
-// Random damage to a real-looking table of contents: whatever the parser
-// makes of it, it must return normally (the sanitizer build checks the rest).
-TEST(GWXARTOCHostileLimits, MutatedTablesOfContentsNeverCrash) {
-    gwtest::XarBuilder builder;
-    const std::string data =
-        builder.dataElement("data", gwtest::bytesOf("hello"), gwtest::XarEncoding::gzip);
-    const std::string ea = builder.dataElement(
-        "ea", gwtest::bytesOf("v"), gwtest::XarEncoding::none, "md5", "<name>user.x</name>");
-    const std::string body =
-        "<file id=\"1\"><name>dir</name><type>directory</type><mode>0755</mode>"
-        "<file id=\"2\"><name>f</name><type link=\"original\">hardlink</type><uid>501</uid>"
-        "<mtime>2010-01-02T03:04:05Z</mtime><flags><UserNoDump/></flags>" +
-        data + ea +
-        "</file><file id=\"3\"><name>h</name><type link=\"2\">hardlink</type></file>"
-        "<file id=\"4\"><name>c</name><type>block special</type><device><major>8</major>"
-        "<minor>1</minor></device><acl><access>u::rw-,g::r--,o::---</access></acl></file>"
-        "</file>";
-    builder.setFiles(body);
-    const std::string document = builder.tocDocument();
-
-    std::mt19937 random(1234);
-    std::size_t parsedCount = 0;
-    for (int round = 0; round < 3000; ++round) {
-        std::string mutated = document;
-        const int edits = 1 + int(random() % 4);
-        for (int e = 0; e < edits; ++e) {
-            const std::size_t at = random() % mutated.size();
-            switch (random() % 3) {
-                case 0: mutated[at] = char(random() % 256); break;
-                case 1: mutated.erase(at, 1 + random() % 8); break;
-                default:
-                    mutated.insert(at, std::string(1 + random() % 4, "<>/\"0Z-9"[random() % 8]));
-            }
-            if (mutated.empty()) {
-                mutated = "x";
-            }
-        }
-        pugi::xml_document xml;
-        if (!xml.load_buffer(mutated.data(), mutated.size(),
-                             GWXARLoadOperation::kTOCParseOptions)) {
-            continue;
-        }
-        gwtest::LogCapture quiet;
-        auto operation = GWXARLoadOperation::initWithArchive(nullptr, false);
-        GWErrorPtr error;
-        auto files = operation->filesFromTOCElement(xml.child("xar").child("toc"), &error);
-        if (files) {
-            for (const auto& file : *files) {
-                (void)file->description();
-                (void)file->hardlinkPath();
-            }
-        }
-        ++parsedCount;
-    }
-    EXPECT_GT(parsedCount, 100u);
 }
 
 }  // namespace

@@ -26,31 +26,6 @@ GWXARArchivePtr openBuiltXar(const XarBuilder& xar, const TemporaryDirectory& di
     return archive;
 }
 
-GWData StreamCalls::bytes() const {
-    GWData joined;
-    for (const auto& call : calls) {
-        if (call.data) {
-            joined.insert(joined.end(), call.data->begin(), call.data->end());
-        }
-    }
-    return joined;
-}
-
-GWXARDataHandler recordingHandler(StreamCalls& calls, int refuseAt) {
-    return [&calls, refuseAt](std::optional<std::span<const std::uint8_t>> data, bool isDone,
-                              bool checksumFailed, const GWErrorPtr& error) {
-        StreamCalls::Call call;
-        if (data) {
-            call.data = GWData(data->begin(), data->end());
-        }
-        call.isDone = isDone;
-        call.checksumFailed = checksumFailed;
-        call.error = error;
-        calls.calls.push_back(std::move(call));
-        return int(calls.calls.size()) - 1 != refuseAt;
-    };
-}
-
 namespace {
 
 std::map<std::string, GWData> userAttributes(const std::string& path) {

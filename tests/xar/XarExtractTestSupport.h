@@ -23,25 +23,6 @@ std::string xarFileElement(int id, const std::string& name, const std::string& t
 GWXARArchivePtr openBuiltXar(const XarBuilder& xar, const TemporaryDirectory& directory,
                              const std::string& name = "test.xar");
 
-// Everything a data handler was told, call by call.
-struct StreamCalls {
-    struct Call {
-        std::optional<GWData> data;
-        bool isDone = false;
-        bool checksumFailed = false;
-        GWErrorPtr error;
-    };
-    std::vector<Call> calls;
-
-    // The data of every call, joined.
-    GWData bytes() const;
-    const Call& last() const { return calls.back(); }
-};
-
-// A handler that records each call into `calls` and refuses the call with
-// index `refuseAt` (never when negative).
-GWXARDataHandler recordingHandler(StreamCalls& calls, int refuseAt = -1);
-
 // One item of an extracted tree, as lstat and the file system describe it.
 struct TreeItem {
     mode_t mode = 0;

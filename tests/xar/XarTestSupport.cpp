@@ -92,12 +92,4 @@ std::vector<std::string> namesOf(const GWXARFileArray& files) {
     return names;
 }
 
-LogCapture::LogCapture() {
-    previous_ = GWSetLogSink([this](const std::string& line) { lines_.push_back(line); });
-}
-
-LogCapture::~LogCapture() {
-    GWSetLogSink(previous_);
-}
-
 }  // namespace gwtest

@@ -8,7 +8,6 @@
 #include <pugixml.hpp>
 
 #include "foundation/GWError.h"
-#include "foundation/GWLog.h"
 #include "xar/GWXARLoadOperation.h"
 
 namespace gwtest {
@@ -40,19 +39,5 @@ std::unique_ptr<pugi::xml_document> xmlElement(const std::string& xml);
 // The entry at a "/"-separated path below `files`, or null.
 GWXARFilePtr entryAtPath(const GWXARFileArray& files, const std::string& path);
 std::vector<std::string> namesOf(const GWXARFileArray& files);
-
-// Collects the library's log lines while alive.
-class LogCapture {
-public:
-    LogCapture();
-    ~LogCapture();
-    LogCapture(const LogCapture&) = delete;
-    LogCapture& operator=(const LogCapture&) = delete;
-    const std::vector<std::string>& lines() const { return lines_; }
-
-private:
-    std::vector<std::string> lines_;
-    GWLogSink previous_;
-};
 
 }  // namespace gwtest
