@@ -231,31 +231,6 @@ TEST(GWKeyedArchiver, KeysBeginningWithADollarSignAreKeptApartFromTheArchivesOwn
     EXPECT_FALSE(unarchiver->decodeObject("$class"));
 }
 
-TEST(GWKeyedArchiver, PythonReadsTheArchive) {
-    if (!gwtest::toolAvailable("python3")) {
-        GTEST_SKIP() << "python3 is not installed";
-    }
-    gwtest::TemporaryDirectory directory;
-    const std::string path = directory.file("archive.plist");
-    gwtest::writeFile(path, GWKeyedArchiver::archivedDataWithRootObject(fullNode()));
-    const std::string script = R"PY(
-import plistlib, sys
-d = plistlib.load(open(sys.argv[1], "rb"))
-root = d["$top"]["root"]
-print(d["$archiver"], d["$version"], root["$class"], root["Name"].encode("unicode_escape").decode(),
-      root["Offset"], root["Big"], root["Date"].isoformat(), len(root["Checksum"]),
-      root["Children"][0]["Name"], root["Fork"]["$class"], root["Fork"]["Extra"],
-      [leaf["Size"] for leaf in root["Leaves"]], root["Error"]["Domain"])
-)PY";
-    auto result = gwtest::runCommand("python3 -c " + gwtest::shellQuote(script) + " " +
-                                     gwtest::shellQuote(path));
-    ASSERT_EQ(result.status, 0) << result.output;
-    EXPECT_EQ(result.output,
-              "GWKeyedArchiver 1 TestNode r\\xe9sum\\xe9 -1234567890123 18446744073709551610 "
-              "1903-12-31T23:59:59.500000 100000 child TestLeafSubclass -9 "
-              "[0, 1099511627776, 2199023255552] NSPOSIXErrorDomain\n");
-}
-
 TEST(GWKeyedArchiver, CyclesDeepNestingAndNoRootAreRefused) {
     auto cycle = std::make_shared<TestNode>();
     cycle->children = std::vector{cycle};
