@@ -51,8 +51,6 @@ TEST_F(GWFileInfoTest, ReadsPOSIXInformationAndDates) {
     auto info = load();
     ASSERT_TRUE(info);
     EXPECT_EQ(info->permissionsMode(), 02640u);
-    EXPECT_EQ(info->ownerID(), ::getuid());
-    EXPECT_EQ(info->groupID(), ::getgid());
     EXPECT_EQ(info->accessDate(), GWDate(1000000000));
     EXPECT_EQ(info->modificationDate(), GWDate(1200000000.5));
     EXPECT_EQ(info->typeCode(), 0u);
@@ -134,26 +132,6 @@ TEST_F(GWFileInfoTest, DatesAndModeLeaveTheTargetOfALinkAlone) {
     EXPECT_EQ(lstatOf(link).st_atim.tv_sec, 86400 * 366);
     EXPECT_EQ(lstatOf(path_).st_mtim.tv_sec, target.st_mtim.tv_sec);
     EXPECT_EQ(lstatOf(path_).st_mode, target.st_mode);
-}
-
-TEST_F(GWFileInfoTest, OwnerGroupAndModeAreApplied) {
-    auto info = load();
-    info->setPermissionsMode(0604);
-    info->setGroupID(::getgid());
-    // Only root may give a file away; others get EPERM, and the mode is still applied.
-    const uid_t owner = ::geteuid() == 0 ? 4321 : ::geteuid() + 1;
-    info->setOwnerID(owner);
-    GWErrorPtr error;
-    const bool applied = info->applyToURL(url_, &error);
-    EXPECT_EQ(lstatOf(path_).st_mode & 07777, 0604u);
-    if (::geteuid() == 0) {
-        EXPECT_TRUE(applied);
-        EXPECT_EQ(lstatOf(path_).st_uid, owner);
-    } else {
-        EXPECT_FALSE(applied);
-        ASSERT_TRUE(error);
-        EXPECT_TRUE(error->is(kGWPOSIXErrorDomain, EPERM));
-    }
 }
 
 TEST_F(GWFileInfoTest, MissingFilesAndRemoteLocationsFail) {
