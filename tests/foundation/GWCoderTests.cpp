@@ -353,7 +353,7 @@ TEST(GWKeyedUnarchiver, EveryTruncatedArchiveIsCorrupt) {
 }
 
 TEST(GWCoder, NonKeyedCoderMakesClassesWriteNothingAndDecodeToNone) {
-    gwtest::WriteCountingCoder recorder;
+    gwtest::RecordingCoder recorder;
     EXPECT_FALSE(recorder.allowsKeyedCoding());
     fullNode()->encodeWithCoder(recorder);
     EXPECT_EQ(recorder.writes, 0);

@@ -68,7 +68,7 @@ TEST(GWRef, AStoredURLThatIsMissingOrRefusedDecodesToNone) {
         EXPECT_TRUE(error->is(kGWCocoaErrorDomain, GWFileReadCorruptFileError));
     }
     // A non-keyed coder gets nothing and gives nothing.
-    gwtest::WriteCountingCoder recorder;
+    gwtest::RecordingCoder recorder;
     GWRef::initWithURL(GWURL::fileURLWithPath("/data/archive.zip"))->encodeWithCoder(recorder);
     EXPECT_EQ(recorder.writes, 0);
     GWNonKeyedCoder coder;
