@@ -279,45 +279,35 @@ struct ServerCase {
     Script script;
     int expected;  // 0: the bytes of the file (the replacement, when redirected to it)
     bool failsAtOpen = false;
-    std::size_t replacementSize = 200000;
     const char* target = "archive";  // "refused": nobody listens; "unanswered": connect never ends
     bool announced = false;          // the range is fetched ahead before it is read
 };
 
 }  // namespace
 
+// Time-outs, replaced resources and a 404 are rows of the tool's own table,
+// which also checks that no wrong bytes are written; these are the rest.
 TEST(GWRemoteFileHandleMisbehavingServerTest, EachEndsInItsErrorWithinTheTimeLimits) {
     const ServerCase cases[] = {
         {"no range support", {Behaviour::ignoreRanges}, ENOTSUP, true},
-        {"not found", {Behaviour::notFound}, ENOENT, true},
         {"another range", {Behaviour::wrongRange}, EPROTO, true},
-        {"silent after accept", {Behaviour::silent}, ETIMEDOUT, true},
-        {"stall after headers", {Behaviour::stallAt, 0}, ETIMEDOUT, true},
-        {"one byte a second", {Behaviour::trickle}, ETIMEDOUT, true},
-        {"declares more than it sends", {Behaviour::stallAt, 150000}, ETIMEDOUT},
-        {"nobody listens", {}, ECONNREFUSED, true, 0, "refused"},
-        {"connect never answered", {}, ETIMEDOUT, true, 0, "unanswered"},
-        {"replaced, no validator", {.replaceAt = 2}, ESTALE, false, 190000},
-        {"replaced, weak tag", {.validators = Validators::weakTagAndDate, .replaceAt = 2}, ESTALE},
-        {"replaced, strong tag", {.validators = Validators::strongTag, .replaceAt = 2}, ESTALE},
+        {"nobody listens", {}, ECONNREFUSED, true, "refused"},
+        {"connect never answered", {}, ETIMEDOUT, true, "unanswered"},
         {"replaced while fetched ahead",
          {.validators = Validators::strongTag, .replaceAt = 2},
          ESTALE,
          false,
-         200000,
          "archive",
          true},
         {"stalls while fetched ahead",
          {Behaviour::stallAt, 150000},
          ETIMEDOUT,
          false,
-         200000,
          "archive",
          true},
         {"strong tag dropped",
          {.validators = Validators::strongTagDroppedLater, .replaceAt = 2},
          ESTALE},
-        {"later request redirected", {.location = "/other", .redirectAt = 2}, ESTALE},
         {"first request redirected to another host",
          {.location = "http://localhost:{port}/other", .redirectAt = 1},
          0},
@@ -345,7 +335,7 @@ TEST(GWRemoteFileHandleMisbehavingServerTest, EachEndsInItsErrorWithinTheTimeLim
         SCOPED_TRACE(row.label);
         const GWData content = gwtest::randomBytes(200000, 4);
         Script script = row.script;
-        script.replacement = gwtest::randomBytes(row.replacementSize, 5);
+        script.replacement = gwtest::randomBytes(200000, 5);
         ScriptedHTTPServer server(content, script);
         UnansweredPort unanswered;
         std::string address = "http://user:secret@" + server.address().substr(7);
