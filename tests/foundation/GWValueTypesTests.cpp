@@ -144,6 +144,8 @@ TEST(GWByteReader, ReadsAreCheckedAndFailureIsSticky) {
               "unexpected end of data at offset 0x6 while reading [0x4, 0x8)");
 
     GWByteReader whole(bytes);
+    EXPECT_FALSE(GWByteReader(bytes).skip(7));  // one past the end
+    EXPECT_TRUE(GWByteReader(bytes).skip(6));
     EXPECT_FALSE(whole.slice(4, 3).ok());
     EXPECT_FALSE(whole.slice(SIZE_MAX, 2).ok());
     GWByteReader part = whole.slice(2, 3);
