@@ -41,9 +41,10 @@ struct Assembly {
     std::uint64_t top = 0;
     std::optional<std::uint64_t> tableOffset;
     std::vector<std::uint64_t> offsetOverrides;  // replaces the first offsets
+    std::string signature = "bplist00";
 
     GWData build() const {
-        GWData out = bytes({'b', 'p', 'l', 'i', 's', 't', '0', '0'});
+        GWData out = gwtest::bytesOf(signature);
         std::vector<std::uint64_t> offsets;
         for (const GWData& object : objects) {
             offsets.push_back(out.size());
@@ -73,17 +74,17 @@ GWErrorPtr readError(const GWData& data) {
     return error;
 }
 
-bool holdsSigned(const GWValue& value) {
-    return std::holds_alternative<std::int64_t>(value.storage);
-}
-
 }  // namespace
 
-TEST(GWBinaryPropertyList, ScalarsAndNestedContainersRoundTripExactly) {
+TEST(GWBinaryPropertyList, ValuesRoundTripExactly) {
     GWDictionary inner{{"data", GWValue(GWData{1, 2, 3})}, {"empty", GWValue(GWArray())}};
     GWArray list{GWValue(1), GWValue("two"), GWValue(inner), GWValue(GWDictionary()),
                  GWValue(GWArray{GWValue(GWArray{GWValue(true)})})};
-    const std::vector<GWValue> values = {
+    GWArray many;  // past 65535 objects: references and offsets of four bytes
+    for (int i = 0; i < 70000; ++i) {
+        many.push_back(GWValue(i * 3));
+    }
+    std::vector<GWValue> values = {
         GWValue(true),
         GWValue(false),
         GWValue(0.0),
@@ -104,196 +105,110 @@ TEST(GWBinaryPropertyList, ScalarsAndNestedContainersRoundTripExactly) {
                              {"same", GWValue(list)},
                              {"\xC3\xA9t\xC3\xA9", GWValue("summer")},
                              {"", GWValue(-7)}}),
+        GWValue(many),
+        // Unsigned values that fit come back signed, and still compare equal.
+        GWValue(std::uint64_t(42)),
     };
-    for (const GWValue& value : values) {
-        EXPECT_EQ(roundTrip(value), value) << value.description().substr(0, 60);
-    }
-}
-
-TEST(GWBinaryPropertyList, IntegersKeepTheirValueAndSign) {
-    const std::vector<std::int64_t> signedValues = {
-        0, 1, 255, 256, 65535, 65536, 4294967295LL, 4294967296LL, INT64_MAX, -1, -256, INT64_MIN};
-    for (std::int64_t number : signedValues) {
-        GWValue back = roundTrip(GWValue(number));
-        EXPECT_TRUE(holdsSigned(back)) << number;
-        EXPECT_EQ(back.integerValue(), number);
+    for (std::int64_t number :
+         std::initializer_list<std::int64_t>{0, 1, 255, 256, 65535, 65536, 4294967295, 4294967296,
+                                             INT64_MAX, -1, -256, INT64_MIN}) {
+        values.push_back(GWValue(number));
     }
     for (std::uint64_t number : {std::uint64_t(INT64_MAX) + 1, UINT64_MAX - 1, UINT64_MAX}) {
-        GWValue back = roundTrip(GWValue(number));
-        EXPECT_FALSE(holdsSigned(back)) << number;
-        EXPECT_EQ(back.unsignedValue(), number);
+        values.push_back(GWValue(number));
     }
-    // Unsigned values that fit come back signed, and still compare equal.
-    EXPECT_EQ(roundTrip(GWValue(std::uint64_t(42))), GWValue(std::uint64_t(42)));
-}
-
-TEST(GWBinaryPropertyList, DatesRoundTripExactly) {
-    const std::vector<GWDate> dates = {
-        GWDate(0),
-        GWDate(978307200),  // the format's epoch
-        GWDate::gregorianDateWithYear(1904, 1, 1, 0, 0, 0, GWTimeZone::UTC()),  // Mac epoch
-        GWDate::gregorianDateWithYear(1904, 2, 29, 23, 59, 59, GWTimeZone::UTC()),
-        GWDate::gregorianDateWithYear(2100, 12, 31, 23, 59, 59, GWTimeZone::UTC()),
-        GWDate(-2082844800.5),
-        GWDate(-2082844800.25),
-        GWDate(4102444800.123),
-        GWDate(978307200.001),
-        GWDate(1700000000.75),
-        GWDate(1234567890.123456),
-    };
-    for (const GWDate& date : dates) {
-        GWValue back = roundTrip(GWValue(date));
-        ASSERT_NE(back.date(), nullptr);
-        EXPECT_EQ(back.date()->timeIntervalSince1970(), date.timeIntervalSince1970())
-            << std::bit_cast<std::uint64_t>(date.timeIntervalSince1970());
+    for (double seconds : {0.0, 978307200.0 /* the format's epoch */, -2082844800.0 /* Mac's */,
+                           -2077660801.0, 4133980799.0, -2082844800.5, -2082844800.25,
+                           4102444800.123, 978307200.001, 1700000000.75, 1234567890.123456}) {
+        values.push_back(GWValue(GWDate(seconds)));
     }
-}
-
-TEST(GWBinaryPropertyList, ManyObjectsUseWideReferencesAndOffsets) {
-    GWArray many;
-    for (int i = 0; i < 70000; ++i) {
-        many.push_back(GWValue(i * 3));
+    for (const GWValue& value : values) {
+        const GWValue back = roundTrip(value);
+        EXPECT_EQ(back, value) << value.description().substr(0, 60);
+        // Signedness survives: only what is past INT64_MAX comes back unsigned.
+        const bool fitsSigned = std::holds_alternative<std::uint64_t>(value.storage) &&
+                                value.unsignedValue() <= INT64_MAX;
+        EXPECT_EQ(back.storage.index(), fitsSigned ? 1u : value.storage.index());
+        if (value.date()) {
+            ASSERT_NE(back.date(), nullptr);
+            EXPECT_EQ(std::bit_cast<std::uint64_t>(back.date()->timeIntervalSince1970()),
+                      std::bit_cast<std::uint64_t>(value.date()->timeIntervalSince1970()));
+        }
     }
-    GWData data = GWBinaryPropertyList::dataWithValue(GWValue(many));
-    ASSERT_GE(data.size(), 32u);
-    EXPECT_EQ(data[data.size() - 25], 4);  // reference size
-    EXPECT_EQ(data[data.size() - 26], 4);  // offset size
-    EXPECT_EQ(roundTrip(GWValue(many)), GWValue(many));
-}
 
-TEST(GWBinaryPropertyList, NestingDeeperThanTheLimitIsRefusedWhenWriting) {
     GWValue deep = GWValue(GWArray());
     for (std::size_t i = 1; i < kGWPropertyListMaxDepth; ++i) {
         deep = GWValue(GWArray{std::move(deep)});
     }
-    EXPECT_EQ(roundTrip(deep), deep);  // exactly at the limit
-
+    EXPECT_EQ(roundTrip(deep), deep);  // exactly at the limit, and one deeper is refused
     GWErrorPtr error;
-    GWValue deeper = GWValue(GWArray{deep});
-    EXPECT_TRUE(GWBinaryPropertyList::dataWithValue(deeper, &error).empty());
+    EXPECT_TRUE(GWBinaryPropertyList::dataWithValue(GWValue(GWArray{deep}), &error).empty());
     ASSERT_TRUE(error);
     EXPECT_TRUE(error->is(kGWCocoaErrorDomain, GWPropertyListWriteInvalidError));
 }
 
-// --- Files of other writers --------------------------------------------------
-
-TEST(GWBinaryPropertyList, ReadsWhatPythonWrites) {
+// Python reads what we write and writes it back its own way, which we read.
+TEST(GWBinaryPropertyList, PythonAgreesBothWays) {
     if (!gwtest::toolAvailable("python3")) {
         GTEST_SKIP() << "python3 is not installed";
     }
-    gwtest::TemporaryDirectory directory;
-    const std::string path = directory.file("python.plist");
-    const std::string script = R"PY(
-import datetime, plistlib, sys
-shared = [1, 2, 3]
-value = {
-    "small": 7, "negative": -5, "min": -2**63, "big": 2**63, "max": 2**64 - 1,
-    "real": 0.1, "true": True, "false": False,
-    "ascii": "plain", "latin": "Gr\u00fc\u00dfe", "emoji": "a\U0001F600z",
-    "data": bytes(range(40)), "empty": b"",
-    "mac": datetime.datetime(1904, 1, 1), "future": datetime.datetime(2100, 6, 1, 12, 30, 15),
-    "list": [shared, shared, {"k": "v"}], "wide": list(range(300)),
-}
-with open(sys.argv[1], "wb") as f:
-    plistlib.dump(value, f, fmt=plistlib.FMT_BINARY)
-)PY";
-    auto result = gwtest::runCommand("python3 -c " + gwtest::shellQuote(script) + " " +
-                                     gwtest::shellQuote(path));
-    ASSERT_EQ(result.status, 0) << result.output;
-
-    GWErrorPtr error;
-    auto value = GWBinaryPropertyList::valueWithData(gwtest::readFile(path), &error);
-    ASSERT_TRUE(value) << error->localizedDescription();
-    GWData forty(40);
-    std::iota(forty.begin(), forty.end(), std::uint8_t(0));
-    GWArray wide;
+    GWArray wide;  // references of two bytes
     for (int i = 0; i < 300; ++i) {
         wide.push_back(GWValue(i));
     }
     const GWValue shared(GWArray{GWValue(1), GWValue(2), GWValue(3)});
-    const GWDictionary expected{
-        {"small", GWValue(7)},
+    const GWValue value(GWDictionary{
         {"negative", GWValue(-5)},
         {"min", GWValue(INT64_MIN)},
         {"big", GWValue(std::uint64_t(1) << 63)},
         {"max", GWValue(UINT64_MAX)},
-        {"real", GWValue(0.1)},
-        {"true", GWValue(true)},
-        {"false", GWValue(false)},
-        {"ascii", GWValue("plain")},
-        {"latin", GWValue("Gr\xC3\xBC\xC3\x9F"
-                          "e")},
-        {"emoji", GWValue("a\xF0\x9F\x98\x80z")},
-        {"data", GWValue(forty)},
-        {"empty", GWValue(GWData())},
-        {"mac", GWValue(GWDate(-2082844800))},
-        {"future",
-         GWValue(GWDate::gregorianDateWithYear(2100, 6, 1, 12, 30, 15, GWTimeZone::UTC()))},
-        {"list", GWValue(GWArray{shared, shared, GWValue(GWDictionary{{"k", GWValue("v")}})})},
-        {"wide", GWValue(wide)}};
-    EXPECT_EQ(*value, GWValue(expected));
-}
-
-TEST(GWBinaryPropertyList, PythonReadsWhatWeWrite) {
-    if (!gwtest::toolAvailable("python3")) {
-        GTEST_SKIP() << "python3 is not installed";
-    }
-    GWDictionary value{
-        {"negative", GWValue(-5)},
-        {"max", GWValue(UINT64_MAX)},
         {"wide", GWValue(std::int64_t(1) << 40)},
+        {"real", GWValue(0.1)},
         {"text", GWValue("Gr\xC3\xBC\xC3\x9F"
                          "e \xF0\x9F\x98\x80")},
         {"data", GWValue(GWData{0, 255, 16})},
         {"mac", GWValue(GWDate(-2082844800))},
         {"future", GWValue(GWDate(4102444800.5))},
         {"nested", GWValue(GWArray{GWValue(true), GWValue(GWDictionary{{"x", GWValue(1.5)}})})},
-    };
+        {"list", GWValue(GWArray{shared, shared, GWValue(wide)})}});
     gwtest::TemporaryDirectory directory;
-    const std::string path = directory.file("ours.plist");
-    gwtest::writeFile(path, GWBinaryPropertyList::dataWithValue(GWValue(value)));
+    const std::string ours = directory.file("ours.plist"), theirs = directory.file("theirs.plist");
+    gwtest::writeFile(ours, GWBinaryPropertyList::dataWithValue(value));
     const std::string script = R"PY(
 import plistlib, sys
 d = plistlib.load(open(sys.argv[1], "rb"))
 print(d["negative"], d["max"], d["wide"], d["text"].encode("unicode_escape").decode(),
       d["data"].hex(), d["mac"].isoformat(), d["future"].isoformat(), d["nested"])
+plistlib.dump(d, open(sys.argv[2], "wb"), fmt=plistlib.FMT_BINARY)
 )PY";
     auto result = gwtest::runCommand("python3 -c " + gwtest::shellQuote(script) + " " +
-                                     gwtest::shellQuote(path));
+                                     gwtest::shellQuote(ours) + " " + gwtest::shellQuote(theirs));
     ASSERT_EQ(result.status, 0) << result.output;
     EXPECT_EQ(result.output,
               "-5 18446744073709551615 1099511627776 Gr\\xfc\\xdfe \\U0001f600 00ff10 "
               "1904-01-01T00:00:00 2100-01-01T00:00:00.500000 [True, {'x': 1.5}]\n");
+    GWErrorPtr error;
+    auto back = GWBinaryPropertyList::valueWithData(gwtest::readFile(theirs), &error);
+    ASSERT_TRUE(back) << error->localizedDescription();
+    EXPECT_EQ(*back, value);
 }
 
 // --- Damaged files -------------------------------------------------------------
 
-TEST(GWBinaryPropertyList, EveryTruncationIsReportedAsCorrupt) {
-    GWDictionary value{{"a", GWValue(GWArray{GWValue(1), GWValue("text")})},
-                       {"b", GWValue(GWData(20, 7))},
-                       {"c", GWValue(GWDate(5))}};
-    const GWData full = GWBinaryPropertyList::dataWithValue(GWValue(value));
-    for (std::size_t length = 0; length < full.size(); ++length) {
-        GWData cut(full.begin(), full.begin() + length);
-        GWErrorPtr error = readError(cut);
-        ASSERT_TRUE(error) << length;
-        EXPECT_TRUE(error->is(kGWCocoaErrorDomain, GWFileReadCorruptFileError)) << length;
-    }
-}
-
-TEST(GWBinaryPropertyList, CorruptedBytesNeverCrash) {
+TEST(GWBinaryPropertyList, EveryTruncationAndCorruptedByteIsCorruptOrReadable) {
     GWDictionary value{{"list", GWValue(GWArray{GWValue(1), GWValue("t\xC3\xA9xt"),
                                                 GWValue(GWDictionary{{"k", GWValue(2.5)}})})},
                        {"date", GWValue(GWDate(5))},
                        {"data", GWValue(GWData(18, 1))}};
     const GWData full = GWBinaryPropertyList::dataWithValue(GWValue(value));
     for (std::size_t i = 0; i < full.size(); ++i) {
+        GWErrorPtr error = readError(GWData(full.begin(), full.begin() + std::ptrdiff_t(i)));
+        ASSERT_TRUE(error) << i;
+        EXPECT_TRUE(error->is(kGWCocoaErrorDomain, GWFileReadCorruptFileError)) << i;
         for (int replacement : {0x00, 0x01, 0x0F, 0x7F, 0x80, 0xAF, 0xDF, 0xFF}) {
             GWData damaged = full;
             damaged[i] = std::uint8_t(replacement);
-            GWErrorPtr error;
-            auto result = GWBinaryPropertyList::valueWithData(damaged, &error);
-            if (!result) {
+            if (!GWBinaryPropertyList::valueWithData(damaged, &error)) {
                 ASSERT_TRUE(error);
                 EXPECT_TRUE(error->is(kGWCocoaErrorDomain, GWFileReadCorruptFileError));
             }
@@ -330,6 +245,28 @@ Assembly with(std::vector<GWData> objects, std::function<void(Assembly&)> change
 }
 
 const GWData kOne = bytes({0x10, 0x01});
+
+// Array i holds array i + 1, far past the depth limit.
+Assembly deepArrays() {
+    Assembly deep;
+    deep.refSize = 2;
+    deep.offsetSize = 2;
+    for (int i = 0; i < 2000; ++i) {
+        deep.objects.push_back(bytes({0xA1, (i + 1) >> 8, (i + 1) & 0xFF}));
+    }
+    deep.objects.push_back(kOne);
+    return deep;
+}
+
+// Each array names the next one twice: 2^60 values from a few hundred bytes.
+Assembly doublingArrays() {
+    Assembly doubling;
+    for (int i = 0; i < 60; ++i) {
+        doubling.objects.push_back(bytes({0xA2, i + 1, i + 1}));
+    }
+    doubling.objects.push_back(kOne);
+    return doubling;
+}
 
 }  // namespace
 
@@ -376,37 +313,12 @@ INSTANTIATE_TEST_SUITE_P(
                with({bytes({0x14, 0, 0, 0, 0, 0, 0, 0, 1, 0, 0, 0, 0, 0, 0, 0, 0})}),
                "does not fit in 64 bits"},
         Damage{"FloatOfTwoBytes", with({bytes({0x21, 0, 0})}), "unsupported marker 0x21"},
-        Damage{"DoubleRunsIntoTheTable", with({bytes({0x23, 0, 0})}), "runs into"}),
+        Damage{"DoubleRunsIntoTheTable", with({bytes({0x23, 0, 0})}), "runs into"},
+        Damage{"BadSignature", with({kOne}, [](Assembly& a) { a.signature = "bplist01"; }),
+               "signature"},
+        Damage{"DeeperThanTheLimit", deepArrays(), "deeper than 512"},
+        Damage{"RunawaySharing", doublingArrays(), "expand"}),
     [](const testing::TestParamInfo<Damage>& info) { return info.param.name; });
-
-TEST(GWBinaryPropertyList, BadSignaturesDeepNestingAndRunawaySharingAreCorrupt) {
-    GWData badSignature = with({kOne}).build();
-    badSignature[7] = '1';
-    // Array i holds array i + 1, far past the limit.
-    Assembly deep;
-    deep.refSize = 2;
-    deep.offsetSize = 2;
-    for (int i = 0; i < 2000; ++i) {
-        deep.objects.push_back(bytes({0xA1, (i + 1) >> 8, (i + 1) & 0xFF}));
-    }
-    deep.objects.push_back(kOne);
-    // Each array names the next one twice: 2^60 values from a few hundred bytes.
-    Assembly doubling;
-    for (int i = 0; i < 60; ++i) {
-        doubling.objects.push_back(bytes({0xA2, i + 1, i + 1}));
-    }
-    doubling.objects.push_back(kOne);
-    const std::pair<GWData, const char*> cases[] = {{badSignature, "signature"},
-                                                    {deep.build(), "deeper than 512"},
-                                                    {doubling.build(), "expand"}};
-    for (const auto& [data, expected] : cases) {
-        GWErrorPtr error = readError(data);
-        ASSERT_TRUE(error) << expected;
-        EXPECT_TRUE(error->is(kGWCocoaErrorDomain, GWFileReadCorruptFileError));
-        EXPECT_NE(error->localizedDescription().find(expected), std::string::npos)
-            << error->localizedDescription();
-    }
-}
 
 TEST(GWBinaryPropertyList, SharedObjectsWithinReasonAreExpanded) {
     // Ten references to one string and one array are an ordinary file.

@@ -42,11 +42,12 @@ private:
 class GWBlockCacheTest : public ::testing::Test {
 protected:
     // Reads through the cache and checks the bytes against the source.
-    GWData read(std::uint64_t offset, std::size_t length) {
+    GWData read(std::uint64_t offset, std::size_t length) { return read(cache_, offset, length); }
+    GWData read(GWBlockCache& cache, std::uint64_t offset, std::size_t length) {
         GWData into(length);
         std::size_t got = 0;
         GWErrorPtr error;
-        EXPECT_TRUE(cache_.read(offset, into, source_.size(), source_.fetch(), got, &error));
+        EXPECT_TRUE(cache.read(offset, into, source_.size(), source_.fetch(), got, &error));
         into.resize(got);
         const std::size_t expected =
             offset < source_.size() ? std::min<std::uint64_t>(length, source_.size() - offset) : 0;
@@ -60,44 +61,35 @@ protected:
 
 }  // namespace
 
-TEST_F(GWBlockCacheTest, SmallReadsShareTheAlignedBlockTheyFall) {
-    read(2010, 10);
-    read(2500, 100);
-    read(2990, 10);
-    EXPECT_EQ(source_.fetches, (Fetches{{2000, 1000}}));
-}
-
-TEST_F(GWBlockCacheTest, AReadAcrossTwoBlocksFetchesOnlyWhatIsMissing) {
-    read(1950, 100);  // both missing: one fetch of two blocks
-    read(2950, 100);  // 2000 cached, 3000 missing
-    EXPECT_EQ(source_.fetches, (Fetches{{1000, 2000}, {3000, 1000}}));
-}
-
-TEST_F(GWBlockCacheTest, LargeReadsGoStraightToTheSourceAndAreNotKept) {
-    read(1234, 1000);
-    read(1234, 5000);
-    read(1300, 10);
-    EXPECT_EQ(source_.fetches, (Fetches{{1234, 1000}, {1234, 5000}, {1000, 1000}}));
-}
-
-TEST_F(GWBlockCacheTest, TheLeastRecentlyUsedBlockGoesFirst) {
-    read(0, 10);
-    read(1000, 10);
-    read(2000, 10);
-    read(5, 10);     // touches block 0
-    read(3000, 10);  // evicts block 1
-    EXPECT_EQ(source_.fetches.size(), 4u);
-    read(20, 10);
-    EXPECT_EQ(source_.fetches.size(), 4u);
-    read(1020, 10);
-    EXPECT_EQ(source_.fetches.size(), 5u);
-}
-
-TEST_F(GWBlockCacheTest, TheEndOfTheSourceShortensReadsWithoutFetchingPastIt) {
-    EXPECT_EQ(read(10100, 100).size(), 23u);
-    EXPECT_TRUE(read(10123, 10).empty());
-    EXPECT_TRUE(read(UINT64_MAX - 5, 10).empty());
-    EXPECT_EQ(source_.fetches, (Fetches{{10000, 123}}));
+// Blocks of 1000 bytes, three kept, over a source of 10123.
+TEST_F(GWBlockCacheTest, ReadsFetchOnlyWhatIsMissing) {
+    const struct {
+        const char* label;
+        std::vector<std::pair<std::uint64_t, std::size_t>> reads;
+        Fetches fetches;
+    } cases[] = {
+        {"small reads share their aligned block",
+         {{2010, 10}, {2500, 100}, {2990, 10}},
+         {{2000, 1000}}},
+        {"across two blocks", {{1950, 100}, {2950, 100}}, {{1000, 2000}, {3000, 1000}}},
+        {"large reads go straight through, unkept",
+         {{1234, 1000}, {1234, 5000}, {1300, 10}},
+         {{1234, 1000}, {1234, 5000}, {1000, 1000}}},
+        // Touching block 0 makes block 1 the one to go.
+        {"least recently used goes first",
+         {{0, 10}, {1000, 10}, {2000, 10}, {5, 10}, {3000, 10}, {20, 10}, {1020, 10}},
+         {{0, 1000}, {1000, 1000}, {2000, 1000}, {3000, 1000}, {1000, 1000}}},
+        {"never past the end", {{10100, 100}, {10123, 10}, {UINT64_MAX - 5, 10}}, {{10000, 123}}},
+    };
+    for (const auto& c : cases) {
+        SCOPED_TRACE(c.label);
+        GWBlockCache cache{1000, 3};
+        source_.fetches.clear();
+        for (const auto& [offset, length] : c.reads) {
+            read(cache, offset, length);
+        }
+        EXPECT_EQ(source_.fetches, c.fetches);
+    }
 }
 
 TEST_F(GWBlockCacheTest, AFailedFetchIsReportedAndLeavesNothingBehind) {

@@ -1,4 +1,5 @@
 #include <gtest/gtest.h>
+#include <zlib.h>
 
 #include "foundation/GWChecksum.h"
 #include "support/TestSupport.h"
@@ -15,18 +16,12 @@ std::string digest(const std::string& text, int algorithm) {
 }  // namespace
 
 TEST(GWChecksum, DigestsMatchThePublishedVectors) {
-    const std::string alphabet = "abcdefghijklmnopqrstuvwxyz";
     const std::tuple<int, std::string, const char*> vectors[] = {
         // The CRC-32 of "1234" is 0x9BE3E0A3, laid out least significant byte first.
         {GWChecksumAlgorithmCRC32, "1234", "a3e0e39b"},
         {GWChecksumAlgorithmCRC32, "", "00000000"},
         {GWChecksumAlgorithmMD2, "", "8350e5a3e24c153df2275c9f80692773"},
-        {GWChecksumAlgorithmMD2, "a", "32ec01ec4a6dac72c0ab96fb34c0b5d1"},
         {GWChecksumAlgorithmMD2, "abc", "da853b0d3f88d99b30283a69e6ded6bb"},
-        {GWChecksumAlgorithmMD2, "message digest", "ab4f496bfb2a530b219ff33031fe06b0"},
-        {GWChecksumAlgorithmMD2, alphabet, "4e8ddff3650292ab5a4108c3aa47940b"},
-        {GWChecksumAlgorithmMD2, "ABCDEFGHIJKLMNOPQRSTUVWXYZ" + alphabet + "0123456789",
-         "da33def2a42df13975352846c30338cd"},
         {GWChecksumAlgorithmMD2,
          "12345678901234567890123456789012345678901234567890123456789012345678901234567890",
          "d5976f79d83d3a0dc9806c3c66f3efd8"},
@@ -48,14 +43,7 @@ TEST(GWChecksum, DigestsMatchThePublishedVectors) {
     }
 }
 
-TEST(GWChecksum, AlgorithmsWithoutADigestGiveNothing) {
-    EXPECT_TRUE(GWChecksum::checksumForData(bytesOf("abc"), GWChecksumAlgorithmNone).empty());
-    EXPECT_TRUE(GWChecksum::checksumForData(bytesOf("abc"), GWChecksumAlgorithmUnknown).empty());
-    EXPECT_TRUE(GWChecksum::checksumForData(bytesOf("abc"), 2).empty());
-    EXPECT_EQ(GWChecksum::checksumWithAlgorithm(GWChecksumAlgorithmNone), nullptr);
-}
-
-TEST(GWChecksum, StreamingInPiecesEqualsOneShot) {
+TEST(GWChecksum, StreamingInAnySplitEqualsOneShotAndZlibsCRC) {
     const GWData data = gwtest::randomBytes(100000, 7);
     for (int algorithm : {1, 3, 4, 5, 6, 7, 8, 9}) {
         auto checksum = GWChecksum::checksumWithAlgorithm(algorithm);
@@ -68,6 +56,25 @@ TEST(GWChecksum, StreamingInPiecesEqualsOneShot) {
         EXPECT_EQ(streamed, GWChecksum::checksumForData(data, algorithm)) << algorithm;
         EXPECT_EQ(streamed.size(), GWChecksum::digestLength(algorithm));
     }
+    for (std::size_t length : {std::size_t(0), std::size_t(1), std::size_t(15), std::size_t(64),
+                               std::size_t(1000), data.size()}) {
+        const auto span = std::span(data).first(length);
+        for (std::size_t split : {std::size_t(0), length / 3, length}) {
+            auto checksum = GWChecksum::checksumWithAlgorithm(GWChecksumAlgorithmCRC32);
+            checksum->update(span.first(split));
+            checksum->update(span.subspan(split));
+            const GWData digest = checksum->finish();
+            ASSERT_EQ(digest.size(), 4u);
+            EXPECT_EQ(digest[0] | digest[1] << 8 | digest[2] << 16 | std::uint32_t(digest[3]) << 24,
+                      crc32_z(0, span.data(), span.size()))
+                << "length " << length << " split " << split;
+        }
+    }
+    // Algorithms without a digest give nothing.
+    for (int algorithm : {int(GWChecksumAlgorithmNone), int(GWChecksumAlgorithmUnknown), 2}) {
+        EXPECT_TRUE(GWChecksum::checksumForData(bytesOf("abc"), algorithm).empty());
+    }
+    EXPECT_EQ(GWChecksum::checksumWithAlgorithm(GWChecksumAlgorithmNone), nullptr);
 }
 
 TEST(GWChecksum, FileDigestsAgreeWithOpenSSL) {
@@ -90,12 +97,9 @@ TEST(GWChecksum, FileDigestsAgreeWithOpenSSL) {
         ASSERT_TRUE(ours) << error->localizedDescription();
         EXPECT_EQ(hex(*ours), result.output.substr(0, result.output.find(' '))) << name;
     }
-}
-
-TEST(GWChecksum, AMissingFileIsAPOSIXError) {
     GWErrorPtr error;
-    EXPECT_FALSE(GWChecksum::checksumAtURL(GWURL::fileURLWithPath("/nonexistent/x"),
-                                           GWChecksumAlgorithmMD5, &error));
+    EXPECT_FALSE(
+        GWChecksum::checksumAtURL(directory.url("missing"), GWChecksumAlgorithmMD5, &error));
     ASSERT_TRUE(error);
     EXPECT_TRUE(error->is(kGWPOSIXErrorDomain, ENOENT));
 }

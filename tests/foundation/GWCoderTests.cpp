@@ -175,16 +175,6 @@ std::shared_ptr<TestNode> fullNode() {
     return node;
 }
 
-// The stored dictionary of the root object, read with the plain property-list reader.
-GWDictionary storedRoot(const GWData& archive) {
-    auto plist = GWBinaryPropertyList::valueWithData(archive);
-    EXPECT_TRUE(plist);
-    const GWValue& top = plist->dictionary()->at("$top");
-    return *top.dictionary()->at("root").dictionary();
-}
-
-using RecordingCoder = gwtest::WriteCountingCoder;
-
 }  // namespace
 
 TEST(GWKeyedArchiver, RoundTripsEveryKindOfValueAndNestedObjects) {
@@ -216,26 +206,13 @@ TEST(GWKeyedArchiver, RoundTripsEveryKindOfValueAndNestedObjects) {
     EXPECT_EQ(GWValue(back->error->userInfo()), GWValue(GWDictionary{{"Key", GWValue(1)}}));
     ASSERT_TRUE(back->error->underlyingError());
     EXPECT_TRUE(back->error->underlyingError()->is(kGWCocoaErrorDomain, GWFileReadUnknownError));
-}
 
-TEST(GWKeyedArchiver, AbsentValuesAreNotWritten) {
-    TestNode node;
-    node.name = "bare";
-    GWData archive = GWKeyedArchiver::archivedDataWithRootObject(node);
-    GWDictionary root = storedRoot(archive);
-    for (const char* key : {"Checksum", "Link", "Children", "Fork", "Error"}) {
-        EXPECT_EQ(root.count(key), 0u) << key;
-    }
-    EXPECT_EQ(root.at("$class"), GWValue("TestNode"));
-    EXPECT_EQ(root.at("Leaves"), GWValue(GWArray()));  // empty, not absent
-
-    auto back = GWKeyedUnarchiver::unarchiveObjectWithData<TestNode>(archive);
+    // Absent values stay absent, not empty.
+    TestNode bare;
+    back = GWKeyedUnarchiver::unarchiveObjectWithData<TestNode>(
+        GWKeyedArchiver::archivedDataWithRootObject(bare));
     ASSERT_TRUE(back);
-    EXPECT_FALSE(back->checksum);
-    EXPECT_FALSE(back->link);
-    EXPECT_FALSE(back->children);
-    EXPECT_FALSE(back->fork);
-    EXPECT_FALSE(back->error);
+    EXPECT_FALSE(back->checksum || back->link || back->children || back->fork || back->error);
 }
 
 TEST(GWKeyedArchiver, KeysBeginningWithADollarSignAreKeptApartFromTheArchivesOwn) {
@@ -252,31 +229,6 @@ TEST(GWKeyedArchiver, KeysBeginningWithADollarSignAreKeptApartFromTheArchivesOwn
     EXPECT_EQ(unarchiver->decodeDictionary("$class"), tricky);
     EXPECT_EQ(unarchiver->decodeString("$$"), "x");
     EXPECT_FALSE(unarchiver->decodeObject("$class"));
-}
-
-TEST(GWKeyedArchiver, PythonReadsTheArchive) {
-    if (!gwtest::toolAvailable("python3")) {
-        GTEST_SKIP() << "python3 is not installed";
-    }
-    gwtest::TemporaryDirectory directory;
-    const std::string path = directory.file("archive.plist");
-    gwtest::writeFile(path, GWKeyedArchiver::archivedDataWithRootObject(fullNode()));
-    const std::string script = R"PY(
-import plistlib, sys
-d = plistlib.load(open(sys.argv[1], "rb"))
-root = d["$top"]["root"]
-print(d["$archiver"], d["$version"], root["$class"], root["Name"].encode("unicode_escape").decode(),
-      root["Offset"], root["Big"], root["Date"].isoformat(), len(root["Checksum"]),
-      root["Children"][0]["Name"], root["Fork"]["$class"], root["Fork"]["Extra"],
-      [leaf["Size"] for leaf in root["Leaves"]], root["Error"]["Domain"])
-)PY";
-    auto result = gwtest::runCommand("python3 -c " + gwtest::shellQuote(script) + " " +
-                                     gwtest::shellQuote(path));
-    ASSERT_EQ(result.status, 0) << result.output;
-    EXPECT_EQ(result.output,
-              "GWKeyedArchiver 1 TestNode r\\xe9sum\\xe9 -1234567890123 18446744073709551610 "
-              "1903-12-31T23:59:59.500000 100000 child TestLeafSubclass -9 "
-              "[0, 1099511627776, 2199023255552] NSPOSIXErrorDomain\n");
 }
 
 TEST(GWKeyedArchiver, CyclesDeepNestingAndNoRootAreRefused) {
@@ -333,11 +285,9 @@ TEST(GWKeyedUnarchiver, WrongKindsUnderAKeyDecodeAsNothing) {
     EXPECT_FALSE(coder->decodeValue("Leaf"));
     EXPECT_FALSE(coder->decodeValue("Mixed"));
     EXPECT_FALSE(coder->decodeObject("Dictionary"));
-    EXPECT_FALSE(coder->decodeObject("String"));
     EXPECT_FALSE(coder->decodeObjectOfClass<TestNode>("Leaf"));
     EXPECT_TRUE(coder->decodeObjectOfClass<TestLeaf>("Leaf"));
     EXPECT_FALSE(coder->decodeObject("Unknown"));
-    EXPECT_FALSE(coder->decodeObjectOfClass<TestLeaf>("Unknown"));
     EXPECT_FALSE(coder->decodeArrayOfObjectsOfClass<TestLeaf>("Mixed"));
     EXPECT_EQ(coder->decodeArrayOfObjectsOfClass<GWCoding>("Mixed")->size(), 2u);
     EXPECT_FALSE(coder->decodeArrayOfObjectsOfClass<TestLeaf>("Values"));
@@ -348,12 +298,10 @@ TEST(GWKeyedUnarchiver, WrongKindsUnderAKeyDecodeAsNothing) {
     EXPECT_EQ(coder->decodeInt32("AllOnes32"), -1);
     EXPECT_EQ(coder->decodeInt32("MinusOne"), -1);
     EXPECT_EQ(coder->decodeUInt64("MinusOne"), UINT64_MAX);
-    EXPECT_EQ(coder->decodeInt64("Wide"), std::int64_t(1) << 40);
 
     EXPECT_FALSE(coder->containsValueForKey("Missing"));
     EXPECT_TRUE(coder->containsValueForKey("Leaf"));
     EXPECT_EQ(coder->decodeInt64("Missing"), 0);
-    EXPECT_FALSE(coder->decodeString("Missing"));
 }
 
 TEST(GWKeyedUnarchiver, ArchivesThatCannotBeReadAreCorrupt) {
@@ -405,7 +353,7 @@ TEST(GWKeyedUnarchiver, EveryTruncatedArchiveIsCorrupt) {
 }
 
 TEST(GWCoder, NonKeyedCoderMakesClassesWriteNothingAndDecodeToNone) {
-    RecordingCoder recorder;
+    gwtest::RecordingCoder recorder;
     EXPECT_FALSE(recorder.allowsKeyedCoding());
     fullNode()->encodeWithCoder(recorder);
     EXPECT_EQ(recorder.writes, 0);

@@ -12,13 +12,11 @@
 
 namespace {
 
-enum class Wrapping { Raw, Zlib };
-
-GWData deflateBytes(const GWData& input, Wrapping wrapping, int level = 6) {
+GWData zlibDeflate(const GWData& input, bool wrapped, int level = 6,
+                   int strategy = Z_DEFAULT_STRATEGY) {
     z_stream stream{};
-    deflateInit2(&stream, level, Z_DEFLATED, wrapping == Wrapping::Raw ? -15 : 15, 8,
-                 Z_DEFAULT_STRATEGY);
-    GWData output(deflateBound(&stream, input.size()));
+    deflateInit2(&stream, level, Z_DEFLATED, wrapped ? 15 : -15, 8, strategy);
+    GWData output(deflateBound(&stream, input.size()) + 16);
     stream.next_in = const_cast<Bytef*>(input.data());
     stream.avail_in = uInt(input.size());
     stream.next_out = output.data();
@@ -84,12 +82,11 @@ std::optional<GWData> decodeInPieces(const Codec& codec, const GWData& stream,
 const Codec kCodecs[] = {
     {"copy", GWDecompressorAlgorithmCopy, [](const GWData& d) { return d; }},
     {"raw deflate", GWDecompressorAlgorithmDeflate,
-     [](const GWData& d) { return deflateBytes(d, Wrapping::Raw); }},
-    {"zlib", GWDecompressorAlgorithmDeflate,
-     [](const GWData& d) { return deflateBytes(d, Wrapping::Zlib); }},
+     [](const GWData& d) { return zlibDeflate(d, false); }},
+    {"zlib", GWDecompressorAlgorithmDeflate, [](const GWData& d) { return zlibDeflate(d, true); }},
     {"bzip2", GWDecompressorAlgorithmBzip2, bzip2Bytes},
     {"deflate on the deflate64 engine", GWDecompressorAlgorithmDeflate64,
-     [](const GWData& d) { return deflateBytes(d, Wrapping::Raw, 9); },
+     [](const GWData& d) { return zlibDeflate(d, false, 9); },
      [] { return GWMakeDeflate64Decoder(false); }},
     {"deflate64", GWDecompressorAlgorithmDeflate64, deflate64Bytes},
     {"lzma", GWDecompressorAlgorithmLZMA, gwtest::zipLzmaBytes},
@@ -97,6 +94,14 @@ const Codec kCodecs[] = {
      [](const GWData& d) { return gwtest::xarEncode(d, gwtest::XarEncoding::xz); }},
     {"zstd", GWDecompressorAlgorithmZstd, gwtest::zstdBytes},
 };
+
+// Text with a stretch of noise: stored, fixed and dynamic blocks alike.
+GWData mixedInput() {
+    GWData data = gwtest::textBytes(700000, 21);
+    const GWData noise = gwtest::randomBytes(200000, 22);
+    data.insert(data.begin() + 300000, noise.begin(), noise.end());
+    return data;
+}
 
 }  // namespace
 
@@ -128,81 +133,6 @@ TEST(GWDecompressor, EveryCodecDecodesPiecesOfAnySize) {
     }
 }
 
-TEST(GWDecompressor, BufferedOutputAsksToRunAgainUntilDelivered) {
-    const GWData input = gwtest::textBytes(2 * 1024 * 1024, 5);
-    auto decompressor =
-        GWDecompressor::initForStreamingWithAlgorithm(GWDecompressorAlgorithmDeflate, nullptr);
-    bool again = false;
-    auto first = decompressor->decompressedDataFromStreamWithInputData(
-        deflateBytes(input, Wrapping::Raw), false, &again, nullptr);
-    ASSERT_TRUE(first);
-    EXPECT_TRUE(again);
-    EXPECT_LT(first->size(), input.size());
-    GWData output = *first;
-    int calls = 0;
-    while (again) {
-        auto more =
-            decompressor->decompressedDataFromStreamWithInputData({}, false, &again, nullptr);
-        ASSERT_TRUE(more);
-        output.insert(output.end(), more->begin(), more->end());
-        ++calls;
-    }
-    EXPECT_GT(calls, 1);
-    EXPECT_TRUE(output == input);
-    // The stream has ended, so an empty last piece ends it quietly.
-    auto last = decompressor->decompressedDataFromStreamWithInputData({}, true, &again, nullptr);
-    ASSERT_TRUE(last);
-    EXPECT_TRUE(last->empty());
-    EXPECT_FALSE(again);
-}
-
-TEST(GWDecompressor, SinkStepsHandOutEveryPieceAndStopWhenTold) {
-    GWData input = gwtest::textBytes(700000, 21);
-    const GWData noise = gwtest::randomBytes(200000, 22);
-    input.insert(input.begin() + 300000, noise.begin(), noise.end());
-    const GWData stream = deflateBytes(input, Wrapping::Zlib);
-    auto decompressor =
-        GWDecompressor::initForStreamingWithAlgorithm(GWDecompressorAlgorithmDeflate, nullptr);
-    GWData output;
-    int pieces = 0;
-    for (std::size_t at = 0; at < stream.size(); at += 50000) {
-        const std::size_t length = std::min<std::size_t>(50000, stream.size() - at);
-        const bool last = at + length == stream.size();
-        GWErrorPtr error;
-        ASSERT_TRUE(decompressor->decompressStreamWithInputData(
-            std::span(stream).subspan(at, length), last,
-            [&](std::span<const std::uint8_t> piece) {
-                EXPECT_FALSE(piece.empty());
-                output.insert(output.end(), piece.begin(), piece.end());
-                ++pieces;
-                return true;
-            },
-            &error));
-    }
-    EXPECT_TRUE(output == input);
-    EXPECT_GT(pieces, 3);
-
-    // A sink that stops ends the step without an error.
-    auto stopped =
-        GWDecompressor::initForStreamingWithAlgorithm(GWDecompressorAlgorithmDeflate, nullptr);
-    GWErrorPtr error;
-    EXPECT_FALSE(stopped->decompressStreamWithInputData(
-        stream, true, [](std::span<const std::uint8_t>) { return false; }, &error));
-    EXPECT_FALSE(error);
-
-    // A cut stream is damaged, and stays so.
-    auto cut =
-        GWDecompressor::initForStreamingWithAlgorithm(GWDecompressorAlgorithmDeflate, nullptr);
-    const GWData half(stream.begin(), stream.begin() + std::ptrdiff_t(stream.size() / 2));
-    auto ignore = [](std::span<const std::uint8_t>) { return true; };
-    EXPECT_FALSE(cut->decompressStreamWithInputData(half, true, ignore, &error));
-    ASSERT_TRUE(error);
-    EXPECT_TRUE(error->is(kGWCocoaErrorDomain, GWFileReadCorruptFileError));
-    GWErrorPtr again;
-    EXPECT_FALSE(cut->decompressStreamWithInputData({}, true, ignore, &again));
-    EXPECT_TRUE(again);
-}
-
 TEST(GWDecompressor, DamagedAndTruncatedStreamsAreErrors) {
     const GWData input = gwtest::textBytes(100000, 9);
     for (const Codec& codec : kCodecs) {
@@ -231,11 +161,7 @@ TEST(GWDecompressor, DamagedAndTruncatedStreamsAreErrors) {
         }
         EXPECT_GT(failures, 0) << codec.name;
     }
-    GWErrorPtr error;
-    EXPECT_FALSE(decodeInPieces(kCodecs[1], gwtest::randomBytes(5000, 11), 100, &error));
-}
-
-TEST(GWDecompressor, UnknownAlgorithmsAreRefusedAndAnErrorIsFinal) {
+    // Unknown algorithms are refused, and an error is final.
     GWErrorPtr error;
     EXPECT_FALSE(GWDecompressor::initForStreamingWithAlgorithm(3, &error));
     EXPECT_TRUE(error->is(kGWPOSIXErrorDomain, EINVAL));
@@ -249,108 +175,219 @@ TEST(GWDecompressor, UnknownAlgorithmsAreRefusedAndAnErrorIsFinal) {
     EXPECT_TRUE(again);
 }
 
+// The default inflate engine held to zlib's verdict: the same bytes, or the
+// same kind of failure, for whole, cut and damaged streams.
+TEST(GWDecompressor, InflateAgreesWithZlibOnWholeCutAndDamagedStreams) {
+    auto decode = [](std::unique_ptr<GWStreamDecoder> engine, const GWData& stream,
+                     std::size_t piece, GWErrorPtr* error) {
+        GWDecompressor decompressor(std::move(engine));
+        return gwtest::decodeInPieces(decompressor, stream, piece, error);
+    };
+    // Returns whether the stream decoded.
+    auto expectSame = [&](const GWData& stream, std::size_t piece, const std::string& label) {
+        GWErrorPtr fastError, zlibError;
+        const auto fast = decode(GWMakeInflateDecoder(), stream, piece, &fastError);
+        const auto reference = decode(GWMakeZlibInflateDecoder(), stream, piece, &zlibError);
+        EXPECT_EQ(bool(fast), bool(reference)) << label;
+        if (fast && reference) {
+            EXPECT_TRUE(*fast == *reference) << label;
+        } else if (!fast && !reference) {
+            EXPECT_TRUE(fastError->is(zlibError->domain(), zlibError->code())) << label;
+        }
+        return bool(fast);
+    };
+    const GWData mixed = mixedInput();
+    for (const GWData& input : {mixed, gwtest::randomBytes(70000, 23), GWData{'a'}, GWData{}}) {
+        for (bool wrapped : {false, true}) {
+            // Level 0 writes stored blocks only; 1, 6 and 9 fixed and dynamic Huffman blocks.
+            for (int level : {0, 1, 6, 9}) {
+                const GWData stream = zlibDeflate(input, wrapped, level);
+                for (std::size_t piece : {std::size_t(0), std::size_t(4093), std::size_t(3)}) {
+                    if (piece != 3 || stream.size() < 100000) {
+                        EXPECT_TRUE(expectSame(stream, piece, "whole"));
+                    }
+                }
+            }
+        }
+    }
+    // Fixed Huffman codes only, and run-length matches at distance one.
+    for (int strategy : {Z_FIXED, Z_RLE, Z_HUFFMAN_ONLY}) {
+        expectSame(zlibDeflate(mixed, false, 6, strategy), 0, "strategy");
+    }
+    const GWData text = gwtest::textBytes(40000, 24);
+    for (bool wrapped : {false, true}) {
+        for (int level : {0, 6}) {
+            const GWData stream = zlibDeflate(text, wrapped, level);
+            for (std::size_t cut = 0; cut < stream.size(); cut += 1 + cut / 8) {
+                const GWData truncated(stream.begin(), stream.begin() + std::ptrdiff_t(cut));
+                EXPECT_FALSE(expectSame(truncated, 1000, "cut at " + std::to_string(cut)));
+            }
+        }
+        const GWData stream = zlibDeflate(mixed, wrapped, 6);
+        int failures = 0;
+        for (std::size_t at = 0; at < stream.size(); at += stream.size() / 97 + 1) {
+            for (std::uint8_t flip : {std::uint8_t(0x01), std::uint8_t(0xA5)}) {
+                GWData damaged = stream;
+                damaged[at] ^= flip;
+                failures += !expectSame(damaged, 65536, "flipped at " + std::to_string(at));
+            }
+        }
+        EXPECT_GT(failures, 0);
+    }
+    expectSame(gwtest::randomBytes(5000, 25), 100, "noise");
+    expectSame(GWData{0x78, 0x9C, 0xFF, 0xFF, 0xFF, 0xFF}, 0, "reserved block type");
+}
+
+TEST(GWDecompressor, BufferedOutputAndSinkStepsDeliverEverythingOnce) {
+    const GWData input = mixedInput();
+    const GWData stream = zlibDeflate(input, true);
+    auto decompressor =
+        GWDecompressor::initForStreamingWithAlgorithm(GWDecompressorAlgorithmDeflate, nullptr);
+    bool again = false;
+    auto first =
+        decompressor->decompressedDataFromStreamWithInputData(stream, false, &again, nullptr);
+    ASSERT_TRUE(first);
+    EXPECT_TRUE(again);
+    GWData output = *first;
+    int calls = 0;
+    while (again) {
+        auto more =
+            decompressor->decompressedDataFromStreamWithInputData({}, false, &again, nullptr);
+        ASSERT_TRUE(more);
+        output.insert(output.end(), more->begin(), more->end());
+        ++calls;
+    }
+    EXPECT_GT(calls, 1);
+    EXPECT_TRUE(output == input);
+    // The stream has ended, so an empty last piece ends it quietly.
+    auto last = decompressor->decompressedDataFromStreamWithInputData({}, true, &again, nullptr);
+    ASSERT_TRUE(last && last->empty());
+    EXPECT_FALSE(again);
+
+    auto sinking =
+        GWDecompressor::initForStreamingWithAlgorithm(GWDecompressorAlgorithmDeflate, nullptr);
+    output.clear();
+    int pieces = 0;
+    for (std::size_t at = 0; at < stream.size(); at += 50000) {
+        const std::size_t length = std::min<std::size_t>(50000, stream.size() - at);
+        ASSERT_TRUE(sinking->decompressStreamWithInputData(
+            std::span(stream).subspan(at, length), at + length == stream.size(),
+            [&](std::span<const std::uint8_t> piece) {
+                EXPECT_FALSE(piece.empty());
+                output.insert(output.end(), piece.begin(), piece.end());
+                ++pieces;
+                return true;
+            },
+            nullptr));
+    }
+    EXPECT_TRUE(output == input);
+    EXPECT_GT(pieces, 3);
+
+    // A sink that stops ends the step without an error.
+    auto stopped =
+        GWDecompressor::initForStreamingWithAlgorithm(GWDecompressorAlgorithmDeflate, nullptr);
+    GWErrorPtr error;
+    EXPECT_FALSE(stopped->decompressStreamWithInputData(
+        stream, true, [](std::span<const std::uint8_t>) { return false; }, &error));
+    EXPECT_FALSE(error);
+
+    // A cut stream is damaged, and stays so.
+    auto cut =
+        GWDecompressor::initForStreamingWithAlgorithm(GWDecompressorAlgorithmDeflate, nullptr);
+    const GWData half(stream.begin(), stream.begin() + std::ptrdiff_t(stream.size() / 2));
+    auto ignore = [](std::span<const std::uint8_t>) { return true; };
+    EXPECT_FALSE(cut->decompressStreamWithInputData(half, true, ignore, &error));
+    ASSERT_TRUE(error);
+    EXPECT_TRUE(error->is(kGWCocoaErrorDomain, GWFileReadCorruptFileError));
+    GWErrorPtr after;
+    EXPECT_FALSE(cut->decompressStreamWithInputData({}, true, ignore, &after));
+    EXPECT_TRUE(after);
+}
+
 TEST(GWDecompressor, RecognisesAndDecodesWholeBuffers) {
     const GWData input = gwtest::textBytes(50000, 4);
+    const GWData zlib = zlibDeflate(input, true);
     int algorithm = -1;
-    EXPECT_TRUE(GWDecompressor::isDataCompressed(deflateBytes(input, Wrapping::Zlib), &algorithm));
+    EXPECT_TRUE(GWDecompressor::isDataCompressed(zlib, &algorithm));
     EXPECT_EQ(algorithm, GWDecompressorAlgorithmDeflate);
     EXPECT_TRUE(GWDecompressor::isDataCompressed(bzip2Bytes(input), &algorithm));
     EXPECT_EQ(algorithm, GWDecompressorAlgorithmBzip2);
     EXPECT_FALSE(GWDecompressor::isDataCompressed(gwtest::bytesOf("<?xml version"), nullptr));
     EXPECT_FALSE(GWDecompressor::isDataCompressed({}, nullptr));
 
-    auto decoded =
-        GWDecompressor::decompressedDataFromData(deflateBytes(input, Wrapping::Zlib), nullptr);
+    auto decoded = GWDecompressor::decompressedDataFromData(zlib, nullptr);
     ASSERT_TRUE(decoded);
     EXPECT_TRUE(*decoded == input);
     GWErrorPtr error;
-    EXPECT_FALSE(GWDecompressor::decompressedDataFromData(deflateBytes(input, Wrapping::Zlib),
-                                                          &error, input.size() - 1));
+    EXPECT_FALSE(GWDecompressor::decompressedDataFromData(zlib, &error, input.size() - 1));
     EXPECT_TRUE(error->is(kGWCocoaErrorDomain, GWFileReadCorruptFileError));
     EXPECT_FALSE(GWDecompressor::decompressedDataFromData(gwtest::bytesOf("plain"), &error));
 }
 
-TEST(GWDecompressor, FileRangesStreamWithBothDigestsOnTheLastCall) {
+TEST(GWDecompressor, FileRangesStreamWithBothDigestsOnOneLastCall) {
     gwtest::TemporaryDirectory directory;
     const GWData input = gwtest::textBytes(1500000, 8);
-    const GWData stream = deflateBytes(input, Wrapping::Zlib);
+    const GWData stream = zlibDeflate(input, true);
     GWData file = gwtest::bytesOf("prefix");
     file.insert(file.end(), stream.begin(), stream.end());
     file.insert(file.end(), {'t', 'a', 'i', 'l'});
     gwtest::writeFile(directory.file("heap"), file);
     auto handle = GWRemoteFileHandle::initForReadingFromURL(directory.url("heap"), nullptr);
-
-    GWData output;
-    int doneCalls = 0;
-    std::optional<GWData> storedDigest, decodedDigest;
-    GWDecompressor::decompressRemoteFileHandle(
-        handle, 6, stream.size(), GWDecompressorAlgorithmDeflate, GWChecksumAlgorithmSHA1,
-        GWChecksumAlgorithmMD5,
-        [&](std::span<const std::uint8_t> piece, std::uint64_t, std::uint64_t, bool done,
-            const std::optional<GWData>& stored, const std::optional<GWData>& decoded,
-            const GWErrorPtr& error) {
-            EXPECT_FALSE(error);
-            EXPECT_EQ(doneCalls, 0) << "no call after the last";
-            output.insert(output.end(), piece.begin(), piece.end());
-            if (done) {
-                ++doneCalls;
-                storedDigest = stored;
-                decodedDigest = decoded;
-            } else {
-                EXPECT_FALSE(stored || decoded);
-            }
-            return true;
-        });
-    EXPECT_EQ(doneCalls, 1);
-    EXPECT_TRUE(output == input);
-    EXPECT_EQ(storedDigest, GWChecksum::checksumForData(stream, GWChecksumAlgorithmSHA1));
-    EXPECT_EQ(decodedDigest, GWChecksum::checksumForData(input, GWChecksumAlgorithmMD5));
-}
-
-TEST(GWDecompressor, FileRangeStreamsStopOnRefusalAndReportErrorsOnce) {
-    gwtest::TemporaryDirectory directory;
-    gwtest::writeFile(directory.file("f"), gwtest::randomBytes(3000000, 1));
-    auto handle = GWRemoteFileHandle::initForReadingFromURL(directory.url("f"), nullptr);
-    int calls = 0;
-    GWDecompressor::decompressRemoteFileHandle(
-        handle, 0, 3000000, GWDecompressorAlgorithmCopy, 0, 0,
-        [&](auto, auto, auto, bool, const auto&, const auto&, const GWErrorPtr&) {
-            ++calls;
-            return false;
-        });
-    EXPECT_EQ(calls, 1);
-
-    // Past the end of the file, and a damaged stream: one call, with the error.
-    for (int algorithm : {GWDecompressorAlgorithmCopy, GWDecompressorAlgorithmDeflate}) {
+    struct Row {
+        std::uint64_t offset, length;
+        int algorithm;
+        const GWData& expected;
+        std::size_t errors;
+        bool refuse = false;
+    };
+    const GWData empty;
+    const Row rows[] = {
+        {6, stream.size(), GWDecompressorAlgorithmDeflate, input, 0},
+        {0, 0, GWDecompressorAlgorithmDeflate, empty, 0},
+        {0, file.size(), GWDecompressorAlgorithmCopy, empty, 0, true},  // the handler stops it
+        {file.size() - 100, 5000, GWDecompressorAlgorithmCopy, empty, 1},
+        {0, file.size(), GWDecompressorAlgorithmDeflate, empty, 1},
+    };
+    for (const Row& row : rows) {
+        SCOPED_TRACE(row.offset + row.length);
+        GWData output;
+        int calls = 0, doneCalls = 0;
         std::vector<GWErrorPtr> errors;
+        std::optional<GWData> storedDigest, decodedDigest;
         GWDecompressor::decompressRemoteFileHandle(
-            handle, algorithm == 0 ? 2999000 : 0, algorithm == 0 ? 5000 : 3000000, algorithm, 1, 1,
-            [&](auto, auto, auto, bool done, const auto& stored, const auto&,
+            handle, row.offset, row.length, row.algorithm, GWChecksumAlgorithmSHA1,
+            GWChecksumAlgorithmMD5,
+            [&](std::span<const std::uint8_t> piece, std::uint64_t, std::uint64_t, bool done,
+                const std::optional<GWData>& stored, const std::optional<GWData>& decoded,
                 const GWErrorPtr& error) {
+                ++calls;
+                EXPECT_EQ(doneCalls, 0) << "no call after the last";
+                output.insert(output.end(), piece.begin(), piece.end());
                 if (error) {
-                    EXPECT_TRUE(done);
-                    EXPECT_FALSE(stored);
+                    EXPECT_TRUE(done && !stored);
                     errors.push_back(error);
                 }
-                return true;
+                if (done) {
+                    ++doneCalls;
+                    storedDigest = stored;
+                    decodedDigest = decoded;
+                } else {
+                    EXPECT_FALSE(stored || decoded);
+                }
+                return !row.refuse;
             });
-        EXPECT_EQ(errors.size(), 1u) << algorithm;
+        EXPECT_EQ(errors.size(), row.errors);
+        if (row.refuse) {
+            EXPECT_EQ(calls, 1);
+        } else if (row.errors == 0) {
+            EXPECT_EQ(doneCalls, 1);
+            EXPECT_TRUE(output == row.expected);
+            const GWData storedRange(file.begin() + std::ptrdiff_t(row.offset),
+                                     file.begin() + std::ptrdiff_t(row.offset + row.length));
+            EXPECT_EQ(storedDigest,
+                      GWChecksum::checksumForData(storedRange, GWChecksumAlgorithmSHA1));
+            EXPECT_EQ(decodedDigest,
+                      GWChecksum::checksumForData(row.expected, GWChecksumAlgorithmMD5));
+        }
     }
-}
-
-TEST(GWDecompressor, AnEmptyRangeIsOneDoneCallWithDigestsOfNothing) {
-    gwtest::TemporaryDirectory directory;
-    gwtest::writeFile(directory.file("f"), gwtest::bytesOf("x"));
-    auto handle = GWRemoteFileHandle::initForReadingFromURL(directory.url("f"), nullptr);
-    int calls = 0;
-    GWDecompressor::decompressRemoteFileHandle(
-        handle, 0, 0, GWDecompressorAlgorithmDeflate, GWChecksumAlgorithmSHA1, 0,
-        [&](std::span<const std::uint8_t> piece, auto, auto, bool done, const auto& stored,
-            const auto& decoded, const GWErrorPtr& error) {
-            ++calls;
-            EXPECT_TRUE(piece.empty() && done && !error && !decoded);
-            EXPECT_EQ(stored, GWChecksum::checksumForData({}, GWChecksumAlgorithmSHA1));
-            return true;
-        });
-    EXPECT_EQ(calls, 1);
 }

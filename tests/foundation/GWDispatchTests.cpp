@@ -35,10 +35,7 @@ TEST(GWSemaphore, CountsSignalsAndTimesOutWithoutOne) {
     EXPECT_FALSE(owing.wait(0ms));
     owing.signal();
     EXPECT_TRUE(owing.wait(0ms));
-}
-
-TEST(GWSemaphore, WakesAWaiterOnAnotherThread) {
-    GWSemaphore semaphore;
+    // A waiter on another thread wakes.
     std::atomic<bool> woke{false};
     std::thread waiter([&] { woke = semaphore.wait(kEventually); });
     semaphore.signal();
@@ -58,10 +55,7 @@ TEST(GWGroup, WaitsUntilEveryEnterIsMatched) {
     group.wait();
     leaver.join();
     EXPECT_TRUE(group.wait(0ms));
-}
-
-TEST(GWGroup, UnbalancedLeaveIsIgnored) {
-    GWGroup group;
+    // An unbalanced leave is ignored.
     group.leave();
     group.enter();
     EXPECT_FALSE(group.wait(0ms));
@@ -115,14 +109,10 @@ TEST(GWDispatchQueue, SerialQueueRunsBlocksOneAtATimeInOrder) {
     std::vector<int> expected(200);
     std::iota(expected.begin(), expected.end(), 0);
     EXPECT_EQ(order, expected);
-}
 
-TEST(GWDispatchQueue, DroppedSerialQueueStillRunsItsBlocks) {
+    // A dropped queue still runs its blocks.
     GWSemaphore ran;
-    {
-        auto queue = GWDispatchQueue::serialQueue("short-lived");
-        queue->async([&] { ran.signal(); });
-    }
+    GWDispatchQueue::serialQueue("short-lived")->async([&] { ran.signal(); });
     EXPECT_TRUE(ran.wait(kEventually));
 }
 

@@ -2,6 +2,7 @@
 #include <zlib.h>
 
 #include <filesystem>
+#include <functional>
 #include <random>
 
 #include "foundation/GWByteReader.h"
@@ -9,7 +10,6 @@
 #include "foundation/decoders/GWStreamDecoder.h"
 #include "support/DecoderTestSupport.h"
 #include "support/TestSupport.h"
-#include "support/ZipBuilder.h"
 #include "support/ZipLegacyEncoders.h"
 
 namespace {
@@ -21,11 +21,6 @@ using gwtest::ImplodeSettings;
 
 const ImplodeSettings kImplodeSettings[] = {
     {false, false}, {false, true}, {true, false}, {true, true}};
-
-std::string describe(const ImplodeSettings& settings) {
-    return std::string(settings.largeDictionary ? "8 KiB" : "4 KiB") +
-           (settings.literalTree ? ", three trees" : ", two trees");
-}
 
 std::shared_ptr<GWDecompressor> makeDecompressor(std::uint16_t method, std::uint16_t flags,
                                                  std::uint64_t size) {
@@ -136,6 +131,28 @@ std::vector<ArchiveMember> readMembers(const GWData& archive, std::string& failu
     return reader.ok() ? members : std::vector<ArchiveMember>();
 }
 
+// A stream of one method and setting, with its encoder.
+struct Subject {
+    std::uint16_t method, flags;
+    std::function<GWData(const GWData&)> encode;
+};
+
+// Shrink clearing at 9 bits (partial clears) and at 13, and every implode setting.
+std::vector<Subject> everySubject() {
+    std::vector<Subject> subjects;
+    for (unsigned clearing : {9u, 13u}) {
+        subjects.push_back({kShrunk, 0, [clearing](const GWData& input) {
+                                return gwtest::shrinkBytes(input, {clearing});
+                            }});
+    }
+    for (const ImplodeSettings& settings : kImplodeSettings) {
+        subjects.push_back({kImploded, settings.flags(), [settings](const GWData& input) {
+                                return gwtest::implodeBytes(input, settings);
+                            }});
+    }
+    return subjects;
+}
+
 void expectCorrupt(std::uint16_t method, std::uint16_t flags, const GWData& stream,
                    const char* message) {
     SCOPED_TRACE(message);
@@ -153,165 +170,112 @@ std::string sampleFolder() {
 
 }  // namespace
 
-TEST(GWUnshrinkDecoder, RoundTripsInPiecesOfAnySize) {
-    for (const GWData& input : sampleInputs()) {
-        for (unsigned clearingCodeSize : {9u, 13u}) {
-            gwtest::ShrinkStats stats;
-            const GWData stored = gwtest::shrinkBytes(input, {clearingCodeSize}, &stats);
-            if (clearingCodeSize == 9 && input.size() > 20000) {
-                EXPECT_GT(stats.partialClears, 0);
-            }
+TEST(GWLegacyDecoders, RoundTripInPiecesOfAnySize) {
+    for (const Subject& subject : everySubject()) {
+        for (const GWData& input : sampleInputs()) {
+            const GWData stored = subject.encode(input);
             for (std::size_t pieceSize : {1, 13, 0}) {
                 if (pieceSize == 1 && stored.size() > 100000) {
                     continue;
                 }
                 GWErrorPtr error;
-                auto output = decodeInPieces(kShrunk, 0, stored, input.size(), pieceSize, &error);
-                ASSERT_TRUE(output) << error->localizedDescription();
+                auto output = decodeInPieces(subject.method, subject.flags, stored, input.size(),
+                                             pieceSize, &error);
+                ASSERT_TRUE(output) << subject.method << "/" << subject.flags << ": "
+                                    << error->localizedDescription();
                 EXPECT_TRUE(*output == input)
-                    << input.size() << " bytes in pieces of " << pieceSize;
+                    << subject.method << "/" << subject.flags << ", " << input.size()
+                    << " bytes in pieces of " << pieceSize;
             }
         }
     }
-}
-
-TEST(GWUnshrinkDecoder, FullTablesClearAndCodesReachThirteenBits) {
-    const GWData input = gwtest::randomBytes(400000, 21);
+    // Full tables clear, codes reach 13 bits, and output runs over several calls.
+    const GWData random = gwtest::randomBytes(400000, 21);
     gwtest::ShrinkStats stats;
-    const GWData stored = gwtest::shrinkBytes(input, {}, &stats);
+    const GWData shrunk = gwtest::shrinkBytes(random, {}, &stats);
     EXPECT_EQ(stats.largestCodeSize, 13u);
     EXPECT_GT(stats.partialClears, 3);
-    auto output = decodeInPieces(kShrunk, 0, stored, input.size(), 4096);
-    ASSERT_TRUE(output);
-    EXPECT_TRUE(*output == input);
+    EXPECT_TRUE(decodeInPieces(kShrunk, 0, shrunk, random.size(), 4096) == random);
+    const GWData text = gwtest::textBytes(3 * 1024 * 1024, 22);
+    const ImplodeSettings settings{true, true};
+    EXPECT_TRUE(decodeInPieces(kShrunk, 0, gwtest::shrinkBytes(text), text.size(), 13) == text);
+    EXPECT_TRUE(decodeInPieces(kImploded, settings.flags(), gwtest::implodeBytes(text, settings),
+                               text.size(), 0) == text);
 }
 
-// A code may run through the slot that its own arrival completes: after a
-// partial clear freed the previous code, the entry built on it went to a lower
-// slot, and the freed slot is the next to be filled. Codes: "a", "b", "c",
-// "bc", clear (frees 257 to 259), "x" (257 becomes 258 + "x"), then 257 runs
-// through 258, which this very code defines as "x" + "x". unzip and 7zz agree.
-TEST(GWUnshrinkDecoder, CodesMayBuildOnTheSlotTheyComplete) {
-    const GWData stored = shrinkCodes({'a', 'b', 'c', 258, 256, 2, 'x', 257});
-    auto output = decodeInPieces(kShrunk, 0, stored, 9, 1);
-    ASSERT_TRUE(output);
-    EXPECT_EQ(std::string(output->begin(), output->end()), "abcbcxxxx");
-}
+TEST(GWLegacyDecoders, HandMadeStreamsDecodeOrNameTheirDamage) {
+    // A code may run through the slot that its own arrival completes: after a
+    // partial clear freed the previous code, the entry built on it went to a lower
+    // slot, and the freed slot is the next to be filled. Codes: "a", "b", "c",
+    // "bc", clear (frees 257 to 259), "x" (257 becomes 258 + "x"), then 257 runs
+    // through 258, which this very code defines as "x" + "x". unzip and 7zz agree.
+    auto output =
+        decodeInPieces(kShrunk, 0, shrinkCodes({'a', 'b', 'c', 258, 256, 2, 'x', 257}), 9, 1);
+    EXPECT_EQ(gwtest::hex(output.value_or(GWData())), gwtest::hex(gwtest::bytesOf("abcbcxxxx")));
+    // Matches before the first byte read zeros.
+    const ImplodeSettings small{false, false};
+    output = decodeInPieces(
+        kImploded, small.flags(),
+        gwtest::implodeTokenStream({{0, 5, 4000}, {'a', 0, 0}, {0, 3, 1}, {0, 2, 10}}, small), 11,
+        0);
+    EXPECT_EQ(gwtest::hex(output.value_or(GWData())), "0000000000616161610000");
 
-TEST(GWUnshrinkDecoder, DamagedCodesAreNamedInTheError) {
-    const std::pair<GWData, const char*> cases[] = {
-        {shrinkCodes({'A', 300}), "shrink code 300 refers to a free slot"},
-        {shrinkCodes({257}), "the shrunk stream begins with code 257"},
-        {shrinkCodes({'A', 256, 3}), "unknown shrink control code 256, 3"},
-        {shrinkCodes({'A', 'B'}), "the shrunk stream ends early"},
-        // The clear frees 257 and 258; 257 is the next slot, 258 is not.
-        {shrinkCodes({'a', 'b', 'c', 256, 2, 258}), "shrink code 258 refers to a free slot"},
-        // The clear frees 257 to 260; 257 is then built on the freed 259.
-        {shrinkCodes({'a', 'b', 'c', 'd', 259, 256, 2, 'x', 257}),
-         "shrink code 257 is built on a free slot"},
-        // Sizes 9 to 13 are four steps; a fifth is one too many.
-        {shrinkCodes({'A', 256, 1, 256, 1, 256, 1, 256, 1, 256, 1}), "beyond 13 bits"},
-    };
-    for (const auto& [stream, message] : cases) {
-        expectCorrupt(kShrunk, 0, stream, message);
-    }
-}
-
-TEST(GWExplodeDecoder, RoundTripsInEveryDictionaryAndTreeSetting) {
-    for (const ImplodeSettings& settings : kImplodeSettings) {
-        for (const GWData& input : sampleInputs()) {
-            const GWData stored = gwtest::implodeBytes(input, settings);
-            for (std::size_t pieceSize : {1, 13, 0}) {
-                if (pieceSize == 1 && stored.size() > 100000) {
-                    continue;
-                }
-                GWErrorPtr error;
-                auto output = decodeInPieces(kImploded, settings.flags(), stored, input.size(),
-                                             pieceSize, &error);
-                ASSERT_TRUE(output) << describe(settings) << ": " << error->localizedDescription();
-                EXPECT_TRUE(*output == input) << describe(settings) << ", " << input.size()
-                                              << " bytes in pieces of " << pieceSize;
-            }
-        }
-    }
-}
-
-TEST(GWExplodeDecoder, EncoderReachesEveryLengthAndDistancePath) {
-    const GWData input = binaryBytes(200000, 2);
-    for (const ImplodeSettings& settings : kImplodeSettings) {
-        std::size_t matches = 0, longest = 0, farthest = 0;
-        for (const auto& token : gwtest::implodeTokens(input, settings)) {
-            matches += token.length > 0;
-            longest = std::max(longest, token.length);
-            farthest = std::max(farthest, token.distance);
-        }
-        EXPECT_GT(matches, 1000u) << describe(settings);
-        EXPECT_EQ(longest, settings.longestMatch()) << describe(settings);
-        EXPECT_GT(farthest, settings.dictionarySize() * 3 / 4) << describe(settings);
-    }
-}
-
-TEST(GWExplodeDecoder, MatchesBeforeTheFirstByteReadZeros) {
-    const ImplodeSettings settings{false, false};
-    const GWData stored =
-        gwtest::implodeTokenStream({{0, 5, 4000}, {'a', 0, 0}, {0, 3, 1}, {0, 2, 10}}, settings);
-    auto output = decodeInPieces(kImploded, settings.flags(), stored, 11, 0);
-    ASSERT_TRUE(output);
-    EXPECT_EQ(gwtest::hex(*output), "0000000000616161610000");
-}
-
-TEST(GWExplodeDecoder, InvalidTablesAreRefused) {
-    // Lengths first, then distances. 0xF5 is a run of 16 six-bit codes, so
-    // four of them make a complete table of 64.
+    // Explode tables are lengths first, then distances. 0xF5 is a run of 16
+    // six-bit codes, so four of them make a complete table of 64.
     const struct {
-        std::uint16_t flags;
+        std::uint16_t method, flags;
         GWData stream;
         const char* message;
     } cases[] = {
-        {0, {0x03, 0xF0, 0xF0, 0xF0, 0xF0}, "invalid Shannon-Fano tree for length codes"},
-        {0, {0x04, 0xF5, 0xF5, 0xF5, 0xF5, 0x05}, "invalid Shannon-Fano tree for length codes"},
-        {0, {0x02, 0xF5, 0xF5, 0xF5}, "invalid Shannon-Fano tree for length codes"},
-        {0,
+        {kShrunk, 0, shrinkCodes({'A', 300}), "shrink code 300 refers to a free slot"},
+        {kShrunk, 0, shrinkCodes({257}), "the shrunk stream begins with code 257"},
+        {kShrunk, 0, shrinkCodes({'A', 256, 3}), "unknown shrink control code 256, 3"},
+        {kShrunk, 0, shrinkCodes({'A', 'B'}), "the shrunk stream ends early"},
+        // The clear frees 257 and 258; 257 is the next slot, 258 is not.
+        {kShrunk, 0, shrinkCodes({'a', 'b', 'c', 256, 2, 258}),
+         "shrink code 258 refers to a free slot"},
+        // The clear frees 257 to 260; 257 is then built on the freed 259.
+        {kShrunk, 0, shrinkCodes({'a', 'b', 'c', 'd', 259, 256, 2, 'x', 257}),
+         "shrink code 257 is built on a free slot"},
+        // Sizes 9 to 13 are four steps; a fifth is one too many.
+        {kShrunk, 0, shrinkCodes({'A', 256, 1, 256, 1, 256, 1, 256, 1, 256, 1}), "beyond 13 bits"},
+        {kImploded,
+         0,
+         {0x03, 0xF0, 0xF0, 0xF0, 0xF0},
+         "invalid Shannon-Fano tree for length codes"},
+        {kImploded,
+         0,
+         {0x04, 0xF5, 0xF5, 0xF5, 0xF5, 0x05},
+         "invalid Shannon-Fano tree for length codes"},
+        {kImploded, 0, {0x02, 0xF5, 0xF5, 0xF5}, "invalid Shannon-Fano tree for length codes"},
+        {kImploded,
+         0,
          {0x03, 0xF5, 0xF5, 0xF5, 0xF5, 0x03, 0xF5, 0xF5, 0xF5, 0xE5, 0x00},
          "invalid Shannon-Fano tree for distance codes"},
-        {0, {0x03, 0xF5, 0xF5, 0xF5}, "the imploded stream ends inside its code tables"},
+        {kImploded, 0, {0x03, 0xF5, 0xF5, 0xF5}, "the imploded stream ends inside its code tables"},
         // Seven-bit lengths leave half the codes unused; all-ones is one of them.
-        {0,
+        {kImploded,
+         0,
          {0x03, 0xF6, 0xF6, 0xF6, 0xF6, 0x03, 0xF6, 0xF6, 0xF6, 0xF6, 0xFE, 0xFF, 0xFF},
          "invalid Shannon-Fano code"},
-        {0,
+        {kImploded,
+         0,
          {0x03, 0xF5, 0xF5, 0xF5, 0xF5, 0x03, 0xF5, 0xF5, 0xF5, 0xF5, 0x01},
          "the imploded stream ends early"},
         // With the literal tree the first table has 256 entries.
-        {4, {0x03, 0xF5, 0xF5, 0xF5, 0xF5}, "for literal codes"},
+        {kImploded, 4, {0x03, 0xF5, 0xF5, 0xF5, 0xF5}, "for literal codes"},
     };
     for (const auto& c : cases) {
-        expectCorrupt(kImploded, c.flags, c.stream, c.message);
-    }
-}
-
-TEST(GWLegacyDecoders, SeveralMebibytesWithRunAgain) {
-    const GWData input = gwtest::textBytes(3 * 1024 * 1024, 22);
-    const ImplodeSettings settings{true, true};
-    for (const auto& [method, flags, stored] :
-         {std::tuple(kShrunk, std::uint16_t(0), gwtest::shrinkBytes(input)),
-          std::tuple(kImploded, settings.flags(), gwtest::implodeBytes(input, settings))}) {
-        for (std::size_t pieceSize : {13, 0}) {
-            auto output = decodeInPieces(method, flags, stored, input.size(), pieceSize);
-            ASSERT_TRUE(output);
-            EXPECT_TRUE(*output == input) << method << " in pieces of " << pieceSize;
-        }
+        expectCorrupt(c.method, c.flags, c.stream, c.message);
     }
 }
 
 TEST(GWLegacyDecoders, OutputStopsAtTheExpectedSize) {
     const GWData input = gwtest::textBytes(50000, 31);
-    const GWData shrunk = gwtest::shrinkBytes(input);
     const ImplodeSettings settings{true, false};
-    const GWData imploded = gwtest::implodeBytes(input, settings);
     for (const auto& [method, flags, stored] :
-         {std::tuple(kShrunk, std::uint16_t(0), shrunk),
-          std::tuple(kImploded, settings.flags(), imploded)}) {
+         {std::tuple(kShrunk, std::uint16_t(0), gwtest::shrinkBytes(input)),
+          std::tuple(kImploded, settings.flags(), gwtest::implodeBytes(input, settings))}) {
         for (std::uint64_t size : {std::uint64_t(0), std::uint64_t(1), std::uint64_t(49999)}) {
             auto output = decodeInPieces(method, flags, stored, size, 13);
             ASSERT_TRUE(output) << method << " " << size;
@@ -358,17 +322,10 @@ TEST(GWLegacyDecoders, EnginesHoldBackOutputForSmallSpans) {
 
 TEST(GWLegacyDecoders, DamagedStreamsEndInAnErrorOrAShortResult) {
     const GWData input = binaryBytes(30000, 51);
-    struct Subject {
-        std::uint16_t method, flags;
-        GWData stored;
-    };
-    std::vector<Subject> subjects = {{kShrunk, 0, gwtest::shrinkBytes(input, {9})}};
-    for (const ImplodeSettings& settings : kImplodeSettings) {
-        subjects.push_back({kImploded, settings.flags(), gwtest::implodeBytes(input, settings)});
-    }
     std::mt19937 generator(20240601);
-    for (const Subject& subject : subjects) {
-        const std::span<const std::uint8_t> stored = subject.stored;
+    for (const Subject& subject : everySubject()) {
+        const GWData encoded = subject.encode(input);
+        const std::span<const std::uint8_t> stored = encoded;
         for (std::size_t cut = 0; cut < stored.size(); cut += stored.size() / 97 + 1) {
             GWErrorPtr error;
             EXPECT_FALSE(decodeInPieces(subject.method, subject.flags, stored.first(cut),
@@ -377,7 +334,7 @@ TEST(GWLegacyDecoders, DamagedStreamsEndInAnErrorOrAShortResult) {
         }
         int refused = 0;
         for (int flip = 0; flip < 300; ++flip) {
-            GWData damaged = subject.stored;
+            GWData damaged = encoded;
             damaged[generator() % damaged.size()] ^= std::uint8_t(1u << (generator() % 8));
             auto output = decodeInPieces(subject.method, subject.flags, damaged, input.size(),
                                          1 + generator() % 4000);
@@ -391,47 +348,6 @@ TEST(GWLegacyDecoders, DamagedStreamsEndInAnErrorOrAShortResult) {
             const GWData garbage = gwtest::randomBytes(1 + generator() % 3000, generator());
             auto output = decodeInPieces(subject.method, subject.flags, garbage, 100000, 512);
             EXPECT_TRUE(!output || output->size() == 100000);
-        }
-    }
-}
-
-TEST(GWLegacyDecoders, PeerToolsAcceptEncoderOutput) {
-    const bool haveUnzip = gwtest::toolAvailable("unzip");
-    const bool have7zz = gwtest::toolAvailable("7zz");
-    if (!haveUnzip && !have7zz) {
-        GTEST_SKIP() << "neither unzip nor 7zz is installed";
-    }
-    const GWData text = gwtest::textBytes(120000, 61);
-    const GWData binary = binaryBytes(120000, 62);
-    const GWData random = gwtest::randomBytes(90000, 63);
-    gwtest::ShrinkStats stats;
-    gwtest::ZipBuilder zip;
-    zip.addEncoded("shrunk-text", text, kShrunk, gwtest::shrinkBytes(text, {9}, &stats));
-    zip.addEncoded("shrunk-random", random, kShrunk, gwtest::shrinkBytes(random));
-    zip.addEncoded("shrunk-byte", {'q'}, kShrunk, gwtest::shrinkBytes({'q'}));
-    // The stream of CodesMayBuildOnTheSlotTheyComplete.
-    zip.addEncoded("shrunk-by-hand", gwtest::bytesOf("abcbcxxxx"), kShrunk,
-                   shrinkCodes({'a', 'b', 'c', 258, 256, 2, 'x', 257}));
-    ASSERT_GT(stats.partialClears, 0);
-    for (const ImplodeSettings& settings : kImplodeSettings) {
-        const std::string suffix = std::string(settings.largeDictionary ? "-8k" : "-4k") +
-                                   (settings.literalTree ? "-3" : "-2");
-        zip.addEncoded("imploded-text" + suffix, text, kImploded,
-                       gwtest::implodeBytes(text, settings), settings.flags());
-        zip.addEncoded("imploded-binary" + suffix, binary, kImploded,
-                       gwtest::implodeBytes(binary, settings), settings.flags());
-    }
-    gwtest::TemporaryDirectory directory;
-    const std::string path = directory.file("legacy.zip");
-    zip.write(path);
-
-    const std::tuple<bool, const char*, const char*> checks[] = {
-        {haveUnzip, "unzip -t ", "No errors detected"}, {have7zz, "7zz t ", "Everything is Ok"}};
-    for (const auto& [available, command, verdict] : checks) {
-        if (available) {
-            const auto result = gwtest::runCommand(command + gwtest::shellQuote(path) + " 2>&1");
-            EXPECT_EQ(result.status, 0) << result.output;
-            EXPECT_NE(result.output.find(verdict), std::string::npos) << result.output;
         }
     }
 }

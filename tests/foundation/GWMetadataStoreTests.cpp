@@ -42,32 +42,28 @@ protected:
 }  // namespace
 
 TEST(GWMetadataNamesTest, MacNamesGoToTheUserNamespaceAndLinuxNamesStay) {
+    for (const char* name :
+         {"user.xdg.comment", "trusted.x", "security.selinux", "system.posix_acl_access"}) {
+        EXPECT_EQ(GWLinuxAttributeName(name), name);
+    }
+    EXPECT_EQ(GWMacAttributeName("trusted.x"), "trusted.x");
     EXPECT_EQ(GWLinuxAttributeName("com.apple.ResourceFork"), "user.com.apple.ResourceFork");
-    EXPECT_EQ(GWLinuxAttributeName("user.xdg.comment"), "user.xdg.comment");
-    EXPECT_EQ(GWLinuxAttributeName("trusted.x"), "trusted.x");
-    EXPECT_EQ(GWLinuxAttributeName("security.selinux"), "security.selinux");
-    EXPECT_EQ(GWLinuxAttributeName("system.posix_acl_access"), "system.posix_acl_access");
     EXPECT_EQ(GWLinuxAttributeName("usersettings"), "user.usersettings");
     EXPECT_EQ(GWMacAttributeName("user.com.apple.FinderInfo"), "com.apple.FinderInfo");
-    EXPECT_EQ(GWMacAttributeName("trusted.x"), "trusted.x");
 }
 
-TEST_F(GWMetadataStoreTest, SmallValuesLiveInExtendedAttributes) {
-    if (!gwtest::userAttributesSupported(directory_.path())) {
-        GTEST_SKIP() << "no user extended attributes here";
-    }
+TEST_F(GWMetadataStoreTest, ValuesLiveInAttributesUntilTheFileSystemRefusesThem) {
     GWMetadataStore store(path_);
-    ASSERT_TRUE(store.setAttribute("com.example.small", bytesOf("abc"), nullptr));
-    EXPECT_EQ(rawAttribute(path_, "user.com.example.small"), bytesOf("abc"));
-    EXPECT_FALSE(fileExists(sidePath_));
-    EXPECT_EQ(store.attribute("user.com.example.small", nullptr), bytesOf("abc"));
-    EXPECT_FALSE(store.attribute("com.example.absent", nullptr));
-}
-
-TEST_F(GWMetadataStoreTest, ValuesTheFileSystemRefusesGoToTheSideFileAndComeBack) {
+    const bool attributes = gwtest::userAttributesSupported(directory_.path());
+    if (attributes) {
+        ASSERT_TRUE(store.setAttribute("com.example.small", bytesOf("abc"), nullptr));
+        EXPECT_EQ(rawAttribute(path_, "user.com.example.small"), bytesOf("abc"));
+        EXPECT_FALSE(fileExists(sidePath_));
+        EXPECT_EQ(store.attribute("user.com.example.small", nullptr), bytesOf("abc"));
+        EXPECT_FALSE(store.attribute("com.example.absent", nullptr));
+    }
     // Over 64 KiB no Linux file system takes an attribute value (E2BIG).
     const GWData big = gwtest::randomBytes(1 << 20, 7);
-    GWMetadataStore store(path_);
     GWErrorPtr error;
     ASSERT_TRUE(store.setAttribute("com.example.big", big, &error))
         << error->localizedDescription();
@@ -81,9 +77,7 @@ TEST_F(GWMetadataStoreTest, ValuesTheFileSystemRefusesGoToTheSideFileAndComeBack
     // Once the value fits again it moves back, and the emptied side file goes.
     ASSERT_TRUE(store.setAttribute("com.example.big", bytesOf("small"), nullptr));
     EXPECT_EQ(store.attribute("com.example.big", nullptr), bytesOf("small"));
-    if (gwtest::userAttributesSupported(directory_.path())) {
-        EXPECT_FALSE(fileExists(sidePath_));
-    }
+    EXPECT_EQ(fileExists(sidePath_), !attributes);
 }
 
 TEST_F(GWMetadataStoreTest, ForcedRefusalKeepsEveryKindOfValueInTheSideFile) {
@@ -119,30 +113,24 @@ TEST_F(GWMetadataStoreTest, ForcedRefusalKeepsEveryKindOfValueInTheSideFile) {
     EXPECT_FALSE(fileExists(sidePath_));
 }
 
-TEST_F(GWMetadataStoreTest, ResourceForkWritesReplaceBytesInPlaceAndZeroFillGaps) {
+TEST_F(GWMetadataStoreTest, ResourceForkWritesLandInPlaceAndZeroFillGapsWhereverTheForkLives) {
     GWMetadataStore store(path_);
     ASSERT_TRUE(store.writeResourceFork(bytesOf("hello"), 0, nullptr));
     ASSERT_TRUE(store.writeResourceFork(bytesOf("XY"), 2, nullptr));
     EXPECT_EQ(fork(store), bytesOf("heXYo"));
     ASSERT_TRUE(store.writeResourceFork(bytesOf("!"), 8, nullptr));
-    EXPECT_EQ(fork(store), bytesOf(std::string("heXYo\0\0\0!", 9)));
+    GWData expected = bytesOf(std::string("heXYo\0\0\0!", 9));
+    EXPECT_EQ(fork(store), expected);
     // Nothing is truncated, not even by an empty write.
     ASSERT_TRUE(store.writeResourceFork({}, 0, nullptr));
-    EXPECT_EQ(fork(store).size(), 9u);
-}
+    EXPECT_EQ(fork(store), expected);
 
-TEST_F(GWMetadataStoreTest, AForkGrowingPastAnyAttributeMovesToTheSideFile) {
-    GWMetadataStore store(path_);
-    const GWData head = gwtest::randomBytes(1000, 1);
-    ASSERT_TRUE(store.writeResourceFork(head, 0, nullptr));
+    // Growing past any attribute, it moves to the side file, where later writes land in place.
     ASSERT_TRUE(store.writeResourceFork(bytesOf("tail"), 70000, nullptr));
     EXPECT_FALSE(rawAttribute(path_, "user.com.apple.ResourceFork"));
-    GWData expected = head;
     expected.resize(70000);
     expected.insert(expected.end(), {'t', 'a', 'i', 'l'});
     EXPECT_EQ(fork(store), expected);
-
-    // Later writes land in the side file in place.
     ASSERT_TRUE(store.writeResourceFork(bytesOf("HEAD"), 0, nullptr));
     std::copy_n("HEAD", 4, expected.begin());
     EXPECT_EQ(fork(store), expected);

@@ -60,7 +60,7 @@ GWBlockOperationPtr recordingOperation(Recorder& recorder, int value) {
 
 }  // namespace
 
-TEST(GWOperation, StartRunsMainOnceAndFinishes) {
+TEST(GWOperation, StartRunsMainOnceAndADependencyOnItIsMetAtOnce) {
     auto operation = std::make_shared<CountingOperation>();
     EXPECT_TRUE(operation->isReady());
     operation->start();
@@ -69,6 +69,24 @@ TEST(GWOperation, StartRunsMainOnceAndFinishes) {
     EXPECT_TRUE(operation->executingInsideMain);
     EXPECT_FALSE(operation->isExecuting());
     EXPECT_TRUE(operation->isFinished());
+
+    auto dependent = std::make_shared<CountingOperation>();
+    dependent->addDependency(operation);
+    dependent->addDependency(operation);
+    dependent->addDependency(dependent);
+    dependent->addDependency(nullptr);
+    EXPECT_TRUE(dependent->isReady());
+    EXPECT_EQ(dependent->dependencies().size(), 1u);
+
+    // Block operations run their blocks in order, and ignore those added late.
+    Recorder recorder;
+    auto blocks = recordingOperation(recorder, 1);
+    blocks->addExecutionBlock([&] { recorder.add(2); });
+    blocks->addExecutionBlock(nullptr);
+    EXPECT_EQ(blocks->executionBlocks().size(), 2u);
+    blocks->start();
+    blocks->addExecutionBlock([&] { recorder.add(3); });
+    EXPECT_EQ(recorder.values(), (std::vector<int>{1, 2}));
 }
 
 TEST(GWOperation, CancelledBeforeStartSkipsMainYetFinishesAndCompletesOnce) {
@@ -108,53 +126,37 @@ TEST(GWOperation, CompletionBlockRunsOnceEvenWhenFinishIsRaced) {
     EXPECT_FALSE(operation->completionBlock());
 }
 
-TEST(GWOperation, WaitUntilFinishedReturnsOnlyAfterTheCompletionBlock) {
+TEST(GWOperation, WaitersAndDependentsGoOnOnlyAfterTheCompletionBlockReturned) {
+    GWOperationQueue first, second;
     auto operation = GWBlockOperation::blockOperationWithBlock([] {});
-    GWSemaphore completionEntered, releaseCompletion, waiterReturned;
+    GWSemaphore completionEntered, releaseCompletion, waiterReturned, dependentStarted;
     std::atomic<bool> completed{false};
     operation->setCompletionBlock([&] {
         completionEntered.signal();
         releaseCompletion.wait();
         completed = true;
     });
-    std::atomic<bool> completedWhenWaitReturned{false};
+    std::atomic<bool> completedWhenWaitReturned{false}, completedWhenDependentRan{false};
     std::thread waiter([&] {
         operation->waitUntilFinished();
         completedWhenWaitReturned = completed.load();
         waiterReturned.signal();
     });
-    GWOperationQueue queue;
-    queue.addOperation(operation);
-    ASSERT_TRUE(completionEntered.wait(kEventually));
-    EXPECT_TRUE(operation->isFinished());
-    EXPECT_FALSE(waiterReturned.wait(kMeanwhile));
-    releaseCompletion.signal();
-    waiter.join();
-    EXPECT_TRUE(completedWhenWaitReturned);
-}
-
-TEST(GWOperation, DependentsStartOnlyAfterTheCompletionBlockReturned) {
-    GWOperationQueue first, second;
-    auto dependency = GWBlockOperation::blockOperationWithBlock([] {});
-    GWSemaphore completionEntered, releaseCompletion, dependentStarted;
-    std::atomic<bool> completed{false};
-    dependency->setCompletionBlock([&] {
-        completionEntered.signal();
-        releaseCompletion.wait();
-        completed = true;
-    });
-    std::atomic<bool> completedWhenDependentRan{false};
     auto dependent = GWBlockOperation::blockOperationWithBlock([&] {
         completedWhenDependentRan = completed.load();
         dependentStarted.signal();
     });
-    dependent->addDependency(dependency);
+    dependent->addDependency(operation);
     second.addOperation(dependent);
-    first.addOperation(dependency);
+    first.addOperation(operation);
     ASSERT_TRUE(completionEntered.wait(kEventually));
+    EXPECT_TRUE(operation->isFinished());
+    EXPECT_FALSE(waiterReturned.wait(kMeanwhile));
     EXPECT_FALSE(dependentStarted.wait(kMeanwhile));
     releaseCompletion.signal();
+    waiter.join();
     ASSERT_TRUE(dependentStarted.wait(kEventually));
+    EXPECT_TRUE(completedWhenWaitReturned);
     EXPECT_TRUE(completedWhenDependentRan);
 }
 
@@ -193,55 +195,27 @@ TEST(GWOperation, ADependencyStartedByHandReleasesQueuedDependents) {
     dependent->waitUntilFinished();
 }
 
-TEST(GWOperation, DependingOnAFinishedOperationIsReadyAtOnce) {
-    auto done = std::make_shared<CountingOperation>();
-    done->start();
-    auto dependent = std::make_shared<CountingOperation>();
-    dependent->addDependency(done);
-    dependent->addDependency(done);
-    dependent->addDependency(dependent);
-    dependent->addDependency(nullptr);
-    EXPECT_TRUE(dependent->isReady());
-    EXPECT_EQ(dependent->dependencies().size(), 1u);
-}
-
-TEST(GWOperation, RemovingTheLastUnfinishedDependencyLetsItRun) {
+TEST(GWOperation, ADependencyThatNeverFinishesIsLeftByRemovalOrCancellation) {
     GWOperationQueue queue;
     auto never = std::make_shared<CountingOperation>();
-    auto dependent = std::make_shared<CountingOperation>();
-    dependent->addDependency(never);
-    queue.addOperation(dependent);
-    dependent->removeDependency(never);
-    dependent->waitUntilFinished();
-    EXPECT_EQ(dependent->mainCalls, 1);
-    EXPECT_TRUE(dependent->dependencies().empty());
-}
-
-TEST(GWOperation, CancellingMakesAnOperationWithUnfinishedDependenciesFinish) {
-    GWOperationQueue queue;
-    auto never = std::make_shared<CountingOperation>();
-    auto dependent = std::make_shared<CountingOperation>();
+    auto removed = std::make_shared<CountingOperation>();
+    auto cancelled = std::make_shared<CountingOperation>();
     std::atomic<int> completions{0};
-    dependent->setCompletionBlock([&] { ++completions; });
-    dependent->addDependency(never);
-    queue.addOperation(dependent);
-    dependent->cancel();
-    dependent->waitUntilFinished();
-    EXPECT_EQ(dependent->mainCalls, 0);
+    cancelled->setCompletionBlock([&] { ++completions; });
+    for (const auto& dependent : {removed, cancelled}) {
+        dependent->addDependency(never);
+        queue.addOperation(dependent);
+    }
+    removed->removeDependency(never);
+    removed->waitUntilFinished();
+    EXPECT_EQ(removed->mainCalls, 1);
+    EXPECT_TRUE(removed->dependencies().empty());
+    cancelled->cancel();
+    cancelled->waitUntilFinished();
+    EXPECT_EQ(cancelled->mainCalls, 0);
     EXPECT_EQ(completions, 1);
     EXPECT_FALSE(never->isFinished());
     queue.waitUntilAllOperationsAreFinished();
-}
-
-TEST(GWBlockOperation, RunsItsBlocksInOrderAndIgnoresLateOnes) {
-    Recorder recorder;
-    auto operation = recordingOperation(recorder, 1);
-    operation->addExecutionBlock([&] { recorder.add(2); });
-    operation->addExecutionBlock(nullptr);
-    EXPECT_EQ(operation->executionBlocks().size(), 2u);
-    operation->start();
-    operation->addExecutionBlock([&] { recorder.add(3); });
-    EXPECT_EQ(recorder.values(), (std::vector<int>{1, 2}));
 }
 
 TEST(GWOperationQueue, NeverRunsMoreThanItsWidthAndReachesIt) {
@@ -313,41 +287,27 @@ TEST(GWOperationQueue, StartsReadyOperationsInTheOrderAdded) {
     EXPECT_EQ(recorder.values(), (std::vector<int>{0, 1, 2, 3, 100, 4, 5}));
 }
 
-TEST(GWOperationQueue, WaitsForEveryOperationAndItsCompletionBlock) {
+TEST(GWOperationQueue, WaitsForEveryCompletionAndCancelAllSkipsWhatIsPending) {
     GWOperationQueue queue;
     std::atomic<int> completions{0};
-    std::vector<GWOperationPtr> operations;
-    for (int i = 0; i < 40; ++i) {
-        auto operation = GWBlockOperation::blockOperationWithBlock([] {});
-        operation->setCompletionBlock([&] { ++completions; });
-        operations.push_back(operation);
-    }
-    queue.addOperations(operations, true);
-    EXPECT_EQ(completions, 40);
-    queue.addOperationWithBlock([] {});
-    queue.waitUntilAllOperationsAreFinished();
-    EXPECT_EQ(queue.operationCount(), 0u);
-}
-
-TEST(GWOperationQueue, CancelAllOperationsFinishesPendingOnesWithoutRunningThem) {
-    GWOperationQueue queue;
-    queue.setSuspended(true);
     std::vector<std::shared_ptr<CountingOperation>> operations;
-    std::atomic<int> completions{0};
-    for (int i = 0; i < 10; ++i) {
-        auto operation = std::make_shared<CountingOperation>();
-        operation->setCompletionBlock([&] { ++completions; });
-        operations.push_back(operation);
-        queue.addOperation(operation);
+    for (int i = 0; i < 40; ++i) {
+        operations.push_back(std::make_shared<CountingOperation>());
+        operations.back()->setCompletionBlock([&] { ++completions; });
     }
+    queue.addOperations({operations.begin(), operations.begin() + 20}, true);
+    EXPECT_EQ(completions, 20);
+    queue.setSuspended(true);
+    queue.addOperations({operations.begin() + 20, operations.end()}, false);
     queue.cancelAllOperations();
     queue.setSuspended(false);
     queue.waitUntilAllOperationsAreFinished();
-    for (const auto& operation : operations) {
-        EXPECT_EQ(operation->mainCalls, 0);
-        EXPECT_TRUE(operation->isFinished());
+    EXPECT_EQ(completions, 40);
+    EXPECT_EQ(queue.operationCount(), 0u);
+    for (int i = 0; i < 40; ++i) {
+        EXPECT_EQ(operations[i]->mainCalls, i < 20 ? 1 : 0);
+        EXPECT_TRUE(operations[i]->isFinished());
     }
-    EXPECT_EQ(completions, 10);
 }
 
 TEST(GWOperationQueue, RefusesOperationsItCannotRun) {
@@ -431,32 +391,22 @@ TEST(GWOperationQueue, BatchReportsTheFirstErrorAndCancelsTheRest) {
     queue.waitUntilAllOperationsAreFinished();
 }
 
-TEST(GWOperationQueue, DroppedQueueStillRunsWhatItHolds) {
+TEST(GWOperationQueue, ADroppedQueueRunsWhatItHoldsAndMayBeDroppedByItsOwnOperation) {
     auto queue = std::make_shared<GWOperationQueue>();
+    std::weak_ptr<GWOperationQueue> watch = queue;
     queue->setMaxConcurrentOperationCount(1);
     GWSemaphore gate;
-    auto blocked = GWBlockOperation::blockOperationWithBlock([&] { gate.wait(); });
+    auto blocked = GWBlockOperation::blockOperationWithBlock([&gate, queue] { gate.wait(); });
     auto waiting = std::make_shared<CountingOperation>();
+    waiting->setCompletionBlock([queue] {});
     waiting->addDependency(blocked);
     queue->addOperation(waiting);
     queue->addOperation(blocked);
     queue.reset();
     gate.signal();
     waiting->waitUntilFinished();
+    blocked->waitUntilFinished();
     EXPECT_EQ(waiting->mainCalls, 1);
-}
-
-TEST(GWOperationQueue, LastReferenceMayBeDroppedByItsOwnOperation) {
-    auto queue = std::make_shared<GWOperationQueue>();
-    std::weak_ptr<GWOperationQueue> watch = queue;
-    auto operation = GWBlockOperation::blockOperationWithBlock([queue] {});
-    auto second = GWBlockOperation::blockOperationWithBlock([] {});
-    second->setCompletionBlock([queue] {});
-    queue->addOperation(operation);
-    queue->addOperation(second);
-    queue.reset();
-    operation->waitUntilFinished();
-    second->waitUntilFinished();
     EXPECT_TRUE(watch.expired());
 }
 

@@ -25,8 +25,6 @@ private:
     std::optional<GWValue> url_;
 };
 
-using RecordingCoder = gwtest::WriteCountingCoder;
-
 }  // namespace
 
 TEST(GWRef, RefusesLocationsThatCannotBeReferenced) {
@@ -38,39 +36,18 @@ TEST(GWRef, RefusesLocationsThatCannotBeReferenced) {
     }
 }
 
-TEST(GWRef, AcceptsFileAndWebLocationsAndCopiesThem) {
+TEST(GWRef, AcceptsFileAndWebLocationsAndRoundTripsThemThroughAnArchive) {
     for (const GWURL& url :
-         {GWURL::fileURLWithPath("/nonexistent/folder/archive.zip"),
+         {GWURL::fileURLWithPath("/data/a b/\xC3\xA9t\xC3\xA9 100%.zip"),
           GWURL::fileURLWithPath("/tmp/dir", true), urlFrom("http://example.com/a.zip"),
-          urlFrom("HTTPS://example.com/a%20b.zip?x=1#part")}) {
+          urlFrom("HTTPS://example.com/x/a%20b.zip?token=a%2Fb&v=2#part")}) {
         auto ref = GWRef::initWithURL(url);
         ASSERT_TRUE(ref) << url.absoluteString();
-        EXPECT_EQ(ref->URL(), url);
         auto copy = ref->copy();
-        ASSERT_TRUE(copy);
-        EXPECT_NE(copy.get(), ref.get());
-        EXPECT_EQ(*copy, *ref);
+        ASSERT_TRUE(copy && copy.get() != ref.get());
         EXPECT_EQ(copy->URL(), url);
-    }
-}
-
-TEST(GWRef, RoundTripsThroughAKeyedArchive) {
-    for (const GWURL& url : {GWURL::fileURLWithPath("/data/a b/\xC3\xA9t\xC3\xA9 100%.zip"),
-                             GWURL::fileURLWithPath("/data/folder/", true),
-                             urlFrom("https://example.com/x/archive.zip?token=a%2Fb&v=2")}) {
-        auto ref = GWRef::initWithURL(url);
-        ASSERT_TRUE(ref);
         GWErrorPtr error;
         GWData archive = GWKeyedArchiver::archivedDataWithRootObject(ref, &error);
-        ASSERT_FALSE(archive.empty());
-
-        auto plist = GWBinaryPropertyList::valueWithData(archive);
-        ASSERT_TRUE(plist);
-        const GWDictionary& stored =
-            *plist->dictionary()->at("$top").dictionary()->at("root").dictionary();
-        EXPECT_EQ(stored.at("$class"), GWValue("GWRef"));
-        EXPECT_EQ(stored.at("URL"), GWValue(url.absoluteString()));
-
         auto back = GWKeyedUnarchiver::unarchiveObjectWithData<GWRef>(archive, &error);
         ASSERT_TRUE(back) << error->localizedDescription();
         EXPECT_EQ(back->URL(), url) << url.absoluteString();
@@ -90,13 +67,9 @@ TEST(GWRef, AStoredURLThatIsMissingOrRefusedDecodesToNone) {
         ASSERT_TRUE(error);
         EXPECT_TRUE(error->is(kGWCocoaErrorDomain, GWFileReadCorruptFileError));
     }
-}
-
-TEST(GWRef, ANonKeyedCoderGetsNothingAndGivesNothing) {
-    auto ref = GWRef::initWithURL(GWURL::fileURLWithPath("/data/archive.zip"));
-    ASSERT_TRUE(ref);
-    RecordingCoder recorder;
-    ref->encodeWithCoder(recorder);
+    // A non-keyed coder gets nothing and gives nothing.
+    gwtest::RecordingCoder recorder;
+    GWRef::initWithURL(GWURL::fileURLWithPath("/data/archive.zip"))->encodeWithCoder(recorder);
     EXPECT_EQ(recorder.writes, 0);
     GWNonKeyedCoder coder;
     EXPECT_FALSE(GWRef::initWithCoder(coder));

@@ -158,32 +158,38 @@ TEST_F(GWRemoteFileHandleHTTPTest, HandlesOfOneResourceShareItsSizeAndBlocks) {
     EXPECT_EQ(server_->requests().size(), 1u);
 }
 
-TEST_F(GWRemoteFileHandleHTTPTest, AResourceReplacedAtTheSameSizeIsNoticedAndThenReread) {
+TEST_F(GWRemoteFileHandleHTTPTest, AResourceReplacedUnderneathIsNoticedAndThenReread) {
     auto first = open("data.bin");
     ASSERT_TRUE(first);
-    const GWData replacement = gwtest::randomBytes(contents_.size(), 8);
+    // Another size, then the same size: nginx's entity tag is made of the size and the time.
+    gwtest::writeFile(directory_.file("data.bin"), gwtest::randomBytes(2000000, 6));
+    ASSERT_TRUE(first->seekToFileOffset(1000000, nullptr));
+    GWErrorPtr error;
+    EXPECT_FALSE(first->readDataOfLength(10, &error));
+    expectPOSIXError(error, ESTALE);
+
+    auto second = open("data.bin");
+    ASSERT_TRUE(second);
+    const GWData replacement = gwtest::randomBytes(2000000, 8);
     gwtest::writeFile(directory_.file("data.bin"), replacement);
-    // nginx's entity tag is made of the size and the modification time.
     ASSERT_EQ(gwtest::runCommand("touch -d '2001-02-03 04:05:06' " +
                                  gwtest::shellQuote(directory_.file("data.bin")))
                   .status,
               0);
-
-    auto second = open("data.bin");
-    ASSERT_TRUE(second);
-    ASSERT_TRUE(second->seekToFileOffset(1000000, nullptr));
-    GWErrorPtr error;
-    EXPECT_FALSE(second->readDataOfLength(10, &error));
-    expectPOSIXError(error, ESTALE);
-
     auto third = open("data.bin");
     ASSERT_TRUE(third);
     ASSERT_TRUE(third->seekToFileOffset(1000000, nullptr));
-    EXPECT_EQ(third->readDataOfLength(10, nullptr),
+    EXPECT_FALSE(third->readDataOfLength(10, &error));
+    expectPOSIXError(error, ESTALE);
+
+    auto fourth = open("data.bin");
+    ASSERT_TRUE(fourth);
+    ASSERT_TRUE(fourth->seekToFileOffset(1000000, nullptr));
+    EXPECT_EQ(fourth->readDataOfLength(10, nullptr),
               GWData(replacement.begin() + 1000000, replacement.begin() + 1000010));
 }
 
-TEST_F(GWRemoteFileHandleHTTPTest, AnEmptyResourceHasSizeZeroAndReadsEmpty) {
+TEST_F(GWRemoteFileHandleHTTPTest, EmptyMissingAndUnwritableResources) {
     GWErrorPtr error;
     auto handle = open("empty", &error);
     ASSERT_TRUE(handle) << error->localizedDescription();
@@ -191,30 +197,14 @@ TEST_F(GWRemoteFileHandleHTTPTest, AnEmptyResourceHasSizeZeroAndReadsEmpty) {
     auto bytes = handle->readDataOfLength(10, &error);
     ASSERT_TRUE(bytes);
     EXPECT_TRUE(bytes->empty());
-}
 
-TEST_F(GWRemoteFileHandleHTTPTest, AMissingResourceIsFileNotFound) {
-    GWErrorPtr error;
     EXPECT_FALSE(open("nothing-here.zip", &error));
     expectPOSIXError(error, ENOENT);
     EXPECT_NE(error->localizedDescription().find("404"), std::string::npos);
-}
 
-TEST_F(GWRemoteFileHandleHTTPTest, RemoteLocationsCannotBeWritten) {
-    GWErrorPtr error;
     EXPECT_FALSE(GWRemoteFileHandle::initForWritingToURL(server_->url("new.bin"), &error));
     ASSERT_TRUE(error);
     EXPECT_TRUE(error->is(kGWCocoaErrorDomain, GWFileWriteUnsupportedSchemeError));
-}
-
-TEST_F(GWRemoteFileHandleHTTPTest, AResourceThatChangesSizeUnderneathIsAnError) {
-    auto handle = open("data.bin");
-    ASSERT_TRUE(handle);
-    gwtest::writeFile(directory_.file("data.bin"), gwtest::randomBytes(2000000, 6));
-    ASSERT_TRUE(handle->seekToFileOffset(1000000, nullptr));
-    GWErrorPtr error;
-    EXPECT_FALSE(handle->readDataOfLength(10, &error));
-    expectPOSIXError(error, ESTALE);
 }
 
 TEST(GWRemoteFileHandleMisbehavingServerTest, ADroppedConnectionFailsTheRangeWithoutShortData) {
@@ -289,45 +279,35 @@ struct ServerCase {
     Script script;
     int expected;  // 0: the bytes of the file (the replacement, when redirected to it)
     bool failsAtOpen = false;
-    std::size_t replacementSize = 200000;
     const char* target = "archive";  // "refused": nobody listens; "unanswered": connect never ends
     bool announced = false;          // the range is fetched ahead before it is read
 };
 
 }  // namespace
 
+// Time-outs, replaced resources and a 404 are rows of the tool's own table,
+// which also checks that no wrong bytes are written; these are the rest.
 TEST(GWRemoteFileHandleMisbehavingServerTest, EachEndsInItsErrorWithinTheTimeLimits) {
     const ServerCase cases[] = {
         {"no range support", {Behaviour::ignoreRanges}, ENOTSUP, true},
-        {"not found", {Behaviour::notFound}, ENOENT, true},
         {"another range", {Behaviour::wrongRange}, EPROTO, true},
-        {"silent after accept", {Behaviour::silent}, ETIMEDOUT, true},
-        {"stall after headers", {Behaviour::stallAt, 0}, ETIMEDOUT, true},
-        {"one byte a second", {Behaviour::trickle}, ETIMEDOUT, true},
-        {"declares more than it sends", {Behaviour::stallAt, 150000}, ETIMEDOUT},
-        {"nobody listens", {}, ECONNREFUSED, true, 0, "refused"},
-        {"connect never answered", {}, ETIMEDOUT, true, 0, "unanswered"},
-        {"replaced, no validator", {.replaceAt = 2}, ESTALE, false, 190000},
-        {"replaced, weak tag", {.validators = Validators::weakTagAndDate, .replaceAt = 2}, ESTALE},
-        {"replaced, strong tag", {.validators = Validators::strongTag, .replaceAt = 2}, ESTALE},
+        {"nobody listens", {}, ECONNREFUSED, true, "refused"},
+        {"connect never answered", {}, ETIMEDOUT, true, "unanswered"},
         {"replaced while fetched ahead",
          {.validators = Validators::strongTag, .replaceAt = 2},
          ESTALE,
          false,
-         200000,
          "archive",
          true},
         {"stalls while fetched ahead",
          {Behaviour::stallAt, 150000},
          ETIMEDOUT,
          false,
-         200000,
          "archive",
          true},
         {"strong tag dropped",
          {.validators = Validators::strongTagDroppedLater, .replaceAt = 2},
          ESTALE},
-        {"later request redirected", {.location = "/other", .redirectAt = 2}, ESTALE},
         {"first request redirected to another host",
          {.location = "http://localhost:{port}/other", .redirectAt = 1},
          0},
@@ -355,7 +335,7 @@ TEST(GWRemoteFileHandleMisbehavingServerTest, EachEndsInItsErrorWithinTheTimeLim
         SCOPED_TRACE(row.label);
         const GWData content = gwtest::randomBytes(200000, 4);
         Script script = row.script;
-        script.replacement = gwtest::randomBytes(row.replacementSize, 5);
+        script.replacement = gwtest::randomBytes(200000, 5);
         ScriptedHTTPServer server(content, script);
         UnansweredPort unanswered;
         std::string address = "http://user:secret@" + server.address().substr(7);

@@ -72,52 +72,49 @@ TEST_F(GWRemoteFileHandleTest, ReadingIntoABufferFillsItUpToTheEnd) {
     EXPECT_TRUE(std::equal(buffer.begin(), buffer.begin() + 10, contents_.end() - 10));
     EXPECT_EQ(buffer[10], 0xEE);
     EXPECT_EQ(handle_->readDataAtOffset(contents_.size() + 5, buffer, nullptr), 0u);
+    // Use after close is an error, not a crash.
     handle_->closeFileAndReturnError(nullptr);
     GWErrorPtr error;
     EXPECT_FALSE(handle_->readDataAtOffset(0, buffer, &error));
     EXPECT_TRUE(error);
+    EXPECT_FALSE(handle_->readDataOfLength(3, &error));
+    EXPECT_TRUE(error->is(kGWPOSIXErrorDomain, EBADF));
+    EXPECT_FALSE(handle_->writeData(gwtest::bytesOf("x"), &error));
 }
 
-TEST_F(GWRemoteFileHandleTest, RangesArriveInLargePiecesWithTheLastMarked) {
-    const auto pieces = readRange(*handle_, 7, contents_.size() - 7, UINT64_MAX);
-    GWData joined;
-    for (std::size_t i = 0; i < pieces.size(); ++i) {
-        EXPECT_FALSE(pieces[i].error);
-        EXPECT_EQ(pieces[i].isLast, i + 1 == pieces.size());
-        if (i + 1 < pieces.size()) {
-            EXPECT_GE(pieces[i].bytes.size(), 256u * 1024);
+TEST_F(GWRemoteFileHandleTest, RangesArriveInPiecesWithOnlyTheLastMarkedAndNeverShort) {
+    struct Row {
+        std::uint64_t offset, length, maxBuffer;
+        std::size_t pieces;  // 0: any number, in pieces of at least 256 KiB
+        bool fails = false;
+    };
+    const std::uint64_t size = contents_.size();
+    for (const Row& row : {Row{7, size - 7, UINT64_MAX, 0}, Row{0, 1000, 300, 4},
+                           Row{5, 0, UINT64_MAX, 1}, Row{size - 100, 1000, UINT64_MAX, 0, true},
+                           Row{UINT64_MAX - 5, 100, UINT64_MAX, 1, true}}) {
+        SCOPED_TRACE(row.offset);
+        const auto pieces = readRange(*handle_, row.offset, row.length, row.maxBuffer);
+        ASSERT_FALSE(pieces.empty());
+        if (row.pieces) {
+            EXPECT_EQ(pieces.size(), row.pieces);
         }
-        joined.insert(joined.end(), pieces[i].bytes.begin(), pieces[i].bytes.end());
+        GWData joined;
+        for (std::size_t i = 0; i < pieces.size(); ++i) {
+            const bool last = i + 1 == pieces.size();
+            EXPECT_EQ(pieces[i].isLast, last);
+            EXPECT_EQ(bool(pieces[i].error), last && row.fails);
+            EXPECT_TRUE(last || row.pieces || pieces[i].bytes.size() >= 256u * 1024);
+            EXPECT_LE(pieces[i].bytes.size(), row.maxBuffer);
+            joined.insert(joined.end(), pieces[i].bytes.begin(), pieces[i].bytes.end());
+        }
+        if (row.fails) {
+            EXPECT_TRUE(pieces.back().error->is(kGWCocoaErrorDomain, GWFileReadCorruptFileError));
+        } else {
+            EXPECT_EQ(joined, GWData(contents_.begin() + std::ptrdiff_t(row.offset),
+                                     contents_.begin() + std::ptrdiff_t(row.offset + row.length)));
+        }
     }
-    EXPECT_EQ(joined, GWData(contents_.begin() + 7, contents_.end()));
-}
-
-TEST_F(GWRemoteFileHandleTest, PieceSizeHonoursTheCallersLimit) {
-    const auto pieces = readRange(*handle_, 0, 1000, 300);
-    ASSERT_EQ(pieces.size(), 4u);
-    EXPECT_EQ(pieces[3].bytes.size(), 100u);
-    EXPECT_TRUE(pieces[3].isLast);
-}
-
-TEST_F(GWRemoteFileHandleTest, AnEmptyRangeIsOneEmptyLastPiece) {
-    const auto pieces = readRange(*handle_, 5, 0, UINT64_MAX);
-    ASSERT_EQ(pieces.size(), 1u);
-    EXPECT_TRUE(pieces[0].bytes.empty());
-    EXPECT_TRUE(pieces[0].isLast);
-    EXPECT_FALSE(pieces[0].error);
-}
-
-TEST_F(GWRemoteFileHandleTest, ARangeRunningPastTheEndIsAnErrorNotAShortPiece) {
-    const auto pieces = readRange(*handle_, contents_.size() - 100, 1000, UINT64_MAX);
-    ASSERT_FALSE(pieces.empty());
-    ASSERT_TRUE(pieces.back().error);
-    EXPECT_TRUE(pieces.back().error->is(kGWCocoaErrorDomain, GWFileReadCorruptFileError));
-    const auto overflow = readRange(*handle_, UINT64_MAX - 5, 100, UINT64_MAX);
-    ASSERT_EQ(overflow.size(), 1u);
-    EXPECT_TRUE(overflow[0].error);
-}
-
-TEST_F(GWRemoteFileHandleTest, AHandlerThatAnswersFalseStopsTheReading) {
+    // A handler that answers false stops the reading.
     int calls = 0;
     handle_->readDataAtOffset(0, contents_.size(), 1000,
                               [&](GWRemoteFileHandle&, std::span<const std::uint8_t>, bool,
@@ -163,15 +160,4 @@ TEST(GWRemoteFileHandle, WritesLandAtThePositionAndAHandleWithoutURLDiscards) {
     EXPECT_TRUE(sink->writeData(gwtest::randomBytes(1000, 1), nullptr));
     EXPECT_EQ(sink->offsetInFile(), 1000u);
     EXPECT_TRUE(sink->closeFileAndReturnError(nullptr));
-}
-
-TEST(GWRemoteFileHandle, UseAfterCloseIsAnErrorNotACrash) {
-    gwtest::TemporaryDirectory directory;
-    gwtest::writeFile(directory.file("f"), gwtest::bytesOf("abc"));
-    auto handle = GWRemoteFileHandle::initForReadingFromURL(directory.url("f"), nullptr);
-    ASSERT_TRUE(handle->closeFileAndReturnError(nullptr));
-    GWErrorPtr error;
-    EXPECT_FALSE(handle->readDataOfLength(3, &error));
-    EXPECT_TRUE(error->is(kGWPOSIXErrorDomain, EBADF));
-    EXPECT_FALSE(handle->writeData(gwtest::bytesOf("x"), &error));
 }
