@@ -211,7 +211,7 @@ sync_tree() {
     if git -C "$tree" rev-parse --git-dir >/dev/null 2>&1; then
         list=$(git -C "$tree" ls-files --cached --others --exclude-standard)
     else
-        list=$(cd "$tree" && find . -path ./build -prune -o -type f -print | sed 's|^\./||')
+        list=$(cd "$tree" && find . -path './build*' -prune -o -type f -print | sed 's|^\./||')
     fi
     local file
     while IFS= read -r file; do
@@ -252,6 +252,7 @@ run_suite() {  # $1: gtest filter, $2: time limit, $3: log prefix
         mkdir -p "$scratch/tmp$index"
         (
             export TMPDIR=$scratch/tmp$index GTEST_TOTAL_SHARDS=2 GTEST_SHARD_INDEX=$index
+            cd "$build/tests" || exit 1
             exec setsid timeout -k 15 "$limit" "$binary" --gtest_fail_fast \
                 --gtest_filter="$filter" --gtest_color=no
         ) >"$prefix.shard$index.log" 2>&1 </dev/null &
@@ -333,15 +334,17 @@ while IFS=$'\t' read -r id path hint what; do
         outcome="build-failed" detail="see $logs/$id.build.log"
         broken=$((broken + 1))
     else
-        verdict=pass first=""
+        verdict=pass first="" phase=""
         if ((hints)) && [[ -n $hint ]]; then
             run_suite "$hint" "$time_limit" "$logs/$id.hint"
+            phase=" [hint]"
         fi
         if [[ $verdict == pass ]]; then
-            rest='*'
+            rest='*' phase=""
             ((hints)) && [[ -n $hint ]] && rest="-$hint"
             run_suite "$rest" "$time_limit" "$logs/$id.rest"
         fi
+        first+=$phase
         case $verdict in
             pass) outcome=survived detail="" survivors+=("$id"); survived=$((survived + 1)) ;;
             timeout) outcome=killed detail="timeout: $first"; killed=$((killed + 1)) ;;
