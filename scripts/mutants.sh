@@ -30,8 +30,9 @@
 #
 # Output: one line per mutant (id, place, verdict, first failing test, seconds), then
 # totals; logs in SCRATCH/logs. A kill whose test passes when rerun alone is checked by
-# repeating the run, so a flaky test does not count as catching the fault. Exit status: 0, or 1 if a mutant did not apply or
-# build, 2 if the unmutated tree does not pass, 64 on a usage error.
+# repeating the run, so a flaky test does not count as catching the fault.
+# Exit status: 0, or 1 if a mutant did not apply or build, 2 if the unmutated tree
+# does not pass, 64 on a usage error.
 set -uo pipefail
 
 # id @@ file @@ original text (unique in the file; \n is a newline) @@ replacement
