@@ -181,20 +181,6 @@ TEST(GWOperation, DependenciesOrderExecutionAcrossQueues) {
     EXPECT_EQ(d->dependencies().size(), 2u);
 }
 
-TEST(GWOperation, ADependencyStartedByHandReleasesQueuedDependents) {
-    GWOperationQueue queue;
-    auto byHand = std::make_shared<CountingOperation>();
-    GWSemaphore dependentRan;
-    auto dependent = GWBlockOperation::blockOperationWithBlock([&] { dependentRan.signal(); });
-    dependent->addDependency(byHand);
-    EXPECT_FALSE(dependent->isReady());
-    queue.addOperation(dependent);
-    EXPECT_FALSE(dependentRan.wait(kMeanwhile));
-    byHand->start();
-    EXPECT_TRUE(dependentRan.wait(kEventually));
-    dependent->waitUntilFinished();
-}
-
 TEST(GWOperation, ADependencyThatNeverFinishesIsLeftByRemovalOrCancellation) {
     GWOperationQueue queue;
     auto never = std::make_shared<CountingOperation>();
@@ -267,26 +253,6 @@ TEST(GWOperationQueue, AsynchronousOperationHoldsItsSlotUntilItFinishes) {
     EXPECT_TRUE(manual->isFinished());
 }
 
-TEST(GWOperationQueue, StartsReadyOperationsInTheOrderAdded) {
-    GWOperationQueue queue;
-    queue.setMaxConcurrentOperationCount(1);
-    queue.setSuspended(true);
-    Recorder recorder;
-    std::vector<GWOperationPtr> operations;
-    for (int i = 0; i < 6; ++i) {
-        operations.push_back(recordingOperation(recorder, i));
-    }
-    // Waits for the fourth one, so it is passed over until then.
-    auto late = recordingOperation(recorder, 100);
-    late->addDependency(operations[3]);
-    operations.insert(operations.begin() + 1, late);
-    queue.addOperations(operations, false);
-    EXPECT_EQ(queue.operations(), operations);
-    queue.setSuspended(false);
-    queue.waitUntilAllOperationsAreFinished();
-    EXPECT_EQ(recorder.values(), (std::vector<int>{0, 1, 2, 3, 100, 4, 5}));
-}
-
 TEST(GWOperationQueue, WaitsForEveryCompletionAndCancelAllSkipsWhatIsPending) {
     GWOperationQueue queue;
     std::atomic<int> completions{0};
@@ -308,29 +274,6 @@ TEST(GWOperationQueue, WaitsForEveryCompletionAndCancelAllSkipsWhatIsPending) {
         EXPECT_EQ(operations[i]->mainCalls, i < 20 ? 1 : 0);
         EXPECT_TRUE(operations[i]->isFinished());
     }
-}
-
-TEST(GWOperationQueue, RefusesOperationsItCannotRun) {
-    GWOperationQueue queue, other;
-    queue.setSuspended(true);
-    auto operation = std::make_shared<CountingOperation>();
-    EXPECT_TRUE(queue.addOperation(operation));
-    EXPECT_FALSE(queue.addOperation(operation));
-    EXPECT_FALSE(other.addOperation(operation));
-    EXPECT_FALSE(queue.addOperation(nullptr));
-    auto finished = std::make_shared<CountingOperation>();
-    finished->start();
-    EXPECT_FALSE(queue.addOperation(finished));
-    auto executing = std::make_shared<ManualOperation>();
-    executing->start();
-    EXPECT_FALSE(queue.addOperation(executing));
-    executing->complete();
-    EXPECT_EQ(queue.operationCount(), 1u);
-    queue.setSuspended(false);
-    queue.waitUntilAllOperationsAreFinished();
-    other.waitUntilAllOperationsAreFinished();
-    EXPECT_EQ(operation->mainCalls, 1);
-    EXPECT_EQ(finished->mainCalls, 1);
 }
 
 // The shape of a batch extraction: a directory, its children, and a final
