@@ -351,20 +351,3 @@ TEST(GWKeyedUnarchiver, EveryTruncatedArchiveIsCorrupt) {
         EXPECT_TRUE(error->is(kGWCocoaErrorDomain, GWFileReadCorruptFileError)) << length;
     }
 }
-
-TEST(GWCoder, NonKeyedCoderMakesClassesWriteNothingAndDecodeToNone) {
-    gwtest::RecordingCoder recorder;
-    EXPECT_FALSE(recorder.allowsKeyedCoding());
-    fullNode()->encodeWithCoder(recorder);
-    EXPECT_EQ(recorder.writes, 0);
-
-    GWNonKeyedCoder coder;
-    EXPECT_FALSE(coder.allowsKeyedCoding());
-    EXPECT_FALSE(TestNode::initWithCoder(coder));
-    EXPECT_FALSE(coder.decodeObjectOfClass<TestLeaf>("Fork"));
-    EXPECT_FALSE(coder.decodeArrayOfObjectsOfClass<TestLeaf>("Leaves"));
-    EXPECT_FALSE(coder.decodeValue("Name"));
-    EXPECT_FALSE(coder.decodeError("Error"));
-    EXPECT_FALSE(coder.containsValueForKey("Name"));
-    EXPECT_EQ(coder.decodeInt64("Offset"), 0);
-}
