@@ -89,41 +89,36 @@ TEST(GWOperation, StartRunsMainOnceAndADependencyOnItIsMetAtOnce) {
     EXPECT_EQ(recorder.values(), (std::vector<int>{1, 2}));
 }
 
-TEST(GWOperation, CancelledBeforeStartSkipsMainYetFinishesAndCompletesOnce) {
-    auto operation = std::make_shared<CountingOperation>();
+TEST(GWOperation, CompletionBlockRunsOnceWhenCancelledBeforeStartOrWhenFinishIsRaced) {
+    auto cancelled = std::make_shared<CountingOperation>();
+    auto raced = std::make_shared<ManualOperation>();
     std::atomic<int> completions{0};
     std::atomic<bool> finishedInsideCompletion{false};
-    operation->setCompletionBlock([&, raw = operation.get()] {
+    cancelled->setCompletionBlock([&, raw = cancelled.get()] {
         finishedInsideCompletion = raw->isFinished();
         ++completions;
     });
-    operation->cancel();
-    operation->start();
-    operation->start();
-    operation->waitUntilFinished();
-    EXPECT_EQ(operation->mainCalls, 0);
-    EXPECT_TRUE(operation->isCancelled());
-    EXPECT_TRUE(operation->isFinished());
-    EXPECT_EQ(completions, 1);
+    raced->setCompletionBlock([&] { ++completions; });
+    cancelled->cancel();
+    cancelled->start();
+    cancelled->start();
+    cancelled->waitUntilFinished();
+    EXPECT_EQ(cancelled->mainCalls, 0);
+    EXPECT_TRUE(cancelled->isCancelled() && cancelled->isFinished());
     EXPECT_TRUE(finishedInsideCompletion);
-}
 
-TEST(GWOperation, CompletionBlockRunsOnceEvenWhenFinishIsRaced) {
-    auto operation = std::make_shared<ManualOperation>();
-    std::atomic<int> completions{0};
-    operation->setCompletionBlock([&] { ++completions; });
-    operation->start();
-    EXPECT_TRUE(operation->isExecuting());
+    raced->start();
+    EXPECT_TRUE(raced->isExecuting());
     std::vector<std::thread> finishers;
     for (int i = 0; i < 4; ++i) {
-        finishers.emplace_back([operation] { operation->complete(); });
+        finishers.emplace_back([raced] { raced->complete(); });
     }
     for (auto& finisher : finishers) {
         finisher.join();
     }
-    EXPECT_TRUE(operation->isFinished());
-    EXPECT_EQ(completions, 1);
-    EXPECT_FALSE(operation->completionBlock());
+    EXPECT_TRUE(raced->isFinished());
+    EXPECT_EQ(completions, 2);
+    EXPECT_FALSE(raced->completionBlock());
 }
 
 TEST(GWOperation, WaitersAndDependentsGoOnOnlyAfterTheCompletionBlockReturned) {
@@ -276,8 +271,8 @@ TEST(GWOperationQueue, WaitsForEveryCompletionAndCancelAllSkipsWhatIsPending) {
     }
 }
 
-// The shape of a batch extraction: a directory, its children, and a final
-// operation that reports the first error the completion blocks recorded.
+// The shape of a batch extraction: children after their directory, and a
+// final operation that reports the first error the completion blocks recorded.
 TEST(GWOperationQueue, BatchReportsTheFirstErrorAndCancelsTheRest) {
     constexpr int kChildren = 300;
     constexpr int kFailing = 40;
@@ -285,32 +280,24 @@ TEST(GWOperationQueue, BatchReportsTheFirstErrorAndCancelsTheRest) {
     // One at a time, so exactly the operations after the failing one are skipped.
     queue.setMaxConcurrentOperationCount(1);
     std::mutex slotMutex;
-    int firstError = 0;
+    int firstError = 0, reported = -1;
+    std::atomic<bool> everyOneFinishedFirst{false};
     std::vector<std::shared_ptr<CountingOperation>> batch;
-    batch.push_back(std::make_shared<CountingOperation>());
-    for (int i = 1; i <= kChildren; ++i) {
+    for (int i = 0; i <= kChildren; ++i) {
         batch.push_back(std::make_shared<CountingOperation>());
-        batch.back()->addDependency(batch.front());
-    }
-    std::atomic<bool> everyOneFinishedFirst{true};
-    int reported = -1;
-    auto final = GWBlockOperation::blockOperationWithBlock([&] {
-        for (const auto& operation : batch) {
-            if (!operation->isFinished()) {
-                everyOneFinishedFirst = false;
-            }
+        if (i > 0) {
+            batch.back()->addDependency(batch.front());
         }
+    }
+    auto final = GWBlockOperation::blockOperationWithBlock([&] {
+        everyOneFinishedFirst = std::all_of(batch.begin(), batch.end(),
+                                            [](const auto& member) { return member->isFinished(); });
         std::lock_guard<std::mutex> lock(slotMutex);
         reported = firstError;
     });
     for (int i = 0; i <= kChildren; ++i) {
-        std::weak_ptr<CountingOperation> weak = batch[i];
-        batch[i]->setCompletionBlock([&, weak, i] {
-            const auto operation = weak.lock();
+        batch[i]->setCompletionBlock([&, i] {
             std::lock_guard<std::mutex> lock(slotMutex);
-            if (operation->isCancelled() && firstError == 0) {
-                firstError = -1;
-            }
             if (i == kFailing && firstError == 0) {
                 firstError = kFailing;
             }
