@@ -34,18 +34,6 @@ namespace {
     return ::testing::AssertionFailure() << "not one error line: " << text;
 }
 
-// A small tree with the kinds of items every ZIP and XAR tool handles.
-void makeSourceTree(const std::string& root) {
-    fs::create_directories(root + "/docs/deep/er");
-    fs::create_directories(root + "/empty-dir");
-    writeFile(root + "/docs/readme.txt", textBytes(20000, 1));
-    writeFile(root + "/docs/deep/er/data.bin", randomBytes(70000, 2));
-    writeFile(root + "/docs/empty.txt", {});
-    writeFile(root + "/run.sh", bytesOf("#!/bin/sh\necho hi\n"));
-    chmod((root + "/run.sh").c_str(), 0755);
-    fs::create_symlink("docs/readme.txt", root + "/latest");
-}
-
 std::string pythonJSON(const std::string& json, const std::string& expression) {
     std::string script = "import json,sys\nd=json.load(sys.stdin)\n" + expression;
     TemporaryDirectory scratch;
@@ -121,43 +109,6 @@ TEST(GWArchiveTool, MissingNonArchiveAndTruncatedFilesGiveOneErrorLine) {
     EXPECT_EQ(readFile(directory.file("out/a.txt")), textBytes(5000, 4));
     ToolRun notThere = runTool("list -v " + shellQuote(directory.file("missing.zip")));
     EXPECT_NE(notThere.err.find("(NSPOSIXErrorDomain 2)"), std::string::npos) << notThere.err;
-}
-
-// --- ZIP archives of other tools ------------------------------------------------
-
-TEST(GWArchiveTool, InfoZipArchiveExtractsAndCatsAsUnzipDoes) {
-    if (!toolAvailable("zip") || !toolAvailable("unzip"))
-        GTEST_SKIP() << "Info-ZIP missing";
-    TemporaryDirectory directory;
-    makeSourceTree(directory.file("src"));
-    std::string archive = directory.file("tree.zip");
-    ASSERT_EQ(runCommand("cd " + shellQuote(directory.file("src")) + " && zip -qry " +
-                         shellQuote(archive) + " .")
-                  .status,
-              0);
-
-    ASSERT_EQ(runCommand("unzip -q " + shellQuote(archive) + " -d " +
-                         shellQuote(directory.file("by-unzip")))
-                  .status,
-              0);
-    ToolRun extract =
-        runTool("extract -C " + shellQuote(directory.file("by-tool")) + " " + shellQuote(archive));
-    ASSERT_EQ(extract.status, 0) << extract.err;
-    EXPECT_TRUE(extract.err.empty()) << "no terminal, so no progress bar: " << extract.err;
-    EXPECT_EQ(describeTree(directory.file("by-tool")), describeTree(directory.file("by-unzip")));
-    // Standard input, from a pipe (spooled) and from a file (read in place).
-    ASSERT_EQ(runCommand("cat " + shellQuote(archive) + " | " GW_TOOL_PATH " extract -C " +
-                         shellQuote(directory.file("by-pipe")) + " -")
-                  .status,
-              0);
-    EXPECT_EQ(describeTree(directory.file("by-pipe")), describeTree(directory.file("by-unzip")));
-    EXPECT_EQ(runTool("list - < " + shellQuote(archive)).out,
-              runTool("list " + shellQuote(archive)).out);
-
-    ToolRun cat = runTool("cat " + shellQuote(archive) + " docs/deep/er/data.bin");
-    ASSERT_EQ(cat.status, 0) << cat.err;
-    EXPECT_EQ(cat.out,
-              runCommand("unzip -p " + shellQuote(archive) + " docs/deep/er/data.bin").output);
 }
 
 // Hidden build folders anywhere below `root`.
@@ -494,7 +445,7 @@ TEST(GWArchiveTool, CommandLineHabitsTable) {
     writeFile(directory.file("n.txt"), bytesOf("plain text"));
 
     const struct {
-        std::string command;  // Z, M, S, X: the archives; N: no archive; OUT: a folder
+        std::string command;  // Z, M, S, X: the archives; N: no archive; OUT: a folder; GW: the tool
         int status;
         std::string out;  // patterns for matchesLoosely
         std::string err;
@@ -518,7 +469,9 @@ TEST(GWArchiveTool, CommandLineHabitsTable) {
          "\"uid\":*,\"gid\":*,\"appleDouble\":false,**\n",
          ""},
         {"list -l M", 0, "d** d/  [fold/MACS]\n-** d/f  [AppleDouble]\n**saved\n", ""},
-        // cat: PATHs in order, folders by their files, damage said plainly.
+        // cat: PATHs in order, folders by their files, damage said plainly; standard
+        // input from a file (read in place) and from a pipe (spooled).
+        {"cat - top.txt < Z && cat Z | GW cat - docs/sub/c.txt", 0, "topcharlie", ""},
         {"cat Z top.txt 'docs/*.txt' top.txt", 0, "topalphatop", ""},
         {"cat Z docs/sub nope", 1, "charlie", "gwarchive: Z: nope: no entry matches\n"},
         {"cat Z bad.txt", 1, "damaged",
@@ -562,7 +515,7 @@ TEST(GWArchiveTool, CommandLineHabitsTable) {
     const std::pair<std::string, std::string> names[] = {
         {"Z", directory.file("z.zip")},   {"M", directory.file("mac.zip")},
         {"S", directory.file("sfx.zip")}, {"X", directory.file("x.xar")},
-        {"N", directory.file("n.txt")},
+        {"N", directory.file("n.txt")},   {"GW", GW_TOOL_PATH},
         {"OUT", directory.file("out")},
     };
     auto substitute = [&](std::string text) {
