@@ -505,53 +505,6 @@ TEST(GWArchiveTool, CommandLineHabitsTable) {
 
 // --- test ----------------------------------------------------------------------
 
-TEST(GWArchiveTool, InfoAndTestJsonCarryTheVerdicts) {
-    XarSigning& signing = sharedSigning();
-    TemporaryDirectory directory;
-    XarBuilder xar;
-    xar.setFiles("<file id=\"1\"><name>good</name><type>file</type>" +
-                 xar.dataElement("data", bytesOf("all fine"), XarEncoding::none, "sha1") +
-                 "</file><file id=\"2\"><name>bad</name><type>file</type>" +
-                 xar.dataElement("data", bytesOf("flip me"), XarEncoding::none, "sha1") +
-                 "</file>");
-    ASSERT_TRUE(signing.signArchive(xar, {{"CMS", signing.leaf(XarKeyType::ecdsa)}}))
-        << signing.problem();
-    GWData bytes = xar.bytes();
-    const std::string text(bytes.begin(), bytes.end());
-    bytes[text.find("flip me")] ^= 0x01;
-    const std::string archive = directory.file("a.xar");
-    writeFile(archive, bytes);
-    const std::string arguments =
-        " --json --trust " + shellQuote(signing.rootCertificateFile()) + " " + shellQuote(archive);
-
-    ToolRun info = runTool("info" + arguments);
-    ASSERT_EQ(info.status, 0) << info.err;
-    EXPECT_EQ(pythonJSON(info.out,
-                         "s = d['signatures'][0]\n"
-                         "print(d['format'], d['entries'], d['bytes'], d['checksum'], "
-                         "d['signature'], repr(d['signatureReason']))\n"
-                         "print(s['type'], s['verdict'], repr(s['reason']), s['certificates'], "
-                         "s['chain'])"),
-              "xar 2 15 valid valid ''\n"
-              "CMS valid '' ['GW Test ECDSA Signer', 'GW Test Intermediate CA'] "
-              "['GW Test ECDSA Signer', 'GW Test Intermediate CA', 'GW Test Root CA']\n");
-
-    ToolRun test = runTool("test --require-signature" + arguments);
-    EXPECT_EQ(test.status, 1) << test.err;
-    EXPECT_EQ(pythonJSON(test.out,
-                         "print(d['passed'], d['entries'], d['signature'], d['error'])\n"
-                         "for b in d['bad']: print(b['path'], b['error']['domain'], "
-                         "b['error']['code'], b['error']['message'])"),
-              "False 2 valid None\n"
-              "bad NSCocoaErrorDomain 259 checksum mismatch (data damaged)\n");
-
-    // Refused before any entry is read: the reason is the object's error.
-    ToolRun refused = runTool("test --require-signature --json " + shellQuote(archive));
-    EXPECT_EQ(refused.status, 1);
-    EXPECT_EQ(pythonJSON(refused.out, "print(d['signature'], d['error']['code'], d['bad'])"),
-              "untrusted 7 []\n");
-}
-
 // How test, extract and info judge a XAR's checksums and signatures.
 // `arguments` name the archive as ARCHIVE, the output directory as OUT and
 // the test root certificate as ROOT.
@@ -660,6 +613,24 @@ INSTANTIATE_TEST_SUITE_P(
                    "extract --require-signature --trust ROOT -C OUT ARCHIVE", 0, "", "", true},
         XarVerdict{"TestRequiresASignature", XarDamage::none, "test --require-signature ARCHIVE", 1,
                    "", "Refused: the signature is none\n", false},
+        XarVerdict{"InfoJsonCarriesTheChain", XarDamage::signedRSA,
+                   "info --json --trust ROOT ARCHIVE", 0,
+                   "\"signature\":\"valid\",\"signatureReason\":\"\",\"signatures\":[{\"type\":"
+                   "\"RSA\",\"extended\":false,\"verdict\":\"valid\",\"reason\":\"\",\"certificates\":"
+                   "[\"GW Test RSA Signer\",\"GW Test Intermediate CA\"],\"chain\":[\"GW Test RSA "
+                   "Signer\",\"GW Test Intermediate CA\",\"GW Test Root CA\"]}]",
+                   "", false},
+        XarVerdict{"TestJsonNamesTheBadEntry", XarDamage::flippedData, "test --json ARCHIVE", 1,
+                   "\"bad\":[{\"path\":\"x.txt\",\"error\":{\"domain\":\"NSCocoaErrorDomain\","
+                   "\"code\":259,\"message\":\"checksum mismatch (data damaged)\"}}],\"error\":null,"
+                   "\"passed\":false}",
+                   "", false},
+        XarVerdict{"TestJsonCarriesTheRefusal", XarDamage::signedRSA,
+                   "test --require-signature --json ARCHIVE", 1,
+                   "\"bad\":[],\"error\":{\"domain\":\"GWXARArchiveErrorDomain\",\"code\":7,",
+                   "Refused: the signature is untrusted (unknown issuer, GW Test RSA Signer, GW "
+                   "Test Intermediate CA)\n",
+                   false},
         XarVerdict{"TrustNeedsCertificates", XarDamage::none, "list --trust ARCHIVE ARCHIVE", 1, "",
                    "The trusted certificates hold no PEM certificate", false}),
     [](const auto& info) { return std::string(info.param.name); });
