@@ -409,6 +409,7 @@ TEST(GWArchiveTool, CommandLineHabitsTable) {
     } rows[] = {
         {"detect Z S X N", 0, "Z: zip\nS: zip (self-extracting)\nX: xar\nN: unknown\n", ""},
         {"detect OUT", 1, "", "gwarchive: OUT: **\n"},
+        {"macbinary N OUT/n", 1, "", "gwarchive: N: **\n"},
         // Missing, no archive, or cut short: one error line and status 1; what the
         // lost directory held is recovered, and said once.
         {"list N", 1, "", "gwarchive: N: **\n"},
@@ -666,12 +667,6 @@ TEST(GWArchiveTool, MacBinaryAndAppleDoubleCommandsRestoreForksAndFinderInfo) {
     char info[32] = {};
     ASSERT_EQ(getxattr(directory.file("App").c_str(), "user.com.apple.FinderInfo", info, 32), 32);
     EXPECT_EQ(std::string(info, 8), "APPLabcd");
-
-    writeFile(directory.file("junk"), bytesOf("not macbinary at all"));
-    ToolRun junk = runTool("macbinary " + shellQuote(directory.file("junk")) + " " +
-                           shellQuote(directory.file("out")));
-    EXPECT_EQ(junk.status, 1);
-    EXPECT_TRUE(isErrorLine(junk.err, directory.file("junk")));
 }
 
 // --- progress -------------------------------------------------------------------
