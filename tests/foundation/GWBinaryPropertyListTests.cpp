@@ -147,52 +147,6 @@ TEST(GWBinaryPropertyList, ValuesRoundTripExactly) {
     EXPECT_TRUE(error->is(kGWCocoaErrorDomain, GWPropertyListWriteInvalidError));
 }
 
-// Python reads what we write and writes it back its own way, which we read.
-TEST(GWBinaryPropertyList, PythonAgreesBothWays) {
-    if (!gwtest::toolAvailable("python3")) {
-        GTEST_SKIP() << "python3 is not installed";
-    }
-    GWArray wide;  // references of two bytes
-    for (int i = 0; i < 300; ++i) {
-        wide.push_back(GWValue(i));
-    }
-    const GWValue shared(GWArray{GWValue(1), GWValue(2), GWValue(3)});
-    const GWValue value(GWDictionary{
-        {"negative", GWValue(-5)},
-        {"min", GWValue(INT64_MIN)},
-        {"big", GWValue(std::uint64_t(1) << 63)},
-        {"max", GWValue(UINT64_MAX)},
-        {"wide", GWValue(std::int64_t(1) << 40)},
-        {"real", GWValue(0.1)},
-        {"text", GWValue("Gr\xC3\xBC\xC3\x9F"
-                         "e \xF0\x9F\x98\x80")},
-        {"data", GWValue(GWData{0, 255, 16})},
-        {"mac", GWValue(GWDate(-2082844800))},
-        {"future", GWValue(GWDate(4102444800.5))},
-        {"nested", GWValue(GWArray{GWValue(true), GWValue(GWDictionary{{"x", GWValue(1.5)}})})},
-        {"list", GWValue(GWArray{shared, shared, GWValue(wide)})}});
-    gwtest::TemporaryDirectory directory;
-    const std::string ours = directory.file("ours.plist"), theirs = directory.file("theirs.plist");
-    gwtest::writeFile(ours, GWBinaryPropertyList::dataWithValue(value));
-    const std::string script = R"PY(
-import plistlib, sys
-d = plistlib.load(open(sys.argv[1], "rb"))
-print(d["negative"], d["max"], d["wide"], d["text"].encode("unicode_escape").decode(),
-      d["data"].hex(), d["mac"].isoformat(), d["future"].isoformat(), d["nested"])
-plistlib.dump(d, open(sys.argv[2], "wb"), fmt=plistlib.FMT_BINARY)
-)PY";
-    auto result = gwtest::runCommand("python3 -c " + gwtest::shellQuote(script) + " " +
-                                     gwtest::shellQuote(ours) + " " + gwtest::shellQuote(theirs));
-    ASSERT_EQ(result.status, 0) << result.output;
-    EXPECT_EQ(result.output,
-              "-5 18446744073709551615 1099511627776 Gr\\xfc\\xdfe \\U0001f600 00ff10 "
-              "1904-01-01T00:00:00 2100-01-01T00:00:00.500000 [True, {'x': 1.5}]\n");
-    GWErrorPtr error;
-    auto back = GWBinaryPropertyList::valueWithData(gwtest::readFile(theirs), &error);
-    ASSERT_TRUE(back) << error->localizedDescription();
-    EXPECT_EQ(*back, value);
-}
-
 // --- Damaged files -------------------------------------------------------------
 
 TEST(GWBinaryPropertyList, EveryTruncationAndCorruptedByteIsCorruptOrReadable) {

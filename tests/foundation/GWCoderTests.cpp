@@ -215,22 +215,6 @@ TEST(GWKeyedArchiver, RoundTripsEveryKindOfValueAndNestedObjects) {
     EXPECT_FALSE(back->checksum || back->link || back->children || back->fork || back->error);
 }
 
-TEST(GWKeyedArchiver, KeysBeginningWithADollarSignAreKeptApartFromTheArchivesOwn) {
-    GWKeyedArchiver archiver;
-    GWDictionary tricky{{"$class", GWValue("NotAClass")},
-                        {"$$already", GWValue(1)},
-                        {"$", GWValue(2)},
-                        {"plain", GWValue(GWDictionary{{"$top", GWValue(3)}})}};
-    archiver.encodeValue(tricky, "$class");
-    archiver.encodeValue(GWValue("x"), "$$");
-    GWErrorPtr error;
-    auto unarchiver = GWKeyedUnarchiver::initForReadingWithData(archiver.encodedData(), &error);
-    ASSERT_TRUE(unarchiver) << error->localizedDescription();
-    EXPECT_EQ(unarchiver->decodeDictionary("$class"), tricky);
-    EXPECT_EQ(unarchiver->decodeString("$$"), "x");
-    EXPECT_FALSE(unarchiver->decodeObject("$class"));
-}
-
 TEST(GWKeyedArchiver, CyclesDeepNestingAndNoRootAreRefused) {
     auto cycle = std::make_shared<TestNode>();
     cycle->children = std::vector{cycle};
@@ -253,7 +237,7 @@ TEST(GWKeyedArchiver, CyclesDeepNestingAndNoRootAreRefused) {
     cycle->children.reset();
 }
 
-TEST(GWKeyedUnarchiver, WrongKindsUnderAKeyDecodeAsNothing) {
+TEST(GWKeyedUnarchiver, WrongKindsUnderAKeyDecodeAsNothingAndDollarKeysAreKeptApart) {
     GWKeyedArchiver archiver;
     auto leaf = std::make_shared<TestLeaf>();
     archiver.encodeValue(GWValue("text"), "String");
@@ -268,8 +252,18 @@ TEST(GWKeyedUnarchiver, WrongKindsUnderAKeyDecodeAsNothing) {
         std::vector<std::shared_ptr<GWCoding>>{leaf, std::make_shared<TestNode>()}, "Mixed");
     archiver.encodeObject(std::make_shared<TestUnregisteredLeaf>(), "Unknown");
     archiver.encodeValue(GWValue(GWArray{GWValue(1)}), "Values");
+    // Keys beginning with "$" are kept apart from the archive's own.
+    GWDictionary tricky{{"$class", GWValue("NotAClass")},
+                        {"$$already", GWValue(1)},
+                        {"$", GWValue(2)},
+                        {"plain", GWValue(GWDictionary{{"$top", GWValue(3)}})}};
+    archiver.encodeValue(tricky, "$class");
+    archiver.encodeValue(GWValue("x"), "$$");
     auto coder = GWKeyedUnarchiver::initForReadingWithData(archiver.encodedData());
     ASSERT_TRUE(coder);
+    EXPECT_EQ(coder->decodeDictionary("$class"), tricky);
+    EXPECT_EQ(coder->decodeString("$$"), "x");
+    EXPECT_FALSE(coder->decodeObject("$class"));
 
     EXPECT_EQ(coder->decodeInt64("String"), 0);
     EXPECT_EQ(coder->decodeInt64("Real"), 0);
@@ -350,21 +344,4 @@ TEST(GWKeyedUnarchiver, EveryTruncatedArchiveIsCorrupt) {
         ASSERT_TRUE(error);
         EXPECT_TRUE(error->is(kGWCocoaErrorDomain, GWFileReadCorruptFileError)) << length;
     }
-}
-
-TEST(GWCoder, NonKeyedCoderMakesClassesWriteNothingAndDecodeToNone) {
-    gwtest::RecordingCoder recorder;
-    EXPECT_FALSE(recorder.allowsKeyedCoding());
-    fullNode()->encodeWithCoder(recorder);
-    EXPECT_EQ(recorder.writes, 0);
-
-    GWNonKeyedCoder coder;
-    EXPECT_FALSE(coder.allowsKeyedCoding());
-    EXPECT_FALSE(TestNode::initWithCoder(coder));
-    EXPECT_FALSE(coder.decodeObjectOfClass<TestLeaf>("Fork"));
-    EXPECT_FALSE(coder.decodeArrayOfObjectsOfClass<TestLeaf>("Leaves"));
-    EXPECT_FALSE(coder.decodeValue("Name"));
-    EXPECT_FALSE(coder.decodeError("Error"));
-    EXPECT_FALSE(coder.containsValueForKey("Name"));
-    EXPECT_EQ(coder.decodeInt64("Offset"), 0);
 }

@@ -22,25 +22,6 @@ TEST(GWConversions, FourCharCodesPutTheFirstCharacterHigh) {
     EXPECT_EQ(GWFourCharCode("ab"), 0u);
 }
 
-TEST(GWConversions, LittleEndianIntegersOfOneToEightBytes) {
-    EXPECT_EQ(GWNumberWithLittleEndianIntegerData(GWData{0x34, 0x12}), 0x1234u);
-    EXPECT_EQ(GWNumberWithLittleEndianIntegerData(GWData{1, 2, 3, 4, 5, 6, 7, 0x88}),
-              0x8807060504030201ull);
-    EXPECT_EQ(GWNumberWithLittleEndianIntegerData(GWData{}), std::nullopt);
-    EXPECT_EQ(GWNumberWithLittleEndianIntegerData(GWData(9, 1)), std::nullopt);
-}
-
-TEST(GWConversions, UniqueIDsAreDistinctUUIDs) {
-    std::set<std::string> seen;
-    for (int i = 0; i < 1000; ++i) {
-        const std::string id = GWUniqueID();
-        EXPECT_EQ(id.size(), 36u);
-        EXPECT_EQ(id[14], '4');
-        seen.insert(id);
-    }
-    EXPECT_EQ(seen.size(), 1000u);
-}
-
 TEST(GWBase64, DecodesStandardTextWithSpacesAndLineBreaksAndRefusesAnythingElse) {
     const std::pair<const char*, GWData> good[] = {
         {"aGVsbG8gd29ybGQ=", gwtest::bytesOf("hello world")},

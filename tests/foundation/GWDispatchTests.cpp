@@ -115,32 +115,3 @@ TEST(GWDispatchQueue, SerialQueueRunsBlocksOneAtATimeInOrder) {
     GWDispatchQueue::serialQueue("short-lived")->async([&] { ran.signal(); });
     EXPECT_TRUE(ran.wait(kEventually));
 }
-
-TEST(GWDispatchQueue, GlobalQueueIsSharedAndConcurrent) {
-    auto global = GWDispatchQueue::globalQueue();
-    EXPECT_EQ(global, GWDispatchQueue::globalQueue());
-    EXPECT_FALSE(global->isSerial());
-    // Each block waits for the other: a serial queue would time out.
-    GWSemaphore first, second;
-    std::atomic<int> met{0};
-    GWGroup group;
-    group.enter();
-    group.enter();
-    global->async([&] {
-        first.signal();
-        met += second.wait(kEventually) ? 1 : 0;
-        group.leave();
-    });
-    global->async([&] {
-        second.signal();
-        met += first.wait(kEventually) ? 1 : 0;
-        group.leave();
-    });
-    group.wait();
-    EXPECT_EQ(met, 2);
-
-    const auto caller = std::this_thread::get_id();
-    std::thread::id ranOn;
-    global->sync([&] { ranOn = std::this_thread::get_id(); });
-    EXPECT_EQ(ranOn, caller);
-}

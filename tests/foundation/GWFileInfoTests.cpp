@@ -134,24 +134,6 @@ TEST_F(GWFileInfoTest, DatesAndModeLeaveTheTargetOfALinkAlone) {
     EXPECT_EQ(lstatOf(path_).st_mode, target.st_mode);
 }
 
-TEST_F(GWFileInfoTest, MissingFilesAndRemoteLocationsFail) {
-    GWErrorPtr error;
-    EXPECT_FALSE(GWFileInfo::initWithURL(directory_.url("missing"), &error));
-    ASSERT_TRUE(error);
-    EXPECT_TRUE(error->is(kGWPOSIXErrorDomain, ENOENT));
-    EXPECT_EQ(error->URL(), directory_.url("missing"));
-
-    const GWURL remote = *GWURL::URLWithString("https://example.com/file");
-    EXPECT_FALSE(GWFileInfo::initWithURL(remote, &error));
-    EXPECT_TRUE(error->is(kGWCocoaErrorDomain, GWFileReadUnsupportedSchemeError));
-    auto info = load();
-    info->setTypeCode(1);
-    EXPECT_FALSE(info->applyToURL(remote, &error));
-    EXPECT_TRUE(error->is(kGWCocoaErrorDomain, GWFileWriteUnsupportedSchemeError));
-    EXPECT_FALSE(info->applyToURL(directory_.url("missing"), &error));
-    EXPECT_TRUE(error->is(kGWPOSIXErrorDomain, ENOENT));
-}
-
 TEST(GWSpotlightCommentsTest, CommentsAreTheFreedesktopAttributeAndEmptyRemovesThem) {
     gwtest::TemporaryDirectory directory;
     const std::string path = directory.file("file");

@@ -352,12 +352,10 @@ TEST(GWLegacyDecoders, DamagedStreamsEndInAnErrorOrAShortResult) {
     }
 }
 
-TEST(GWLegacyDecoders, PKZIPArchivesDecodeLikeUnzip) {
+// PKZIP's own archives: what it stored decodes to the CRC it recorded.
+TEST(GWLegacyDecoders, PKZIPArchivesDecodeToTheirRecordedCRC) {
     if (!std::filesystem::is_directory(sampleFolder())) {
         GTEST_SKIP() << sampleFolder() << " is absent";
-    }
-    if (!gwtest::toolAvailable("unzip")) {
-        GTEST_SKIP() << "unzip is not installed";
     }
     int decoded[7] = {};
     for (const char* name : {"PKZ110.ZIP", "PKZ110EI.ZIP", "PKZ110ES.ZIP", "PKZ80B1.ZIP"}) {
@@ -375,10 +373,6 @@ TEST(GWLegacyDecoders, PKZIPArchivesDecodeLikeUnzip) {
             auto output = decodeInPieces(member.method, member.flags, member.stored,
                                          member.uncompressedSize, 997, &error);
             ASSERT_TRUE(output) << error->localizedDescription();
-            const auto extracted = gwtest::runCommand("unzip -p " + gwtest::shellQuote(path) + " " +
-                                                      gwtest::shellQuote(member.name));
-            ASSERT_EQ(extracted.status, 0);
-            EXPECT_TRUE(*output == gwtest::bytesOf(extracted.output));
             EXPECT_EQ(crc32(0, output->data(), uInt(output->size())), member.crc);
             ++decoded[member.method];
         }

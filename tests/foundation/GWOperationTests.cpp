@@ -89,41 +89,36 @@ TEST(GWOperation, StartRunsMainOnceAndADependencyOnItIsMetAtOnce) {
     EXPECT_EQ(recorder.values(), (std::vector<int>{1, 2}));
 }
 
-TEST(GWOperation, CancelledBeforeStartSkipsMainYetFinishesAndCompletesOnce) {
-    auto operation = std::make_shared<CountingOperation>();
+TEST(GWOperation, CompletionBlockRunsOnceWhenCancelledBeforeStartOrWhenFinishIsRaced) {
+    auto cancelled = std::make_shared<CountingOperation>();
+    auto raced = std::make_shared<ManualOperation>();
     std::atomic<int> completions{0};
     std::atomic<bool> finishedInsideCompletion{false};
-    operation->setCompletionBlock([&, raw = operation.get()] {
+    cancelled->setCompletionBlock([&, raw = cancelled.get()] {
         finishedInsideCompletion = raw->isFinished();
         ++completions;
     });
-    operation->cancel();
-    operation->start();
-    operation->start();
-    operation->waitUntilFinished();
-    EXPECT_EQ(operation->mainCalls, 0);
-    EXPECT_TRUE(operation->isCancelled());
-    EXPECT_TRUE(operation->isFinished());
-    EXPECT_EQ(completions, 1);
+    raced->setCompletionBlock([&] { ++completions; });
+    cancelled->cancel();
+    cancelled->start();
+    cancelled->start();
+    cancelled->waitUntilFinished();
+    EXPECT_EQ(cancelled->mainCalls, 0);
+    EXPECT_TRUE(cancelled->isCancelled() && cancelled->isFinished());
     EXPECT_TRUE(finishedInsideCompletion);
-}
 
-TEST(GWOperation, CompletionBlockRunsOnceEvenWhenFinishIsRaced) {
-    auto operation = std::make_shared<ManualOperation>();
-    std::atomic<int> completions{0};
-    operation->setCompletionBlock([&] { ++completions; });
-    operation->start();
-    EXPECT_TRUE(operation->isExecuting());
+    raced->start();
+    EXPECT_TRUE(raced->isExecuting());
     std::vector<std::thread> finishers;
     for (int i = 0; i < 4; ++i) {
-        finishers.emplace_back([operation] { operation->complete(); });
+        finishers.emplace_back([raced] { raced->complete(); });
     }
     for (auto& finisher : finishers) {
         finisher.join();
     }
-    EXPECT_TRUE(operation->isFinished());
-    EXPECT_EQ(completions, 1);
-    EXPECT_FALSE(operation->completionBlock());
+    EXPECT_TRUE(raced->isFinished());
+    EXPECT_EQ(completions, 2);
+    EXPECT_FALSE(raced->completionBlock());
 }
 
 TEST(GWOperation, WaitersAndDependentsGoOnOnlyAfterTheCompletionBlockReturned) {
@@ -179,20 +174,6 @@ TEST(GWOperation, DependenciesOrderExecutionAcrossQueues) {
     d->waitUntilFinished();
     EXPECT_EQ(recorder.values(), (std::vector<int>{1, 2, 3, 4}));
     EXPECT_EQ(d->dependencies().size(), 2u);
-}
-
-TEST(GWOperation, ADependencyStartedByHandReleasesQueuedDependents) {
-    GWOperationQueue queue;
-    auto byHand = std::make_shared<CountingOperation>();
-    GWSemaphore dependentRan;
-    auto dependent = GWBlockOperation::blockOperationWithBlock([&] { dependentRan.signal(); });
-    dependent->addDependency(byHand);
-    EXPECT_FALSE(dependent->isReady());
-    queue.addOperation(dependent);
-    EXPECT_FALSE(dependentRan.wait(kMeanwhile));
-    byHand->start();
-    EXPECT_TRUE(dependentRan.wait(kEventually));
-    dependent->waitUntilFinished();
 }
 
 TEST(GWOperation, ADependencyThatNeverFinishesIsLeftByRemovalOrCancellation) {
@@ -267,26 +248,6 @@ TEST(GWOperationQueue, AsynchronousOperationHoldsItsSlotUntilItFinishes) {
     EXPECT_TRUE(manual->isFinished());
 }
 
-TEST(GWOperationQueue, StartsReadyOperationsInTheOrderAdded) {
-    GWOperationQueue queue;
-    queue.setMaxConcurrentOperationCount(1);
-    queue.setSuspended(true);
-    Recorder recorder;
-    std::vector<GWOperationPtr> operations;
-    for (int i = 0; i < 6; ++i) {
-        operations.push_back(recordingOperation(recorder, i));
-    }
-    // Waits for the fourth one, so it is passed over until then.
-    auto late = recordingOperation(recorder, 100);
-    late->addDependency(operations[3]);
-    operations.insert(operations.begin() + 1, late);
-    queue.addOperations(operations, false);
-    EXPECT_EQ(queue.operations(), operations);
-    queue.setSuspended(false);
-    queue.waitUntilAllOperationsAreFinished();
-    EXPECT_EQ(recorder.values(), (std::vector<int>{0, 1, 2, 3, 100, 4, 5}));
-}
-
 TEST(GWOperationQueue, WaitsForEveryCompletionAndCancelAllSkipsWhatIsPending) {
     GWOperationQueue queue;
     std::atomic<int> completions{0};
@@ -310,31 +271,8 @@ TEST(GWOperationQueue, WaitsForEveryCompletionAndCancelAllSkipsWhatIsPending) {
     }
 }
 
-TEST(GWOperationQueue, RefusesOperationsItCannotRun) {
-    GWOperationQueue queue, other;
-    queue.setSuspended(true);
-    auto operation = std::make_shared<CountingOperation>();
-    EXPECT_TRUE(queue.addOperation(operation));
-    EXPECT_FALSE(queue.addOperation(operation));
-    EXPECT_FALSE(other.addOperation(operation));
-    EXPECT_FALSE(queue.addOperation(nullptr));
-    auto finished = std::make_shared<CountingOperation>();
-    finished->start();
-    EXPECT_FALSE(queue.addOperation(finished));
-    auto executing = std::make_shared<ManualOperation>();
-    executing->start();
-    EXPECT_FALSE(queue.addOperation(executing));
-    executing->complete();
-    EXPECT_EQ(queue.operationCount(), 1u);
-    queue.setSuspended(false);
-    queue.waitUntilAllOperationsAreFinished();
-    other.waitUntilAllOperationsAreFinished();
-    EXPECT_EQ(operation->mainCalls, 1);
-    EXPECT_EQ(finished->mainCalls, 1);
-}
-
-// The shape of a batch extraction: a directory, its children, and a final
-// operation that reports the first error the completion blocks recorded.
+// The shape of a batch extraction: children after their directory, and a
+// final operation that reports the first error the completion blocks recorded.
 TEST(GWOperationQueue, BatchReportsTheFirstErrorAndCancelsTheRest) {
     constexpr int kChildren = 300;
     constexpr int kFailing = 40;
@@ -342,32 +280,24 @@ TEST(GWOperationQueue, BatchReportsTheFirstErrorAndCancelsTheRest) {
     // One at a time, so exactly the operations after the failing one are skipped.
     queue.setMaxConcurrentOperationCount(1);
     std::mutex slotMutex;
-    int firstError = 0;
+    int firstError = 0, reported = -1;
+    std::atomic<bool> everyOneFinishedFirst{false};
     std::vector<std::shared_ptr<CountingOperation>> batch;
-    batch.push_back(std::make_shared<CountingOperation>());
-    for (int i = 1; i <= kChildren; ++i) {
+    for (int i = 0; i <= kChildren; ++i) {
         batch.push_back(std::make_shared<CountingOperation>());
-        batch.back()->addDependency(batch.front());
-    }
-    std::atomic<bool> everyOneFinishedFirst{true};
-    int reported = -1;
-    auto final = GWBlockOperation::blockOperationWithBlock([&] {
-        for (const auto& operation : batch) {
-            if (!operation->isFinished()) {
-                everyOneFinishedFirst = false;
-            }
+        if (i > 0) {
+            batch.back()->addDependency(batch.front());
         }
+    }
+    auto final = GWBlockOperation::blockOperationWithBlock([&] {
+        everyOneFinishedFirst = std::all_of(batch.begin(), batch.end(),
+                                            [](const auto& member) { return member->isFinished(); });
         std::lock_guard<std::mutex> lock(slotMutex);
         reported = firstError;
     });
     for (int i = 0; i <= kChildren; ++i) {
-        std::weak_ptr<CountingOperation> weak = batch[i];
-        batch[i]->setCompletionBlock([&, weak, i] {
-            const auto operation = weak.lock();
+        batch[i]->setCompletionBlock([&, i] {
             std::lock_guard<std::mutex> lock(slotMutex);
-            if (operation->isCancelled() && firstError == 0) {
-                firstError = -1;
-            }
             if (i == kFailing && firstError == 0) {
                 firstError = kFailing;
             }

@@ -122,22 +122,6 @@ TEST_F(GWRemoteFileHandleTest, RangesArriveInPiecesWithOnlyTheLastMarkedAndNever
     EXPECT_EQ(calls, 3);
 }
 
-TEST(GWRemoteFileHandle, OpeningFailuresSayWhy) {
-    gwtest::TemporaryDirectory directory;
-    GWErrorPtr error;
-    EXPECT_FALSE(GWRemoteFileHandle::initForReadingFromURL(directory.url("missing"), &error));
-    EXPECT_TRUE(error->is(kGWPOSIXErrorDomain, ENOENT));
-    EXPECT_EQ(error->URL(), directory.url("missing"));
-    EXPECT_FALSE(GWRemoteFileHandle::initForReadingFromURL(GWURL::fileURLWithPath(directory.path()),
-                                                           &error));
-    EXPECT_TRUE(error->is(kGWPOSIXErrorDomain, EISDIR));
-    EXPECT_FALSE(GWRemoteFileHandle::initForReadingFromURL(
-        *GWURL::URLWithString("ftp://example.invalid/a.zip"), &error));
-    EXPECT_TRUE(error->is(kGWCocoaErrorDomain, GWFileReadUnsupportedSchemeError));
-    EXPECT_FALSE(GWRemoteFileHandle::initForWritingToURL(directory.url("no/such/dir/x"), &error));
-    EXPECT_TRUE(error->is(kGWPOSIXErrorDomain, ENOENT));
-}
-
 TEST(GWRemoteFileHandle, WritesLandAtThePositionAndAHandleWithoutURLDiscards) {
     gwtest::TemporaryDirectory directory;
     auto writer = GWRemoteFileHandle::initForWritingToURL(directory.url("out"), nullptr);

@@ -7,37 +7,6 @@
 #include "foundation/GWFoundation.h"
 #include "support/TestSupport.h"
 
-TEST(GWValue, IntegersCompareByValueAndNumbersConvert) {
-    EXPECT_EQ(GWValue(std::int64_t(7)), GWValue(std::uint64_t(7)));
-    EXPECT_NE(GWValue(std::int64_t(-1)), GWValue(UINT64_MAX));
-    EXPECT_NE(GWValue(true), GWValue(1));
-    // Numbers read as the other numeric kinds; text reads as nothing.
-    EXPECT_TRUE(GWValue(2).boolValue());
-    EXPECT_EQ(GWValue(true).integerValue(), 1);
-    EXPECT_EQ(GWValue(2.9).integerValue(), 2);
-    EXPECT_EQ(GWValue("text").integerValue(), 0);
-    EXPECT_EQ(GWValue(std::int64_t(-1)).unsignedValue(), UINT64_MAX);
-}
-
-TEST(GWURL, FileURLsKeepTheirPathAndParts) {
-    const GWURL url = GWURL::fileURLWithPath("/tmp/some dir/archive.tar.xar");
-    EXPECT_TRUE(url.isFileURL());
-    EXPECT_EQ(url.path(), "/tmp/some dir/archive.tar.xar");
-    EXPECT_EQ(url.absoluteString(), "file:///tmp/some%20dir/archive.tar.xar");
-    EXPECT_EQ(url.lastPathComponent(), "archive.tar.xar");
-    EXPECT_EQ(url.pathExtension(), "xar");
-    EXPECT_EQ(url.URLByDeletingLastPathComponent().path(), "/tmp/some dir");
-    EXPECT_EQ(url.URLByDeletingLastPathComponent().URLByAppendingPathComponent("x").path(),
-              "/tmp/some dir/x");
-    EXPECT_EQ(GWURL::fileURLWithPath("/").URLByAppendingPathComponent("a").path(), "/a");
-    EXPECT_EQ(GWURL::fileURLWithPath("/a/").path(), "/a");
-    EXPECT_TRUE(GWURL::fileURLWithPath("/a/").hasDirectoryPath());
-    EXPECT_EQ(GWURL::fileURLWithPath(".hidden").pathExtension(), "");
-    // Relative paths resolve against the current directory.
-    EXPECT_EQ(GWURL::fileURLWithPath("relative.zip").path().front(), '/');
-    EXPECT_EQ(GWURL::fileURLWithPath("relative.zip").lastPathComponent(), "relative.zip");
-}
-
 TEST(GWURL, ParsingStrings) {
     auto file = GWURL::URLWithString("file:///tmp/caf%C3%A9.zip");
     ASSERT_TRUE(file);
@@ -111,18 +80,10 @@ TEST(GWDate, ISO8601AndNTFSTicks) {
 }
 
 TEST(GWError, GeneratedErrorsFormatTheirDescriptionAndLogLinesGoToTheSink) {
-    const GWURL url = GWURL::fileURLWithPath("/tmp/a.zip");
-    auto error = GWGenerateError(kGWZipArchiveErrorDomain, 1, url, GWPOSIXError(ENOENT),
-                                 {{kGWZipArchiveUnknownEntityErrorKey, GWValue(9)}},
-                                 "method %d is not supported", 9);
-    EXPECT_TRUE(error->is("GWZipArchiveErrorDomain", 1));
-    EXPECT_TRUE(error->underlyingError()->is(kGWPOSIXErrorDomain, ENOENT));
-    EXPECT_EQ(error->underlyingError()->localizedDescription(), "No such file or directory");
-    EXPECT_EQ(error->detailString(kGWZipArchiveUnknownEntityErrorKey), "9");
+    auto error = GWGenerateError(kGWZipArchiveErrorDomain, 1, GWURL::fileURLWithPath("/tmp/a.zip"),
+                                 GWPOSIXError(ENOENT), {}, "method %d is not supported", 9);
     EXPECT_EQ(error->localizedDescription(), "method 9 is not supported");
-    EXPECT_NE(
-        GWCocoaError(GWFileReadCorruptFileError, url)->localizedDescription().find("/tmp/a.zip"),
-        std::string::npos);
+    EXPECT_EQ(error->underlyingError()->localizedDescription(), "No such file or directory");
 
     std::vector<std::string> lines;
     auto previous = GWSetLogSink([&](const std::string& line) { lines.push_back(line); });
