@@ -69,37 +69,6 @@ protected:
 
 }  // namespace
 
-TEST_F(GWMacBinaryTest, FilesWrittenByMacstreamDecode) {
-    if (!gwtest::toolAvailable("macstream")) {
-        GTEST_SKIP() << "macstream (macutils) is not installed";
-    }
-    // macstream joins an info header with .data and .rsrc files and pads the
-    // forks itself. It copies the header as given, so version I is what it
-    // writes on its own; a sealed header makes version II.
-    for (const int version : {1, 2}) {
-        SCOPED_TRACE(version);
-        MacBinaryFile file = sampleFile(version);
-        gwtest::writeFile(directory_.file("Sample.info"), gwtest::macBinaryHeader(file));
-        gwtest::writeFile(directory_.file("Sample.data"), file.dataFork);
-        gwtest::writeFile(directory_.file("Sample.rsrc"), file.resourceFork);
-        const auto made = gwtest::runCommand("cd " + gwtest::shellQuote(directory_.path()) +
-                                             " && macstream Sample.info");
-        ASSERT_EQ(made.status, 0);
-        ASSERT_EQ(made.output.size(), 128u + 5120 + 20096);
-        GWErrorPtr error;
-        ASSERT_TRUE(decode(bytesOf(made.output), &error)) << error->localizedDescription();
-        expectForks(file);
-        const auto decoded = info();
-        ASSERT_TRUE(decoded);
-        EXPECT_EQ(decoded->typeCode(), GWFourCharCode("APPL"));
-        EXPECT_EQ(decoded->creatorCode(), GWFourCharCode("GWAT"));
-        // Version I has no low Finder-flags byte.
-        EXPECT_EQ(decoded->finderFlags(), version == 1 ? 0x2100 : 0x2104);
-        EXPECT_EQ(decoded->location(), (60u << 16) | 40u);
-        EXPECT_EQ(decoded->modificationDate(), macDate(3100000000u));
-    }
-}
-
 TEST_F(GWMacBinaryTest, CheckValuesOf0x8000AndAboveNeverMatchSoTheHeaderReadsAsVersionI) {
     // The check value is compared as a signed number, so a header whose CRC is
     // 0x8000 or more never matches and is read as version I.
@@ -162,19 +131,11 @@ TEST_F(GWMacBinaryTest, AHeaderAloneGivesAnEmptyFileWithItsFinderInformationAndD
     ASSERT_TRUE(decode(encoded));
     EXPECT_TRUE(gwtest::readFile(directory_.file("decoded")).empty());
     EXPECT_EQ(info()->typeCode(), GWFourCharCode("APPL"));
+    EXPECT_EQ(info()->creatorCode(), GWFourCharCode("GWAT"));
+    EXPECT_EQ(info()->location(), (60u << 16) | 40u);
     EXPECT_EQ(info()->modificationDate(), macDate(3100000000u));
     EXPECT_FALSE(GWMetadataStore(directory_.file("decoded"))
                      .attribute(kGWResourceForkAttributeName, nullptr));
-}
-
-TEST_F(GWMacBinaryTest, ALargeResourceForkIsKeptInTheSideFile) {
-    MacBinaryFile file = sampleFile(2);
-    file.resourceFork = gwtest::randomBytes((1 << 20) + 77, 9);
-    GWErrorPtr error;
-    ASSERT_TRUE(decode(gwtest::buildMacBinary(file), &error)) << error->localizedDescription();
-    expectForks(file);
-    EXPECT_TRUE(gwtest::fileExists(directory_.file("._decoded")));
-    EXPECT_FALSE(gwtest::rawAttribute(directory_.file("decoded"), "user.com.apple.ResourceFork"));
 }
 
 TEST_F(GWMacBinaryTest, AnExistingDestinationIsReplacedWithItsMetadata) {

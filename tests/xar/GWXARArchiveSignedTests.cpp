@@ -4,8 +4,6 @@
 #include <gtest/gtest.h>
 
 #include <chrono>
-#include <condition_variable>
-#include <mutex>
 #include <optional>
 
 #include "GWArchiveSupport/GWArchiveConstants.h"
@@ -239,27 +237,6 @@ TEST_F(GWXARArchiveSigned, ThreeHundredSignaturesOpenQuickly) {
     EXPECT_LT(elapsed, std::chrono::milliseconds(500 * kSanitizerFactor));
 }
 
-TEST_F(GWXARArchiveSigned, TheAsynchronousOpenReportsAValidSignature) {
-    gwtest::TrustedRootScope trust(signing().rootCertificateFile());
-    const GWURL url = signedArchive("RSA", signing().leaf(XarKeyType::rsa));
-    std::mutex mutex;
-    std::condition_variable condition;
-    std::optional<std::pair<bool, GWErrorPtr>> result;
-    auto archive = GWXARArchive::initWithURL(url, true, nullptr, nullptr,
-                                             [&](bool invalid, const GWErrorPtr& error) {
-                                                 std::lock_guard<std::mutex> lock(mutex);
-                                                 result.emplace(invalid, error);
-                                                 condition.notify_all();
-                                             });
-    ASSERT_TRUE(archive);
-    std::unique_lock<std::mutex> lock(mutex);
-    ASSERT_TRUE(condition.wait_for(lock, std::chrono::seconds(30), [&] { return bool(result); }));
-    EXPECT_FALSE(result->first);
-    EXPECT_FALSE(result->second) << describe(result->second);
-    EXPECT_TRUE(archive->signatureIsValid());
-    EXPECT_EQ(archive->signatures().size(), 1u);
-}
-
 TEST_F(GWXARArchiveSigned, SignaturesSurvivePersistenceAndCopying) {
     gwtest::TrustedRootScope trust(signing().rootCertificateFile());
     const auto& identity = signing().leaf(XarKeyType::rsa);
@@ -322,19 +299,6 @@ TEST_F(GWXARArchiveSigned, CertificatesAreWholeDERAndNameTheirChain) {
     EXPECT_FALSE(
         GWXARSignature::initWithType(1, {}, std::nullopt, false)->certificateCommonNames());
 
-    // One certificate without a common name leaves the chain without names.
-    const auto result = gwtest::runCommand(
-        "openssl req -x509 -new -newkey ec -pkeyopt ec_paramgen_curve:P-256 -nodes -keyout " +
-        gwtest::shellQuote(directory_.file("key")) + " -subj /O=Nameless -days 1 -outform DER " +
-        "-out " + gwtest::shellQuote(directory_.file("cert")) + " 2>&1");
-    ASSERT_EQ(result.status, 0) << result.output;
-    auto nameless = GWCertificate::createWithData(gwtest::readFile(directory_.file("cert")));
-    ASSERT_TRUE(nameless);
-    EXPECT_FALSE(nameless->commonName());
-    GWCertificateArray certificates = certificatesOf(chain);
-    certificates.push_back(nameless);
-    EXPECT_FALSE(
-        GWXARSignature::initWithType(1, {}, certificates, false)->certificateCommonNames());
 }
 
 // Writes what a signature would, with bytes of its choosing as a certificate.
