@@ -300,7 +300,7 @@ TEST_F(XarExtraction, TopLevelNameDoesNotPlaceTheItem) {
     EXPECT_EQ(access(directory.file("escape").c_str(), F_OK), -1);
 }
 
-TEST_F(XarExtraction, ExistingDestinationIsLeftUntouched) {
+TEST_F(XarExtraction, ExistingOrNonFileDestinationIsRefused) {
     auto archive =
         open(xarFileElement(1, "f", "file", "0644",
                             xar.dataElement("data", gwtest::bytesOf("new"), XarEncoding::gzip)));
@@ -313,6 +313,11 @@ TEST_F(XarExtraction, ExistingDestinationIsLeftUntouched) {
     EXPECT_TRUE(error->is(kGWPOSIXErrorDomain, EEXIST));
     EXPECT_EQ(gwtest::readFile(outputPath("f")), gwtest::bytesOf("old"));
     EXPECT_TRUE(temporaryLeftovers().empty());
+    // A destination that is no file at all is refused too.
+    EXPECT_FALSE(archive->extractFile(archive->fileWithPath("f"),
+                                      *GWURL::URLWithString("https://example.com/f"), nullptr,
+                                      &error));
+    EXPECT_TRUE(error && error->is(kGWCocoaErrorDomain, 518));
 }
 
 // Extractions in which entries fail: each is left out with an error naming
@@ -522,17 +527,6 @@ INSTANTIATE_TEST_SUITE_P(
             "",
             {"", "f", "h"}}),
     [](const auto& info) { return std::string(info.param.name); });
-
-TEST_F(XarExtraction, NonFileDestinationIsRefused) {
-    auto archive = open(xarFileElement(1, "f", "file", "0644"));
-    ASSERT_TRUE(archive);
-    GWErrorPtr error;
-    EXPECT_FALSE(archive->extractFile(archive->fileWithPath("f"),
-                                      *GWURL::URLWithString("https://example.com/f"), nullptr,
-                                      &error));
-    ASSERT_TRUE(error);
-    EXPECT_TRUE(error->is(kGWCocoaErrorDomain, 518));
-}
 
 TEST_F(XarExtraction, CancelledOperationCreatesNothing) {
     auto archive = open(xarFileElement(1, "f", "file", "0644"));
