@@ -38,10 +38,11 @@ MacBinaryFile sampleFile(int version) {
 
 class GWMacBinaryTest : public ::testing::Test {
 protected:
-    bool decode(const GWData& encoded, GWErrorPtr* error = nullptr) {
+    bool decode(const GWData& encoded, GWErrorPtr* error = nullptr,
+                const std::string& destination = "decoded") {
         gwtest::writeFile(directory_.file("source.bin"), encoded);
         return GWAppleFileDecoder::sharedInstance()->decodeMacBinaryFileAtURL(
-            directory_.url("source.bin"), directory_.url("decoded"), error);
+            directory_.url("source.bin"), directory_.url(destination), error);
     }
 
     GWData resourceFork() {
@@ -151,19 +152,7 @@ TEST_F(GWMacBinaryTest, AnExistingDestinationIsReplacedWithItsMetadata) {
     EXPECT_FALSE(GWMetadataStore(destination).attribute("com.example.old", nullptr));
 }
 
-TEST_F(GWMacBinaryTest, ADirectoryDestinationFailsBeforeAnythingIsWritten) {
-    gwtest::writeFile(directory_.file("source.bin"), gwtest::buildMacBinary(sampleFile(2)));
-    ASSERT_EQ(::mkdir(directory_.file("folder").c_str(), 0755), 0);
-    GWErrorPtr error;
-    EXPECT_FALSE(GWAppleFileDecoder::sharedInstance()->decodeMacBinaryFileAtURL(
-        directory_.url("source.bin"), directory_.url("folder"), &error));
-    ASSERT_TRUE(error);
-    EXPECT_TRUE(error->is(kGWCocoaErrorDomain, GWFileIsDirectoryError));
-    EXPECT_EQ(error->URL(), directory_.url("folder"));
-    EXPECT_EQ(gwtest::runCommand("ls -A " + directory_.file("folder")).output, "");
-}
-
-TEST_F(GWMacBinaryTest, LocationsAreCheckedBeforeTheSource) {
+TEST_F(GWMacBinaryTest, LocationsAreCheckedBeforeTheSourceIsRead) {
     const auto& decoder = GWAppleFileDecoder::sharedInstance();
     const GWURL remote = *GWURL::URLWithString("https://example.com/x.bin");
     GWErrorPtr error;
@@ -178,6 +167,13 @@ TEST_F(GWMacBinaryTest, LocationsAreCheckedBeforeTheSource) {
                                                    &error));
     EXPECT_TRUE(error->is(kGWPOSIXErrorDomain, ENOENT));
     EXPECT_EQ(error->URL(), directory_.url("missing"));
+
+    // A folder in the way fails before anything is written into it.
+    ASSERT_EQ(::mkdir(directory_.file("folder").c_str(), 0755), 0);
+    EXPECT_FALSE(decode(gwtest::buildMacBinary(sampleFile(2)), &error, "folder"));
+    EXPECT_TRUE(error->is(kGWCocoaErrorDomain, GWFileIsDirectoryError));
+    EXPECT_EQ(error->URL(), directory_.url("folder"));
+    EXPECT_EQ(gwtest::runCommand("ls -A " + directory_.file("folder")).output, "");
 }
 
 // Malformed files: each mutation of a sound version II file, with the error it must give.

@@ -3,7 +3,6 @@
 
 #include <gtest/gtest.h>
 
-#include <dirent.h>
 #include <linux/fs.h>
 #include <sys/acl.h>
 #include <sys/ioctl.h>
@@ -34,20 +33,6 @@ using gwtest::XarBuilder;
 using gwtest::XarEncoding;
 using gwtest::xarFileElement;
 
-std::vector<std::string> directoryNames(const std::string& path) {
-    std::vector<std::string> names;
-    if (DIR* directory = opendir(path.c_str())) {
-        while (const dirent* entry = readdir(directory)) {
-            const std::string name = entry->d_name;
-            if (name != "." && name != "..") {
-                names.push_back(name);
-            }
-        }
-        closedir(directory);
-    }
-    return names;
-}
-
 class XarExtraction : public ::testing::Test {
 protected:
     GWXARArchivePtr open(const std::string& body) {
@@ -65,7 +50,16 @@ protected:
     }
     GWURL output(const std::string& name) const { return GWURL::fileURLWithPath(out + "/" + name); }
     std::string outputPath(const std::string& name) const { return out + "/" + name; }
-    std::vector<std::string> temporaryLeftovers() const { return directoryNames(temporaryRoot_); }
+    // Paths below the private temporary folder ("" is the folder itself).
+    std::vector<std::string> temporaryLeftovers() const {
+        std::vector<std::string> paths;
+        for (const auto& [path, item] : gwtest::snapshotTree(temporaryRoot_)) {
+            if (!path.empty()) {
+                paths.push_back(path);
+            }
+        }
+        return paths;
+    }
 
     gwtest::TemporaryDirectory directory;
     XarBuilder xar;
@@ -296,7 +290,7 @@ TEST_F(XarExtraction, TopLevelNameDoesNotPlaceTheItem) {
     ASSERT_TRUE(archive->extractFile(archive->files()[0], output("here"), nullptr, &error))
         << error->localizedDescription();
     EXPECT_EQ(gwtest::readFile(outputPath("here")), gwtest::bytesOf("x"));
-    EXPECT_EQ(directoryNames(directory.file("out")), std::vector<std::string>{"here"});
+    EXPECT_EQ(gwtest::snapshotTree(out).size(), 2u);  // out and here
     EXPECT_EQ(access(directory.file("escape").c_str(), F_OK), -1);
 }
 
