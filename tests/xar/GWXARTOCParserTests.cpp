@@ -230,24 +230,13 @@ TEST(GWXARTOCEntries, CancellationStopsTheParse) {
     EXPECT_TRUE(error->is(kGWCocoaErrorDomain, GWUserCancelledError));
 }
 
-TEST(GWXARTOCValues, NamesOfChecksumsAndCompressions) {
+TEST(GWXARTOCValues, NamesOfChecksums) {
     const std::pair<const char*, int> names[] = {{"SHA", 5},    {"sha1", 5},   {"Sha224", 6},
                                                  {"sha256", 7}, {"sha384", 8}, {"SHA512", 9},
                                                  {"MD5", 4},    {"md2", 3},    {"crc32", -1}};
     for (const auto& [name, type] : names) {
         EXPECT_EQ(GWXARLoadOperation::checksumTypeFromName(name), type) << name;
     }
-    auto operation = GWXARLoadOperation::initWithArchive(nullptr, false);
-    GWErrorPtr error;
-    std::uint64_t type = 99;
-    auto lzma = gwtest::xmlElement("<encoding style=\"application/x-lzma\"/>");
-    EXPECT_TRUE(operation->getCompressionType(&type, lzma->first_child(), &error));
-    EXPECT_EQ(type, GWXARCompressionTypeLZMA);
-    // Matched exactly, case included.
-    auto upper = gwtest::xmlElement("<encoding style=\"Application/X-Gzip\"/>");
-    EXPECT_FALSE(operation->getCompressionType(&type, upper->first_child(), &error));
-    EXPECT_TRUE(error->is(kGWXARArchiveErrorDomain, GWXARArchiveUnsupportedCompressionError));
-    EXPECT_EQ(entity(error), "Application/X-Gzip");
 }
 
 }  // namespace
