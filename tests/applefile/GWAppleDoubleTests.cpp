@@ -2,7 +2,6 @@
 #include <sys/stat.h>
 
 #include <functional>
-#include <regex>
 
 #include "applefile/GWAppleFileDecoder.h"
 #include "foundation/GWConversions.h"
@@ -50,36 +49,6 @@ protected:
     std::string dataPath_;
 };
 
-// What `lsar -L` lists for the one file in a ZIP made of `name` and its
-// companion "__MACOSX/._name".
-std::string lsarListing(const gwtest::TemporaryDirectory& directory, const std::string& name,
-                        const GWData& data, const GWData& companion) {
-    const std::string stage = directory.file("stage");
-    ::mkdir(stage.c_str(), 0755);
-    ::mkdir((stage + "/__MACOSX").c_str(), 0755);
-    gwtest::writeFile(stage + "/" + name, data);
-    gwtest::writeFile(stage + "/__MACOSX/._" + name, companion);
-    const std::string zip = directory.file("listing.zip");
-    ::unlink(zip.c_str());
-    const auto zipped =
-        gwtest::runCommand("cd " + gwtest::shellQuote(stage) + " && zip -qrX " +
-                           gwtest::shellQuote(zip) + " " + gwtest::shellQuote(name) + " __MACOSX");
-    EXPECT_EQ(zipped.status, 0);
-    return gwtest::runCommand("lsar -L " + gwtest::shellQuote(zip) + " 2>&1").output;
-}
-
-std::string listedCode(const std::string& listing, const std::string& label) {
-    std::smatch match;
-    const std::regex pattern(label + R"(:\s+\S{4} \((0x[0-9a-f]{8})\))");
-    return std::regex_search(listing, match, pattern) ? match[1].str() : std::string();
-}
-
-std::string hexCode(std::uint32_t code) {
-    char text[16];
-    std::snprintf(text, sizeof text, "0x%08x", code);
-    return text;
-}
-
 }  // namespace
 
 TEST_F(GWAppleDoubleTest, EverythingInTheFileArrivesAndTheDataStays) {
@@ -104,26 +73,6 @@ TEST_F(GWAppleDoubleTest, EverythingInTheFileArrivesAndTheDataStays) {
     if (gwtest::userAttributesSupported(directory_.path())) {
         EXPECT_EQ(gwtest::rawAttribute(dataPath_, "user.com.example.label"), bytesOf("blue"));
     }
-}
-
-TEST_F(GWAppleDoubleTest, LsarReadsTheSameCodesFromTheCompanionAndFromTheSideFile) {
-    if (!gwtest::toolAvailable("lsar") || !gwtest::toolAvailable("zip")) {
-        GTEST_SKIP() << "lsar (unar) or zip is not installed";
-    }
-    const GWData companion = gwtest::buildAppleDouble(fullFile());
-    ASSERT_TRUE(merge(companion));
-    const auto info = GWFileInfo::initWithURL(directory_.url("Document.txt"), nullptr);
-    ASSERT_TRUE(info);
-
-    const std::string listing = lsarListing(directory_, "Document.txt", contents_, companion);
-    EXPECT_EQ(listedCode(listing, "Mac OS type code"), hexCode(info->typeCode())) << listing;
-    EXPECT_EQ(listedCode(listing, "Mac OS creator code"), hexCode(info->creatorCode()));
-
-    // The side file the store wrote is an AppleDouble file other tools read.
-    const GWData sideFile = gwtest::readFile(directory_.file("._Document.txt"));
-    const std::string sideListing = lsarListing(directory_, "Document.txt", contents_, sideFile);
-    EXPECT_NE(sideListing.find("Is a Mac OS resource fork: Yes"), std::string::npos) << sideListing;
-    EXPECT_NE(sideListing.find("Length of embedded data:   1048576"), std::string::npos);
 }
 
 TEST_F(GWAppleDoubleTest, AResourceForkAloneReplacesTheFilesOwn) {

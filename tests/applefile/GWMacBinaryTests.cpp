@@ -38,10 +38,11 @@ MacBinaryFile sampleFile(int version) {
 
 class GWMacBinaryTest : public ::testing::Test {
 protected:
-    bool decode(const GWData& encoded, GWErrorPtr* error = nullptr) {
+    bool decode(const GWData& encoded, GWErrorPtr* error = nullptr,
+                const std::string& destination = "decoded") {
         gwtest::writeFile(directory_.file("source.bin"), encoded);
         return GWAppleFileDecoder::sharedInstance()->decodeMacBinaryFileAtURL(
-            directory_.url("source.bin"), directory_.url("decoded"), error);
+            directory_.url("source.bin"), directory_.url(destination), error);
     }
 
     GWData resourceFork() {
@@ -68,37 +69,6 @@ protected:
 };
 
 }  // namespace
-
-TEST_F(GWMacBinaryTest, FilesWrittenByMacstreamDecode) {
-    if (!gwtest::toolAvailable("macstream")) {
-        GTEST_SKIP() << "macstream (macutils) is not installed";
-    }
-    // macstream joins an info header with .data and .rsrc files and pads the
-    // forks itself. It copies the header as given, so version I is what it
-    // writes on its own; a sealed header makes version II.
-    for (const int version : {1, 2}) {
-        SCOPED_TRACE(version);
-        MacBinaryFile file = sampleFile(version);
-        gwtest::writeFile(directory_.file("Sample.info"), gwtest::macBinaryHeader(file));
-        gwtest::writeFile(directory_.file("Sample.data"), file.dataFork);
-        gwtest::writeFile(directory_.file("Sample.rsrc"), file.resourceFork);
-        const auto made = gwtest::runCommand("cd " + gwtest::shellQuote(directory_.path()) +
-                                             " && macstream Sample.info");
-        ASSERT_EQ(made.status, 0);
-        ASSERT_EQ(made.output.size(), 128u + 5120 + 20096);
-        GWErrorPtr error;
-        ASSERT_TRUE(decode(bytesOf(made.output), &error)) << error->localizedDescription();
-        expectForks(file);
-        const auto decoded = info();
-        ASSERT_TRUE(decoded);
-        EXPECT_EQ(decoded->typeCode(), GWFourCharCode("APPL"));
-        EXPECT_EQ(decoded->creatorCode(), GWFourCharCode("GWAT"));
-        // Version I has no low Finder-flags byte.
-        EXPECT_EQ(decoded->finderFlags(), version == 1 ? 0x2100 : 0x2104);
-        EXPECT_EQ(decoded->location(), (60u << 16) | 40u);
-        EXPECT_EQ(decoded->modificationDate(), macDate(3100000000u));
-    }
-}
 
 TEST_F(GWMacBinaryTest, CheckValuesOf0x8000AndAboveNeverMatchSoTheHeaderReadsAsVersionI) {
     // The check value is compared as a signed number, so a header whose CRC is
@@ -162,19 +132,11 @@ TEST_F(GWMacBinaryTest, AHeaderAloneGivesAnEmptyFileWithItsFinderInformationAndD
     ASSERT_TRUE(decode(encoded));
     EXPECT_TRUE(gwtest::readFile(directory_.file("decoded")).empty());
     EXPECT_EQ(info()->typeCode(), GWFourCharCode("APPL"));
+    EXPECT_EQ(info()->creatorCode(), GWFourCharCode("GWAT"));
+    EXPECT_EQ(info()->location(), (60u << 16) | 40u);
     EXPECT_EQ(info()->modificationDate(), macDate(3100000000u));
     EXPECT_FALSE(GWMetadataStore(directory_.file("decoded"))
                      .attribute(kGWResourceForkAttributeName, nullptr));
-}
-
-TEST_F(GWMacBinaryTest, ALargeResourceForkIsKeptInTheSideFile) {
-    MacBinaryFile file = sampleFile(2);
-    file.resourceFork = gwtest::randomBytes((1 << 20) + 77, 9);
-    GWErrorPtr error;
-    ASSERT_TRUE(decode(gwtest::buildMacBinary(file), &error)) << error->localizedDescription();
-    expectForks(file);
-    EXPECT_TRUE(gwtest::fileExists(directory_.file("._decoded")));
-    EXPECT_FALSE(gwtest::rawAttribute(directory_.file("decoded"), "user.com.apple.ResourceFork"));
 }
 
 TEST_F(GWMacBinaryTest, AnExistingDestinationIsReplacedWithItsMetadata) {
@@ -190,19 +152,7 @@ TEST_F(GWMacBinaryTest, AnExistingDestinationIsReplacedWithItsMetadata) {
     EXPECT_FALSE(GWMetadataStore(destination).attribute("com.example.old", nullptr));
 }
 
-TEST_F(GWMacBinaryTest, ADirectoryDestinationFailsBeforeAnythingIsWritten) {
-    gwtest::writeFile(directory_.file("source.bin"), gwtest::buildMacBinary(sampleFile(2)));
-    ASSERT_EQ(::mkdir(directory_.file("folder").c_str(), 0755), 0);
-    GWErrorPtr error;
-    EXPECT_FALSE(GWAppleFileDecoder::sharedInstance()->decodeMacBinaryFileAtURL(
-        directory_.url("source.bin"), directory_.url("folder"), &error));
-    ASSERT_TRUE(error);
-    EXPECT_TRUE(error->is(kGWCocoaErrorDomain, GWFileIsDirectoryError));
-    EXPECT_EQ(error->URL(), directory_.url("folder"));
-    EXPECT_EQ(gwtest::runCommand("ls -A " + directory_.file("folder")).output, "");
-}
-
-TEST_F(GWMacBinaryTest, LocationsAreCheckedBeforeTheSource) {
+TEST_F(GWMacBinaryTest, LocationsAreCheckedBeforeTheSourceIsRead) {
     const auto& decoder = GWAppleFileDecoder::sharedInstance();
     const GWURL remote = *GWURL::URLWithString("https://example.com/x.bin");
     GWErrorPtr error;
@@ -217,6 +167,13 @@ TEST_F(GWMacBinaryTest, LocationsAreCheckedBeforeTheSource) {
                                                    &error));
     EXPECT_TRUE(error->is(kGWPOSIXErrorDomain, ENOENT));
     EXPECT_EQ(error->URL(), directory_.url("missing"));
+
+    // A folder in the way fails before anything is written into it.
+    ASSERT_EQ(::mkdir(directory_.file("folder").c_str(), 0755), 0);
+    EXPECT_FALSE(decode(gwtest::buildMacBinary(sampleFile(2)), &error, "folder"));
+    EXPECT_TRUE(error->is(kGWCocoaErrorDomain, GWFileIsDirectoryError));
+    EXPECT_EQ(error->URL(), directory_.url("folder"));
+    EXPECT_EQ(gwtest::runCommand("ls -A " + directory_.file("folder")).output, "");
 }
 
 // Malformed files: each mutation of a sound version II file, with the error it must give.

@@ -35,8 +35,7 @@ void appendFork(GWData& out, const GWData& fork, MacBinaryPadding padding) {
     out.resize(out.size() + pad);
 }
 
-}  // namespace
-
+// The CRC-16 of MacBinary II headers, bit by bit rather than by table as the library does.
 std::uint16_t macBinaryCRC(const std::uint8_t* bytes, std::size_t length) {
     std::uint16_t crc = 0;
     for (std::size_t i = 0; i < length; ++i) {
@@ -47,6 +46,8 @@ std::uint16_t macBinaryCRC(const std::uint8_t* bytes, std::size_t length) {
     }
     return crc;
 }
+
+}  // namespace
 
 void resealMacBinaryHeader(GWData& bytes, MacBinarySeal seal) {
     for (int filler = 0; filler < 256; ++filler) {

@@ -38,10 +38,6 @@ struct MacBinaryFile {
 // 128 - length % 128 bytes, so files for it pad a full block after such a fork.
 enum class MacBinaryPadding { standard, fullBlockAfterAlignedFork };
 
-// The CRC-16 of MacBinary II headers, computed bit by bit (independently of
-// the library's table-driven form).
-std::uint16_t macBinaryCRC(const std::uint8_t* bytes, std::size_t length);
-
 // The 128-byte header. Versions II and III carry the CRC of bytes 1 to 123 at
 // 124; version I leaves it zero.
 GWData macBinaryHeader(const MacBinaryFile& file);
@@ -54,7 +50,6 @@ namespace macbinary {
 inline constexpr std::size_t kNameLength = 1;
 inline constexpr std::size_t kZeroByte74 = 74;
 inline constexpr std::size_t kZeroByte82 = 82;
-inline constexpr std::size_t kSignature = 102;
 inline constexpr std::size_t kWriterVersion = 122;
 inline constexpr std::size_t kReaderVersion = 123;
 inline constexpr std::size_t kCRC = 124;

@@ -4,6 +4,7 @@
 #include <lzma.h>
 #include <zlib.h>
 
+#include <map>
 #include <stdexcept>
 
 #include "TestSupport.h"
@@ -14,21 +15,13 @@ namespace gwtest {
 namespace {
 
 int digestForStyle(const std::string& style) {
-    if (style == "sha1")
-        return GWChecksumAlgorithmSHA1;
-    if (style == "md5")
-        return GWChecksumAlgorithmMD5;
-    if (style == "md2")
-        return GWChecksumAlgorithmMD2;
-    if (style == "sha224")
-        return GWChecksumAlgorithmSHA224;
-    if (style == "sha256")
-        return GWChecksumAlgorithmSHA256;
-    if (style == "sha384")
-        return GWChecksumAlgorithmSHA384;
-    if (style == "sha512")
-        return GWChecksumAlgorithmSHA512;
-    return GWChecksumAlgorithmNone;
+    static const std::map<std::string, int> digests = {
+        {"sha1", GWChecksumAlgorithmSHA1},     {"md5", GWChecksumAlgorithmMD5},
+        {"md2", GWChecksumAlgorithmMD2},       {"sha224", GWChecksumAlgorithmSHA224},
+        {"sha256", GWChecksumAlgorithmSHA256}, {"sha384", GWChecksumAlgorithmSHA384},
+        {"sha512", GWChecksumAlgorithmSHA512}};
+    const auto found = digests.find(style);
+    return found == digests.end() ? GWChecksumAlgorithmNone : found->second;
 }
 
 std::string styleForHeaderNumber(std::uint32_t number) {
@@ -159,12 +152,9 @@ GWData XarBuilder::bytes() const {
     const std::string document = tocDocument();
     const GWData plain(document.begin(), document.end());
     const GWData stored = compressTOC ? xarEncode(plain, XarEncoding::gzip) : plain;
-    GWData digest;
-    if (digestLength() > 0) {
-        digest = GWChecksum::checksumForData(stored, digestAlgorithm_);
-        if (corruptStoredChecksum && !digest.empty()) {
-            digest[0] ^= 0x01;
-        }
+    GWData digest = tocChecksum();
+    if (corruptStoredChecksum && !digest.empty()) {
+        digest[0] ^= 0x01;
     }
 
     GWData out;

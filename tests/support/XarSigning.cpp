@@ -75,7 +75,6 @@ XarSigning::XarSigning() {
              shellQuote(folder_.file("intermediate.pem")))) {
         return;
     }
-    rootCertificate_ = derOf(rootCertificateFile_);
     intermediate_.keyFile = intermediate;
     intermediate_.certificateFile = folder_.file("intermediate.pem");
     intermediate_.chain = {derOf(intermediate_.certificateFile)};
@@ -287,8 +286,8 @@ bool XarSigning::signArchive(XarBuilder& xar, const std::vector<Request>& reques
                 problem_ = "signArchive: a request without an identity";
                 return false;
             }
-            const std::string keyInfo = request.keyInfoXML.value_or(
-                keyInfoElement(request.certificates.value_or(request.identity->chain)));
+            const std::string keyInfo =
+                keyInfoElement(request.certificates.value_or(request.identity->chain));
             elements += signatureElement(request.style, offset, signatures[i].size(), keyInfo,
                                          request.extended);
             offset += signatures[i].size();

@@ -48,7 +48,6 @@ public:
     const std::string& problem() const { return problem_; }
 
     const std::string& rootCertificateFile() const { return rootCertificateFile_; }
-    const GWData& rootCertificate() const { return rootCertificate_; }
 
     // Made on first use, then reused. An empty identity when openssl failed.
     const XarSigningIdentity& leaf(XarKeyType type);
@@ -73,7 +72,7 @@ public:
                 const GWData& checksum);
 
     // One signature for signArchive. `certificates` replaces the identity's
-    // chain in the KeyInfo; `keyInfoXML` replaces the whole KeyInfo element.
+    // chain in the KeyInfo.
     struct Request {
         Request(std::string style, const XarSigningIdentity& identity, bool extended = false)
             : style(std::move(style)), identity(&identity), extended(extended) {}
@@ -83,7 +82,6 @@ public:
         bool extended;                // an "x-signature" element
         bool withoutSigners = false;  // a CMS message carrying only the certificates
         std::optional<std::vector<GWData>> certificates;
-        std::optional<std::string> keyInfoXML;
     };
     // Puts a signature element per request at the start of the builder's
     // table of contents and appends the signature bytes to its heap, so that
@@ -111,7 +109,6 @@ private:
     std::string problem_;
     std::string config_;
     std::string rootCertificateFile_;
-    GWData rootCertificate_;
     XarSigningIdentity intermediate_;  // as an issuer: its chain is only itself
     std::map<int, XarSigningIdentity> leaves_;
     std::optional<XarSigningIdentity> selfSigned_;

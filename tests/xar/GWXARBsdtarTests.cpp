@@ -1,6 +1,5 @@
 // Archives written by an independent tool (bsdtar) open with a valid checksum,
-// list as the tool lists them, and extract to the tree they were made from and
-// to what the tool itself extracts.
+// read as the tree they were made from, and extract to that tree.
 
 #include <gtest/gtest.h>
 
@@ -11,45 +10,23 @@
 #include <sys/xattr.h>
 #include <unistd.h>
 
-#include <sstream>
-
 #include "XarExtractTestSupport.h"
 
 namespace {
 
 using gwtest::TreeItem;
 
-std::string modeString(std::uint16_t mode) {
-    std::string text;
-    switch (mode & 0170000) {
-        case 0040000: text = "d"; break;
-        case 0120000: text = "l"; break;
-        case 0010000: text = "p"; break;
-        case 0020000: text = "c"; break;
-        case 0060000: text = "b"; break;
-        default: text = "-";
-    }
-    const char* letters = "rwxrwxrwx";
-    for (int bit = 8; bit >= 0; --bit) {
-        text += (mode >> bit) & 1 ? letters[8 - bit] : '-';
-    }
-    return text;
-}
-
 void expectSameItems(const std::map<std::string, TreeItem>& expected,
-                     const std::map<std::string, TreeItem>& actual, const std::string& what,
-                     bool compareDevices = true) {
-    ASSERT_EQ(expected.size(), actual.size()) << what;
+                     const std::map<std::string, TreeItem>& actual) {
+    ASSERT_EQ(expected.size(), actual.size());
     for (const auto& [path, want] : expected) {
-        ASSERT_TRUE(actual.count(path)) << what << ": " << path << " is missing";
+        ASSERT_TRUE(actual.count(path)) << path << " is missing";
         const TreeItem& got = actual.at(path);
-        SCOPED_TRACE(what + ": " + path);
+        SCOPED_TRACE(path);
         EXPECT_EQ(got.mode, want.mode);
         EXPECT_EQ(got.owner, want.owner);
         EXPECT_EQ(got.group, want.group);
-        if (compareDevices) {
-            EXPECT_EQ(got.device, want.device);
-        }
+        EXPECT_EQ(got.device, want.device);
         EXPECT_EQ(got.linkText, want.linkText);
         EXPECT_EQ(got.digest, want.digest);
         EXPECT_EQ(got.attributes, want.attributes);
@@ -151,7 +128,7 @@ TEST_P(GWXARBsdtar, ReadsAndExtractsAsTheSourceAndBsdtarSay) {
     auto small = archive->fileWithPath("tree/small"), hard = archive->fileWithPath("tree/d/hard");
     EXPECT_TRUE(small->hardlinkDestination() == hard || hard->hardlinkDestination() == small);
 
-    // Extracted, the tree is the source's and what bsdtar makes of the archive.
+    // Extracted, the tree is the source's.
     ASSERT_EQ(mkdir(directory.file("ours").c_str(), 0755), 0);
     bool checksumIsInvalid = true;
     GWErrorPtr error;
@@ -162,52 +139,13 @@ TEST_P(GWXARBsdtar, ReadsAndExtractsAsTheSourceAndBsdtarSay) {
         << error->localizedDescription();
     EXPECT_FALSE(checksumIsInvalid);
     const auto ours = gwtest::snapshotTree(directory.file("ours/tree"));
-    expectSameItems(source, ours, "source vs library");
+    expectSameItems(source, ours);
     EXPECT_EQ(ours.at("").modificationSeconds, 1100000000);
     // bsdtar gives the second name of a hard link no data of its own, so
     // nothing proves the bytes there are the target's: it becomes a copy.
-    ASSERT_EQ(gwtest::hardLinkGroups(source).size(), 1u);
-    EXPECT_TRUE(gwtest::hardLinkGroups(ours).empty());
+    ASSERT_EQ(source.at("small").inode, source.at("d/hard").inode);
+    EXPECT_NE(ours.at("small").inode, ours.at("d/hard").inode);
     EXPECT_EQ(ours.at("d/hard").digest, source.at("small").digest);
-    if (xz()) {
-        return;  // bsdtar fails to read back the small xz streams it writes
-    }
-    // bsdtar's own listing: mode, owner, group and size of every member.
-    auto listing = gwtest::runCommand("bsdtar -tvf " + gwtest::shellQuote(archivePath));
-    ASSERT_EQ(listing.status, 0) << listing.output;
-    std::istringstream lines(listing.output);
-    std::string line;
-    int checked = 0;
-    while (std::getline(lines, line)) {
-        std::istringstream fields(line);
-        std::string mode, links, owner, group, size, month, day, time, name;
-        fields >> mode >> links >> owner >> group >> size;
-        if (size.ends_with(',')) {
-            fields >> size;  // "1, 3": a device's numbers stand where the size would
-        }
-        fields >> month >> day >> time >> name;
-        SCOPED_TRACE(line);
-        auto entry = archive->fileWithPath(name);
-        ASSERT_TRUE(entry);
-        EXPECT_EQ(modeString(entry->permissionsMode()), mode);
-        // Owners without a name here are listed by number.
-        EXPECT_EQ(entry->ownerName().value_or(std::to_string(entry->ownerID())), owner);
-        EXPECT_EQ(entry->groupOwnerName().value_or(std::to_string(entry->groupOwnerID())), group);
-        if (entry->type() == GWXARFileTypeRegular) {
-            EXPECT_EQ(std::to_string(entry->dataFork() ? entry->dataFork()->uncompressedSize() : 0),
-                      size);
-        }
-        ++checked;
-    }
-    EXPECT_EQ(checked, int(source.size()));
-    ASSERT_EQ(mkdir(directory.file("theirs").c_str(), 0755), 0);
-    const auto result =
-        gwtest::runCommand("bsdtar -xpf " + gwtest::shellQuote(archivePath) + " -C " +
-                           gwtest::shellQuote(directory.file("theirs")) + " 2>&1");
-    ASSERT_EQ(result.status, 0) << result.output;
-    // bsdtar reads its own device elements back as 0,0 (bsdtar -tv shows it).
-    expectSameItems(gwtest::snapshotTree(directory.file("theirs/tree")), ours, "bsdtar vs library",
-                    false);
 }
 
 INSTANTIATE_TEST_SUITE_P(Compressions, GWXARBsdtar,

@@ -156,17 +156,13 @@ TEST(GWXARFileTree, PathsHardLinkPathsAndTheArchive) {
 }
 
 TEST(GWXARFileTree, ChildrenSortCaseInsensitivelyWithNumbersByValue) {
-    auto directory = entry("d", 0040755);
-    auto b = entry("b"), A = entry("A"), file10 = entry("file10"), file2 = entry("file2");
-    directory->setChildren({b, A, file10, file2});
-    EXPECT_EQ(directory->children(), (GWXARFileArray{A, b, file2, file10}));
-    EXPECT_EQ(file2->parent(), directory);
-
-    // Equal names keep their order; long digit runs compare by value.
+    // Case aside, equal names keep their order; long digit runs compare by value.
+    auto directory = entry("d", 0040755), file2 = entry("file2");
     auto same1 = entry("Same"), same2 = entry("same"), zero = entry("file02");
     auto huge = entry("v100000000000000000000000"), big = entry("v99999999999999999999999");
     directory->setChildren({huge, same1, same2, file2, zero, big});
     EXPECT_EQ(directory->children(), (GWXARFileArray{file2, zero, same1, same2, big, huge}));
+    EXPECT_EQ(file2->parent(), directory);
 }
 
 TEST(GWXARFileACL, SlotsOwnTheirCopies) {
@@ -220,7 +216,7 @@ TEST(GWXARFileACL, TextAndPersistentFormRoundTripAndRefuseDamage) {
     }
 }
 
-TEST(GWXARFileCoding, KeyedRoundTripKeepsValuesButNotTheWeakLinks) {
+TEST(GWXARFileCoding, RoundTripAndCopyKeepValuesButNotTheWeakLinks) {
     SampleTree tree;
     GWErrorPtr error;
     auto decoded = GWKeyedUnarchiver::unarchiveObjectWithData<GWXARFile>(
@@ -241,25 +237,18 @@ TEST(GWXARFileCoding, KeyedRoundTripKeepsValuesButNotTheWeakLinks) {
     EXPECT_EQ(file->extendedAttributes()[0]->uncompressedChecksum(), GWData{});
     GWNonKeyedCoder nonKeyed;
     EXPECT_EQ(GWXARFile::initWithCoder(nonKeyed), nullptr);
-}
 
-TEST(GWXARFileCopy, IsDeepAndLeavesTheChildrensParentAtTheSource) {
-    SampleTree tree;
-    auto copy = tree.directory->copy();
-    ASSERT_EQ(copy->children().size(), 2u);
-    auto file = copy->children()[0];
-    auto link = copy->children()[1];
-    // Intended: the copied children still name the source as their parent.
-    EXPECT_EQ(file->parent(), tree.directory);
-    EXPECT_EQ(fields(*file), fields(*tree.file));
-    EXPECT_EQ(copy->archive(), nullptr);
-    EXPECT_EQ(link->hardlinkDestination(), nullptr);
-    EXPECT_EQ(link->hardlinkDestinationID(), "stale");
-    // Owned parts are the copy's own.
-    EXPECT_NE(file->accessACL()->handle(), tree.file->accessACL()->handle());
-    EXPECT_NE(file->extendedAttributes()[0], tree.file->extendedAttributes()[0]);
-    tree.file->dataFork()->setOffset(1);
-    EXPECT_EQ(file->dataFork()->offset(), 0x1cu);
+    // A copy is deep, but its children still name the source as their parent.
+    SampleTree source;
+    auto copy = source.directory->copy();
+    auto copied = copy->children()[0];
+    EXPECT_EQ(copied->parent(), source.directory);
+    EXPECT_EQ(fields(*copied), fields(*source.file));
+    EXPECT_EQ(copy->children()[1]->hardlinkDestinationID(), "stale");
+    EXPECT_NE(copied->accessACL()->handle(), source.file->accessACL()->handle());
+    EXPECT_NE(copied->extendedAttributes()[0], source.file->extendedAttributes()[0]);
+    source.file->dataFork()->setOffset(1);
+    EXPECT_EQ(copied->dataFork()->offset(), 0x1cu);
 }
 
 // A linked pair, a nested file, and a subdocument, with a checksum that fails.
@@ -286,45 +275,56 @@ std::string xmlText(const std::shared_ptr<pugi::xml_document>& document) {
     return stream.str();
 }
 
-void expectLinkedWithin(const GWXARArchivePtr& archive) {
-    auto link = archive->fileWithPath("link");
-    auto original = archive->fileWithPath("dir/original");
-    ASSERT_TRUE(link && original);
-    EXPECT_EQ(link->hardlinkDestination(), original);
-    EXPECT_EQ(link->archive(), archive);
-    EXPECT_EQ(original->archive(), archive);
-    EXPECT_EQ(original->parent(), archive->fileWithPath("dir"));
-}
-
-TEST(GWXARArchiveCoding, KeyedRoundTripRestoresEverythingButTheQueue) {
+// Decoded or copied, an archive keeps its values and its own linked tree; a
+// decoded one has no queue and is not cancelled, a copy gets a queue of its own.
+TEST(GWXARArchiveCoding, RoundTripAndCopyRestoreEverythingButTheQueue) {
     gwtest::TemporaryDirectory directory;
     const GWXARArchivePtr source = loadedArchive(directory);
     ASSERT_TRUE(source);
     source->setChecksumValidationError(GWCocoaError(GWFileReadCorruptFileError));
     source->setPrivateSignatureIsValid(true);
-    source->setIsCancelled(true);
-
     GWErrorPtr error;
     auto decoded = GWKeyedUnarchiver::unarchiveObjectWithData<GWXARArchive>(
         GWKeyedArchiver::archivedDataWithRootObject(*source, &error), &error);
     ASSERT_TRUE(decoded) << (error ? error->localizedDescription() : "");
-    EXPECT_EQ(decoded->URL(), source->URL());
-    EXPECT_EQ(gwtest::namesOf(decoded->files()), gwtest::namesOf(source->files()));
-    EXPECT_EQ(decoded->tocChecksum(), source->tocChecksum());
-    EXPECT_EQ(decoded->tocChecksum().size(), 20u);
-    EXPECT_FALSE(decoded->checksumIsValid());
-    EXPECT_TRUE(decoded->privateSignatureIsValid());
-    EXPECT_FALSE(decoded->signatureIsValid());  // the checksum still fails
-    ASSERT_TRUE(decoded->checksumValidationError());
-    EXPECT_TRUE(decoded->checksumValidationError()->is(kGWCocoaErrorDomain, 259));
-    // Without an error of its own, the signature reports the checksum's.
-    EXPECT_EQ(decoded->signatureValidationError(), decoded->checksumValidationError());
-    ASSERT_EQ(decoded->subdocuments().size(), 1u);
-    EXPECT_EQ(xmlText(decoded->subdocuments().at("info")),
-              xmlText(source->subdocuments().at("info")));
+    source->setIsCancelled(true);
+    auto copy = source->copy();
+    for (const auto& other : {decoded, copy}) {
+        SCOPED_TRACE(other == copy ? "copy" : "decoded");
+        EXPECT_EQ(other->URL(), source->URL());
+        EXPECT_EQ(gwtest::namesOf(other->files()), gwtest::namesOf(source->files()));
+        EXPECT_NE(other->files()[0], source->files()[0]);
+        EXPECT_EQ(other->tocChecksum(), source->tocChecksum());
+        EXPECT_EQ(other->tocChecksum().size(), 20u);
+        EXPECT_FALSE(other->checksumIsValid());
+        EXPECT_TRUE(other->privateSignatureIsValid());
+        EXPECT_FALSE(other->signatureIsValid());  // the checksum still fails
+        ASSERT_TRUE(other->checksumValidationError());
+        EXPECT_TRUE(other->checksumValidationError()->is(kGWCocoaErrorDomain, 259));
+        // Without an error of its own, the signature reports the checksum's.
+        EXPECT_EQ(other->signatureValidationError(), other->checksumValidationError());
+        EXPECT_EQ(xmlText(other->subdocuments().at("info")),
+                  xmlText(source->subdocuments().at("info")));
+        auto link = other->fileWithPath("link");
+        auto original = other->fileWithPath("dir/original");
+        ASSERT_TRUE(link && original);
+        EXPECT_EQ(link->hardlinkDestination(), original);
+        EXPECT_EQ(link->archive(), other);
+        EXPECT_EQ(original->archive(), other);
+    }
+    // A copy's children still name the source's entries as their parents.
+    EXPECT_EQ(decoded->fileWithPath("dir/original")->parent(), decoded->fileWithPath("dir"));
     EXPECT_FALSE(decoded->operationQueue());
     EXPECT_FALSE(decoded->isCancelled());
-    expectLinkedWithin(decoded);
+    EXPECT_TRUE(copy->operationQueue());
+    EXPECT_NE(copy->operationQueue(), source->operationQueue());
+    EXPECT_NE(copy->ref(), source->ref());
+    source->setPrivateSignatureValidationError(GWCocoaError(GWFileReadUnknownError));
+    EXPECT_EQ(source->copy()->privateSignatureValidationError(),
+              source->privateSignatureValidationError());
+    // Subdocuments are the copy's own.
+    copy->subdocuments().at("info")->document_element().set_name("changed");
+    EXPECT_STREQ(source->subdocuments().at("info")->document_element().name(), "about");
 
     auto empty = GWKeyedUnarchiver::unarchiveObjectWithData<GWXARArchive>(
         GWKeyedArchiver::archivedDataWithRootObject(*GWXARArchive::init()));
@@ -332,31 +332,6 @@ TEST(GWXARArchiveCoding, KeyedRoundTripRestoresEverythingButTheQueue) {
     EXPECT_TRUE(empty->files().empty() && empty->tocChecksum().empty());
     GWNonKeyedCoder nonKeyed;
     EXPECT_FALSE(GWXARArchive::initWithCoder(nonKeyed));
-}
-
-TEST(GWXARArchiveCopy, IsDeepAndLinkedWithinItself) {
-    gwtest::TemporaryDirectory directory;
-    const GWXARArchivePtr source = loadedArchive(directory);
-    ASSERT_TRUE(source);
-    source->setPrivateSignatureValidationError(GWCocoaError(GWFileReadUnknownError));
-    auto copy = source->copy();
-
-    EXPECT_TRUE(copy->operationQueue());
-    EXPECT_NE(copy->operationQueue(), source->operationQueue());
-    EXPECT_EQ(copy->URL(), source->URL());
-    EXPECT_NE(copy->ref(), source->ref());
-    EXPECT_EQ(copy->tocChecksum(), source->tocChecksum());
-    EXPECT_EQ(copy->checksumIsValid(), source->checksumIsValid());
-    EXPECT_EQ(copy->privateSignatureValidationError(), source->privateSignatureValidationError());
-    EXPECT_NE(copy->files()[0], source->files()[0]);
-    expectLinkedWithin(source);
-    auto link = copy->fileWithPath("link");
-    ASSERT_TRUE(link);
-    EXPECT_EQ(link->hardlinkDestination(), copy->fileWithPath("dir/original"));
-    EXPECT_EQ(link->archive(), copy);
-    // Subdocuments are the copy's own.
-    copy->subdocuments().at("info")->document_element().set_name("changed");
-    EXPECT_STREQ(source->subdocuments().at("info")->document_element().name(), "about");
 }
 
 }  // namespace

@@ -4,8 +4,6 @@
 
 #include <gtest/gtest.h>
 
-#include <cerrno>
-
 #include "GWArchiveSupport/GWArchiveConstants.h"
 #include "XarTestSupport.h"
 #include "foundation/GWChecksum.h"
@@ -232,64 +230,13 @@ TEST(GWXARTOCEntries, CancellationStopsTheParse) {
     EXPECT_TRUE(error->is(kGWCocoaErrorDomain, GWUserCancelledError));
 }
 
-TEST(GWXARTOCValues, ChecksumsInlineOrStoredInTheHeap) {
-    auto operation = GWXARLoadOperation::initWithArchive(nullptr, false);
-    GWErrorPtr error;
-    int type = -7;
-    auto inline_ = gwtest::xmlElement("<c style=\"sha256\">ABcd</c>");
-    EXPECT_EQ(operation->checksumFromElement(inline_->first_child(), &type, &error),
-              (GWData{0xab, 0xcd}));
-    EXPECT_EQ(type, GWChecksumAlgorithmSHA256);
-    auto empty = gwtest::xmlElement("<c style=\"md5\"></c>");
-    EXPECT_EQ(operation->checksumFromElement(empty->first_child(), nullptr, &error), GWData{});
-    // The style is only mapped when the caller asks for it.
-    auto odd = gwtest::xmlElement("<c style=\"crc\">00</c>");
-    EXPECT_EQ(operation->checksumFromElement(odd->first_child(), nullptr, &error), GWData{0});
-    EXPECT_FALSE(operation->checksumFromElement(odd->first_child(), &type, &error));
-    EXPECT_TRUE(error->is(kGWXARArchiveErrorDomain, GWXARArchiveUnknownChecksumError));
-    EXPECT_EQ(entity(error), "crc");
-
-    gwtest::TemporaryDirectory directory;
-    gwtest::writeFile(directory.file("heap"), gwtest::bytesOf("0123456789abcdef"));
-    operation->setArchiveURL(directory.url("heap"));
-    auto stored = gwtest::xmlElement("<c style=\"sha1\"><offset>2</offset><size>4</size></c>");
-    // Without an open file there is nothing to read from.
-    EXPECT_FALSE(operation->checksumFromElement(stored->first_child(), nullptr, &error));
-    EXPECT_TRUE(error->is(kGWPOSIXErrorDomain, EBADF));
-    operation->setFileHandle(
-        GWRemoteFileHandle::initForReadingFromURL(directory.url("heap"), &error));
-    operation->setHeapStart(10);
-    EXPECT_EQ(operation->checksumFromElement(stored->first_child(), &type, &error),
-              gwtest::bytesOf("cdef"));
-    EXPECT_EQ(type, GWChecksumAlgorithmSHA1);
-
-    auto badSize = gwtest::xmlElement("<c style=\"sha1\"><offset>2</offset><size>-4</size></c>");
-    EXPECT_FALSE(operation->checksumFromElement(badSize->first_child(), nullptr, &error));
-    EXPECT_TRUE(error->is(kGWXARArchiveErrorDomain, GWXARArchiveMalformedValueError));
-    EXPECT_EQ(entity(error), "-4");
-    EXPECT_EQ(error->URL(), directory.url("heap"));
-    EXPECT_EQ(error->detailString(kGWXARArchiveAffectedXMLNodeErrorKey),
-              "<c style=\"sha1\"><offset>2</offset><size>-4</size></c>");
-}
-
-TEST(GWXARTOCValues, NamesOfChecksumsAndCompressions) {
+TEST(GWXARTOCValues, NamesOfChecksums) {
     const std::pair<const char*, int> names[] = {{"SHA", 5},    {"sha1", 5},   {"Sha224", 6},
                                                  {"sha256", 7}, {"sha384", 8}, {"SHA512", 9},
                                                  {"MD5", 4},    {"md2", 3},    {"crc32", -1}};
     for (const auto& [name, type] : names) {
         EXPECT_EQ(GWXARLoadOperation::checksumTypeFromName(name), type) << name;
     }
-    auto operation = GWXARLoadOperation::initWithArchive(nullptr, false);
-    GWErrorPtr error;
-    std::uint64_t type = 99;
-    auto lzma = gwtest::xmlElement("<encoding style=\"application/x-lzma\"/>");
-    EXPECT_TRUE(operation->getCompressionType(&type, lzma->first_child(), &error));
-    EXPECT_EQ(type, GWXARCompressionTypeLZMA);
-    // Matched exactly, case included.
-    auto upper = gwtest::xmlElement("<encoding style=\"Application/X-Gzip\"/>");
-    EXPECT_FALSE(operation->getCompressionType(&type, upper->first_child(), &error));
-    EXPECT_TRUE(error->is(kGWXARArchiveErrorDomain, GWXARArchiveUnsupportedCompressionError));
-    EXPECT_EQ(entity(error), "Application/X-Gzip");
 }
 
 }  // namespace

@@ -103,20 +103,4 @@ std::map<std::string, TreeItem> snapshotTree(const std::string& root) {
     return tree;
 }
 
-std::vector<std::vector<std::string>> hardLinkGroups(const std::map<std::string, TreeItem>& tree) {
-    std::map<ino_t, std::vector<std::string>> byInode;
-    for (const auto& [path, item] : tree) {
-        if (S_ISREG(item.mode)) {
-            byInode[item.inode].push_back(path);
-        }
-    }
-    std::vector<std::vector<std::string>> groups;
-    for (auto& [inode, paths] : byInode) {
-        if (paths.size() > 1) {
-            groups.push_back(paths);
-        }
-    }
-    return groups;
-}
-
 }  // namespace gwtest

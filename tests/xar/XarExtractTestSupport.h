@@ -39,7 +39,4 @@ struct TreeItem {
 // Every item below `root`, by path relative to it ("" is the root itself).
 std::map<std::string, TreeItem> snapshotTree(const std::string& root);
 
-// Paths of regular files that share an inode with another one, grouped.
-std::vector<std::vector<std::string>> hardLinkGroups(const std::map<std::string, TreeItem>& tree);
-
 }  // namespace gwtest

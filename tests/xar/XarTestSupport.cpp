@@ -59,12 +59,6 @@ ParsedEntries parseEntries(const std::string& fileElements, std::uint64_t heapSt
     return parsed;
 }
 
-std::unique_ptr<pugi::xml_document> xmlElement(const std::string& xml) {
-    auto document = std::make_unique<pugi::xml_document>();
-    document->load_string(xml.c_str(), GWXARLoadOperation::kTOCParseOptions);
-    return document;
-}
-
 GWXARFilePtr entryAtPath(const GWXARFileArray& files, const std::string& path) {
     const GWXARFileArray* level = &files;
     GWXARFilePtr found;

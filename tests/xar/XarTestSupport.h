@@ -33,8 +33,6 @@ struct ParsedEntries {
 };
 // Parses `fileElements` wrapped in <xar><toc>; the operation's heap starts at `heapStart`.
 ParsedEntries parseEntries(const std::string& fileElements, std::uint64_t heapStart = 0);
-// The single element `xml` (e.g. "<device>...</device>") as a document.
-std::unique_ptr<pugi::xml_document> xmlElement(const std::string& xml);
 
 // The entry at a "/"-separated path below `files`, or null.
 GWXARFilePtr entryAtPath(const GWXARFileArray& files, const std::string& path);
