@@ -64,6 +64,10 @@ c++ -std=c++20 $cflags -E list_entries.cpp -o preprocessed.i
 if grep -E '^# [0-9]+ "' preprocessed.i | grep -F -e "$source_dir" -e "$build_dir"; then
   fail "the consumer's preprocessed output names files of the source or build tree"
 fi
+# Nor does it need the development headers of the libraries behind it.
+if grep -E '^# [0-9]+ "' preprocessed.i | grep -E 'sys/acl\.h|pugixml|openssl/|curl/|zlib\.h|bzlib\.h|lzma|zstd|isa-l'; then
+  fail "the consumer's preprocessed output needs a dependency's headers"
+fi
 
 # 2. find_package, against GWArchiveSupport::GWArchiveSupport.
 cmake -S . -B cmake-build -DCMAKE_PREFIX_PATH="$prefix" -DCMAKE_BUILD_TYPE=Release >/dev/null

@@ -6,6 +6,8 @@
 #include <utility>
 #include <vector>
 
+#include <sys/acl.h>
+
 #include "foundation/GWByteReader.h"
 
 namespace {

@@ -5,11 +5,14 @@
 #include <string>
 #include <string_view>
 
-#include <sys/acl.h>
-
 #include "GWError.h"
 #include "GWExport.h"
 #include "GWValue.h"
+
+// libacl's handle, declared as <sys/acl.h> does, so that callers need no
+// libacl headers to use the library.
+struct __acl_ext;
+typedef struct __acl_ext* acl_t;
 
 // One access-control list as a XAR entry holds it. Usually a POSIX ACL owned
 // through its libacl handle; archives made on Macs carry extended ACLs in the

@@ -5,6 +5,8 @@
 
 #include <sstream>
 
+#include <sys/acl.h>
+
 #include "XarTestSupport.h"
 #include "foundation/GWCoder.h"
 #include "support/TestSupport.h"
