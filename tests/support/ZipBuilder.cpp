@@ -114,14 +114,6 @@ ZipEntry& ZipBuilder::addFile(const std::string& name, GWData content, std::uint
     return add(std::move(entry));
 }
 
-ZipEntry& ZipBuilder::addEncoded(const std::string& name, GWData content, std::uint16_t method,
-                                 GWData stored, std::uint16_t flags) {
-    ZipEntry& entry = addFile(name, std::move(content), method);
-    entry.stored = std::move(stored);
-    entry.flags = flags;
-    return entry;
-}
-
 ZipEntry& ZipBuilder::addDirectory(const std::string& name) {
     ZipEntry entry;
     entry.name = bytesOf(name);
@@ -151,26 +143,18 @@ void appendZipEntry(const ZipEntry& entry, std::uint64_t offset, GWData& out, GW
     if (!entry.omitLocalHeader) {
         const GWData& localName = entry.localName ? *entry.localName : entry.name;
         GWData localExtra = entry.localExtra;
-        const std::uint64_t localCompressed = entry.localCompressedSize.value_or(compressed);
-        const std::uint64_t localUncompressed = entry.localUncompressedSize.value_or(uncompressed);
         if (entry.zip64Sizes) {
-            append(localExtra, zip64Block({localUncompressed, localCompressed}));
+            append(localExtra, zip64Block({uncompressed, compressed}));
         }
         put32(out, 0x04034B50);
-        put16(out, entry.versionNeeded);
+        put16(out, 20);
         put16(out, flags);
         put16(out, entry.method);
         put16(out, entry.dosTime);
         put16(out, entry.dosDate);
-        if (entry.dataDescriptor) {
-            put32(out, entry.localCRC32.value_or(0));
-            put32(out, entry.localCompressedSize.value_or(0));
-            put32(out, entry.localUncompressedSize.value_or(0));
-        } else {
-            put32(out, entry.localCRC32.value_or(crc));
-            put32(out, entry.zip64Sizes ? kEscaped32 : localCompressed);
-            put32(out, entry.zip64Sizes ? kEscaped32 : localUncompressed);
-        }
+        put32(out, entry.dataDescriptor ? 0 : crc);
+        put32(out, entry.dataDescriptor ? 0 : entry.zip64Sizes ? kEscaped32 : compressed);
+        put32(out, entry.dataDescriptor ? 0 : entry.zip64Sizes ? kEscaped32 : uncompressed);
         put16(out, localName.size());
         put16(out, localExtra.size());
         append(out, localName);
@@ -204,8 +188,8 @@ void appendZipEntry(const ZipEntry& entry, std::uint64_t offset, GWData& out, GW
         append(centralExtra, zip64Block(escaped));
     }
     put32(directory, 0x02014B50);
-    put16(directory, std::uint16_t(entry.host) << 8 | entry.madeByVersion);
-    put16(directory, entry.versionNeeded);
+    put16(directory, std::uint16_t(entry.host) << 8 | 30);
+    put16(directory, 20);
     put16(directory, flags);
     put16(directory, entry.method);
     put16(directory, entry.dosTime);
@@ -216,8 +200,7 @@ void appendZipEntry(const ZipEntry& entry, std::uint64_t offset, GWData& out, GW
     put16(directory, entry.name.size());
     put16(directory, centralExtra.size());
     put16(directory, entry.comment.size());
-    put16(directory, entry.diskNumberStart);
-    put16(directory, entry.internalAttributes);
+    put32(directory, 0);  // disk number and internal attributes
     put32(directory, entry.externalAttributes);
     put32(directory, entry.zip64Offset ? kEscaped32 : recordedOffset);
     append(directory, entry.name);
