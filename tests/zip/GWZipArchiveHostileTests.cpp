@@ -20,20 +20,22 @@ namespace {
 
 using namespace gwtest;
 
-void put32(GWData& bytes, std::size_t at, std::uint32_t value) {
-    for (int i = 0; i < 4; ++i) {
-        bytes[at + i] = std::uint8_t(value >> (8 * i));
-    }
-}
-
-void put16(GWData& bytes, std::size_t at, std::uint16_t value) {
-    bytes[at] = std::uint8_t(value);
-    bytes[at + 1] = std::uint8_t(value >> 8);
-}
-
 std::size_t find(const GWData& bytes, std::initializer_list<std::uint8_t> pattern) {
     auto at = std::search(bytes.begin(), bytes.end(), pattern.begin(), pattern.end());
     return std::size_t(at - bytes.begin());
+}
+
+// `bytes` with the little-endian `values` written from `offset` bytes past
+// the first `signature`, each `width` bytes wide.
+GWData patched(GWData bytes, std::initializer_list<std::uint8_t> signature, std::size_t offset,
+               std::vector<std::uint32_t> values, int width = 4) {
+    std::size_t at = find(bytes, signature) + offset;
+    for (std::uint32_t value : values) {
+        for (int i = 0; i < width; ++i) {
+            bytes[at++] = std::uint8_t(value >> (8 * i));
+        }
+    }
+    return bytes;
 }
 
 // Two plain entries; the mutations below break one structure each.
@@ -42,6 +44,18 @@ GWData sampleArchive() {
     zip.addFile("one.txt", bytesOf("first entry"));
     zip.addFile("dir/two.txt", textBytes(400, 7), 8);
     return zip.bytes();
+}
+
+// One small entry, with `change` made to the builder.
+GWData oneEntry(const std::function<void(ZipBuilder&)>& change) {
+    ZipBuilder zip;
+    zip.addFile("a", bytesOf("x"));
+    change(zip);
+    return zip.bytes();
+}
+
+GWData withZip64EndRecord() {
+    return oneEntry([](ZipBuilder& zip) { zip.zip64EndRecord = true; });
 }
 
 struct HostileCase {
@@ -104,73 +118,38 @@ const HostileCase kHostileCases[] = {
      }},
     {"CentralSignatureBroken",
      [] {
-         GWData bytes = sampleArchive();
-         bytes[find(bytes, {'P', 'K', 1, 2}) + 3] = 9;
-         return bytes;
+         return patched(sampleArchive(), {'P', 'K', 1, 2}, 3, {9}, 1);
      },
      nullptr, "Couldn't read central directory record!"},
     {"MoreEntriesThanTheDirectoryHolds",
-     [] {
-         ZipBuilder zip;
-         zip.addFile("a", bytesOf("x"));
-         zip.endRecordEntryCount = 0xFFF0;
-         return zip.bytes();
-     }},
+     [] { return oneEntry([](ZipBuilder& zip) { zip.endRecordEntryCount = 0xFFF0; }); }},
     {"Zip64CountOfBillions",
      [] {
-         GWData bytes = [] {
-             ZipBuilder zip;
-             zip.addFile("a", bytesOf("x"));
-             zip.zip64EndRecord = true;
-             return zip.bytes();
-         }();
-         const std::size_t record = find(bytes, {'P', 'K', 6, 6});
-         put32(bytes, record + 24, 0xFFFFFFFF);
-         put32(bytes, record + 28, 0x0FFFFFFF);
-         put32(bytes, record + 32, 0xFFFFFFFF);
-         put32(bytes, record + 36, 0x0FFFFFFF);
-         return bytes;
+         return patched(withZip64EndRecord(), {'P', 'K', 6, 6}, 24,
+                        {0xFFFFFFFF, 0x0FFFFFFF, 0xFFFFFFFF, 0x0FFFFFFF});
      }},
     {"DirectoryOffsetPastTheEnd",
      [] {
-         ZipBuilder zip;
-         zip.addFile("a", bytesOf("x"));
-         zip.endRecordCentralDirectoryOffset = 0x7FFFFFFF;
-         return zip.bytes();
+         return oneEntry([](ZipBuilder& zip) { zip.endRecordCentralDirectoryOffset = 0x7FFFFFFF; });
      }},
     {"Zip64OffsetWithoutLocator",
      [] {
-         ZipBuilder zip;
-         zip.addFile("a", bytesOf("x"));
-         zip.endRecordCentralDirectoryOffset = 0xFFFFFFFF;
-         return zip.bytes();
+         return oneEntry([](ZipBuilder& zip) { zip.endRecordCentralDirectoryOffset = 0xFFFFFFFF; });
      }},
     {"Zip64LocatorPointsPastItself",
      [] {
-         ZipBuilder zip;
-         zip.addFile("a", bytesOf("x"));
-         zip.zip64EndRecord = true;
-         GWData bytes = zip.bytes();
-         const std::size_t locator = find(bytes, {'P', 'K', 6, 7});
-         put32(bytes, locator + 8, 0x7FFFFFF0);
-         return bytes;
+         return patched(withZip64EndRecord(), {'P', 'K', 6, 7}, 8, {0x7FFFFFF0});
      }},
     {"Zip64RecordSignatureBroken",
      [] {
-         ZipBuilder zip;
-         zip.addFile("a", bytesOf("x"));
-         zip.zip64EndRecord = true;
-         GWData bytes = zip.bytes();
-         bytes[find(bytes, {'P', 'K', 6, 6}) + 2] = 0;
-         return bytes;
+         return patched(withZip64EndRecord(), {'P', 'K', 6, 6}, 2, {0}, 1);
      },
      nullptr, "error parsing Zip64 end of central dir record"},
     {"LocalHeaderOffsetPastTheEnd",
      [] {
-         ZipBuilder zip;
-         zip.addFile("a", bytesOf("x"));
-         zip.addFile("b", bytesOf("y")).centralLocalHeaderOffset = 0x7FFFFFFF;
-         return zip.bytes();
+         return oneEntry([](ZipBuilder& zip) {
+             zip.addFile("b", bytesOf("y")).centralLocalHeaderOffset = 0x7FFFFFFF;
+         });
      }},
     {"LocalHeaderOffsetIntoData",
      [] {
@@ -181,21 +160,15 @@ const HostileCase kHostileCases[] = {
      }},
     {"LocalNameRunsPastTheFile",
      [] {
-         GWData bytes = sampleArchive();
-         put16(bytes, find(bytes, {'P', 'K', 3, 4}) + 26, 0xFFFF);
-         return bytes;
+         return patched(sampleArchive(), {'P', 'K', 3, 4}, 26, {0xFFFF}, 2);
      }},
     {"CentralNameRunsPastTheDirectory",
      [] {
-         GWData bytes = sampleArchive();
-         put16(bytes, find(bytes, {'P', 'K', 1, 2}) + 28, 0xFFFF);
-         return bytes;
+         return patched(sampleArchive(), {'P', 'K', 1, 2}, 28, {0xFFFF}, 2);
      }},
     {"CentralExtraRunsPastTheDirectory",
      [] {
-         GWData bytes = sampleArchive();
-         put16(bytes, find(bytes, {'P', 'K', 1, 2}) + 30, 0xFFF0);
-         return bytes;
+         return patched(sampleArchive(), {'P', 'K', 1, 2}, 30, {0xFFF0}, 2);
      }},
     {"TenThousandRecordsShareOneLocalHeader",
      [] {
