@@ -2,6 +2,7 @@
 
 #include <cstdint>
 #include <fstream>
+#include <initializer_list>
 #include <optional>
 #include <string>
 #include <vector>
@@ -22,6 +23,11 @@ enum ZipHost : std::uint8_t {
 // `content` as ZIP method 8 (raw deflate) or 12 (bzip2) stores it; other
 // methods return it unchanged.
 GWData zipCompress(const GWData& content, std::uint16_t method);
+
+// Appends each value as `width` bytes, least (putLE) or most (putBE)
+// significant first.
+void putLE(GWData& out, std::initializer_list<std::pair<std::uint64_t, int>> values);
+void putBE(GWData& out, std::initializer_list<std::pair<std::uint64_t, int>> values);
 
 std::uint16_t zipDOSTime(int hour, int minute, int second);  // second / 2 is stored
 std::uint16_t zipDOSDate(int year, int month, int day);
