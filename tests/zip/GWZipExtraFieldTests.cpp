@@ -54,25 +54,23 @@ GWData patched(GWData bytes, std::size_t at, std::uint8_t value) {
 }
 
 Mac3Attributes sampleAttributes() {
-    Mac3Attributes a;
-    a.finderFlags = 0x0500;
-    a.vertical = 0xFFFE;
-    a.horizontal = 300;
-    a.folder = 7;
-    a.iconID = -5;
-    a.script = -1;
-    a.extendedFlags = 0x40;
-    a.commentID = -300;
-    a.putAway = -2;
-    a.version = 4;
-    a.accessRights = 0x80;
-    a.times = {macSeconds(kY2K), macSeconds(kLater), macSeconds(kY2K + 86400)};
-    a.offsets = {3600, -18000, 0};
-    a.hfsPath =
-        "Macintosh HD:Dokumente:Gr\x9f\xa7"
-        "e";                       // "Grüße"
-    a.comment = "Kommentar \xa5";  // "•"
-    return a;
+    return {.finderFlags = 0x0500,
+            .vertical = 0xFFFE,
+            .horizontal = 300,
+            .folder = 7,
+            .iconID = -5,
+            .script = -1,
+            .extendedFlags = 0x40,
+            .commentID = -300,
+            .putAway = -2,
+            .version = 4,
+            .accessRights = 0x80,
+            .times = {macSeconds(kY2K), macSeconds(kLater), macSeconds(kY2K + 86400)},
+            .offsets = {3600, -18000, 0},
+            .hfsPath =
+                "Macintosh HD:Dokumente:Gr\x9f\xa7"
+                "e",                       // "Grüße"
+            .comment = "Kommentar \xa5"};  // "•"
 }
 
 GWDictionary merged(GWDictionary base, const GWDictionary& more) {

@@ -214,14 +214,11 @@ TEST_F(GWZipExtractMacMetadata, FinderInformationFromTheExtraFieldIsApplied) {
 class ScopedNoChown {
 public:
     ScopedNoChown() {
-        header_.version = _LINUX_CAPABILITY_VERSION_3;
-        if (syscall(SYS_capget, &header_, data_) != 0) {
-            return;
+        if (syscall(SYS_capget, &header_, saved_) == 0) {
+            __user_cap_data_struct reduced[2] = {saved_[0], saved_[1]};
+            reduced[0].effective &= ~(1u << CAP_CHOWN);
+            active_ = syscall(SYS_capset, &header_, reduced) == 0;
         }
-        saved_[0] = data_[0];
-        saved_[1] = data_[1];
-        data_[0].effective &= ~(1u << CAP_CHOWN);
-        active_ = syscall(SYS_capset, &header_, data_) == 0;
     }
     ~ScopedNoChown() {
         if (active_) {
@@ -231,8 +228,7 @@ public:
     bool active() const { return active_; }
 
 private:
-    __user_cap_header_struct header_{};
-    __user_cap_data_struct data_[2]{};
+    __user_cap_header_struct header_{_LINUX_CAPABILITY_VERSION_3, 0};
     __user_cap_data_struct saved_[2]{};
     bool active_ = false;
 };

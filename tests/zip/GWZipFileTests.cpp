@@ -217,28 +217,6 @@ TEST(GWZipFileDerived, MacBinaryEntriesReportNoChecksum) {
     EXPECT_EQ(dir->uncompressedChecksumAlgorithm(), 1u);
 }
 
-TEST(GWZipFileStorage, OptionalFieldsKeepNoneApartFromEmpty) {
-    const GWData sha1(20, 0xAB);
-    for (const std::optional<GWData>& checksum :
-         {std::optional<GWData>(), std::optional<GWData>(GWData{}),
-          std::optional<GWData>(GWData{1, 2, 3, 4}), std::optional<GWData>(GWData(8, 7)),
-          std::optional<GWData>(sha1)}) {
-        auto file = makeFile("f");
-        file->setUncompressedChecksum(checksum);
-        file->setSymlinkDestination(checksum ? std::optional<std::string>("") : std::nullopt);
-        file->setExtraInfo(checksum ? GWDictionary{{kGWZipCommentKey, "c"}} : GWDictionary{});
-        for (const auto& seen : {file, file->copy()}) {
-            EXPECT_EQ(seen->privateUncompressedChecksum(), checksum);
-            EXPECT_EQ(seen->symlinkDestination().has_value(), checksum.has_value());
-            EXPECT_EQ(seen->comment().has_value(), checksum.has_value());
-        }
-    }
-    auto file = makeFile("f");
-    file->setResourceFork(nullptr);
-    EXPECT_EQ(file->resourceFork(), nullptr);
-    EXPECT_EQ(file->appleDoubleFile(), nullptr);
-}
-
 // The entry's name after setExtraInfo; names that are not one component
 // are refused, and Mac names keep their slashes as colons.
 TEST(GWZipFileRenaming, NameKeysInOrderAndOnlyOneComponent) {
