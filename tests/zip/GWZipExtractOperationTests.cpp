@@ -322,6 +322,7 @@ const std::vector<IntegrityCase>& integrityCases() {
     };
     // A small declared size over a large stream: the shape of a zip bomb.
     const auto lyingSize = [](ZipEntry& entry) { entry.uncompressedSize = 100; };
+    const auto claims10 = [](ZipEntry& entry) { entry.uncompressedSize = 10; };
     static const std::vector<IntegrityCase> cases = {
         {"StoredBadCRC", 0, textBytes(70000, 3), wrongCRC, kGWZipArchiveErrorDomain, 5, 70000},
         {"DeflatedBadCRC", 8, textBytes(70000, 3), wrongCRC, kGWZipArchiveErrorDomain, 5, 70000},
@@ -331,13 +332,7 @@ const std::vector<IntegrityCase>& integrityCases() {
         {"EmptyWithACRC", 0, {}, [](ZipEntry& e) { e.crc32 = 1; }, kGWZipArchiveErrorDomain, 5, 0},
         {"ShortStored", 0, textBytes(5000, 4), [](ZipEntry& e) { e.uncompressedSize = 6000; },
          kGWZipArchiveErrorDomain, 6, 5000},
-        {"EmptyWithASize",
-         0,
-         {},
-         [](ZipEntry& e) { e.uncompressedSize = 10; },
-         kGWZipArchiveErrorDomain,
-         6,
-         0},
+        {"EmptyWithASize", 0, {}, claims10, kGWZipArchiveErrorDomain, 6, 0},
         {"DeflateBomb", 8, GWData(8 << 20, 0), lyingSize, kGWZipArchiveErrorDomain, 6, 100},
         {"Bzip2Bomb", 12, GWData(8 << 20, 0), lyingSize, kGWZipArchiveErrorDomain, 6, 100},
         {"CorruptDeflate", 8, textBytes(5000, 1),

@@ -43,33 +43,6 @@ Tree treeAt(const std::string& root, bool withDates) {
     return tree;
 }
 
-// Laid out as Android and Java tools do: a JAR marker on the first entry,
-// alignment padding blocks on stored ones, methods mixed and Zip64 forced
-// on some entries.
-const char* kPythonScript = R"(
-import os, struct, sys, zipfile
-with zipfile.ZipFile(sys.argv[1], 'w') as z:
-    for root, dirs, files in os.walk('tree'):
-        dirs.sort()
-        for name in sorted(dirs + files):
-            path = os.path.join(root, name)
-            if os.path.islink(path):
-                continue
-            info = zipfile.ZipInfo.from_file(path, path)
-            if info.is_dir():
-                z.writestr(info, b'')
-                continue
-            data = open(path, 'rb').read()
-            info.compress_type = [zipfile.ZIP_STORED, zipfile.ZIP_DEFLATED,
-                                  zipfile.ZIP_BZIP2][len(name) % 3]
-            if not z.infolist():
-                info.extra = struct.pack('<HH', 0xCAFE, 0)
-            elif info.compress_type == zipfile.ZIP_STORED:
-                info.extra = struct.pack('<HHH3x', 0xD935, 5, 4)
-            with z.open(info, 'w', force_zip64=name.endswith('.bin')) as f:
-                f.write(data)
-)";
-
 struct PeerCase {
     const char* label;
     const char* tool;
@@ -123,7 +96,6 @@ TEST_P(GWZipPeers, ExtractsAsUnzip) {
     if (!toolAvailable(c.tool)) {
         GTEST_SKIP() << c.tool << " not installed";
     }
-    writeFile(directory.file("src/make.py"), bytesOf(kPythonScript));
     run(std::string("cd src && ") + c.command);
     GWErrorPtr error;
     auto archive = GWZipArchive::initWithURL(directory.url("peer.zip"), &error);
@@ -160,8 +132,7 @@ INSTANTIATE_TEST_SUITE_P(
         PeerCase{"Bsdtar", "bsdtar", "bsdtar --format zip -cf ../peer.zip tree", true, true, true},
         PeerCase{"SevenZipNTFSTimes", "7zz",
                  "7zz a -tzip -snl -mtm=on -mta=on -mtc=on ../peer.zip tree > /dev/null", false,
-                 true},
-        PeerCase{"PythonAndroidLike", "python3", "python3 make.py ../peer.zip", false, false}),
+                 true}),
     [](const auto& info) { return std::string(info.param.label); });
 
 // The methods only 7zz writes here: what it extracts, the library does.
