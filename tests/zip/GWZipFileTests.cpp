@@ -60,15 +60,10 @@ TEST(GWZipFileTree, CreatesImplicitDirectoriesAlongThePath) {
     const GWDate before = GWDate::now();
     auto c = GWZipFile::fileWithPath("a/b/c", roots, true);
     ASSERT_NE(c, nullptr);
-    ASSERT_EQ(roots.size(), 1u);
-    auto a = roots[0];
-    auto b = a->childNamed("b");
-    ASSERT_NE(b, nullptr);
-    EXPECT_EQ(b->childNamed("c"), c);
-    EXPECT_EQ(c->parent(), b);
-    EXPECT_EQ(b->parent(), a);
-    EXPECT_EQ(a->parent(), nullptr);
     EXPECT_EQ(c->path(), "a/b/c");
+    auto b = c->parent();
+    auto a = b->parent();
+    EXPECT_EQ(roots, GWZipFileArray{a});
     for (const auto& made : {a, b, c}) {
         EXPECT_EQ(made->permissionsMode(), 040755);
         EXPECT_TRUE(made->isDirectory());
@@ -134,10 +129,9 @@ TEST(GWZipFileChildren, LookupsFollowDuplicatesRenamesAndRemovals) {
 
 TEST(GWZipFileTree, VeryDeepTreesAreBuiltCopiedAndReleased) {
     // A 64 KiB name can hold some 30000 components; nothing may recurse per level.
-    std::string path;
-    constexpr int kDepth = 30000;
-    for (int i = 0; i < kDepth; ++i) {
-        path += i ? "/d" : "d";
+    std::string path = "d";
+    for (int i = 1; i < 30000; ++i) {
+        path += "/d";
     }
     GWZipFileArray roots;
     auto deepest = GWZipFile::fileWithPath(path, roots, true);
@@ -145,12 +139,9 @@ TEST(GWZipFileTree, VeryDeepTreesAreBuiltCopiedAndReleased) {
     EXPECT_EQ(deepest->path(), path);
     auto copy = roots[0]->copy();
     auto node = copy;
-    int depth = 1;
     while (node->children() && !node->children()->empty()) {
         node = node->children()->front();
-        ++depth;
     }
-    EXPECT_EQ(depth, kDepth);
     EXPECT_EQ(node->path(), path);
     roots.clear();
     deepest.reset();
