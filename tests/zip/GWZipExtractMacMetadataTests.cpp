@@ -11,7 +11,6 @@
 
 #include "foundation/GWConversions.h"
 #include "foundation/GWFileInfo.h"
-#include "foundation/GWLog.h"
 #include "foundation/GWMetadataStore.h"
 #include "foundation/GWRemoteFileHandle.h"
 #include "support/AppleDoubleBuilder.h"
@@ -21,6 +20,7 @@
 #include "support/ZipBuilder.h"
 #include "support/ZipExtraFields.h"
 #include "zip/ZipExtractTestSupport.h"
+#include "zip/ZipTestSupport.h"
 
 namespace {
 
@@ -130,19 +130,17 @@ TEST_P(GWZipExtractForks, TheForkIsWholeOrWarnedAbout) {
         file->setResourceFork(zipEntryFromBuilder(zip, 1));
     }
 
-    std::vector<std::string> logged;
-    auto previous = GWSetLogSink([&](const std::string& line) { logged.push_back(line); });
+    ZipLogCapture log;
     GWErrorPtr error;
     auto operation = GWZipExtractOperation::initForExtractingFile(
         file, GWURL::fileURLWithPath(archivePath), 0, directory.url(name), c.atomically, nullptr,
         &error);
     runToEnd(operation);
-    GWSetLogSink(previous);
     ASSERT_FALSE(operation->error()) << operation->error()->localizedDescription();
     EXPECT_EQ(readFile(directory.file(name)), data);
     EXPECT_EQ(attribute(name, "com.apple.ResourceFork"),
               c.longName ? std::nullopt : std::optional(fork));
-    EXPECT_EQ(logged.size(), c.longName ? 1u : 0u);
+    EXPECT_EQ(log.lines().size(), c.longName ? 1u : 0u);
     if (finderInfo) {
         auto info = GWFileInfo::initWithURL(directory.url(name), nullptr);
         ASSERT_TRUE(info);
