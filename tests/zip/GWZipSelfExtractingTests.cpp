@@ -1,5 +1,5 @@
-// Recognising ZIP archives and self-extracting executables, and opening
-// archives that follow a stub.
+// Recognising ZIP archives and self-extracting executables. Opening archives
+// behind a prefix is GWZipArchiveOpen's and GWZipArchiveRemote's to test.
 
 #include <gtest/gtest.h>
 
@@ -143,33 +143,6 @@ TEST_F(GWZipSelfExtracting, IsZipArchiveAcceptsZipsExecutablesAndTrailingEndReco
     EXPECT_FALSE(GWZipArchive::isSelfExtractingZipArchiveAtURL(directory.url("absent.exe")));
     EXPECT_FALSE(GWZipArchive::isSelfExtractingZipArchiveAtURL(
         *GWURL::URLWithString("https://example.invalid/setup.exe")));
-}
-
-TEST_F(GWZipSelfExtracting, ArchivesBehindAStubOpenWithTheirStartOffset) {
-    GWData stub = executable("stub", {{".text", 0x200, 0x100}}, 1000);
-    GWData bytes = stub;
-    const GWData zip = smallZip();
-    bytes.insert(bytes.end(), zip.begin(), zip.end());
-    writeFile(directory.file("sfx.exe"), bytes);
-    GWErrorPtr error;
-    auto archive = GWZipArchive::initWithURL(directory.url("sfx.exe"), &error);
-    ASSERT_TRUE(archive) << error->localizedDescription();
-    EXPECT_EQ(archive->startOffset(), 1000u);
-    ASSERT_EQ(archive->files().size(), 1u);
-    EXPECT_EQ(archive->files()[0]->localHeaderOffset(), 0u);
-
-    if (!toolAvailable("zip")) {
-        GTEST_SKIP() << "zip is not installed";
-    }
-    // zip -A adds the stub's length to every offset.
-    writeFile(directory.file("adjusted.exe"), bytes);
-    ASSERT_EQ(runCommand("zip -qA " + shellQuote(directory.file("adjusted.exe"))).status, 0);
-    auto adjusted = GWZipArchive::initWithURL(directory.url("adjusted.exe"), &error);
-    ASSERT_TRUE(adjusted) << error->localizedDescription();
-    EXPECT_EQ(adjusted->startOffset(), 0u);
-    ASSERT_EQ(adjusted->files().size(), 1u);
-    EXPECT_EQ(adjusted->files()[0]->localHeaderOffset(), 1000u);
-    EXPECT_EQ(adjusted->files()[0]->storedUncompressedSize(), 6u);
 }
 
 }  // namespace
