@@ -27,14 +27,6 @@ protected:
     TemporaryDirectory directory;
 };
 
-std::vector<std::string> rootNames(const GWZipArchivePtr& archive) {
-    std::vector<std::string> names;
-    for (const auto& file : archive->files()) {
-        names.push_back(file->name());
-    }
-    return names;
-}
-
 // A JLEE block marks the fork an entry holds; the loader reads the local one.
 ZipEntry& markFork(ZipEntry& entry, bool isDataFork) {
     entry.localExtra = zipExtraBlock(0x07C8, jleePayload("TEXT", "ttxt", 0, 0, 0, isDataFork));
@@ -92,8 +84,15 @@ TEST_F(GWZipMetadataPairing, CompanionsAttachToTheEntriesTheyDescribe) {
     EXPECT_EQ(archive->fileWithPath("dir/name")->uncompressedSize(), 3u * bytesOf("x").size());
 }
 
-TEST_F(GWZipMetadataPairing, AHugeMacOSXFolderPairsEveryEntry) {
+// Pairing is a pass over an index, not a scan per entry nor a recursion per level.
+TEST_F(GWZipMetadataPairing, ManyAndDeeplyNestedCompanionsAllPair) {
+    std::string deep;
+    for (int level = 0; level < 30000; ++level) {
+        deep += "d/";
+    }
     ZipBuilder zip;
+    zip.addFile(deep + "x", bytesOf("deep"));
+    zip.addFile("__MACOSX/" + deep + "._x", GWData(82, 1));
     constexpr int kCount = 20000;
     for (int i = 0; i < kCount; ++i) {
         zip.addFile("f" + std::to_string(i), bytesOf("x"));
@@ -104,25 +103,12 @@ TEST_F(GWZipMetadataPairing, AHugeMacOSXFolderPairsEveryEntry) {
     auto archive = open(zip);
     ASSERT_TRUE(archive);
     const auto files = archive->files();
-    ASSERT_EQ(files.size(), std::size_t(kCount));
-    for (const auto& file : files) {
-        ASSERT_TRUE(file->appleDoubleFile()) << file->name();
-        EXPECT_EQ(file->appleDoubleFile()->name(), "._" + file->name());
+    ASSERT_EQ(files.size(), std::size_t(kCount) + 1);
+    for (std::size_t i = 1; i < files.size(); ++i) {
+        ASSERT_TRUE(files[i]->appleDoubleFile()) << files[i]->name();
+        EXPECT_EQ(files[i]->appleDoubleFile()->name(), "._" + files[i]->name());
     }
-}
-
-TEST_F(GWZipMetadataPairing, DeeplyNestedCompanionsPairWithoutRecursion) {
-    std::string path;
-    for (int level = 0; level < 30000; ++level) {
-        path += "d/";
-    }
-    ZipBuilder zip;
-    zip.addFile(path + "x", bytesOf("deep"));
-    zip.addFile("__MACOSX/" + path + "._x", GWData(82, 1));
-    auto archive = open(zip);
-    ASSERT_TRUE(archive);
-    EXPECT_EQ(rootNames(archive), std::vector<std::string>{"d"});
-    auto x = archive->fileWithPath(path + "x");
+    auto x = archive->fileWithPath(deep + "x");
     ASSERT_TRUE(x);
     EXPECT_TRUE(x->appleDoubleFile());
 }
