@@ -12,10 +12,16 @@ namespace {
 
 const GWData kEvil = bytesOf("written by a hostile archive");
 
-GWData zipOf(const std::function<void(ZipBuilder&)>& fill) {
-    ZipBuilder zip;
-    fill(zip);
-    return zip.bytes();
+// The archive `fill` builds for the sandbox whose parent folder it is given.
+HostileArchive zipCase(std::string name, std::string refusedPath,
+                       std::function<void(ZipBuilder&, const std::string& parent)> fill) {
+    return {std::move(name),
+            [fill](const std::string& parent) {
+                ZipBuilder zip;
+                fill(zip, parent);
+                return zip.bytes();
+            },
+            std::move(refusedPath)};
 }
 
 // A plain file entry whose local and central extra fields are `extra`.
@@ -42,96 +48,64 @@ std::string regular(XarBuilder& xar) {
 }  // namespace
 
 const std::vector<HostileArchive>& hostileZipArchives() {
+    using P = const std::string&;
     static const std::vector<HostileArchive> archives{
-        {"DotDotNames",
-         [](const std::string&) {
-             return zipOf([](ZipBuilder& zip) {
-                 zip.addFile("../canary", kEvil);
-                 zip.addFile("../x", kEvil);
-             });
-         },
-         ""},
-        {"DotDotInsideNames",
-         [](const std::string&) {
-             return zipOf([](ZipBuilder& zip) {
-                 zip.addFile("a/../../canary", kEvil);
-                 zip.addFile("a/b/../../../sub/kept", kEvil);
-             });
-         },
-         ""},
-        {"AbsoluteNames",
-         [](const std::string& parent) {
-             return zipOf([&](ZipBuilder& zip) {
-                 zip.addFile(parent + "/canary", kEvil);
-                 zip.addFile("/tmp/x", kEvil);
-             });
-         },
-         ""},
-        {"DirectoryThenLinkInItsPlace",
-         [](const std::string&) {
-             return zipOf([](ZipBuilder& zip) {
-                 zip.addDirectory("d/").externalAttributes = 040700u << 16;
-                 zip.addSymlink("d", "..");
-             });
-         },
-         ""},
-        {"LinkToParentThenFile",
-         [](const std::string&) {
-             return zipOf([](ZipBuilder& zip) {
-                 zip.addSymlink("link", "..");
-                 zip.addFile("link/canary", kEvil);
-             });
-         },
-         "link/canary"},
-        {"AbsoluteLinkThenFile",
-         [](const std::string& parent) {
-             return zipOf([&](ZipBuilder& zip) {
-                 zip.addSymlink("link", parent);
-                 zip.addFile("link/canary", kEvil);
-             });
-         },
-         "link/canary"},
-        {"LinkThenDirectoryThenFile",
-         [](const std::string&) {
-             return zipOf([](ZipBuilder& zip) {
-                 zip.addSymlink("link", "..");
-                 zip.addDirectory("link/sub/");
-                 zip.addFile("link/sub/kept", kEvil);
-             });
-         },
-         "link/sub"},
-        {"LinkThenSameNamedFile",
-         [](const std::string& parent) {
-             return zipOf([&](ZipBuilder& zip) {
-                 zip.addSymlink("x", parent + "/canary");
-                 zip.addFile("x", kEvil);
-             });
-         },
-         ""},
-        {"ZipItFilenameClimbing",
-         [](const std::string&) {
-             return zipOf([](ZipBuilder& zip) {
-                 addRenamedFile(zip, zipExtraBlock(0x2605, zipItPayload("../../canary", "TEXT",
-                                                                        "ttxt", std::nullopt)));
-             });
-         },
-         ""},
-        {"SmartZipFilenameClimbing",
-         [](const std::string&) {
-             return zipOf([](ZipBuilder& zip) {
-                 SmartZipInfo info;
-                 info.name = "../../canary";
-                 addRenamedFile(zip, zipExtraBlock(0x4D63, smartZipPayload(info)));
-             });
-         },
-         ""},
-        {"POSIXPathClimbing",
-         [](const std::string&) {
-             return zipOf([](ZipBuilder& zip) {
-                 addRenamedFile(zip, zipExtraBlock(0x7075, infoZipUnicodePayload("../..")));
-             });
-         },
-         ""},
+        zipCase("DotDotNames", "",
+                [](ZipBuilder& zip, P) {
+                    zip.addFile("../canary", kEvil);
+                    zip.addFile("../x", kEvil);
+                }),
+        zipCase("DotDotInsideNames", "",
+                [](ZipBuilder& zip, P) {
+                    zip.addFile("a/../../canary", kEvil);
+                    zip.addFile("a/b/../../../sub/kept", kEvil);
+                }),
+        zipCase("AbsoluteNames", "",
+                [](ZipBuilder& zip, P parent) {
+                    zip.addFile(parent + "/canary", kEvil);
+                    zip.addFile("/tmp/x", kEvil);
+                }),
+        zipCase("DirectoryThenLinkInItsPlace", "",
+                [](ZipBuilder& zip, P) {
+                    zip.addDirectory("d/").externalAttributes = 040700u << 16;
+                    zip.addSymlink("d", "..");
+                }),
+        zipCase("LinkToParentThenFile", "link/canary",
+                [](ZipBuilder& zip, P) {
+                    zip.addSymlink("link", "..");
+                    zip.addFile("link/canary", kEvil);
+                }),
+        zipCase("AbsoluteLinkThenFile", "link/canary",
+                [](ZipBuilder& zip, P parent) {
+                    zip.addSymlink("link", parent);
+                    zip.addFile("link/canary", kEvil);
+                }),
+        zipCase("LinkThenDirectoryThenFile", "link/sub",
+                [](ZipBuilder& zip, P) {
+                    zip.addSymlink("link", "..");
+                    zip.addDirectory("link/sub/");
+                    zip.addFile("link/sub/kept", kEvil);
+                }),
+        zipCase("LinkThenSameNamedFile", "",
+                [](ZipBuilder& zip, P parent) {
+                    zip.addSymlink("x", parent + "/canary");
+                    zip.addFile("x", kEvil);
+                }),
+        zipCase("ZipItFilenameClimbing", "",
+                [](ZipBuilder& zip, P) {
+                    addRenamedFile(zip, zipExtraBlock(0x2605, zipItPayload("../../canary", "TEXT",
+                                                                           "ttxt", std::nullopt)));
+                }),
+        zipCase("SmartZipFilenameClimbing", "",
+                [](ZipBuilder& zip, P) {
+                    SmartZipInfo info;
+                    info.name = "../../canary";
+                    addRenamedFile(zip, zipExtraBlock(0x4D63, smartZipPayload(info)));
+                }),
+        zipCase("POSIXPathClimbing", "",
+                [](ZipBuilder& zip, P) {
+                    addRenamedFile(zip, zipExtraBlock(0x7075, infoZipUnicodePayload("../..")));
+                }),
     };
     return archives;
 }

@@ -14,19 +14,10 @@ namespace {
 
 constexpr std::uint32_t kEscaped32 = 0xFFFFFFFF;
 
-void put16(GWData& out, std::uint64_t value) {
-    out.push_back(std::uint8_t(value));
-    out.push_back(std::uint8_t(value >> 8));
-}
-
-void put32(GWData& out, std::uint64_t value) {
-    put16(out, value & 0xFFFF);
-    put16(out, (value >> 16) & 0xFFFF);
-}
-
-void put64(GWData& out, std::uint64_t value) {
-    put32(out, value & 0xFFFFFFFF);
-    put32(out, value >> 32);
+// Each value as `width` little-endian bytes.
+template <typename... Values>
+void le(GWData& out, int width, Values... values) {
+    (putLE(out, {{std::uint64_t(values), width}}), ...);
 }
 
 void append(GWData& out, const GWData& bytes) {
@@ -67,15 +58,30 @@ GWData bzip2Compress(const GWData& input) {
 // The Zip64 block for the fields a header escaped, in their standard order.
 GWData zip64Block(const std::vector<std::uint64_t>& values) {
     GWData block;
-    put16(block, 0x0001);
-    put16(block, values.size() * 8);
+    le(block, 2, 0x0001, values.size() * 8);
     for (std::uint64_t value : values) {
-        put64(block, value);
+        le(block, 8, value);
     }
     return block;
 }
 
 }  // namespace
+
+void putLE(GWData& out, std::initializer_list<std::pair<std::uint64_t, int>> values) {
+    for (const auto& [value, width] : values) {
+        for (int i = 0; i < width; ++i) {
+            out.push_back(std::uint8_t(value >> (8 * i)));
+        }
+    }
+}
+
+void putBE(GWData& out, std::initializer_list<std::pair<std::uint64_t, int>> values) {
+    for (const auto& [value, width] : values) {
+        for (int i = width - 1; i >= 0; --i) {
+            out.push_back(std::uint8_t(value >> (8 * i)));
+        }
+    }
+}
 
 std::uint16_t zipDOSTime(int hour, int minute, int second) {
     return std::uint16_t(hour << 11 | minute << 5 | second / 2);
@@ -114,14 +120,6 @@ ZipEntry& ZipBuilder::addFile(const std::string& name, GWData content, std::uint
     return add(std::move(entry));
 }
 
-ZipEntry& ZipBuilder::addEncoded(const std::string& name, GWData content, std::uint16_t method,
-                                 GWData stored, std::uint16_t flags) {
-    ZipEntry& entry = addFile(name, std::move(content), method);
-    entry.stored = std::move(stored);
-    entry.flags = flags;
-    return entry;
-}
-
 ZipEntry& ZipBuilder::addDirectory(const std::string& name) {
     ZipEntry entry;
     entry.name = bytesOf(name);
@@ -151,43 +149,25 @@ void appendZipEntry(const ZipEntry& entry, std::uint64_t offset, GWData& out, GW
     if (!entry.omitLocalHeader) {
         const GWData& localName = entry.localName ? *entry.localName : entry.name;
         GWData localExtra = entry.localExtra;
-        const std::uint64_t localCompressed = entry.localCompressedSize.value_or(compressed);
-        const std::uint64_t localUncompressed = entry.localUncompressedSize.value_or(uncompressed);
         if (entry.zip64Sizes) {
-            append(localExtra, zip64Block({localUncompressed, localCompressed}));
+            append(localExtra, zip64Block({uncompressed, compressed}));
         }
-        put32(out, 0x04034B50);
-        put16(out, entry.versionNeeded);
-        put16(out, flags);
-        put16(out, entry.method);
-        put16(out, entry.dosTime);
-        put16(out, entry.dosDate);
-        if (entry.dataDescriptor) {
-            put32(out, entry.localCRC32.value_or(0));
-            put32(out, entry.localCompressedSize.value_or(0));
-            put32(out, entry.localUncompressedSize.value_or(0));
-        } else {
-            put32(out, entry.localCRC32.value_or(crc));
-            put32(out, entry.zip64Sizes ? kEscaped32 : localCompressed);
-            put32(out, entry.zip64Sizes ? kEscaped32 : localUncompressed);
-        }
-        put16(out, localName.size());
-        put16(out, localExtra.size());
+        const bool zeroed = entry.dataDescriptor;
+        const std::uint64_t localCompressed = entry.zip64Sizes ? kEscaped32 : compressed;
+        const std::uint64_t localUncompressed = entry.zip64Sizes ? kEscaped32 : uncompressed;
+        le(out, 4, 0x04034B50);
+        le(out, 2, 20, flags, entry.method, entry.dosTime, entry.dosDate);
+        le(out, 4, zeroed ? 0 : crc, zeroed ? 0 : localCompressed, zeroed ? 0 : localUncompressed);
+        le(out, 2, localName.size(), localExtra.size());
         append(out, localName);
         append(out, localExtra);
         append(out, stored);
         if (entry.dataDescriptor) {
             if (entry.dataDescriptorSignature) {
-                put32(out, 0x08074B50);
+                le(out, 4, 0x08074B50);
             }
-            put32(out, crc);
-            if (entry.zip64Sizes) {
-                put64(out, compressed);
-                put64(out, uncompressed);
-            } else {
-                put32(out, compressed);
-                put32(out, uncompressed);
-            }
+            le(out, 4, crc);
+            le(out, entry.zip64Sizes ? 8 : 4, compressed, uncompressed);
         }
     }
 
@@ -203,23 +183,13 @@ void appendZipEntry(const ZipEntry& entry, std::uint64_t offset, GWData& out, GW
     if (!escaped.empty()) {
         append(centralExtra, zip64Block(escaped));
     }
-    put32(directory, 0x02014B50);
-    put16(directory, std::uint16_t(entry.host) << 8 | entry.madeByVersion);
-    put16(directory, entry.versionNeeded);
-    put16(directory, flags);
-    put16(directory, entry.method);
-    put16(directory, entry.dosTime);
-    put16(directory, entry.dosDate);
-    put32(directory, crc);
-    put32(directory, entry.zip64Sizes ? kEscaped32 : compressed);
-    put32(directory, entry.zip64Sizes ? kEscaped32 : uncompressed);
-    put16(directory, entry.name.size());
-    put16(directory, centralExtra.size());
-    put16(directory, entry.comment.size());
-    put16(directory, entry.diskNumberStart);
-    put16(directory, entry.internalAttributes);
-    put32(directory, entry.externalAttributes);
-    put32(directory, entry.zip64Offset ? kEscaped32 : recordedOffset);
+    le(directory, 4, 0x02014B50);
+    le(directory, 2, entry.host << 8 | 30, 20, flags, entry.method, entry.dosTime, entry.dosDate);
+    le(directory, 4, crc, entry.zip64Sizes ? kEscaped32 : compressed,
+       entry.zip64Sizes ? kEscaped32 : uncompressed);
+    // Name, extra and comment lengths, disk number and internal attributes.
+    le(directory, 2, entry.name.size(), centralExtra.size(), entry.comment.size(), 0, 0);
+    le(directory, 4, entry.externalAttributes, entry.zip64Offset ? kEscaped32 : recordedOffset);
     append(directory, entry.name);
     append(directory, centralExtra);
     append(directory, entry.comment);
@@ -240,29 +210,21 @@ struct EndRecords {
 
 void appendEndRecords(const EndRecords& end, GWData& out) {
     if (end.zip64) {
-        put32(out, 0x06064B50);
-        put64(out, 44);  // size of the rest of the record
-        put16(out, kZipHostUnix << 8 | 45);
-        put16(out, 45);
-        put32(out, 0);
-        put32(out, 0);
-        put64(out, end.count);
-        put64(out, end.count);
-        put64(out, end.directorySize);
-        put64(out, end.directoryOffset);
-        put32(out, 0x07064B50);
-        put32(out, 0);
-        put64(out, end.recordOffset);
-        put32(out, 1);
+        // The record (44 bytes after its size field), then the locator.
+        le(out, 4, 0x06064B50);
+        le(out, 8, 44);
+        le(out, 2, kZipHostUnix << 8 | 45, 45);
+        le(out, 4, 0, 0);
+        le(out, 8, end.count, end.count, end.directorySize, end.directoryOffset);
+        le(out, 4, 0x07064B50, 0);
+        le(out, 8, end.recordOffset);
+        le(out, 4, 1);
     }
-    put32(out, 0x06054B50);
-    put16(out, 0);
-    put16(out, 0);
     const std::uint16_t shortCount = end.zip64 ? 0xFFFF : std::uint16_t(end.count);
-    put16(out, end.entryCount.value_or(shortCount));
-    put16(out, end.entryCount.value_or(shortCount));
-    put32(out, end.size.value_or(end.zip64 ? kEscaped32 : end.directorySize));
-    put32(out, end.offset.value_or(end.zip64 ? kEscaped32 : end.directoryOffset));
+    le(out, 4, 0x06054B50);
+    le(out, 2, 0, 0, end.entryCount.value_or(shortCount), end.entryCount.value_or(shortCount));
+    le(out, 4, end.size.value_or(end.zip64 ? kEscaped32 : end.directorySize),
+       end.offset.value_or(end.zip64 ? kEscaped32 : end.directoryOffset));
 }
 
 }  // namespace
@@ -283,7 +245,7 @@ GWData ZipBuilder::bytes() const {
          out.size() - base + (offsetsIncludePrefix ? 0 : prefix.size()), zip64EndRecord,
          endRecordEntryCount, endRecordCentralDirectorySize, endRecordCentralDirectoryOffset},
         out);
-    put16(out, archiveComment.size());
+    le(out, 2, archiveComment.size());
     append(out, archiveComment);
     return out;
 }
@@ -342,7 +304,7 @@ bool StreamingZipWriter::finish() {
                       {},
                       {}},
                      end);
-    put16(end, 0);
+    le(end, 2, 0);
     out_.write(reinterpret_cast<const char*>(end.data()), std::streamsize(end.size()));
     out_.close();
     return !out_.fail();

@@ -2,6 +2,7 @@
 
 #include <cstdint>
 #include <fstream>
+#include <initializer_list>
 #include <optional>
 #include <string>
 #include <vector>
@@ -23,6 +24,11 @@ enum ZipHost : std::uint8_t {
 // methods return it unchanged.
 GWData zipCompress(const GWData& content, std::uint16_t method);
 
+// Appends each value as `width` bytes, least (putLE) or most (putBE)
+// significant first.
+void putLE(GWData& out, std::initializer_list<std::pair<std::uint64_t, int>> values);
+void putBE(GWData& out, std::initializer_list<std::pair<std::uint64_t, int>> values);
+
 std::uint16_t zipDOSTime(int hour, int minute, int second);  // second / 2 is stored
 std::uint16_t zipDOSDate(int year, int month, int day);
 
@@ -37,28 +43,21 @@ struct ZipEntry {
     std::optional<GWData> stored;
 
     std::uint8_t host = kZipHostUnix;
-    std::uint8_t madeByVersion = 30;
-    std::uint16_t versionNeeded = 20;
     std::uint16_t flags = 0;
     std::uint16_t method = 0;
     std::uint16_t dosTime = zipDOSTime(12, 0, 0);
     std::uint16_t dosDate = zipDOSDate(2020, 1, 1);
-    std::uint16_t internalAttributes = 0;
     std::uint32_t externalAttributes = 0100644u << 16;
-    std::uint16_t diskNumberStart = 0;
 
     // Raw extra fields, central and local separately (see ZipExtraFields.h).
     GWData centralExtra;
     GWData localExtra;
     GWData comment;
 
-    // Overrides of the derived values; the local ones default to the central.
+    // Overrides of the derived values, in both headers.
     std::optional<std::uint32_t> crc32;
     std::optional<std::uint64_t> compressedSize;
     std::optional<std::uint64_t> uncompressedSize;
-    std::optional<std::uint32_t> localCRC32;
-    std::optional<std::uint64_t> localCompressedSize;
-    std::optional<std::uint64_t> localUncompressedSize;
     // Written into the central record instead of the real offset.
     std::optional<std::uint64_t> centralLocalHeaderOffset;
 
@@ -90,9 +89,6 @@ class ZipBuilder {
 public:
     ZipEntry& add(ZipEntry entry);
     ZipEntry& addFile(const std::string& name, GWData content, std::uint16_t method = 0);
-    // `stored` is what an encoder of `method` (with its `flags`) made of `content`.
-    ZipEntry& addEncoded(const std::string& name, GWData content, std::uint16_t method,
-                         GWData stored, std::uint16_t flags = 0);
     // Name should end in "/"; a Unix directory mode.
     ZipEntry& addDirectory(const std::string& name);
     // A Unix symbolic link whose data is the target.

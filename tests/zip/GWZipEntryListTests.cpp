@@ -25,20 +25,6 @@ struct ScanModel {
     }
 };
 
-TEST(GWZipEntryList, AppendReportsTheFirstEntryOfTheSameName) {
-    GWZipEntryList list;
-    auto a = entry("a");
-    auto a2 = entry("a");
-    EXPECT_EQ(list.append(a), nullptr);
-    EXPECT_EQ(list.append(entry("b")), nullptr);
-    EXPECT_EQ(list.append(a2), a);
-    EXPECT_EQ(list.firstNamed("a"), a);
-    EXPECT_TRUE(list.remove(a));
-    EXPECT_EQ(list.firstNamed("a"), a2);
-    EXPECT_FALSE(list.remove(a));
-    EXPECT_EQ(list.firstNamed("missing"), nullptr);
-}
-
 // Many names, few distinct, with removals and renames in between: lookups
 // must always give what a scan in list order gives.
 TEST(GWZipEntryList, LookupsMatchAScanThroughAppendsRemovalsAndRenames) {
@@ -63,6 +49,7 @@ TEST(GWZipEntryList, LookupsMatchAScanThroughAppendsRemovalsAndRenames) {
         ASSERT_EQ(list.firstNamed(probe), model.firstNamed(probe)) << "step " << step;
     }
     EXPECT_EQ(list.entries(), model.items);
+    EXPECT_FALSE(list.remove(entry("n1")));
     EXPECT_EQ(list.takeEntries(), model.items);
     EXPECT_TRUE(list.empty());
     EXPECT_EQ(list.firstNamed("n1"), nullptr);

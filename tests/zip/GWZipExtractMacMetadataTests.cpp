@@ -11,7 +11,6 @@
 
 #include "foundation/GWConversions.h"
 #include "foundation/GWFileInfo.h"
-#include "foundation/GWLog.h"
 #include "foundation/GWMetadataStore.h"
 #include "foundation/GWRemoteFileHandle.h"
 #include "support/AppleDoubleBuilder.h"
@@ -21,6 +20,7 @@
 #include "support/ZipBuilder.h"
 #include "support/ZipExtraFields.h"
 #include "zip/ZipExtractTestSupport.h"
+#include "zip/ZipTestSupport.h"
 
 namespace {
 
@@ -130,19 +130,17 @@ TEST_P(GWZipExtractForks, TheForkIsWholeOrWarnedAbout) {
         file->setResourceFork(zipEntryFromBuilder(zip, 1));
     }
 
-    std::vector<std::string> logged;
-    auto previous = GWSetLogSink([&](const std::string& line) { logged.push_back(line); });
+    ZipLogCapture log;
     GWErrorPtr error;
     auto operation = GWZipExtractOperation::initForExtractingFile(
         file, GWURL::fileURLWithPath(archivePath), 0, directory.url(name), c.atomically, nullptr,
         &error);
     runToEnd(operation);
-    GWSetLogSink(previous);
     ASSERT_FALSE(operation->error()) << operation->error()->localizedDescription();
     EXPECT_EQ(readFile(directory.file(name)), data);
     EXPECT_EQ(attribute(name, "com.apple.ResourceFork"),
               c.longName ? std::nullopt : std::optional(fork));
-    EXPECT_EQ(logged.size(), c.longName ? 1u : 0u);
+    EXPECT_EQ(log.lines().size(), c.longName ? 1u : 0u);
     if (finderInfo) {
         auto info = GWFileInfo::initWithURL(directory.url(name), nullptr);
         ASSERT_TRUE(info);
@@ -214,14 +212,11 @@ TEST_F(GWZipExtractMacMetadata, FinderInformationFromTheExtraFieldIsApplied) {
 class ScopedNoChown {
 public:
     ScopedNoChown() {
-        header_.version = _LINUX_CAPABILITY_VERSION_3;
-        if (syscall(SYS_capget, &header_, data_) != 0) {
-            return;
+        if (syscall(SYS_capget, &header_, saved_) == 0) {
+            __user_cap_data_struct reduced[2] = {saved_[0], saved_[1]};
+            reduced[0].effective &= ~(1u << CAP_CHOWN);
+            active_ = syscall(SYS_capset, &header_, reduced) == 0;
         }
-        saved_[0] = data_[0];
-        saved_[1] = data_[1];
-        data_[0].effective &= ~(1u << CAP_CHOWN);
-        active_ = syscall(SYS_capset, &header_, data_) == 0;
     }
     ~ScopedNoChown() {
         if (active_) {
@@ -231,8 +226,7 @@ public:
     bool active() const { return active_; }
 
 private:
-    __user_cap_header_struct header_{};
-    __user_cap_data_struct data_[2]{};
+    __user_cap_header_struct header_{_LINUX_CAPABILITY_VERSION_3, 0};
     __user_cap_data_struct saved_[2]{};
     bool active_ = false;
 };

@@ -42,7 +42,6 @@ GWZipExtractOperation::DataHandler DataHandlerLog::handler(bool answer) {
         std::lock_guard lock(mutex);
         if (data) {
             bytes.insert(bytes.end(), data->begin(), data->end());
-            sizes.push_back(data->size());
         }
         hadData.push_back(data.has_value());
         doneFlags.push_back(isDone);

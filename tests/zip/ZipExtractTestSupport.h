@@ -25,7 +25,6 @@ void runToEnd(const GWZipExtractOperationPtr& operation);
 struct DataHandlerLog {
     std::mutex mutex;
     GWData bytes;
-    std::vector<std::size_t> sizes;  // of each call with data
     std::vector<bool> doneFlags;
     std::vector<bool> hadData;
     std::vector<GWErrorPtr> errors;

@@ -1,6 +1,9 @@
 #include "ZipTestSupport.h"
 
+#include <cstdio>
 #include <ctime>
+
+#include "support/TestSupport.h"
 
 namespace gwtest {
 
@@ -36,6 +39,40 @@ ScopedTimeZone::~ScopedTimeZone() {
         unsetenv("TZ");
     }
     tzset();
+}
+
+std::string zipTreeShape(const GWZipFileArray& files, const GWZipFilePtr& parent) {
+    std::string text;
+    for (const auto& file : files) {
+        text += (text.empty() ? "" : " ") + file->name() + (file->parent() != parent ? "!" : "");
+        if (file->isDirectory()) {
+            char mode[8];
+            std::snprintf(mode, sizeof mode, "/%o", file->permissionsMode() & 0777);
+            text += mode;
+        }
+        if (auto companion = file->appleDoubleFile()) {
+            text += "[" + companion->name() + "]";
+        }
+        if (auto fork = file->resourceFork()) {
+            text += "{" + fork->name() + "}";
+        }
+        if (auto children = file->children()) {
+            text += "(" + zipTreeShape(*children, file) + ")";
+        }
+    }
+    return text;
+}
+
+ZipBuilder zipOfNames(const std::vector<std::string>& names) {
+    ZipBuilder zip;
+    for (const std::string& name : names) {
+        if (name.back() == '/') {
+            zip.addDirectory(name).externalAttributes = 040700u << 16;
+        } else {
+            zip.addFile(name, bytesOf("x"));
+        }
+    }
+    return zip;
 }
 
 }  // namespace gwtest

@@ -7,6 +7,8 @@
 #include <vector>
 
 #include "foundation/GWLog.h"
+#include "support/ZipBuilder.h"
+#include "zip/GWZipArchive.h"
 #include "zip/GWZipWorkOperation.h"
 
 namespace gwtest {
@@ -38,5 +40,14 @@ public:
 private:
     std::optional<std::string> previous_;
 };
+
+// The tree as "name" for files and "name/mode" for directories (octal
+// permission bits), then "[._name]" for an AppleDouble companion, "{name}"
+// for a resource fork and the children in parentheses; "!" marks a node
+// whose parent link is wrong.
+std::string zipTreeShape(const GWZipFileArray& files, const GWZipFilePtr& parent = nullptr);
+
+// Names ending in "/" become directories of mode 700, the rest files.
+ZipBuilder zipOfNames(const std::vector<std::string>& names);
 
 }  // namespace gwtest
