@@ -290,8 +290,8 @@ TEST(GWOperationQueue, BatchReportsTheFirstErrorAndCancelsTheRest) {
         }
     }
     auto final = GWBlockOperation::blockOperationWithBlock([&] {
-        everyOneFinishedFirst = std::all_of(batch.begin(), batch.end(),
-                                            [](const auto& member) { return member->isFinished(); });
+        everyOneFinishedFirst = std::all_of(
+            batch.begin(), batch.end(), [](const auto& member) { return member->isFinished(); });
         std::lock_guard<std::mutex> lock(slotMutex);
         reported = firstError;
     });

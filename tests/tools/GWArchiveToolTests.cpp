@@ -48,9 +48,9 @@ std::string pythonJSON(const std::string& json, const std::string& expression) {
 // --- Usage and errors ---------------------------------------------------------
 
 TEST(GWArchiveTool, UsageErrorsExitTwoAndHelpExitsZero) {
-    for (const char* usage : {"", "frobnicate x", "list", "list --bogus a.zip", "cat a.zip",
-                              "extract -C", "list --encoding NO-SUCH-CHARSET a.zip",
-                              "extract --strip-components -1 a.zip"})
+    for (const char* usage :
+         {"", "frobnicate x", "list", "list --bogus a.zip", "cat a.zip", "extract -C",
+          "list --encoding NO-SUCH-CHARSET a.zip", "extract --strip-components -1 a.zip"})
         EXPECT_EQ(runTool(usage).status, 2) << usage;
     for (const char* command :
          {"list", "extract", "cat", "test", "info", "detect", "macbinary", "appledouble"}) {
@@ -218,9 +218,9 @@ TEST(GWArchiveTool, AnInterruptedExtractionLeavesNoBuildFolders) {
 }
 
 TEST(GWArchiveTool, ControlCharactersInNamesAreEscapedExceptInJson) {
-    const std::vector<std::string> names = {"esc\x1b[2J", "cr\rx", "lf\nx",
-                                            "x\ngwarchive: t.zip: forged (POSIX 1)", "c1\xc2\x9b",
-                                            "q\"uote\\d"};
+    const std::vector<std::string> names = {"esc\x1b[2J", "cr\rx",
+                                            "lf\nx",      "x\ngwarchive: t.zip: forged (POSIX 1)",
+                                            "c1\xc2\x9b", "q\"uote\\d"};
     ZipBuilder zip;
     for (const std::string& name : names)
         zip.addFile(name, bytesOf("x")).crc32 = 1;  // so that test and extract name them too
@@ -482,11 +482,10 @@ TEST(GWArchiveTool, CommandLineHabitsTable) {
          ""},
     };
     const std::pair<std::string, std::string> names[] = {
-        {"Z", directory.file("z.zip")},   {"M", directory.file("mac.zip")},
-        {"S", directory.file("sfx.zip")}, {"X", directory.file("x.xar")},
-        {"N", directory.file("n.txt")},   {"GW", GW_TOOL_PATH},
-        {"CUT", directory.file("cut.zip")},
-        {"OUT", directory.file("out")},
+        {"Z", directory.file("z.zip")},     {"M", directory.file("mac.zip")},
+        {"S", directory.file("sfx.zip")},   {"X", directory.file("x.xar")},
+        {"N", directory.file("n.txt")},     {"GW", GW_TOOL_PATH},
+        {"CUT", directory.file("cut.zip")}, {"OUT", directory.file("out")},
     };
     auto substitute = [&](std::string text) {
         for (const auto& [name, path] : names)
@@ -615,18 +614,19 @@ INSTANTIATE_TEST_SUITE_P(
                    "extract --require-signature --trust ROOT -C OUT ARCHIVE", 0, "", "", true},
         XarVerdict{"TestRequiresASignature", XarDamage::none, "test --require-signature ARCHIVE", 1,
                    "", "Refused: the signature is none\n", false},
-        XarVerdict{"InfoJsonCarriesTheChain", XarDamage::signedRSA,
-                   "info --json --trust ROOT ARCHIVE", 0,
-                   "\"signature\":\"valid\",\"signatureReason\":\"\",\"signatures\":[{\"type\":"
-                   "\"RSA\",\"extended\":false,\"verdict\":\"valid\",\"reason\":\"\",\"certificates\":"
-                   "[\"GW Test RSA Signer\",\"GW Test Intermediate CA\"],\"chain\":[\"GW Test RSA "
-                   "Signer\",\"GW Test Intermediate CA\",\"GW Test Root CA\"]}]",
-                   "", false},
-        XarVerdict{"TestJsonNamesTheBadEntry", XarDamage::flippedData, "test --json ARCHIVE", 1,
-                   "\"bad\":[{\"path\":\"x.txt\",\"error\":{\"domain\":\"NSCocoaErrorDomain\","
-                   "\"code\":259,\"message\":\"checksum mismatch (data damaged)\"}}],\"error\":null,"
-                   "\"passed\":false}",
-                   "", false},
+        XarVerdict{
+            "InfoJsonCarriesTheChain", XarDamage::signedRSA, "info --json --trust ROOT ARCHIVE", 0,
+            "\"signature\":\"valid\",\"signatureReason\":\"\",\"signatures\":[{\"type\":"
+            "\"RSA\",\"extended\":false,\"verdict\":\"valid\",\"reason\":\"\",\"certificates\":"
+            "[\"GW Test RSA Signer\",\"GW Test Intermediate CA\"],\"chain\":[\"GW Test RSA "
+            "Signer\",\"GW Test Intermediate CA\",\"GW Test Root CA\"]}]",
+            "", false},
+        XarVerdict{
+            "TestJsonNamesTheBadEntry", XarDamage::flippedData, "test --json ARCHIVE", 1,
+            "\"bad\":[{\"path\":\"x.txt\",\"error\":{\"domain\":\"NSCocoaErrorDomain\","
+            "\"code\":259,\"message\":\"checksum mismatch (data damaged)\"}}],\"error\":null,"
+            "\"passed\":false}",
+            "", false},
         XarVerdict{"TestJsonCarriesTheRefusal", XarDamage::signedRSA,
                    "test --require-signature --json ARCHIVE", 1,
                    "\"bad\":[],\"error\":{\"domain\":\"GWXARArchiveErrorDomain\",\"code\":7,",

@@ -276,7 +276,9 @@ TEST_F(DataStreamContract, UnreadableStreamsEndWithOneError) {
          },
          "", 0},
         {"past the end of the file", "f",
-         [](GWXARArchive& a, auto&) { a.fileWithPath("f")->dataFork()->setCompressedSize(1u << 30); },
+         [](GWXARArchive& a, auto&) {
+             a.fileWithPath("f")->dataFork()->setCompressedSize(1u << 30);
+         },
          "", 0},
         {"archive file gone", "f", [](GWXARArchive& a, auto&) { unlink(a.URL().path().c_str()); },
          "", 0},
@@ -287,9 +289,9 @@ TEST_F(DataStreamContract, UnreadableStreamsEndWithOneError) {
     };
     for (const auto& c : cases) {
         SCOPED_TRACE(c.what);
-        auto archive = openWithFile(gwtest::textBytes(5000, 9),
-                                    xarFileElement(2, "d", "directory", "0755") +
-                                        xarFileElement(7, "p", "fifo", "0644"));
+        auto archive =
+            openWithFile(gwtest::textBytes(5000, 9), xarFileElement(2, "d", "directory", "0755") +
+                                                         xarFileElement(7, "p", "fifo", "0644"));
         ASSERT_TRUE(archive);
         auto other = gwtest::openBuiltXar(xar, directory, "other.xar");
         if (c.damage) {

@@ -102,8 +102,8 @@ INSTANTIATE_TEST_SUITE_P(
         HostileTOC{"UnknownEncoding", withData("<encoding style=\"application/zstd\"/>"), kXAR,
                    GWXARArchiveUnsupportedCompressionError, "application/zstd"},
         // Encodings are matched exactly, case included.
-        HostileTOC{"EncodingInCapitals", withData("<encoding style=\"Application/X-Gzip\"/>"),
-                   kXAR, GWXARArchiveUnsupportedCompressionError, "Application/X-Gzip"},
+        HostileTOC{"EncodingInCapitals", withData("<encoding style=\"Application/X-Gzip\"/>"), kXAR,
+                   GWXARArchiveUnsupportedCompressionError, "Application/X-Gzip"},
         HostileTOC{"UnknownType", withProperty("<type>portal</type>"), kXAR,
                    GWXARArchiveMalformedValueError, "portal"},
         HostileTOC{"HardLinkWithoutLink", withProperty("<type>hardlink</type>"), kXAR,
