@@ -373,15 +373,17 @@ bool GWZipLoadOperation::parseItemFromCentralDirectoryRecord(
             zip64Size(uncompressedSize, kGWZipUncompressedSizeKey, record.uncompressedSize);
     }
 
-    std::uint64_t dataLength = compressedSize;
-    if (dataLength == kGWZip32BitSentinel) {
+    if (compressedSize == kGWZip32BitSentinel) {
         // Escaped with no Zip64 value where it was taken from: the central
-        // record's, and failing that the value as it stands.
-        dataLength = record.compressedSize;
-        if (dataLength == kGWZip32BitSentinel && extraFieldData) {
-            dataLength = centralZip64CompressedSize(*extraFieldData, record).value_or(dataLength);
+        // record's, then its Zip64 field's. Read without the local header, an
+        // entry escaping this size alone would otherwise claim 4 GiB of data.
+        compressedSize = record.compressedSize;
+        if (compressedSize == kGWZip32BitSentinel && extraFieldData) {
+            compressedSize =
+                centralZip64CompressedSize(*extraFieldData, record).value_or(compressedSize);
         }
     }
+    std::uint64_t dataLength = compressedSize;
     if (consultLocalHeader && (flags & kDataDescriptorFlag)) {
         // The shortest descriptor: no signature, 32-bit sizes.
         dataLength = saturatingSum(dataLength, 12);

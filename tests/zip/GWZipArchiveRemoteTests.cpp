@@ -9,6 +9,7 @@
 #include "support/ServedFolderTest.h"
 #include "support/TestSupport.h"
 #include "support/ZipBuilder.h"
+#include "support/ZipExtraFields.h"
 #include "tools/ToolTestSupport.h"
 #include "zip/GWZipArchive.h"
 
@@ -26,6 +27,14 @@ ZipBuilder mixedArchive() {
     zip.addFile("data/empty", {});
     zip.addFile("caf\xC3\xA9.txt", bytesOf("unicode name"), 8);
     zip.addSymlink("docs/link", "readme.txt");
+    // Only the compressed size escaped: over HTTP no local header is read, so
+    // the central record's Zip64 field alone says where the data ends.
+    GWData escaped = textBytes(3000, 4);
+    ZipEntry& zip64 = zip.addFile("docs/zip64.txt", escaped, 8);
+    zip64.centralExtra = zipExtraBlock(0x0001, zip64Payload({zip64.storedBytes().size()}));
+    zip64.localExtra =
+        zipExtraBlock(0x0001, zip64Payload({escaped.size(), zip64.storedBytes().size()}));
+    zip64.compressedSize = 0xFFFFFFFFu;
     // Stored entries each larger than a read-ahead block, side by side.
     for (int index = 0; index < 40; ++index) {
         zip.addFile("many/" + std::to_string(index), randomBytes(40000, 10 + index), 0);
